@@ -1,0 +1,61 @@
+#pragma once
+
+#include <fcntl.h>
+#include <linux/stat.h>
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace tamber {
+
+// Every file, attribute and directory call of the program goes through this interface, so that
+// tests can inject faults (see FaultInjectingFileSystem). Methods behave like the system calls
+// they are named after: -1 (or null/false) with errno set on failure.
+//
+// Extended attribute names are given without the "user." namespace prefix; only the Linux
+// implementation adds and strips it.
+class FileSystem {
+public:
+    virtual ~FileSystem() = default;
+
+    // The process-wide instance (LinuxFileSystem unless a test replaced it).
+    static FileSystem& current();
+    static std::shared_ptr<FileSystem> currentShared();
+    // Replaces the process-wide instance; returns the previous one. Tests only.
+    static std::shared_ptr<FileSystem> setCurrent(std::shared_ptr<FileSystem> fs);
+
+    virtual int open(const std::string& path, int flags, mode_t mode = 0) = 0;
+    virtual int openat(int dirfd, const std::string& name, int flags, mode_t mode = 0) = 0;
+    virtual int close(int fd) = 0;
+
+    // statx(2); `dirfd` AT_FDCWD for absolute paths.
+    virtual int statx(int dirfd, const std::string& path, int flags, unsigned int mask,
+                      struct statx* out) = 0;
+    virtual int faccessat(int dirfd, const std::string& path, int mode, int flags) = 0;
+
+    // lgetxattr(2): never follows a final symbolic link.
+    virtual ssize_t lgetxattr(const std::string& path, const std::string& name, void* value,
+                              size_t size) = 0;
+    // llistxattr(2); the names returned are without the "user." prefix, and names of other
+    // namespaces are left out.
+    virtual ssize_t llistxattr(const std::string& path, char* list, size_t size) = 0;
+    virtual int fsetxattr(int fd, const std::string& name, const void* value, size_t size,
+                          int flags) = 0;
+    virtual int fremovexattr(int fd, const std::string& name) = 0;
+
+    struct DirectoryEntry {
+        std::string name;
+        unsigned char type;  // DT_* from getdents64; DT_UNKNOWN when the file system does not say
+        ino_t inode;
+    };
+    // All entries of an open directory except "." and "..", sorted by name (byte order).
+    // Returns false with errno set on failure.
+    virtual bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) = 0;
+
+    virtual int mkdir(const std::string& path, mode_t mode) = 0;
+};
+
+}  // namespace tamber

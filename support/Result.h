@@ -1,0 +1,50 @@
+#pragma once
+
+#include <cassert>
+#include <optional>
+#include <utility>
+#include <variant>
+
+#include "support/Error.h"
+
+namespace tamber {
+
+// A value or an error. The success type may be void-like through `Result<std::monostate>`.
+template <class T>
+class Result {
+public:
+    Result(T value) : v_(std::move(value)) {}  // NOLINT: implicit by design
+    Result(Error error) : v_(std::move(error)) {}  // NOLINT
+
+    bool ok() const { return v_.index() == 0; }
+    explicit operator bool() const { return ok(); }
+
+    T& value() & {
+        assert(ok());
+        return std::get<0>(v_);
+    }
+    const T& value() const& {
+        assert(ok());
+        return std::get<0>(v_);
+    }
+    T&& value() && {
+        assert(ok());
+        return std::get<0>(std::move(v_));
+    }
+    const Error& error() const {
+        assert(!ok());
+        return std::get<1>(v_);
+    }
+    T* operator->() { return &value(); }
+    const T* operator->() const { return &value(); }
+    T& operator*() & { return value(); }
+    const T& operator*() const& { return value(); }
+
+private:
+    std::variant<T, Error> v_;
+};
+
+// The outcome of an operation with no value: no error means success.
+using Status = std::optional<Error>;
+
+}  // namespace tamber
