@@ -1,0 +1,26 @@
+#pragma once
+
+#include "platform/FileSystem.h"
+
+namespace tamber {
+
+// The real system calls. Attribute names gain the "user." prefix here and nowhere else.
+class LinuxFileSystem : public FileSystem {
+public:
+    int open(const std::string& path, int flags, mode_t mode) override;
+    int openat(int dirfd, const std::string& name, int flags, mode_t mode) override;
+    int close(int fd) override;
+    int statx(int dirfd, const std::string& path, int flags, unsigned int mask,
+              struct statx* out) override;
+    int faccessat(int dirfd, const std::string& path, int mode, int flags) override;
+    ssize_t lgetxattr(const std::string& path, const std::string& name, void* value,
+                      size_t size) override;
+    ssize_t llistxattr(const std::string& path, char* list, size_t size) override;
+    int fsetxattr(int fd, const std::string& name, const void* value, size_t size,
+                  int flags) override;
+    int fremovexattr(int fd, const std::string& name) override;
+    bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) override;
+    int mkdir(const std::string& path, mode_t mode) override;
+};
+
+}  // namespace tamber
