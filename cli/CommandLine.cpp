@@ -1,14 +1,45 @@
 #include "cli/CommandLine.h"
 
+#include <iostream>
+#include <memory>
+#include <vector>
+
 #include <CLI/CLI.hpp>
+
+#include "cli/CliContext.h"
+#include "cli/MetaCommand.h"
+#include "support/Log.h"
 
 namespace tamber {
 
-int runCommandLine(int argc, char** argv) {
-    CLI::App app{"tamber: publishes on-disk documents to a file browser"};
-    app.set_version_flag("--version", TAMBER_VERSION);
-    CLI11_PARSE(app, argc, argv);
-    return 0;
+int runCommandLine(int argc, char** argv) { return runCommandLine(argc, argv, std::cout, std::cerr); }
+
+int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) {
+    CliContext context(out, err);
+    CLI::App app{"tamber: publishes a device's documents to a file browser, addressed by "
+                 "persistent identifiers"};
+    app.set_version_flag("--version", std::string("tamber ") + TAMBER_VERSION);
+    app.add_option("--storage", context.storagePath,
+                   "The document storage folder (default ~/Documents; created when missing)");
+    app.add_flag("--debug", context.debug, "Write debug log lines");
+    app.require_subcommand(1);
+
+    std::vector<std::unique_ptr<Command>> commands;
+    commands.push_back(std::make_unique<MetaCommand>());
+    std::vector<std::pair<CLI::App*, Command*>> verbs;
+    for (auto& c : commands) verbs.emplace_back(c->add(app), c.get());
+
+    try {
+        app.parse(argc, argv);
+    } catch (const CLI::ParseError& e) {
+        return app.exit(e, out, err);
+    }
+    Log::shared().setDebugEnabled(context.debug);
+    if (auto error = context.prepareStorage()) return context.fail(*error, false);
+    for (auto& [sub, command] : verbs) {
+        if (sub->parsed()) return command->run(context);
+    }
+    return 2;
 }
 
 }  // namespace tamber

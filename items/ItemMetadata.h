@@ -1,0 +1,51 @@
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/Url.h"
+#include "platform/objects/Data.h"
+#include "platform/objects/Date.h"
+#include "platform/objects/Number.h"
+#include "platform/objects/String.h"
+#include "support/Result.h"
+
+namespace tamber {
+
+// The user metadata kept in an item's extended attributes, decoded. Each value is a keyed
+// archive; a missing or undecodable attribute leaves its field empty.
+struct ItemMetadata {
+    std::shared_ptr<const Date> lastUsedDate;
+    // The tag labels as stored, and the same tags (no colour) as platform tag data.
+    std::optional<std::vector<std::string>> tagLabels;
+    std::optional<Bytes> tagData;
+    std::shared_ptr<const Number> favoriteRank;
+    std::shared_ptr<const Date> trashDate;
+    // The path the item was trashed from, relative to its library.
+    std::shared_ptr<const String> putBack;
+
+    // Reads all five attributes. One attribute listing first, so that an item without
+    // metadata (the common case) costs one call instead of five.
+    static ItemMetadata read(const Url& url);
+
+    static std::shared_ptr<const Date> readLastUsedDate(const Url& url);
+    static std::optional<std::vector<std::string>> readTagLabels(const Url& url);
+    static std::shared_ptr<const Number> readFavoriteRank(const Url& url);
+    static std::shared_ptr<const Date> readTrashDate(const Url& url);
+    static std::shared_ptr<const String> readPutBack(const Url& url);
+
+    // Writers. Nothing removes the attribute, except for tags: absent or undecodable tag data
+    // is written as an empty list, and the tags attribute is never removed.
+    static Status writeLastUsedDate(const Url& url, const std::shared_ptr<const Date>& date);
+    static Status writeTagData(const Url& url, const std::optional<Bytes>& tagData);
+    static Status writeFavoriteRank(const Url& url, const std::shared_ptr<const Number>& rank);
+    static Status writeTrashDate(const Url& url, const std::shared_ptr<const Date>& date);
+    static Status writePutBack(const Url& url, const std::shared_ptr<const String>& path);
+
+    // Tag data for labels, each a tag without colour.
+    static Bytes tagDataForLabels(const std::vector<std::string>& labels);
+};
+
+}  // namespace tamber
