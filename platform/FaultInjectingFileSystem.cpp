@@ -1,0 +1,192 @@
+#include "platform/FaultInjectingFileSystem.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+
+namespace tamber {
+
+namespace {
+
+std::string descriptorPath(int fd) {
+    std::string link = "/proc/self/fd/" + std::to_string(fd);
+    char buffer[PATH_MAX];
+    ssize_t n = ::readlink(link.c_str(), buffer, sizeof buffer);
+    return n < 0 ? std::string() : std::string(buffer, static_cast<size_t>(n));
+}
+
+}  // namespace
+
+std::string_view FaultInjectingFileSystem::operationName(Operation op) {
+    switch (op) {
+        case Operation::Open:
+            return "open";
+        case Operation::Openat:
+            return "openat";
+        case Operation::Close:
+            return "close";
+        case Operation::Statx:
+            return "statx";
+        case Operation::Faccessat:
+            return "faccessat";
+        case Operation::Lgetxattr:
+            return "lgetxattr";
+        case Operation::Llistxattr:
+            return "llistxattr";
+        case Operation::Fsetxattr:
+            return "fsetxattr";
+        case Operation::Fremovexattr:
+            return "fremovexattr";
+        case Operation::ReadDirectory:
+            return "readDirectory";
+        case Operation::Mkdir:
+            return "mkdir";
+    }
+    return "unknown";
+}
+
+FaultInjectingFileSystem::FaultInjectingFileSystem(std::shared_ptr<FileSystem> inner)
+    : inner_(std::move(inner)) {}
+
+void FaultInjectingFileSystem::inject(Operation op, int errnoValue, int times,
+                                      std::string pathSubstring) {
+    if (times == 0)
+        return;
+    std::lock_guard lock(mutex_);
+    injections_.push_back({op, errnoValue, times, std::move(pathSubstring)});
+}
+
+void FaultInjectingFileSystem::clearInjections() {
+    std::lock_guard lock(mutex_);
+    injections_.clear();
+}
+
+size_t FaultInjectingFileSystem::pendingInjections() const {
+    std::lock_guard lock(mutex_);
+    size_t pending = 0;
+    for (const Injection& injection : injections_) {
+        pending += injection.remaining < 0 ? 1 : static_cast<size_t>(injection.remaining);
+    }
+    return pending;
+}
+
+size_t FaultInjectingFileSystem::calls(Operation op) const {
+    return calls_[static_cast<size_t>(op)].load();
+}
+
+void FaultInjectingFileSystem::resetCalls() {
+    for (auto& count : calls_) count.store(0);
+}
+
+std::string FaultInjectingFileSystem::describe(const Subject& subject) {
+    if (subject.path.starts_with('/'))
+        return std::string(subject.path);
+    std::string base;
+    if (subject.fd >= 0) {
+        base = descriptorPath(subject.fd);
+    } else if (subject.fd == AT_FDCWD) {
+        char cwd[PATH_MAX];
+        if (::getcwd(cwd, sizeof cwd))
+            base = cwd;
+    }
+    if (subject.path.empty())
+        return base;
+    return base + "/" + std::string(subject.path);
+}
+
+bool FaultInjectingFileSystem::shouldFail(Operation op, const Subject& subject) {
+    calls_[static_cast<size_t>(op)].fetch_add(1);
+    std::lock_guard lock(mutex_);
+    std::string path;
+    bool described = false;
+    for (auto it = injections_.begin(); it != injections_.end(); ++it) {
+        if (it->op != op)
+            continue;
+        if (!it->pathSubstring.empty()) {
+            if (!described) {
+                path = describe(subject);
+                described = true;
+            }
+            if (path.find(it->pathSubstring) == std::string::npos)
+                continue;
+        }
+        int errnoValue = it->errnoValue;
+        if (it->remaining > 0 && --it->remaining == 0)
+            injections_.erase(it);
+        errno = errnoValue;
+        return true;
+    }
+    return false;
+}
+
+int FaultInjectingFileSystem::open(const std::string& path, int flags, mode_t mode) {
+    if (shouldFail(Operation::Open, {AT_FDCWD, path}))
+        return -1;
+    return inner_->open(path, flags, mode);
+}
+
+int FaultInjectingFileSystem::openat(int dirfd, const std::string& name, int flags, mode_t mode) {
+    if (shouldFail(Operation::Openat, {dirfd, name}))
+        return -1;
+    return inner_->openat(dirfd, name, flags, mode);
+}
+
+int FaultInjectingFileSystem::close(int fd) {
+    if (shouldFail(Operation::Close, {fd, {}}))
+        return -1;
+    return inner_->close(fd);
+}
+
+int FaultInjectingFileSystem::statx(int dirfd, const std::string& path, int flags,
+                                    unsigned int mask, struct statx* out) {
+    if (shouldFail(Operation::Statx, {dirfd, path}))
+        return -1;
+    return inner_->statx(dirfd, path, flags, mask, out);
+}
+
+int FaultInjectingFileSystem::faccessat(int dirfd, const std::string& path, int mode, int flags) {
+    if (shouldFail(Operation::Faccessat, {dirfd, path}))
+        return -1;
+    return inner_->faccessat(dirfd, path, mode, flags);
+}
+
+ssize_t FaultInjectingFileSystem::lgetxattr(const std::string& path, const std::string& name,
+                                            void* value, size_t size) {
+    if (shouldFail(Operation::Lgetxattr, {AT_FDCWD, path}))
+        return -1;
+    return inner_->lgetxattr(path, name, value, size);
+}
+
+ssize_t FaultInjectingFileSystem::llistxattr(const std::string& path, char* list, size_t size) {
+    if (shouldFail(Operation::Llistxattr, {AT_FDCWD, path}))
+        return -1;
+    return inner_->llistxattr(path, list, size);
+}
+
+int FaultInjectingFileSystem::fsetxattr(int fd, const std::string& name, const void* value,
+                                        size_t size, int flags) {
+    if (shouldFail(Operation::Fsetxattr, {fd, {}}))
+        return -1;
+    return inner_->fsetxattr(fd, name, value, size, flags);
+}
+
+int FaultInjectingFileSystem::fremovexattr(int fd, const std::string& name) {
+    if (shouldFail(Operation::Fremovexattr, {fd, {}}))
+        return -1;
+    return inner_->fremovexattr(fd, name);
+}
+
+bool FaultInjectingFileSystem::readDirectory(int dirfd, std::vector<DirectoryEntry>& out) {
+    if (shouldFail(Operation::ReadDirectory, {dirfd, {}}))
+        return false;
+    return inner_->readDirectory(dirfd, out);
+}
+
+int FaultInjectingFileSystem::mkdir(const std::string& path, mode_t mode) {
+    if (shouldFail(Operation::Mkdir, {AT_FDCWD, path}))
+        return -1;
+    return inner_->mkdir(path, mode);
+}
+
+}  // namespace tamber

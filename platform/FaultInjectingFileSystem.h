@@ -1,0 +1,91 @@
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <cstddef>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/FileSystem.h"
+
+namespace tamber {
+
+// Forwards every call to another file system, except those a test asked to fail: a failing call
+// sets errno and returns the call's failure value without reaching the inner file system.
+// Counts every call per operation, failed or not. Safe to use from several threads.
+class FaultInjectingFileSystem : public FileSystem {
+  public:
+    enum class Operation {
+        Open,
+        Openat,
+        Close,
+        Statx,
+        Faccessat,
+        Lgetxattr,
+        Llistxattr,
+        Fsetxattr,
+        Fremovexattr,
+        ReadDirectory,
+        Mkdir,
+    };
+    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::Mkdir) + 1;
+    static std::string_view operationName(Operation op);
+
+    explicit FaultInjectingFileSystem(std::shared_ptr<FileSystem> inner);
+
+    // The next `times` calls of `op` whose path contains `pathSubstring` fail with `errnoValue`;
+    // `times` < 0 means every such call from now on. For calls that take a descriptor the path
+    // is the one the descriptor was opened with (as /proc reports it); for a name relative to a
+    // directory descriptor, that directory's path, "/", and the name. An empty substring matches
+    // every call. Injections are tried in the order they were made.
+    void inject(Operation op, int errnoValue, int times = 1, std::string pathSubstring = "");
+    void clearInjections();
+    // Injected failures not yet used up (forever-injections count as one).
+    size_t pendingInjections() const;
+
+    // How many calls of `op` were made, including the failed ones.
+    size_t calls(Operation op) const;
+    void resetCalls();
+
+    int open(const std::string& path, int flags, mode_t mode) override;
+    int openat(int dirfd, const std::string& name, int flags, mode_t mode) override;
+    int close(int fd) override;
+    int statx(int dirfd, const std::string& path, int flags, unsigned int mask,
+              struct statx* out) override;
+    int faccessat(int dirfd, const std::string& path, int mode, int flags) override;
+    ssize_t lgetxattr(const std::string& path, const std::string& name, void* value,
+                      size_t size) override;
+    ssize_t llistxattr(const std::string& path, char* list, size_t size) override;
+    int fsetxattr(int fd, const std::string& name, const void* value, size_t size,
+                  int flags) override;
+    int fremovexattr(int fd, const std::string& name) override;
+    bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) override;
+    int mkdir(const std::string& path, mode_t mode) override;
+
+  private:
+    struct Injection {
+        Operation op;
+        int errnoValue;
+        int remaining;
+        std::string pathSubstring;
+    };
+    // A path, or how to build it when an injection needs to look at it.
+    struct Subject {
+        int fd = -1;  // a descriptor, or the directory of a relative name
+        std::string_view path;
+    };
+
+    // Counts the call; true (with errno set) when it must fail.
+    bool shouldFail(Operation op, const Subject& subject);
+    static std::string describe(const Subject& subject);
+
+    std::shared_ptr<FileSystem> inner_;
+    std::array<std::atomic<size_t>, kOperationCount> calls_{};
+    mutable std::mutex mutex_;
+    std::vector<Injection> injections_;
+};
+
+}  // namespace tamber

@@ -1,0 +1,171 @@
+#include "platform/LinuxFileSystem.h"
+
+#include <sys/syscall.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstddef>
+#include <cstdint>
+#include <cstring>
+#include <string_view>
+
+namespace tamber {
+
+namespace {
+
+constexpr std::string_view kUserPrefix = "user.";
+
+std::string userName(const std::string& name) {
+    std::string full;
+    full.reserve(kUserPrefix.size() + name.size());
+    full.append(kUserPrefix).append(name);
+    return full;
+}
+
+// Offsets in a getdents64 record (struct linux_dirent64): inode, next offset, record length,
+// type, then the NUL-terminated name.
+constexpr size_t kInodeOffset = 0;
+constexpr size_t kLengthOffset = 16;
+constexpr size_t kTypeOffset = 18;
+constexpr size_t kNameOffset = 19;
+
+// Reads every entry of `fd` from its current offset to the end.
+bool readAllEntries(int fd, std::vector<FileSystem::DirectoryEntry>& out) {
+    alignas(8) char buffer[32 * 1024];
+    for (;;) {
+        long n = ::syscall(SYS_getdents64, fd, buffer, sizeof buffer);
+        if (n < 0) {
+            if (errno == EINTR)
+                continue;
+            return false;
+        }
+        if (n == 0)
+            return true;
+        for (long pos = 0; pos < n;) {
+            const char* record = buffer + pos;
+            uint64_t inode;
+            unsigned short length;
+            std::memcpy(&inode, record + kInodeOffset, sizeof inode);
+            std::memcpy(&length, record + kLengthOffset, sizeof length);
+            auto type = static_cast<unsigned char>(record[kTypeOffset]);
+            std::string_view name(record + kNameOffset);
+            pos += length;
+            if (name == "." || name == "..")
+                continue;
+            out.push_back({std::string(name), type, static_cast<ino_t>(inode)});
+        }
+    }
+}
+
+}  // namespace
+
+int LinuxFileSystem::open(const std::string& path, int flags, mode_t mode) {
+    return ::open(path.c_str(), flags | O_CLOEXEC, mode);
+}
+
+int LinuxFileSystem::openat(int dirfd, const std::string& name, int flags, mode_t mode) {
+    return ::openat(dirfd, name.c_str(), flags | O_CLOEXEC, mode);
+}
+
+int LinuxFileSystem::close(int fd) {
+    return ::close(fd);
+}
+
+int LinuxFileSystem::statx(int dirfd, const std::string& path, int flags, unsigned int mask,
+                           struct statx* out) {
+    return ::statx(dirfd, path.c_str(), flags, mask, out);
+}
+
+int LinuxFileSystem::faccessat(int dirfd, const std::string& path, int mode, int flags) {
+    return ::faccessat(dirfd, path.c_str(), mode, flags);
+}
+
+ssize_t LinuxFileSystem::lgetxattr(const std::string& path, const std::string& name, void* value,
+                                   size_t size) {
+    return ::lgetxattr(path.c_str(), userName(name).c_str(), value, size);
+}
+
+ssize_t LinuxFileSystem::llistxattr(const std::string& path, char* list, size_t size) {
+    // The kernel's list has every namespace; read it whole, then keep the user names without
+    // their prefix. The list may grow between the two calls, hence the loop.
+    std::vector<char> raw;
+    for (;;) {
+        ssize_t needed = ::llistxattr(path.c_str(), nullptr, 0);
+        if (needed < 0)
+            return -1;
+        if (needed == 0)
+            return 0;
+        raw.resize(static_cast<size_t>(needed));
+        ssize_t got = ::llistxattr(path.c_str(), raw.data(), raw.size());
+        if (got >= 0) {
+            raw.resize(static_cast<size_t>(got));
+            break;
+        }
+        if (errno != ERANGE)
+            return -1;
+    }
+
+    std::string names;
+    for (size_t pos = 0; pos < raw.size();) {
+        const char* start = raw.data() + pos;
+        size_t length = ::strnlen(start, raw.size() - pos);
+        std::string_view name(start, length);
+        pos += length + 1;
+        if (name.size() > kUserPrefix.size() && name.starts_with(kUserPrefix)) {
+            names.append(name.substr(kUserPrefix.size()));
+            names.push_back('\0');
+        }
+    }
+    if (size == 0)
+        return static_cast<ssize_t>(names.size());
+    if (size < names.size()) {
+        errno = ERANGE;
+        return -1;
+    }
+    std::memcpy(list, names.data(), names.size());
+    return static_cast<ssize_t>(names.size());
+}
+
+int LinuxFileSystem::fsetxattr(int fd, const std::string& name, const void* value, size_t size,
+                               int flags) {
+    return ::fsetxattr(fd, userName(name).c_str(), value, size, flags);
+}
+
+int LinuxFileSystem::fremovexattr(int fd, const std::string& name) {
+    return ::fremovexattr(fd, userName(name).c_str());
+}
+
+bool LinuxFileSystem::readDirectory(int dirfd, std::vector<DirectoryEntry>& out) {
+    out.clear();
+    // A description of our own leaves the caller's offset alone. Opening "." needs search
+    // permission, which a readable directory may lack; then read the caller's fd from the start.
+    int own = ::openat(dirfd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    bool ok;
+    if (own >= 0) {
+        ok = readAllEntries(own, out);
+        int saved = errno;
+        ::close(own);
+        errno = saved;
+    } else {
+        if (::lseek(dirfd, 0, SEEK_SET) < 0)
+            return false;
+        ok = readAllEntries(dirfd, out);
+    }
+    if (!ok) {
+        int saved = errno;
+        out.clear();
+        errno = saved;
+        return false;
+    }
+    std::sort(out.begin(), out.end(),
+              [](const DirectoryEntry& a, const DirectoryEntry& b) { return a.name < b.name; });
+    return true;
+}
+
+int LinuxFileSystem::mkdir(const std::string& path, mode_t mode) {
+    return ::mkdir(path.c_str(), mode);
+}
+
+}  // namespace tamber

@@ -1,0 +1,186 @@
+#include "platform/ResourceValues.h"
+
+#include <cerrno>
+#include <optional>
+
+#include "platform/FileSystem.h"
+#include "platform/TypeIdentifiers.h"
+#include "platform/UrlPath.h"
+#include "platform/objects/Date.h"
+#include "platform/objects/Number.h"
+#include "platform/objects/String.h"
+
+namespace tamber::ResourceValues {
+
+namespace {
+
+namespace K = ResourceKeys;
+
+constexpr ResourceKey kAllKeys[] = {
+    K::kName,
+    K::kLocalizedName,
+    K::kParentDirectoryURL,
+    K::kTypeIdentifier,
+    K::kFileSize,
+    K::kCreationDate,
+    K::kContentModificationDate,
+    K::kIsReadable,
+    K::kIsWritable,
+    K::kIsDirectory,
+    K::kIsPackage,
+    K::kIsSymbolicLink,
+    K::kLinkCount,
+    K::kFileID,
+    K::kDocumentID,
+};
+
+// The statx fields a key needs. Every fetch asks for the file type, which also tells whether
+// the file exists.
+unsigned int maskFor(ResourceKey key) {
+    if (key == K::kFileSize)
+        return STATX_SIZE;
+    if (key == K::kCreationDate)
+        return STATX_BTIME;
+    if (key == K::kContentModificationDate)
+        return STATX_MTIME;
+    if (key == K::kLinkCount)
+        return STATX_NLINK;
+    if (key == K::kFileID)
+        return STATX_INO;
+    return 0;
+}
+
+Error errorFor(int error, const std::string& path) {
+    if (error == ENOENT || error == ENOTDIR)
+        return Error::fileNoSuchFile(path);
+    return Error::posix(error);
+}
+
+ObjectRef dateFrom(const struct statx_timestamp& t) {
+    return Date::make(static_cast<double>(t.tv_sec) + static_cast<double>(t.tv_nsec) / 1e9);
+}
+
+// Whether the file at `path` grants `mode` to this process; an error when the check fails
+// for another reason than the answer being no.
+Result<bool> access(const std::string& path, int mode, bool isSymbolicLink) {
+    FileSystem& fs = FileSystem::current();
+    if (fs.faccessat(AT_FDCWD, path, mode, AT_EACCESS | AT_SYMLINK_NOFOLLOW) == 0)
+        return true;
+    int error = errno;
+    if (error == EINVAL) {
+        // No kernel support for checking a link itself. Linux never checks a link's own
+        // permissions, so a link is accessible; anything else is not a link and can be
+        // checked without the flag.
+        if (isSymbolicLink)
+            return true;
+        if (fs.faccessat(AT_FDCWD, path, mode, AT_EACCESS) == 0)
+            return true;
+        error = errno;
+    }
+    switch (error) {
+        case EACCES:
+        case EPERM:
+        case EROFS:
+        case ETXTBSY:
+            return false;
+        default:
+            return errorFor(error, path);
+    }
+}
+
+ObjectRef unsignedValue(uint64_t value) {
+    return Number::fromUInt64(value);
+}
+
+}  // namespace
+
+bool isKnownKey(ResourceKey key) {
+    for (ResourceKey known : kAllKeys) {
+        if (known == key)
+            return true;
+    }
+    return false;
+}
+
+bool isReadFromFile(ResourceKey key) {
+    return key != K::kDocumentID && isKnownKey(key);
+}
+
+Error unknownKeyError(ResourceKey key) {
+    return Error(kPosixErrorDomain, EINVAL,
+                 {{"description", "Unknown resource key " + std::string(key) + "."},
+                  {"key", std::string(key)}});
+}
+
+Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<ResourceKey>& keys) {
+    unsigned int mask = STATX_TYPE | STATX_MODE;
+    for (ResourceKey key : keys) {
+        if (!isReadFromFile(key))
+            return unknownKeyError(key);
+        mask |= maskFor(key);
+    }
+
+    struct statx st {};
+    if (FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, mask, &st) != 0) {
+        return errorFor(errno, path);
+    }
+    const bool isDirectory = S_ISDIR(st.stx_mode);
+    const bool isSymbolicLink = S_ISLNK(st.stx_mode);
+    const std::string_view name = UrlPath::lastComponent(path);
+    auto has = [&](unsigned int field) { return (st.stx_mask & field) != 0; };
+
+    std::vector<ObjectRef> values;
+    values.reserve(keys.size());
+    for (ResourceKey key : keys) {
+        ObjectRef value;
+        if (key == K::kName || key == K::kLocalizedName) {
+            value = String::make(std::string(name));
+        } else if (key == K::kParentDirectoryURL) {
+            if (path != "/") {
+                value = std::make_shared<UrlObject>(
+                    Url::fileURLWithPath(UrlPath::deletingLastComponent(path)));
+            }
+        } else if (key == K::kTypeIdentifier) {
+            std::string type;
+            if (isSymbolicLink) {
+                type = TypeIdentifiers::kSymbolicLink;
+            } else if (isDirectory || S_ISREG(st.stx_mode)) {
+                type = TypeIdentifierForName(name, isDirectory);
+            } else {
+                type = TypeIdentifiers::kItem;  // sockets, pipes, devices
+            }
+            value = String::make(std::move(type));
+        } else if (key == K::kFileSize) {
+            if (!isDirectory && has(STATX_SIZE))
+                value = unsignedValue(st.stx_size);
+        } else if (key == K::kCreationDate) {
+            if (has(STATX_BTIME))
+                value = dateFrom(st.stx_btime);
+        } else if (key == K::kContentModificationDate) {
+            if (has(STATX_MTIME))
+                value = dateFrom(st.stx_mtime);
+        } else if (key == K::kIsReadable || key == K::kIsWritable) {
+            Result<bool> allowed =
+                access(path, key == K::kIsReadable ? R_OK : W_OK, isSymbolicLink);
+            if (!allowed)
+                return allowed.error();
+            value = Number::fromBool(*allowed);
+        } else if (key == K::kIsDirectory) {
+            value = Number::fromBool(isDirectory);
+        } else if (key == K::kIsSymbolicLink) {
+            value = Number::fromBool(isSymbolicLink);
+        } else if (key == K::kIsPackage) {
+            value = Number::fromBool(isDirectory && IsPackageName(name));
+        } else if (key == K::kLinkCount) {
+            if (has(STATX_NLINK))
+                value = unsignedValue(st.stx_nlink);
+        } else if (key == K::kFileID) {
+            if (has(STATX_INO))
+                value = unsignedValue(st.stx_ino);
+        }
+        values.push_back(std::move(value));
+    }
+    return values;
+}
+
+}  // namespace tamber::ResourceValues
