@@ -2,6 +2,7 @@
 
 #include <iostream>
 #include <memory>
+#include <string_view>
 #include <vector>
 
 #include <CLI/CLI.hpp>
@@ -35,7 +36,11 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
         return app.exit(e, out, err);
     }
     Log::shared().setDebugEnabled(context.debug);
-    if (auto error = context.prepareStorage()) return context.fail(*error, false);
+    if (auto error = context.prepareStorage()) {
+        bool json = false;
+        for (int i = 1; i < argc; ++i) json = json || std::string_view(argv[i]) == "--json";
+        return context.fail(*error, json);
+    }
     for (auto& [sub, command] : verbs) {
         if (sub->parsed()) return command->run(context);
     }

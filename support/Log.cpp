@@ -124,7 +124,12 @@ void logFormat(LogLevel level, std::string_view format, std::initializer_list<Fo
 }
 
 void fatalError(std::string_view message) {
-    Log::shared().write(LogLevel::Error, std::string("[ERROR] fatal: ").append(message));
+    std::string line = std::string("[ERROR] fatal: ").append(message);
+    Log::shared().write(LogLevel::Error, line);
+    // The journal may be where the line went; the person at the terminal should see it too.
+    if (!std::dynamic_pointer_cast<StderrLogSink>(Log::shared().sink())) {
+        StderrLogSink().write(LogLevel::Error, line);
+    }
     std::abort();
 }
 
