@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <string_view>
+#include <vector>
 
 #include "platform/objects/Data.h"
 #include "platform/objects/Object.h"
@@ -28,6 +29,8 @@ public:
     void encodeBool(bool value, std::string_view key);
     // An array of object references (what Array uses).
     void encodeObjects(const std::vector<ObjectRef>& objects, std::string_view key);
+    // Stops the archive: archivedDataWithRootObject returns the first error reported.
+    void failWithError(Error error);
 
     class Impl;
     explicit KeyedArchiver(Impl& impl) : impl_(impl) {}

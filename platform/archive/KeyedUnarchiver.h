@@ -33,9 +33,11 @@ public:
     template <class T>
     static Result<std::shared_ptr<const T>> unarchivedObjectOfClass(const Bytes& data) {
         auto r = unarchivedObjectOfClasses({std::string(T::kClassName)}, data);
-        if (!r.ok()) return r.error();
+        if (!r.ok())
+            return r.error();
         auto typed = objectCast<T>(r.value());
-        if (!typed) return wrongClassError(T::kClassName, r.value());
+        if (!typed)
+            return wrongClassError(T::kClassName, r.value());
         return typed;
     }
 
@@ -47,6 +49,22 @@ public:
     std::optional<uint64_t> decodeUInt64(std::string_view key);
     std::optional<double> decodeDouble(std::string_view key);
     std::optional<bool> decodeBool(std::string_view key);
+    // Like decodeObject and decodeObjects, but the objects (and what they hold) may also be of
+    // `classes` when the unarchive is restricted: a class vouches for its own fields.
+    ObjectRef decodeObjectOfClasses(std::string_view key, const std::vector<std::string>& classes);
+    std::optional<std::vector<ObjectRef>> decodeObjectsOfClasses(
+        std::string_view key, const std::vector<std::string>& classes);
+    // Null or a T; an object of any other class fails the unarchive.
+    template <class T>
+    std::shared_ptr<const T> decodeObjectOfClass(std::string_view key) {
+        ObjectRef object = decodeObjectOfClasses(key, {std::string(T::kClassName)});
+        if (!object)
+            return nullptr;
+        auto typed = objectCast<T>(object);
+        if (!typed)
+            failWithError(wrongClassError(T::kClassName, object));
+        return typed;
+    }
     bool containsValue(std::string_view key) const;
     void failWithError(Error error);
 
