@@ -177,8 +177,15 @@ Result<ObjectRef> Url::resourceValue(ResourceKey key) const {
         // Only a found ID is kept: the service may assign one later.
         DocumentIdLookup lookup = gDocumentIdLookup.load();
         std::optional<uint32_t> id = lookup ? lookup(storage_->text) : std::nullopt;
-        if (!id)
+        if (!id) {
+            // No ID yet is a normal answer for a file that exists; a vanished file is an error,
+            // as for every other key.
+            Result<std::vector<ObjectRef>> exists =
+                ResourceValues::read(storage_->text, {ResourceKeys::kFileID});
+            if (!exists)
+                return exists.error();
             return ObjectRef();
+        }
         value = Number::fromUInt64(*id);
     } else {
         Result<std::vector<ObjectRef>> values = ResourceValues::read(storage_->text, {key});

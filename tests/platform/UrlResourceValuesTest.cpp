@@ -245,8 +245,9 @@ std::optional<uint32_t> lookupFor(const std::string& path) {
 }
 
 TEST_F(UrlResourceValuesTest, DocumentIdsComeFromTheInstalledLookup) {
-    Url known = Url::fileURLWithPath(dir_ / "known");
-    Url unknown = Url::fileURLWithPath(dir_ / "unknown");
+    Url known = Url::fileURLWithPath(dir_.writeFile("known"));
+    Url unknown = Url::fileURLWithPath(dir_.writeFile("unknown"));
+    fs_->resetCalls();
     EXPECT_EQ(value(known, K::kDocumentID), nullptr);
     struct Uninstall {
         ~Uninstall() { setDocumentIdLookup(nullptr); }
@@ -256,7 +257,11 @@ TEST_F(UrlResourceValuesTest, DocumentIdsComeFromTheInstalledLookup) {
     EXPECT_EQ(value(unknown, K::kDocumentID), nullptr);
     setDocumentIdLookup(nullptr);
     EXPECT_EQ(unsignedValue(known, K::kDocumentID), 99u) << "a found ID is cached";
-    EXPECT_EQ(fs_->calls(Op::Statx), 0u);
+    // Only the answers "no ID" looked at the disk, to tell a vanished file from a new one.
+    EXPECT_EQ(fs_->calls(Op::Statx), 2u);
+    auto gone = Url::fileURLWithPath(dir_ / "gone").resourceValue(K::kDocumentID);
+    ASSERT_FALSE(gone.ok());
+    EXPECT_TRUE(gone.error().is(kHostPlatformErrorDomain, 260));
 }
 
 TEST_F(UrlResourceValuesTest, OneStatxServesAPrefetch) {

@@ -1,0 +1,276 @@
+#include "items/TBFileObjectIdentifier.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+#include <charconv>
+#include <climits>
+#include <string>
+
+#include "host/HostPorterManager.h"
+#include "host/UrlOperations.h"
+#include "items/AppLibraryLookup.h"
+#include "items/TBPFileObjectIdentifier.h"
+#include "platform/FileSystem.h"
+#include "platform/objects/Number.h"
+#include "platform/strata/AttributeList.h"
+#include "platform/strata/StrataService.h"
+#include "support/Log.h"
+
+namespace tamber {
+
+namespace {
+
+constexpr int kEventOnlyFlags = O_PATH | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
+
+// The descriptor of an open-for-events item, closed on every path out.
+class EventOnlyDescriptor {
+public:
+    explicit EventOnlyDescriptor(const std::string& path)
+        : fd_(FileSystem::current().open(path, kEventOnlyFlags)) {}
+    ~EventOnlyDescriptor() { close(); }
+    EventOnlyDescriptor(const EventOnlyDescriptor&) = delete;
+    EventOnlyDescriptor& operator=(const EventOnlyDescriptor&) = delete;
+    int get() const { return fd_; }
+    bool ok() const { return fd_ >= 0; }
+    void close() {
+        if (fd_ < 0) return;
+        int saved = errno;
+        FileSystem::current().close(fd_);
+        fd_ = -1;
+        errno = saved;
+    }
+
+private:
+    int fd_;
+};
+
+std::string pathOrUnknown(const Url& url) {
+    return url.path().empty() ? std::string("<Unknown File>") : url.path();
+}
+
+// The cached-or-read ID resource value: a number, nothing, or a read failure (logged).
+enum class IdRead { Value, Absent, Failed };
+
+IdRead readIdResource(const Url& url, ResourceKey key, const char* kind, uint64_t& value) {
+    auto result = url.resourceValue(key);
+    if (!result.ok()) {
+        const Error& error = result.error();
+        LogLevel level = error.is(kHostPlatformErrorDomain, kHostPlatformFileNoSuchFile)
+                             ? LogLevel::Info
+                             : LogLevel::Error;
+        logFormat(level, "can't get resource value for " + std::string(key) + "; %@",
+                  {error.description()});
+        return IdRead::Failed;
+    }
+    if (!result.value()) return IdRead::Absent;
+    auto number = objectCast<Number>(result.value());
+    if (!number) {
+        fatalError(formatPlatform(std::string("unexpected class for ") + kind +
+                                      " (expected: HostNumber, actual: %@) at %@",
+                                  {std::string(result.value()->className()), pathOrUnknown(url)}));
+    }
+    value = number->uint64Value();
+    return IdRead::Value;
+}
+
+uint64_t parseValue(const std::string& text) {
+    uint64_t value = 0;
+    auto [ptr, ec] = std::from_chars(text.data(), text.data() + text.size(), value);
+    (void)ptr;
+    return ec == std::errc() ? value : 0;
+}
+
+bool isRetriedErrno(int error) { return error == EAGAIN || error == EBUSY || error == ESTALE; }
+
+}  // namespace
+
+uint32_t TBFileObjectIdentifier::deviceIDWithError(const Url& url, Error* error) {
+    EventOnlyDescriptor fd(url.path());
+    CommonAttributes attributes;
+    if (!fd.ok() || GetAttributeList(fd.get(), attributes) != 0) {
+        int saved = errno;
+        if (error) *error = Error::posix(saved);
+        errno = saved;
+        return 0;
+    }
+    return attributes.device;
+}
+
+uint32_t TBFileObjectIdentifier::deviceID(const Url& url) { return deviceIDWithError(url, nullptr); }
+
+std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(const Url& url) {
+    if (!url.isFileURL()) {
+        logFormat(LogLevel::Error, "can't compute file object identifier if not a file URL", {});
+        return std::nullopt;
+    }
+    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
+    switch (pt_relationshipToItemAtURL(storage, url)) {
+        case UrlRelationship::Same:
+            return HostPorterRootContainerItemIdentifier;
+        case UrlRelationship::Contains:
+            break;
+        case UrlRelationship::Other: {
+            bool inLibrary = false;
+            auto lookup = AppLibraryLookup::current();
+            for (const Url& root : lookup ? lookup->rootURLsForAppLibraries() : std::vector<Url>{}) {
+                UrlRelationship r = pt_relationshipToItemAtURL(root, url);
+                if (r == UrlRelationship::Contains) {
+                    inLibrary = true;
+                    break;
+                }
+                if (r == UrlRelationship::Same)
+                    return TBPFileObjectIdentifier::fromAppLibraryDataContainerURL(root);
+            }
+            if (!inLibrary) {
+                logFormat(LogLevel::Info,
+                          "can't compute file object identifier because \"%@\" is not part of "
+                          "Tamber",
+                          {url.path()});
+                return std::nullopt;
+            }
+            break;
+        }
+    }
+
+    uint64_t cached = 0;
+    bool folder = pt_isFolder(url);
+    IdRead read = folder ? readIdResource(url, ResourceKeys::kFileID, "file ID", cached)
+                         : readIdResource(url, ResourceKeys::kDocumentID, "doc ID", cached);
+    if (read == IdRead::Failed) return std::nullopt;
+    if (read == IdRead::Value) {
+        return folder ? TBPFileObjectIdentifier::fromFileID(cached)
+                      : TBPFileObjectIdentifier::fromDocumentID(cached);
+    }
+
+    auto package = url.resourceValue(ResourceKeys::kIsPackage);
+    if (!package.ok()) {
+        logFormat(LogLevel::Error, "can't get resource HostURLIsPackageKey for \"%@\"; %@",
+                  {url.path(), package.error().description()});
+        return std::nullopt;
+    }
+    auto packageNumber = objectCast<Number>(package.value());
+    bool isPackage = packageNumber && packageNumber->boolValue();
+
+    EventOnlyDescriptor fd(url.path());
+    if (!fd.ok()) {
+        logFormat(LogLevel::Error, "can't open file at \"%@\"; %{errno}d",
+                  {url.path(), ErrnoArg{errno}});
+        return std::nullopt;
+    }
+    CommonAttributes attributes;
+    if (GetAttributeList(fd.get(), attributes) != 0) {
+        logFormat(LogLevel::Error, "can't get attribute list for \"%@\"; %{errno}d",
+                  {url.path(), ErrnoArg{errno}});
+        return std::nullopt;
+    }
+    uint32_t type = attributes.mode & 0xF000;
+    bool isDocument = type == 0x8000 || (type == 0x4000 && isPackage);
+    if (!isDocument) {
+        fd.close();
+        if (auto error = url.setResourceValue(Number::fromUInt64(attributes.fileId),
+                                              ResourceKeys::kFileID)) {
+            logFormat(LogLevel::Info,
+                      "can't cache value %@ for key HostURLFileResourceIdentifierKey; %@",
+                      {std::to_string(attributes.fileId), error->description()});
+        }
+        return TBPFileObjectIdentifier::fromFileID(attributes.fileId);
+    }
+
+    uint32_t documentId = attributes.documentId;
+    if (documentId == 0) documentId = StrataLibraryGetOrAllocateDocumentId(fd.get());
+    if (documentId == 0) {
+        logFormat(LogLevel::Error, "can't get permanent storage for \"%@\"", {url.path()});
+        return std::nullopt;
+    }
+    fd.close();
+    if (auto error =
+            url.setResourceValue(Number::fromUInt64(documentId), ResourceKeys::kDocumentID)) {
+        logFormat(LogLevel::Info, "can't cache value %@ for key HostURLDocumentIdentifierKey; %@",
+                  {std::to_string(documentId), error->description()});
+    }
+    return TBPFileObjectIdentifier::fromDocumentID(documentId);
+}
+
+std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(
+    const HostPorterItemIdentifier& identifier) {
+    if (identifier == HostPorterRootContainerItemIdentifier)
+        return HostPorterManager::defaultManager()->documentStorageURL();
+
+    std::vector<std::string> components;
+    size_t start = 0;
+    while (true) {
+        size_t eq = identifier.find('=', start);
+        components.push_back(identifier.substr(start, eq - start));
+        if (eq == std::string::npos) break;
+        start = eq + 1;
+    }
+    if (components.size() != 2) {
+        logFormat(LogLevel::Error,
+                  "invalid identifier; identifier should have 2 components, not %lu",
+                  {uint64_t(components.size())});
+        return std::nullopt;
+    }
+    const std::string& host = components[0];
+    if (host != "did" && host != "fid") {
+        logFormat(LogLevel::Error, "invalid host for identifier \"%@\"", {identifier});
+        return std::nullopt;
+    }
+    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
+    uint32_t device = deviceID(storage);
+    if (device == 0) {
+        logFormat(LogLevel::Error, "can't get device ID for \"%@\"; %{errno}d",
+                  {storage.path(), ErrnoArg{errno}});
+        return std::nullopt;
+    }
+    uint64_t value = parseValue(components[1]);
+    uint64_t fileId = value;
+    if (host == "did") {
+        // Document IDs are 32-bit; a larger number names no document.
+        uint32_t documentId = value > UINT32_MAX ? 0 : static_cast<uint32_t>(value);
+        fileId = StrataLibraryResolveDocumentId2(device, documentId);
+        for (int retry = 0; fileId == 0; ++retry) {
+            int error = errno;
+            if (!isRetriedErrno(error)) {
+                logFormat(LogLevel::Error, "can't resolve doc ID \"%lld\"; %{errno}d",
+                          {int64_t(value), ErrnoArg{error}});
+                return std::nullopt;
+            }
+            if (retry == kResolutionRetries) {
+                logFormat(LogLevel::Info, "can't resolve doc ID \"%lld\" after five attempts",
+                          {int64_t(value)});
+                return std::nullopt;
+            }
+            logFormat(LogLevel::Info,
+                      "doc ID resolution failed with errno(%d), let's try again after resting",
+                      {int64_t(error)});
+            ::usleep(kRetryRestMicroseconds);
+            fileId = StrataLibraryResolveDocumentId2(device, documentId);
+        }
+    }
+    return _fileURLWithFileIdentifier(fileId, device);
+}
+
+std::optional<Url> TBFileObjectIdentifier::fileURLWithFileIdentifier(uint64_t fileID) {
+    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
+    uint32_t device = deviceID(storage);
+    if (device == 0) {
+        logFormat(LogLevel::Error, "can't get device ID for \"%@\"; %{errno}d",
+                  {storage.path(), ErrnoArg{errno}});
+        return std::nullopt;
+    }
+    return _fileURLWithFileIdentifier(fileID, device);
+}
+
+std::optional<Url> TBFileObjectIdentifier::_fileURLWithFileIdentifier(uint64_t fileID,
+                                                                      uint32_t deviceID) {
+    char buffer[1024];
+    if (PathFromFileID(deviceID, fileID, buffer, sizeof buffer) != 0) {
+        logFormat(LogLevel::Info, "can't resolve path matching file ID \"%lld\"; %{errno}d",
+                  {int64_t(fileID), ErrnoArg{errno}});
+        return std::nullopt;
+    }
+    return Url::fileURLWithPath(buffer);
+}
+
+}  // namespace tamber

@@ -1,0 +1,35 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+
+#include "host/HostPorterItemIdentifier.h"
+#include "platform/Url.h"
+#include "support/Error.h"
+
+namespace tamber {
+
+// Identifiers of file URLs and back. Nothing here throws: every failure is one log line and an
+// empty result.
+class TBFileObjectIdentifier {
+public:
+    // The 32-bit device number of the volume holding the item; 0 (and a POSIX error when asked
+    // for) on failure.
+    static uint32_t deviceIDWithError(const Url& url, Error* error);
+    static uint32_t deviceID(const Url& url);
+
+    // The identifier of the item at `url`. Caches the file or document ID it found in the URL's
+    // resource values, so that a second call on the same URL is cheap.
+    static std::optional<HostPorterItemIdentifier> itemIdentifier(const Url& url);
+
+    static std::optional<Url> fileURLWithItemIdentifier(const HostPorterItemIdentifier& identifier);
+    static std::optional<Url> fileURLWithFileIdentifier(uint64_t fileID);
+    static std::optional<Url> _fileURLWithFileIdentifier(uint64_t fileID, uint32_t deviceID);
+
+    // How often a document-ID resolution is retried after a passing failure, and the rest
+    // between tries: at most about 5 ms on the caller's thread.
+    static constexpr int kResolutionRetries = 5;
+    static constexpr unsigned kRetryRestMicroseconds = 1000;
+};
+
+}  // namespace tamber
