@@ -35,17 +35,20 @@ int main(int argc, char** argv) {
     size_t count = argc > 1 ? std::strtoul(argv[1], nullptr, 10) : 20000;
     const char* tmp = argc > 2 ? argv[2] : (std::getenv("TMPDIR") ? std::getenv("TMPDIR") : "/tmp");
     std::string root = std::string(tmp) + "/tamber-bench-XXXXXX";
-    if (!mkdtemp(root.data())) return 1;
+    if (!mkdtemp(root.data()))
+        return 1;
 
     std::fprintf(stderr, "building %zu files under %s...\n", count, root.c_str());
     std::vector<std::string> paths;
     paths.reserve(count);
     for (size_t i = 0; i < count; ++i) {
         std::string dir = root + "/d" + std::to_string(i / 1000);
-        if (i % 1000 == 0) mkdir(dir.c_str(), 0755);
+        if (i % 1000 == 0)
+            mkdir(dir.c_str(), 0755);
         paths.push_back(dir + "/file-" + std::to_string(i) + ".txt");
         int fd = open(paths.back().c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0644);
-        if (fd < 0) return 1;
+        if (fd < 0)
+            return 1;
         close(fd);
         // A quarter of the files carry metadata, as a used library would.
         if (i % 4 == 0) {
@@ -66,7 +69,8 @@ int main(int argc, char** argv) {
                                  LocalItem::xattrTrashPutBackName()};
     double fiveReads = secondsFor(paths, [&](const std::string& p) {
         char buf[512];
-        for (const auto& n : names) seen += lgetxattr(p.c_str(), ("user." + n).c_str(), buf, 512) > 0;
+        for (const auto& n : names)
+            seen += lgetxattr(p.c_str(), ("user." + n).c_str(), buf, 512) > 0;
     });
     double metadata = secondsFor(paths, [&](const std::string& p) {
         ItemMetadata m = ItemMetadata::read(Url::fileURLWithPath(p));

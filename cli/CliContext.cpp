@@ -24,12 +24,15 @@ std::string defaultStoragePath() {
 bool makeDirectories(const std::string& path) {
     FileSystem& fs = FileSystem::current();
     for (size_t pos = 1; pos <= path.size(); ++pos) {
-        if (pos != path.size() && path[pos] != '/') continue;
+        if (pos != path.size() && path[pos] != '/')
+            continue;
         std::string prefix = path.substr(0, pos);
-        if (fs.mkdir(prefix, 0755) != 0 && errno != EEXIST) return false;
+        if (fs.mkdir(prefix, 0755) != 0 && errno != EEXIST)
+            return false;
     }
     struct statx st {};
-    if (fs.statx(AT_FDCWD, path, 0, STATX_TYPE, &st) != 0) return false;
+    if (fs.statx(AT_FDCWD, path, 0, STATX_TYPE, &st) != 0)
+        return false;
     if (!S_ISDIR(st.stx_mode)) {
         errno = ENOTDIR;
         return false;
@@ -60,16 +63,19 @@ Error CliContext::usageError(const std::string& message) {
 
 std::string CliContext::errorMessage(const Error& error) {
     auto it = error.userInfo().find("description");
-    if (it != error.userInfo().end()) return it->second;
-    if (error.domain() == kPosixErrorDomain) return std::strerror(static_cast<int>(error.code()));
+    if (it != error.userInfo().end())
+        return it->second;
+    if (error.domain() == kPosixErrorDomain)
+        return std::strerror(static_cast<int>(error.code()));
     std::string text = error.description();
     auto quote = text.find('"');
     return quote == std::string::npos ? text : text.substr(quote + 1, text.size() - quote - 2);
 }
 
 nlohmann::json CliContext::errorJson(const Error& error) {
-    return {{"error",
-             {{"domain", error.domain()}, {"code", error.code()}, {"message", errorMessage(error)}}}};
+    return {
+        {"error",
+         {{"domain", error.domain()}, {"code", error.code()}, {"message", errorMessage(error)}}}};
 }
 
 int CliContext::fail(const Error& error, bool json) {

@@ -13,12 +13,15 @@
 
 namespace tamber {
 
-int runCommandLine(int argc, char** argv) { return runCommandLine(argc, argv, std::cout, std::cerr); }
+int runCommandLine(int argc, char** argv) {
+    return runCommandLine(argc, argv, std::cout, std::cerr);
+}
 
 int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) {
     CliContext context(out, err);
-    CLI::App app{"tamber: publishes a device's documents to a file browser, addressed by "
-                 "persistent identifiers"};
+    CLI::App app{
+        "tamber: publishes a device's documents to a file browser, addressed by "
+        "persistent identifiers"};
     app.set_version_flag("--version", std::string("tamber ") + TAMBER_VERSION);
     app.add_option("--storage", context.storagePath,
                    "The document storage folder (default ~/Documents; created when missing)");
@@ -42,7 +45,8 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
         return context.fail(*error, json);
     }
     for (auto& [sub, command] : verbs) {
-        if (sub->parsed()) return command->run(context);
+        if (sub->parsed())
+            return command->run(context);
     }
     return 2;
 }

@@ -9,12 +9,14 @@
 namespace tamber {
 
 CLI::App* MetaCommand::add(CLI::App& app) {
-    auto* sub = app.add_subcommand("meta", "Show or change an item's tags, last-used date and "
-                                           "favourite rank");
+    auto* sub = app.add_subcommand("meta",
+                                   "Show or change an item's tags, last-used date and "
+                                   "favourite rank");
     sub->add_option("PATH", path_, "The file or folder")->required();
     sub->add_flag("--json", json_, "Print JSON");
-    sub->add_option("--set-tags", setTags_, "Replace the tags with these comma-separated labels "
-                                            "(\"\" clears them)");
+    sub->add_option("--set-tags", setTags_,
+                    "Replace the tags with these comma-separated labels "
+                    "(\"\" clears them)");
     sub->add_option("--set-rank", setRank_, "Set the favourite rank to an integer, or \"none\"");
     sub->add_option("--set-last-used", setLastUsed_,
                     "Set the last-used date: \"now\", \"none\" or an ISO 8601 UTC time "
@@ -29,7 +31,8 @@ nlohmann::json dateJson(const std::shared_ptr<const Date>& date) {
 }
 
 nlohmann::json numberJson(const std::shared_ptr<const Number>& n) {
-    if (!n) return nullptr;
+    if (!n)
+        return nullptr;
     switch (n->kind()) {
         case Number::Kind::Unsigned:
             return n->uint64Value();
@@ -48,9 +51,11 @@ std::vector<std::string> splitLabels(const std::string& text) {
     size_t start = 0;
     while (start <= text.size()) {
         size_t comma = text.find(',', start);
-        if (comma == std::string::npos) comma = text.size();
+        if (comma == std::string::npos)
+            comma = text.size();
         std::string label = text.substr(start, comma - start);
-        if (!label.empty()) labels.push_back(label);
+        if (!label.empty())
+            labels.push_back(label);
         start = comma + 1;
     }
     return labels;
@@ -60,7 +65,8 @@ std::vector<std::string> splitLabels(const std::string& text) {
 std::optional<double> parseIso8601(const std::string& text) {
     std::tm tm{};
     const char* end = strptime(text.c_str(), "%Y-%m-%dT%H:%M:%S", &tm);
-    if (!end) return std::nullopt;
+    if (!end)
+        return std::nullopt;
     double fraction = 0;
     if (*end == '.') {
         const char* digits = ++end;
@@ -70,9 +76,11 @@ std::optional<double> parseIso8601(const std::string& text) {
             scale /= 10;
             ++end;
         }
-        if (end == digits) return std::nullopt;
+        if (end == digits)
+            return std::nullopt;
     }
-    if (std::string_view(end) != "Z") return std::nullopt;
+    if (std::string_view(end) != "Z")
+        return std::nullopt;
     return static_cast<double>(timegm(&tm)) + fraction;
 }
 
@@ -101,7 +109,8 @@ Status MetaCommand::applyChanges(const Url& url) {
                                               s + "\"");
             rank = Number::fromInt64(value);
         }
-        if (auto error = ItemMetadata::writeFavoriteRank(url, rank)) return error;
+        if (auto error = ItemMetadata::writeFavoriteRank(url, rank))
+            return error;
     }
     if (setLastUsed_) {
         std::shared_ptr<const Date> date;
@@ -115,11 +124,13 @@ Status MetaCommand::applyChanges(const Url& url) {
                     *setLastUsed_ + "\"");
             date = Date::make(*seconds);
         }
-        if (auto error = ItemMetadata::writeLastUsedDate(url, date)) return error;
+        if (auto error = ItemMetadata::writeLastUsedDate(url, date))
+            return error;
     }
     if (setTags_) {
         Bytes tagData = ItemMetadata::tagDataForLabels(splitLabels(*setTags_));
-        if (auto error = ItemMetadata::writeTagData(url, tagData)) return error;
+        if (auto error = ItemMetadata::writeTagData(url, tagData))
+            return error;
     }
     return std::nullopt;
 }
@@ -129,11 +140,12 @@ int MetaCommand::run(CliContext& context) {
     auto exists = url.resourceValue(ResourceKeys::kFileID);
     if (!exists.ok()) {
         const Error& e = exists.error();
-        return context.fail(Error(e.domain(), e.code(),
-                                  {{"description", "no such file or folder: " + url.path()}}),
-                            json_);
+        return context.fail(
+            Error(e.domain(), e.code(), {{"description", "no such file or folder: " + url.path()}}),
+            json_);
     }
-    if (auto error = applyChanges(url)) return context.fail(*error, json_);
+    if (auto error = applyChanges(url))
+        return context.fail(*error, json_);
 
     ItemMetadata metadata = ItemMetadata::read(url);
     nlohmann::json j = toJson(metadata);

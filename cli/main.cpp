@@ -1,3 +1,5 @@
 #include "cli/CommandLine.h"
 
-int main(int argc, char** argv) { return tamber::runCommandLine(argc, argv); }
+int main(int argc, char** argv) {
+    return tamber::runCommandLine(argc, argv);
+}

@@ -21,7 +21,8 @@ public:
     virtual Result<HostPorterItemRef> itemForIdentifier(const HostPorterItemIdentifier& identifier);
     virtual std::optional<Url> URLForItemWithPersistentIdentifier(
         const HostPorterItemIdentifier& identifier);
-    virtual std::optional<HostPorterItemIdentifier> persistentIdentifierForItemAtURL(const Url& url);
+    virtual std::optional<HostPorterItemIdentifier> persistentIdentifierForItemAtURL(
+        const Url& url);
     virtual Result<HostPorterEnumeratorRef> enumeratorForContainerItemIdentifier(
         const HostPorterItemIdentifier& identifier);
 

@@ -17,7 +17,8 @@ std::shared_ptr<HostPorterManager>& slot() {
 
 std::shared_ptr<HostPorterManager> HostPorterManager::defaultManager() {
     auto manager = std::atomic_load(&slot());
-    if (!manager) fatalError("no HostPorterManager installed before the provider started");
+    if (!manager)
+        fatalError("no HostPorterManager installed before the provider started");
     return manager;
 }
 
@@ -31,14 +32,17 @@ StorageHostPorterManager::StorageHostPorterManager(Url documentStorage, SignalHa
 
 void StorageHostPorterManager::signalEnumeratorForContainerItemIdentifier(
     const HostPorterItemIdentifier& container, Completion completion) {
-    if (onSignal_) onSignal_(container);
-    if (completion) completion(std::nullopt);
+    if (onSignal_)
+        onSignal_(container);
+    if (completion)
+        completion(std::nullopt);
 }
 
 void StorageHostPorterManager::deleteSearchableItemsWithDomainIdentifiers(
     const std::vector<std::string>&, Completion completion) {
     // Nothing on this system indexes published items, so there is nothing to delete.
-    if (completion) completion(std::nullopt);
+    if (completion)
+        completion(std::nullopt);
 }
 
 }  // namespace tamber

@@ -18,7 +18,8 @@ void RecordingHostPorterManager::signalEnumeratorForContainerItemIdentifier(
         signals_.push_back(container);
         error = signalError_;
     }
-    if (completion) completion(error);
+    if (completion)
+        completion(error);
 }
 
 void RecordingHostPorterManager::deleteSearchableItemsWithDomainIdentifiers(
@@ -27,7 +28,8 @@ void RecordingHostPorterManager::deleteSearchableItemsWithDomainIdentifiers(
         std::lock_guard lock(mutex_);
         deletions_.push_back(domainIdentifiers);
     }
-    if (completion) completion(std::nullopt);
+    if (completion)
+        completion(std::nullopt);
 }
 
 std::vector<HostPorterItemIdentifier> RecordingHostPorterManager::signals() const {

@@ -20,8 +20,8 @@ struct Identity {
 Identity identityOf(const std::string& path) {
     struct statx st {};
     Identity id;
-    if (FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW,
-                                    STATX_TYPE | STATX_INO, &st) != 0) {
+    if (FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, STATX_TYPE | STATX_INO,
+                                    &st) != 0) {
         return id;
     }
     id.exists = true;
@@ -40,27 +40,34 @@ bool isStrictAncestorPath(const std::string& ancestor, const std::string& path) 
 }  // namespace
 
 UrlRelationship pt_relationshipToItemAtURL(const Url& url, const Url& other) {
-    if (!url.isFileURL() || !other.isFileURL()) return UrlRelationship::Other;
+    if (!url.isFileURL() || !other.isFileURL())
+        return UrlRelationship::Other;
     const std::string& a = url.path();
     const std::string& b = other.path();
-    if (a == b) return UrlRelationship::Same;
+    if (a == b)
+        return UrlRelationship::Same;
     Identity ia = identityOf(a);
     if (isStrictAncestorPath(a, b)) {
         return ia.isDirectory ? UrlRelationship::Contains : UrlRelationship::Other;
     }
-    if (!ia.exists) return UrlRelationship::Other;
+    if (!ia.exists)
+        return UrlRelationship::Other;
     Identity ib = identityOf(b);
-    if (ib.exists && ia.device == ib.device && ia.inode == ib.inode) return UrlRelationship::Same;
+    if (ib.exists && ia.device == ib.device && ia.inode == ib.inode)
+        return UrlRelationship::Same;
     return UrlRelationship::Other;
 }
 
 bool pt_isFolder(const Url& url) {
     auto isDirectory = url.resourceValue(ResourceKeys::kIsDirectory);
-    if (!isDirectory.ok()) return false;
+    if (!isDirectory.ok())
+        return false;
     auto dir = objectCast<Number>(isDirectory.value());
-    if (!dir || !dir->boolValue()) return false;
+    if (!dir || !dir->boolValue())
+        return false;
     auto isPackage = url.resourceValue(ResourceKeys::kIsPackage);
-    if (!isPackage.ok()) return false;
+    if (!isPackage.ok())
+        return false;
     auto package = objectCast<Number>(isPackage.value());
     return !(package && package->boolValue());
 }
@@ -68,7 +75,8 @@ bool pt_isFolder(const Url& url) {
 Result<uint64_t> pt_directorySizeWithError(const Url& url) {
     FileSystem& fs = FileSystem::current();
     int root = fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-    if (root < 0) return Error::errorWithPOSIXCode(errno);
+    if (root < 0)
+        return Error::errorWithPOSIXCode(errno);
 
     uint64_t total = 0;
     std::vector<int> pending{root};  // descriptors still to read; depth-first, bounded by depth
@@ -78,11 +86,13 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url) {
         int dir = pending.back();
         pending.pop_back();
         entries.clear();
-        if (!failure && !fs.readDirectory(dir, entries)) failure = Error::errorWithPOSIXCode(errno);
+        if (!failure && !fs.readDirectory(dir, entries))
+            failure = Error::errorWithPOSIXCode(errno);
         for (const auto& entry : failure ? std::vector<FileSystem::DirectoryEntry>{} : entries) {
             struct statx st {};
             if (fs.statx(dir, entry.name, AT_SYMLINK_NOFOLLOW, STATX_TYPE | STATX_SIZE, &st) != 0) {
-                if (errno == ENOENT) continue;  // removed while we walked
+                if (errno == ENOENT)
+                    continue;  // removed while we walked
                 failure = Error::errorWithPOSIXCode(errno);
                 break;
             }
@@ -100,14 +110,16 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url) {
         }
         fs.close(dir);
     }
-    if (failure) return *failure;
+    if (failure)
+        return *failure;
     return total;
 }
 
 bool pt_withReadWriteAccess(const Url& url, const std::function<bool(int fd)>& body) {
     FileSystem& fs = FileSystem::current();
     int fd = fs.open(url.path(), O_RDONLY | O_NOFOLLOW);
-    if (fd < 0) return false;
+    if (fd < 0)
+        return false;
     bool ok = body(fd);
     int saved = errno;
     fs.close(fd);

@@ -13,7 +13,9 @@ std::shared_ptr<AppLibraryLookup>& slot() {
 
 }  // namespace
 
-std::shared_ptr<AppLibraryLookup> AppLibraryLookup::current() { return std::atomic_load(&slot()); }
+std::shared_ptr<AppLibraryLookup> AppLibraryLookup::current() {
+    return std::atomic_load(&slot());
+}
 
 std::shared_ptr<AppLibraryLookup> AppLibraryLookup::setCurrent(
     std::shared_ptr<AppLibraryLookup> lookup) {

@@ -22,7 +22,8 @@ std::optional<Bytes> ReadXattrData(const std::string& name, const Url& url) {
     const std::string& path = url.path();
     ssize_t size = fs.lgetxattr(path, name, nullptr, 0);
     if (size < 0) {
-        if (errno == ENODATA) return std::nullopt;
+        if (errno == ENODATA)
+            return std::nullopt;
         Error error = Error::errorWithPOSIXCode(errno);
         logAt(levelUnless(ENOENT, error), "can't get xattr " + name + "; " + error.description());
         return std::nullopt;
@@ -42,13 +43,15 @@ std::optional<Bytes> ReadXattrData(const std::string& name, const Url& url) {
 Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::string& name) {
     FileSystem& fs = FileSystem::current();
     if (!data) {
-        if (fs.fremovexattr(fd, name) == 0 || errno == ENODATA) return std::nullopt;
+        if (fs.fremovexattr(fd, name) == 0 || errno == ENODATA)
+            return std::nullopt;
         Error error = Error::errorWithPOSIXCode(errno);
         logAt(levelUnless(EACCES, error),
               "can't remove xattr \"" + name + "\"; " + error.description());
         return error;
     }
-    if (fs.fsetxattr(fd, name, data->data(), data->size(), 0) == 0) return std::nullopt;
+    if (fs.fsetxattr(fd, name, data->data(), data->size(), 0) == 0)
+        return std::nullopt;
     Error error = Error::errorWithPOSIXCode(errno);
     logAt(levelUnless(EACCES, error), "can't set xattr \"" + name + "\"; " + error.description());
     return error;
@@ -57,7 +60,8 @@ Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::str
 Status WriteXattrAtURL(const Url& url, const std::optional<Bytes>& data, const std::string& name) {
     bool ok = pt_withReadWriteAccess(
         url, [&](int fd) { return !SetOrRemoveXattr(fd, data, name).has_value(); });
-    if (ok) return std::nullopt;
+    if (ok)
+        return std::nullopt;
     Error error = Error::errorWithPOSIXCode(errno);
     logError("can't set xattr " + name + " on " + url.absoluteString() + "; " +
              error.description());

@@ -20,7 +20,8 @@ namespace {
 template <class T>
 std::shared_ptr<const T> decodeAttribute(const std::string& name, const Url& url) {
     auto data = ReadXattrData(name, url);
-    if (!data) return nullptr;
+    if (!data)
+        return nullptr;
     auto value = KeyedUnarchiver::unarchivedObjectOfClass<T>(*data);
     return value.ok() ? value.value() : nullptr;
 }
@@ -28,14 +29,17 @@ std::shared_ptr<const T> decodeAttribute(const std::string& name, const Url& url
 std::optional<std::vector<std::string>> labelsFromArchive(const Bytes& data) {
     auto root = KeyedUnarchiver::unarchivedObjectOfClasses(
         {std::string(Array::kClassName), std::string(String::kClassName)}, data);
-    if (!root.ok()) return std::nullopt;
+    if (!root.ok())
+        return std::nullopt;
     auto array = objectCast<Array>(root.value());
-    if (!array) return std::nullopt;
+    if (!array)
+        return std::nullopt;
     std::vector<std::string> labels;
     labels.reserve(array->count());
     for (const auto& element : array->objects()) {
         auto label = objectCast<String>(element);
-        if (!label) return std::nullopt;
+        if (!label)
+            return std::nullopt;
         labels.push_back(label->value());
     }
     return labels;
@@ -43,9 +47,11 @@ std::optional<std::vector<std::string>> labelsFromArchive(const Bytes& data) {
 
 // Archives `object`, or nothing for a null object (which removes the attribute).
 Result<std::optional<Bytes>> archiveOrNothing(const ObjectRef& object) {
-    if (!object) return std::optional<Bytes>();
+    if (!object)
+        return std::optional<Bytes>();
     auto data = KeyedArchiver::archivedDataWithRootObject(object);
-    if (!data.ok()) return data.error();
+    if (!data.ok())
+        return data.error();
     return std::optional<Bytes>(std::move(data.value()));
 }
 
@@ -69,15 +75,19 @@ std::optional<std::set<std::string>> listAttributes(const Url& url) {
             std::set<std::string> names;
             for (size_t start = 0; start < static_cast<size_t>(n);) {
                 size_t end = buffer.find('\0', start);
-                if (end == std::string::npos || end > static_cast<size_t>(n)) end = n;
-                if (end > start) names.emplace(buffer, start, end - start);
+                if (end == std::string::npos || end > static_cast<size_t>(n))
+                    end = n;
+                if (end > start)
+                    names.emplace(buffer, start, end - start);
                 start = end + 1;
             }
             return names;
         }
-        if (errno != ERANGE) return std::nullopt;
+        if (errno != ERANGE)
+            return std::nullopt;
         ssize_t needed = fs.llistxattr(url.path(), nullptr, 0);
-        if (needed < 0) return std::nullopt;
+        if (needed < 0)
+            return std::nullopt;
         buffer.assign(static_cast<size_t>(needed) + 64, '\0');
     }
     return std::nullopt;
@@ -91,7 +101,8 @@ std::shared_ptr<const Date> ItemMetadata::readLastUsedDate(const Url& url) {
 
 std::optional<std::vector<std::string>> ItemMetadata::readTagLabels(const Url& url) {
     auto data = ReadXattrData(LocalItem::xattrTagDataName(), url);
-    if (!data) return std::nullopt;
+    if (!data)
+        return std::nullopt;
     return labelsFromArchive(*data);
 }
 
@@ -101,7 +112,8 @@ std::shared_ptr<const Number> ItemMetadata::readFavoriteRank(const Url& url) {
 
 std::shared_ptr<const Date> ItemMetadata::readTrashDate(const Url& url) {
     auto data = ReadXattrData(LocalItem::xattrTrashDateName(), url);
-    if (!data) return nullptr;
+    if (!data)
+        return nullptr;
     return UnarchiveLogged<Date>(*data);
 }
 
@@ -113,15 +125,21 @@ ItemMetadata ItemMetadata::read(const Url& url) {
     ItemMetadata m;
     auto present = listAttributes(url);
     auto has = [&](const std::string& name) { return !present || present->count(name) > 0; };
-    if (present && present->empty()) return m;
-    if (has(LocalItem::xattrLastUsedDateName())) m.lastUsedDate = readLastUsedDate(url);
+    if (present && present->empty())
+        return m;
+    if (has(LocalItem::xattrLastUsedDateName()))
+        m.lastUsedDate = readLastUsedDate(url);
     if (has(LocalItem::xattrTagDataName())) {
         m.tagLabels = readTagLabels(url);
-        if (m.tagLabels) m.tagData = tagDataForLabels(*m.tagLabels);
+        if (m.tagLabels)
+            m.tagData = tagDataForLabels(*m.tagLabels);
     }
-    if (has(LocalItem::xattrFavoriteRankName())) m.favoriteRank = readFavoriteRank(url);
-    if (has(LocalItem::xattrTrashDateName())) m.trashDate = readTrashDate(url);
-    if (has(LocalItem::xattrTrashPutBackName())) m.putBack = readPutBack(url);
+    if (has(LocalItem::xattrFavoriteRankName()))
+        m.favoriteRank = readFavoriteRank(url);
+    if (has(LocalItem::xattrTrashDateName()))
+        m.trashDate = readTrashDate(url);
+    if (has(LocalItem::xattrTrashPutBackName()))
+        m.putBack = readPutBack(url);
     return m;
 }
 

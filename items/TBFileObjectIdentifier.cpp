@@ -34,7 +34,8 @@ public:
     int get() const { return fd_; }
     bool ok() const { return fd_ >= 0; }
     void close() {
-        if (fd_ < 0) return;
+        if (fd_ < 0)
+            return;
         int saved = errno;
         FileSystem::current().close(fd_);
         fd_ = -1;
@@ -63,7 +64,8 @@ IdRead readIdResource(const Url& url, ResourceKey key, const char* kind, uint64_
                   {error.description()});
         return IdRead::Failed;
     }
-    if (!result.value()) return IdRead::Absent;
+    if (!result.value())
+        return IdRead::Absent;
     auto number = objectCast<Number>(result.value());
     if (!number) {
         fatalError(formatPlatform(std::string("unexpected class for ") + kind +
@@ -81,7 +83,9 @@ uint64_t parseValue(const std::string& text) {
     return ec == std::errc() ? value : 0;
 }
 
-bool isRetriedErrno(int error) { return error == EAGAIN || error == EBUSY || error == ESTALE; }
+bool isRetriedErrno(int error) {
+    return error == EAGAIN || error == EBUSY || error == ESTALE;
+}
 
 }  // namespace
 
@@ -90,14 +94,17 @@ uint32_t TBFileObjectIdentifier::deviceIDWithError(const Url& url, Error* error)
     CommonAttributes attributes;
     if (!fd.ok() || GetAttributeList(fd.get(), attributes) != 0) {
         int saved = errno;
-        if (error) *error = Error::posix(saved);
+        if (error)
+            *error = Error::posix(saved);
         errno = saved;
         return 0;
     }
     return attributes.device;
 }
 
-uint32_t TBFileObjectIdentifier::deviceID(const Url& url) { return deviceIDWithError(url, nullptr); }
+uint32_t TBFileObjectIdentifier::deviceID(const Url& url) {
+    return deviceIDWithError(url, nullptr);
+}
 
 std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(const Url& url) {
     if (!url.isFileURL()) {
@@ -113,7 +120,8 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
         case UrlRelationship::Other: {
             bool inLibrary = false;
             auto lookup = AppLibraryLookup::current();
-            for (const Url& root : lookup ? lookup->rootURLsForAppLibraries() : std::vector<Url>{}) {
+            for (const Url& root :
+                 lookup ? lookup->rootURLsForAppLibraries() : std::vector<Url>{}) {
                 UrlRelationship r = pt_relationshipToItemAtURL(root, url);
                 if (r == UrlRelationship::Contains) {
                     inLibrary = true;
@@ -137,7 +145,8 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     bool folder = pt_isFolder(url);
     IdRead read = folder ? readIdResource(url, ResourceKeys::kFileID, "file ID", cached)
                          : readIdResource(url, ResourceKeys::kDocumentID, "doc ID", cached);
-    if (read == IdRead::Failed) return std::nullopt;
+    if (read == IdRead::Failed)
+        return std::nullopt;
     if (read == IdRead::Value) {
         return folder ? TBPFileObjectIdentifier::fromFileID(cached)
                       : TBPFileObjectIdentifier::fromDocumentID(cached);
@@ -178,7 +187,8 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     }
 
     uint32_t documentId = attributes.documentId;
-    if (documentId == 0) documentId = StrataLibraryGetOrAllocateDocumentId(fd.get());
+    if (documentId == 0)
+        documentId = StrataLibraryGetOrAllocateDocumentId(fd.get());
     if (documentId == 0) {
         logFormat(LogLevel::Error, "can't get permanent storage for \"%@\"", {url.path()});
         return std::nullopt;
@@ -202,7 +212,8 @@ std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(
     while (true) {
         size_t eq = identifier.find('=', start);
         components.push_back(identifier.substr(start, eq - start));
-        if (eq == std::string::npos) break;
+        if (eq == std::string::npos)
+            break;
         start = eq + 1;
     }
     if (components.size() != 2) {

@@ -10,11 +10,13 @@ namespace tamber {
 
 template <class T>
 std::shared_ptr<const T> UnarchiveLogged(const Bytes& data) {
-    if (data.empty()) return nullptr;
+    if (data.empty())
+        return nullptr;
     Error error;
     auto root = KeyedUnarchiver::unarchiveObjectWithData(data);
     if (root.ok()) {
-        if (auto typed = objectCast<T>(root.value())) return typed;
+        if (auto typed = objectCast<T>(root.value()))
+            return typed;
         error = makeError(UnarchiveError::invalidResultingClass);
     } else {
         error = root.error();

@@ -17,7 +17,7 @@ namespace tamber {
 // sets errno and returns the call's failure value without reaching the inner file system.
 // Counts every call per operation, failed or not. Safe to use from several threads.
 class FaultInjectingFileSystem : public FileSystem {
-  public:
+public:
     enum class Operation {
         Open,
         Openat,
@@ -65,7 +65,7 @@ class FaultInjectingFileSystem : public FileSystem {
     bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) override;
     int mkdir(const std::string& path, mode_t mode) override;
 
-  private:
+private:
     struct Injection {
         Operation op;
         int errnoValue;

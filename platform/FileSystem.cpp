@@ -15,7 +15,9 @@ std::shared_ptr<FileSystem>& slot() {
 
 }  // namespace
 
-std::shared_ptr<FileSystem> FileSystem::currentShared() { return std::atomic_load(&slot()); }
+std::shared_ptr<FileSystem> FileSystem::currentShared() {
+    return std::atomic_load(&slot());
+}
 
 FileSystem& FileSystem::current() {
     // The instance stays alive while tests swap it: they keep the previous one and restore it.

@@ -48,8 +48,8 @@ public:
 
     bool isFileURL() const;
     bool isEmpty() const;
-    const std::string& path() const;    // for file URLs; empty otherwise
-    std::string absoluteString() const;  // "file:///..." percent-encoded, or the URL text
+    const std::string& path() const;        // for file URLs; empty otherwise
+    std::string absoluteString() const;     // "file:///..." percent-encoded, or the URL text
     std::string lastPathComponent() const;  // "/" for the root
     std::string pathExtension() const;      // without the dot; empty when none
     std::vector<std::string> pathComponents() const;  // "/" first, then each component

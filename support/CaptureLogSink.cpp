@@ -37,7 +37,8 @@ size_t CaptureLogSink::countStartingWith(std::string_view prefix) const {
 bool CaptureLogSink::contains(std::string_view text) const {
     std::lock_guard lock(mutex_);
     for (const auto& l : lines_)
-        if (l.text == text) return true;
+        if (l.text == text)
+            return true;
     return false;
 }
 

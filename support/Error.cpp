@@ -19,14 +19,18 @@ std::string reasonFor(const std::string& domain, int64_t code) {
         return std::strerror(static_cast<int>(code));
     }
     if (domain == kHostPlatformErrorDomain) {
-        if (code == kHostPlatformFileNoSuchFile) return "The file doesn't exist.";
+        if (code == kHostPlatformFileNoSuchFile)
+            return "The file doesn't exist.";
         if (code == kHostPlatformFileWriteNoPermission)
             return "You don't have permission to save the file.";
     }
     if (domain == kHostPorterErrorDomain) {
-        if (code == kHostPorterSyncAnchorExpired) return "The sync anchor expired.";
-        if (code == kHostPorterNoSuchItem) return "The item doesn't exist.";
-        if (code == kHostPorterInvalidParameter) return "A parameter is invalid.";
+        if (code == kHostPorterSyncAnchorExpired)
+            return "The sync anchor expired.";
+        if (code == kHostPorterNoSuchItem)
+            return "The item doesn't exist.";
+        if (code == kHostPorterInvalidParameter)
+            return "A parameter is invalid.";
     }
     return "The operation couldn't be completed.";
 }
@@ -39,9 +43,13 @@ std::string Error::description() const {
     return "Error Domain=" + domain_ + " Code=" + std::to_string(code_) + " \"" + reason + "\"";
 }
 
-Error Error::errorWithPOSIXCode(int /*ignored*/) { return Error(kPosixErrorDomain, errno); }
+Error Error::errorWithPOSIXCode(int /*ignored*/) {
+    return Error(kPosixErrorDomain, errno);
+}
 
-Error Error::posix(int code) { return Error(kPosixErrorDomain, code); }
+Error Error::posix(int code) {
+    return Error(kPosixErrorDomain, code);
+}
 
 Error Error::errorFileWriteNoPermission() {
     return Error(kHostPlatformErrorDomain, kHostPlatformFileWriteNoPermission);
@@ -49,7 +57,8 @@ Error Error::errorFileWriteNoPermission() {
 
 Error Error::fileNoSuchFile(const std::string& path) {
     std::map<std::string, std::string> info;
-    if (!path.empty()) info["path"] = path;
+    if (!path.empty())
+        info["path"] = path;
     return Error(kHostPlatformErrorDomain, kHostPlatformFileNoSuchFile, std::move(info));
 }
 
@@ -59,7 +68,8 @@ Error Error::porterErrorForNonExistentItemWithIdentifier(const std::string& iden
 
 Error Error::invalidParameter(const std::string& parameter, const std::string& value) {
     std::map<std::string, std::string> info{{"parameter", parameter}};
-    if (!value.empty()) info["value"] = value;
+    if (!value.empty())
+        info["value"] = value;
     return Error(kHostPorterErrorDomain, kHostPorterInvalidParameter, std::move(info));
 }
 

@@ -17,8 +17,9 @@ bool JournalLogSink::available() {
 }
 
 void JournalLogSink::write(LogLevel level, std::string_view line) {
-    int priority = level == LogLevel::Error ? LOG_ERR : level == LogLevel::Info ? LOG_INFO
-                                                                                 : LOG_DEBUG;
+    int priority = level == LogLevel::Error  ? LOG_ERR
+                   : level == LogLevel::Info ? LOG_INFO
+                                             : LOG_DEBUG;
     std::string message(line);
     sd_journal_send("MESSAGE=%s", message.c_str(), "PRIORITY=%d", priority, "SUBSYSTEM=%s",
                     subsystem_, "CATEGORY=%s", category_, "SYSLOG_IDENTIFIER=tamber", nullptr);

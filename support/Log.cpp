@@ -37,18 +37,23 @@ std::shared_ptr<LogSink> Log::setSink(std::shared_ptr<LogSink> sink) {
     return std::atomic_exchange(&sink_, std::move(sink));
 }
 
-std::shared_ptr<LogSink> Log::sink() const { return std::atomic_load(&sink_); }
+std::shared_ptr<LogSink> Log::sink() const {
+    return std::atomic_load(&sink_);
+}
 
 void Log::write(LogLevel level, std::string_view line) {
-    if (level == LogLevel::Debug && !debugEnabled()) return;
-    if (auto s = sink()) s->write(level, line);
+    if (level == LogLevel::Debug && !debugEnabled())
+        return;
+    if (auto s = sink())
+        s->write(level, line);
 }
 
 namespace {
 
 void writePrefixed(LogLevel level, const char* prefix, std::string_view message) {
     Log& log = Log::shared();
-    if (level == LogLevel::Debug && !log.debugEnabled()) return;
+    if (level == LogLevel::Debug && !log.debugEnabled())
+        return;
     std::string line;
     line.reserve(std::strlen(prefix) + message.size());
     line.append(prefix).append(message);
@@ -57,9 +62,15 @@ void writePrefixed(LogLevel level, const char* prefix, std::string_view message)
 
 }  // namespace
 
-void logDebug(std::string_view message) { writePrefixed(LogLevel::Debug, "[DEBUG] ", message); }
-void logInfo(std::string_view message) { writePrefixed(LogLevel::Info, "[INFO] ", message); }
-void logError(std::string_view message) { writePrefixed(LogLevel::Error, "[ERROR] ", message); }
+void logDebug(std::string_view message) {
+    writePrefixed(LogLevel::Debug, "[DEBUG] ", message);
+}
+void logInfo(std::string_view message) {
+    writePrefixed(LogLevel::Info, "[INFO] ", message);
+}
+void logError(std::string_view message) {
+    writePrefixed(LogLevel::Error, "[ERROR] ", message);
+}
 
 void logAt(LogLevel level, std::string_view message) {
     switch (level) {
@@ -106,20 +117,23 @@ std::string formatPlatform(std::string_view format, std::initializer_list<Format
         bool matched = false;
         for (auto p : kPlaceholders) {
             if (format.substr(i, p.size()) == p) {
-                if (next != args.end()) appendArg(out, *next++);
+                if (next != args.end())
+                    appendArg(out, *next++);
                 i += p.size();
                 matched = true;
                 break;
             }
         }
-        if (!matched) out.push_back(format[i++]);
+        if (!matched)
+            out.push_back(format[i++]);
     }
     return out;
 }
 
 void logFormat(LogLevel level, std::string_view format, std::initializer_list<FormatArg> args) {
     Log& log = Log::shared();
-    if (level == LogLevel::Debug && !log.debugEnabled()) return;
+    if (level == LogLevel::Debug && !log.debugEnabled())
+        return;
     log.write(level, formatPlatform(format, args));
 }
 

@@ -49,9 +49,10 @@ void logAt(LogLevel level, std::string_view message);
 
 // Debug lines are written for every item and event; build their text only when it is written.
 template <class F>
-    requires std::is_invocable_v<F>
+requires std::is_invocable_v<F>
 void logDebug(F&& makeMessage) {
-    if (Log::shared().debugEnabled()) logDebug(std::string_view(std::forward<F>(makeMessage)()));
+    if (Log::shared().debugEnabled())
+        logDebug(std::string_view(std::forward<F>(makeMessage)()));
 }
 
 // Formatted lines with the platform's placeholders, used by the identifier module:

@@ -13,7 +13,7 @@ namespace tamber {
 template <class T>
 class Result {
 public:
-    Result(T value) : v_(std::move(value)) {}  // NOLINT: implicit by design
+    Result(T value) : v_(std::move(value)) {}      // NOLINT: implicit by design
     Result(Error error) : v_(std::move(error)) {}  // NOLINT
 
     bool ok() const { return v_.index() == 0; }

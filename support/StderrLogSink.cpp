@@ -15,7 +15,8 @@ void StderrLogSink::write(LogLevel, std::string_view line) {
     size_t done = 0;
     while (done < text.size()) {
         ssize_t n = ::write(STDERR_FILENO, text.data() + done, text.size() - done);
-        if (n <= 0) break;
+        if (n <= 0)
+            break;
         done += static_cast<size_t>(n);
     }
 }

@@ -16,12 +16,15 @@ std::string describeBytes(const Bytes& bytes) {
         std::snprintf(hex, sizeof hex, "%02x", bytes[i]);
         out += hex;
     }
-    if (shown < bytes.size()) out += "...";
+    if (shown < bytes.size())
+        out += "...";
     out += "}";
     return out;
 }
 
-std::string Data::description() const { return describeBytes(bytes_); }
+std::string Data::description() const {
+    return describeBytes(bytes_);
+}
 
 bool Data::isEqual(const Object& other) const {
     auto d = dynamic_cast<const Data*>(&other);

@@ -16,7 +16,8 @@ std::shared_ptr<const Date> Date::now() {
 }
 
 std::string Date::iso8601() const {
-    if (!std::isfinite(seconds_)) return "invalid date";
+    if (!std::isfinite(seconds_))
+        return "invalid date";
     double whole = std::floor(seconds_);
     auto millis = static_cast<int>(std::lround((seconds_ - whole) * 1000.0));
     if (millis == 1000) {
@@ -24,10 +25,12 @@ std::string Date::iso8601() const {
         millis = 0;
     }
     // Out of time_t's range there is no calendar date to show.
-    if (whole < -6.2e10 || whole > 2.5e11) return "invalid date";
+    if (whole < -6.2e10 || whole > 2.5e11)
+        return "invalid date";
     std::time_t t = static_cast<std::time_t>(whole);
     std::tm tm{};
-    if (!gmtime_r(&t, &tm)) return "invalid date";
+    if (!gmtime_r(&t, &tm))
+        return "invalid date";
     char buf[64];
     std::snprintf(buf, sizeof buf, "%04d-%02d-%02dT%02d:%02d:%02d.%03dZ", tm.tm_year + 1900,
                   tm.tm_mon + 1, tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec, millis);

@@ -15,7 +15,8 @@ std::string Dictionary::description() const {
     std::string out = "{";
     bool first = true;
     for (const auto& [k, v] : entries_) {
-        if (!first) out += ", ";
+        if (!first)
+            out += ", ";
         first = false;
         out += k + " = " + (v ? v->description() : "null");
     }
@@ -24,10 +25,12 @@ std::string Dictionary::description() const {
 
 bool Dictionary::isEqual(const Object& other) const {
     auto d = dynamic_cast<const Dictionary*>(&other);
-    if (!d || d->entries_.size() != entries_.size()) return false;
+    if (!d || d->entries_.size() != entries_.size())
+        return false;
     for (const auto& [k, v] : entries_) {
         auto it = d->entries_.find(k);
-        if (it == d->entries_.end() || !objectsEqual(v, it->second)) return false;
+        if (it == d->entries_.end() || !objectsEqual(v, it->second))
+            return false;
     }
     return true;
 }

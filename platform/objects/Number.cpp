@@ -28,8 +28,10 @@ uint64_t Number::uint64Value() const {
             return static_cast<uint64_t>(i_);
         case Kind::Floating:
             // Out-of-range conversions are undefined in C++; clamp instead.
-            if (!(d_ >= 0)) return 0;
-            if (d_ >= 18446744073709551615.0) return UINT64_MAX;
+            if (!(d_ >= 0))
+                return 0;
+            if (d_ >= 18446744073709551615.0)
+                return UINT64_MAX;
             return static_cast<uint64_t>(d_);
     }
     return 0;
@@ -43,9 +45,12 @@ int64_t Number::int64Value() const {
         case Kind::Signed:
             return i_;
         case Kind::Floating:
-            if (!(d_ == d_)) return 0;
-            if (d_ <= -9223372036854775808.0) return INT64_MIN;
-            if (d_ >= 9223372036854775807.0) return INT64_MAX;
+            if (!(d_ == d_))
+                return 0;
+            if (d_ <= -9223372036854775808.0)
+                return INT64_MIN;
+            if (d_ >= 9223372036854775807.0)
+                return INT64_MAX;
             return static_cast<int64_t>(d_);
     }
     return 0;
@@ -96,11 +101,14 @@ std::string Number::description() const {
 
 bool Number::isEqual(const Object& other) const {
     auto n = dynamic_cast<const Number*>(&other);
-    if (!n) return false;
+    if (!n)
+        return false;
     if (n->kind_ == Kind::Floating || kind_ == Kind::Floating)
         return n->doubleValue() == doubleValue();
-    if (n->kind_ == Kind::Signed && n->i_ < 0) return kind_ == Kind::Signed && i_ == n->i_;
-    if (kind_ == Kind::Signed && i_ < 0) return false;
+    if (n->kind_ == Kind::Signed && n->i_ < 0)
+        return kind_ == Kind::Signed && i_ == n->i_;
+    if (kind_ == Kind::Signed && i_ < 0)
+        return false;
     return n->uint64Value() == uint64Value();
 }
 

@@ -15,7 +15,9 @@ std::shared_ptr<StrataService>& slot() {
 
 }  // namespace
 
-std::shared_ptr<StrataService> StrataService::current() { return std::atomic_load(&slot()); }
+std::shared_ptr<StrataService> StrataService::current() {
+    return std::atomic_load(&slot());
+}
 
 std::shared_ptr<StrataService> StrataService::setCurrent(std::shared_ptr<StrataService> service) {
     return std::atomic_exchange(&slot(), std::move(service));
@@ -46,7 +48,8 @@ int PathFromFileID(uint32_t device, uint64_t fileId, char* buffer, size_t size) 
         return -1;
     }
     std::string path;
-    if (!service->pathForFileId(device, fileId, path)) return -1;
+    if (!service->pathForFileId(device, fileId, path))
+        return -1;
     if (path.size() + 1 > size) {
         errno = ERANGE;
         return -1;

@@ -8,7 +8,8 @@ namespace tamber::testing {
 
 uint32_t FakeStrataService::getOrAllocateDocumentId(int fd) {
     struct stat st {};
-    if (::fstat(fd, &st) != 0) return 0;
+    if (::fstat(fd, &st) != 0)
+        return 0;
     std::lock_guard lock(mutex_);
     ++allocations_;
     if (allocationError_) {
@@ -16,7 +17,8 @@ uint32_t FakeStrataService::getOrAllocateDocumentId(int fd) {
         return 0;
     }
     auto it = documentByInode_.find(st.st_ino);
-    if (it != documentByInode_.end()) return it->second;
+    if (it != documentByInode_.end())
+        return it->second;
     uint32_t id = nextDocument_++;
     documentByInode_[st.st_ino] = id;
     inodeByDocument_[id] = st.st_ino;
@@ -58,7 +60,8 @@ bool FakeStrataService::pathForFileId(uint32_t, uint64_t fileId, std::string& pa
 
 void FakeStrataService::publish(const std::string& path) {
     struct stat st {};
-    if (::lstat(path.c_str(), &st) != 0) return;
+    if (::lstat(path.c_str(), &st) != 0)
+        return;
     std::lock_guard lock(mutex_);
     pathByInode_[st.st_ino] = path;
 }

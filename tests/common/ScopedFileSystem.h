@@ -9,13 +9,13 @@ namespace tamber::testing {
 // Installs `fs` as the process-wide file system for the lifetime of the object and restores
 // the previous one afterwards.
 class ScopedFileSystem {
-  public:
+public:
     explicit ScopedFileSystem(std::shared_ptr<FileSystem> fs);
     ~ScopedFileSystem();
     ScopedFileSystem(const ScopedFileSystem&) = delete;
     ScopedFileSystem& operator=(const ScopedFileSystem&) = delete;
 
-  private:
+private:
     std::shared_ptr<FileSystem> previous_;
 };
 

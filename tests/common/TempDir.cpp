@@ -10,7 +10,8 @@ namespace tamber::testing {
 TempDir::TempDir() {
     const char* base = std::getenv("TMPDIR");
     std::string templ = std::string(base && *base ? base : "/tmp") + "/tamber-test-XXXXXX";
-    if (!::mkdtemp(templ.data())) throw std::runtime_error("mkdtemp failed");
+    if (!::mkdtemp(templ.data()))
+        throw std::runtime_error("mkdtemp failed");
     path_ = templ;
 }
 

@@ -32,17 +32,17 @@ TEST(HostPorterManagerTest, InstalledManagerIsTheDefaultAndRecords) {
     EXPECT_EQ(manager->documentStorageURL().path(), "/srv/docs");
 
     int completions = 0;
-    manager->signalEnumeratorForContainerItemIdentifier(
-        HostPorterWorkingSetContainerItemIdentifier, [&](auto error) {
-            EXPECT_FALSE(error.has_value());
-            ++completions;
-        });
+    manager->signalEnumeratorForContainerItemIdentifier(HostPorterWorkingSetContainerItemIdentifier,
+                                                        [&](auto error) {
+                                                            EXPECT_FALSE(error.has_value());
+                                                            ++completions;
+                                                        });
     recording->setSignalError(Error::syncAnchorExpired());
-    manager->signalEnumeratorForContainerItemIdentifier(
-        HostPorterRootContainerItemIdentifier, [&](auto error) {
-            EXPECT_TRUE(error.has_value());
-            ++completions;
-        });
+    manager->signalEnumeratorForContainerItemIdentifier(HostPorterRootContainerItemIdentifier,
+                                                        [&](auto error) {
+                                                            EXPECT_TRUE(error.has_value());
+                                                            ++completions;
+                                                        });
     manager->deleteSearchableItemsWithDomainIdentifiers({"com.example.app"}, nullptr);
     EXPECT_EQ(completions, 2);
     EXPECT_EQ(recording->signals(),
@@ -87,9 +87,8 @@ TEST(HostExtensionMainTest, HandsThePrincipalInstanceToTheRuntime) {
     // The base provider publishes nothing and completes provide calls at once.
     EXPECT_FALSE(received->itemForIdentifier("fid=1").ok());
     bool completed = false;
-    received->startProvidingItemAtURL(Url::fileURLWithPath("/x"), [&](auto error) {
-        completed = !error.has_value();
-    });
+    received->startProvidingItemAtURL(Url::fileURLWithPath("/x"),
+                                      [&](auto error) { completed = !error.has_value(); });
     EXPECT_TRUE(completed);
     HostRegisterPrincipalClass(nullptr);
     HostRegisterRuntime(nullptr);

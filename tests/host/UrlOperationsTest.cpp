@@ -15,7 +15,9 @@ namespace {
 
 using testing::TempDir;
 
-Url at(const std::string& path) { return Url::fileURLWithPath(path); }
+Url at(const std::string& path) {
+    return Url::fileURLWithPath(path);
+}
 
 TEST(UrlRelationshipTest, SameContainsAndOther) {
     TempDir dir;

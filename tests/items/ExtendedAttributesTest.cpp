@@ -109,8 +109,8 @@ TEST_F(ExtendedAttributesTest, VanishedFileLogsAtDebugLevelOnly) {
     EXPECT_FALSE(ReadXattrData(kName, gone).has_value());
     ASSERT_EQ(log->lines().size(), 1u);
     EXPECT_EQ(log->lines()[0].level, LogLevel::Debug);
-    EXPECT_EQ(log->lines()[0].text, "[DEBUG] can't get xattr " + kName + "; " +
-                                        Error::posix(ENOENT).description());
+    EXPECT_EQ(log->lines()[0].text,
+              "[DEBUG] can't get xattr " + kName + "; " + Error::posix(ENOENT).description());
 }
 
 TEST_F(ExtendedAttributesTest, OtherReadFailuresLogAtErrorLevel) {
@@ -119,10 +119,10 @@ TEST_F(ExtendedAttributesTest, OtherReadFailuresLogAtErrorLevel) {
     fs->inject(Op::Lgetxattr, EIO);
     ScopedLogCapture log;
     EXPECT_FALSE(ReadXattrData(kName, file).has_value());
-    EXPECT_EQ(log->count("[ERROR] can't get xattr " + kName + "; " +
-                             Error::posix(EIO).description(),
-                         LogLevel::Error),
-              1u);
+    EXPECT_EQ(
+        log->count("[ERROR] can't get xattr " + kName + "; " + Error::posix(EIO).description(),
+                   LogLevel::Error),
+        1u);
 }
 
 TEST_F(ExtendedAttributesTest, FailedCopyLogsWithItsOwnTextAndLevelRule) {

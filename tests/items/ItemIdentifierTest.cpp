@@ -41,7 +41,8 @@ public:
     std::optional<std::string> bundleIdentifierForRoot(const Url& url,
                                                        UrlRelationship relationship) override {
         for (auto& [root, bundle] : libraries)
-            if (pt_relationshipToItemAtURL(root, url) == relationship) return bundle;
+            if (pt_relationshipToItemAtURL(root, url) == relationship)
+                return bundle;
         return std::nullopt;
     }
 };
@@ -75,8 +76,8 @@ protected:
 
 TEST_F(ItemIdentifierTest, StorageFolderIsTheRootAndBack) {
     EXPECT_EQ(idOf(storagePath), HostPorterRootContainerItemIdentifier);
-    auto url = TBFileObjectIdentifier::fileURLWithItemIdentifier(
-        HostPorterRootContainerItemIdentifier);
+    auto url =
+        TBFileObjectIdentifier::fileURLWithItemIdentifier(HostPorterRootContainerItemIdentifier);
     ASSERT_TRUE(url);
     EXPECT_EQ(url->path(), storagePath);
 }
@@ -142,9 +143,9 @@ TEST_F(ItemIdentifierTest, FailuresOnTheWayAreLoggedAndGiveNothing) {
     {
         ScopedLogCapture log;
         EXPECT_FALSE(TBFileObjectIdentifier::itemIdentifier(*Url::parse("https://example.org/x")));
-        EXPECT_EQ(log->count("can't compute file object identifier if not a file URL",
-                             LogLevel::Error),
-                  1u);
+        EXPECT_EQ(
+            log->count("can't compute file object identifier if not a file URL", LogLevel::Error),
+            1u);
     }
 }
 

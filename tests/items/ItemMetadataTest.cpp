@@ -47,9 +47,9 @@ protected:
 };
 
 TEST_F(ItemMetadataTest, ThreeStoredLabelsBecomeThreeUncolouredTagsInOrder) {
-    store(LocalItem::xattrTagDataName(), archive(Array::make({String::make("Work"),
-                                                              String::make("Ünïcode"),
-                                                              String::make("a,b")})));
+    store(
+        LocalItem::xattrTagDataName(),
+        archive(Array::make({String::make("Work"), String::make("Ünïcode"), String::make("a,b")})));
     ItemMetadata m = ItemMetadata::read(file);
     ASSERT_TRUE(m.tagData.has_value());
     auto tags = GetTagsFromTagsData(*m.tagData);

@@ -17,7 +17,7 @@ namespace {
 using Op = FaultInjectingFileSystem::Operation;
 
 class FaultInjectingFileSystemTest : public ::testing::Test {
-  protected:
+protected:
     bool exists(const std::string& path) {
         struct statx st {};
         return fs_.statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &st) == 0;

@@ -23,7 +23,7 @@ namespace K = ResourceKeys;
 using Op = FaultInjectingFileSystem::Operation;
 
 class UrlResourceValuesTest : public ::testing::Test {
-  protected:
+protected:
     UrlResourceValuesTest()
         : fs_(std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>())),
           scoped_(fs_) {}

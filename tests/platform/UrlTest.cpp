@@ -39,7 +39,7 @@ TEST(UrlPathTest, FileUrlPathsAreStandardisedLexically) {
 
 // Changes the working directory for a scope.
 class ScopedWorkingDirectory {
-  public:
+public:
     explicit ScopedWorkingDirectory(const std::string& path) {
         char* old = ::getcwd(nullptr, 0);
         previous_ = old ? old : "/";
@@ -52,7 +52,7 @@ class ScopedWorkingDirectory {
             ADD_FAILURE() << "chdir back";
     }
 
-  private:
+private:
     std::string previous_;
 };
 
