@@ -83,6 +83,17 @@ uint64_t parseValue(const std::string& text) {
     return ec == std::errc() ? value : 0;
 }
 
+// The device of the document storage folder; 0 after logging why it has none.
+uint32_t storageDeviceID() {
+    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
+    uint32_t device = TBFileObjectIdentifier::deviceID(storage);
+    if (device == 0) {
+        logFormat(LogLevel::Error, "can't get device ID for \"%@\"; %{errno}d",
+                  {storage.path(), ErrnoArg{errno}});
+    }
+    return device;
+}
+
 bool isRetriedErrno(int error) {
     return error == EAGAIN || error == EBUSY || error == ESTALE;
 }
@@ -227,13 +238,8 @@ std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(
         logFormat(LogLevel::Error, "invalid host for identifier \"%@\"", {identifier});
         return std::nullopt;
     }
-    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
-    uint32_t device = deviceID(storage);
-    if (device == 0) {
-        logFormat(LogLevel::Error, "can't get device ID for \"%@\"; %{errno}d",
-                  {storage.path(), ErrnoArg{errno}});
-        return std::nullopt;
-    }
+    uint32_t device = storageDeviceID();
+    if (device == 0) return std::nullopt;
     uint64_t value = parseValue(components[1]);
     uint64_t fileId = value;
     if (host == "did") {
@@ -263,13 +269,8 @@ std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(
 }
 
 std::optional<Url> TBFileObjectIdentifier::fileURLWithFileIdentifier(uint64_t fileID) {
-    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
-    uint32_t device = deviceID(storage);
-    if (device == 0) {
-        logFormat(LogLevel::Error, "can't get device ID for \"%@\"; %{errno}d",
-                  {storage.path(), ErrnoArg{errno}});
-        return std::nullopt;
-    }
+    uint32_t device = storageDeviceID();
+    if (device == 0) return std::nullopt;
     return _fileURLWithFileIdentifier(fileID, device);
 }
 
