@@ -1,0 +1,115 @@
+#pragma once
+
+#include <sys/inotify.h>
+
+#include <atomic>
+#include <cstddef>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/tremors/FileChange.h"
+#include "platform/tremors/InotifyApi.h"
+#include "platform/tremors/InotifyTranslator.h"
+#include "support/Result.h"
+
+namespace tamber {
+
+// Watches directory trees with one inotify instance and hands their changes to the caller.
+//
+// The reading side never waits for anything but the kernel: consume() reads what is queued into
+// memory and returns it; journaling is the caller's business, on another thread. Directories
+// are listed through FileSystem::current() and every system call goes through InotifyApi, so
+// that tests can make either fail.
+//
+// watchTree, consume and drain may be called from different threads; they take turns.
+// requestStop may be called from any thread at any time.
+class InotifyBackend {
+public:
+    // What every directory is watched for.
+    static constexpr uint32_t kWatchMask =
+        IN_CREATE | IN_DELETE | IN_MODIFY | IN_CLOSE_WRITE | IN_ATTRIB | IN_MOVED_FROM |
+        IN_MOVED_TO | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR | IN_DONT_FOLLOW | IN_EXCL_UNLINK;
+    // How much one read takes; consume stops after a few of these so that a storm of events
+    // cannot keep it from returning.
+    static constexpr size_t kReadBufferSize = 64 * 1024;
+    static constexpr size_t kReadsPerConsume = 16;
+
+    static Result<std::unique_ptr<InotifyBackend>> start(
+        std::shared_ptr<InotifyApi> api = InotifyApi::system());
+    ~InotifyBackend();
+    InotifyBackend(const InotifyBackend&) = delete;
+    InotifyBackend& operator=(const InotifyBackend&) = delete;
+
+    // Watches the directory `root` (absolute, not a symbolic link) and every directory below
+    // it, never following symbolic links. A directory that cannot be watched is logged as an
+    // error and reported in `discovered` as WatchFailed; its tree is left out and the rest
+    // is watched. Fails (and reports WatchFailed) when `root` itself cannot be watched.
+    Status watchTree(const std::string& root, std::vector<FileChange>& discovered);
+
+    // Waits up to `timeoutMs` (negative: forever) for events. Returns false once a stop was
+    // requested, true otherwise (events queued, or the time ran out).
+    bool wait(int timeoutMs);
+    // Appends the changes queued by the kernel without waiting: it reads until the queue is
+    // empty, or until it has read kReadsPerConsume buffers, in which case the next wait()
+    // returns at once. A directory that appeared is watched and then listed, and everything
+    // found inside is reported as Created, so that nothing created in it before the watch
+    // existed is missed (some may be reported twice).
+    void consume(std::vector<FileChange>& out);
+    // Like consume, but returns only once every event queued before the call has been read:
+    // each is in `out`, or in the output of a consume that was running on another thread.
+    void drain(std::vector<FileChange>& out);
+    // Makes wait() return false, now and from then on.
+    void requestStop();
+    bool stopRequested() const { return stopRequested_.load(); }
+
+    size_t watchCount() const;
+
+private:
+    struct Private {};
+
+public:
+    InotifyBackend(Private, std::shared_ptr<InotifyApi> api, int inotifyFd, int stopFd,
+                   bool watchThroughDescriptors);
+
+private:
+    // Reads and handles one buffer; false when nothing more was queued.
+    bool readOnce(std::vector<FileChange>& out, size_t& bytesRead);
+    // Hands out what the translator still holds; `queueEmpty` when the last read found nothing.
+    void finishReading(std::vector<FileChange>& out, bool queueEmpty);
+    // Removes the kernel watches of directories that left the trees.
+    void dropOrphanedWatches();
+    // Passes translated changes on, watching and listing the directories that appeared.
+    void handle(std::vector<FileChange>& changes, std::vector<FileChange>& out);
+    // Watches `top` and the directories below it. With `reportContents`, every entry found in
+    // a directory that was not watched yet is reported as Created. Returns the errno value that
+    // kept `top` from being watched, 0 when it is watched.
+    int watchDirectories(const std::string& top, bool reportContents, std::vector<FileChange>& out);
+    // Opens the directory, watches it through that descriptor and lists it. Returns the errno
+    // value on failure.
+    int watchOne(const std::string& path, std::vector<std::string>& subdirectories,
+                 bool reportContents, std::vector<FileChange>& out);
+    void reportUnwatched(const std::string& path, int error, std::vector<FileChange>& out);
+    // Lists again, at their new place, directories that vanished before they could be watched
+    // because `from` (or a directory above them) was renamed to `to`.
+    void rewatchMoved(const std::string& from, const std::string& to, std::vector<FileChange>& out);
+
+    const std::shared_ptr<InotifyApi> api_;
+    const int inotifyFd_;
+    const int stopFd_;
+    // Watch "/proc/self/fd/N/." of the descriptor that is listed, rather than the path.
+    const bool watchThroughDescriptors_;
+    std::atomic<bool> stopRequested_{false};
+    // consume() left events queued on purpose; wait() must not block.
+    std::atomic<bool> readingCutShort_{false};
+
+    mutable std::mutex mutex_;
+    InotifyTranslator translator_;
+    std::vector<char> buffer_;
+    // Directories that appeared but were gone when they were to be watched; a rename read
+    // later may say where they went. Forgotten once the queue is empty.
+    std::vector<std::string> vanished_;
+};
+
+}  // namespace tamber
