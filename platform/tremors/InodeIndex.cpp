@@ -1,0 +1,267 @@
+#include "platform/tremors/InodeIndex.h"
+
+#include <cerrno>
+#include <limits>
+#include <unordered_set>
+
+namespace tamber {
+
+namespace {
+
+// SQLite integers are signed; inodes round-trip through the same 64 bits.
+int64_t i64(uint64_t v) {
+    return static_cast<int64_t>(v);
+}
+uint64_t u64(int64_t v) {
+    return static_cast<uint64_t>(v);
+}
+
+constexpr const char* kSchema = R"sql(
+CREATE TABLE inodes(
+    inode INTEGER PRIMARY KEY,
+    parent INTEGER NOT NULL,
+    name TEXT NOT NULL,
+    kind INTEGER NOT NULL);
+CREATE INDEX inodes_by_parent ON inodes(parent);
+CREATE TABLE documents(
+    doc_id INTEGER PRIMARY KEY,
+    inode INTEGER NOT NULL);
+CREATE UNIQUE INDEX documents_by_inode ON documents(inode);
+)sql";
+
+constexpr const char* kFindByInode =
+    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id FROM inodes i "
+    "LEFT JOIN documents d ON d.inode = i.inode WHERE i.inode = ?";
+constexpr const char* kFindByParent =
+    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id FROM inodes i "
+    "LEFT JOIN documents d ON d.inode = i.inode WHERE i.parent = ?";
+
+InodeRecord readInode(const SqliteDatabase::Statement& stmt) {
+    InodeRecord record;
+    record.inode = u64(stmt.columnInt64(0));
+    record.parent = u64(stmt.columnInt64(1));
+    record.name = stmt.columnText(2);
+    record.kind = static_cast<uint8_t>(stmt.columnInt64(3));
+    record.docID = static_cast<uint32_t>(stmt.columnInt64(4));  // NULL reads as 0
+    return record;
+}
+
+}  // namespace
+
+const char* InodeIndex::schema() {
+    return kSchema;
+}
+
+bool InodeIndex::isEntryName(std::string_view name) {
+    return !name.empty() && name != "." && name != ".." &&
+           name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
+}
+
+Status InodeIndex::load() {
+    auto next = db_.queryInt64("SELECT next_document_id FROM meta WHERE id = 1");
+    if (!next)
+        return next.error();
+    auto highest = db_.queryInt64("SELECT coalesce(max(doc_id), 0) FROM documents");
+    if (!highest)
+        return highest.error();
+    if (next.value() < 1 || highest.value() >= next.value()) {
+        return SqliteDatabase::makeError(SQLITE_CORRUPT, "checking the event journal",
+                                         "document IDs beyond the counter");
+    }
+    nextDocumentId_ = u64(next.value());
+    return std::nullopt;
+}
+
+// ---- Tree ----
+
+Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
+    for (const InodeRecord& record : records) {
+        if (!isEntryName(record.name) || record.inode == 0) {
+            return Error::invalidParameter("name", record.name);
+        }
+    }
+    auto txn = db_.begin();
+    if (!txn)
+        return txn.error();
+    auto upsert = db_.cached(
+        "INSERT INTO inodes(inode, parent, name, kind) VALUES(?, ?, ?, ?) "
+        "ON CONFLICT(inode) DO UPDATE SET parent = excluded.parent, name = excluded.name, "
+        "kind = excluded.kind");
+    if (!upsert)
+        return upsert.error();
+    for (const InodeRecord& record : records) {
+        upsert->bind(1, i64(record.inode))
+            .bind(2, i64(record.parent))
+            .bind(3, record.name)
+            .bind(4, int64_t{record.kind});
+        if (Status status = upsert->run())
+            return status;
+    }
+    return txn->commit();
+}
+
+Status InodeIndex::remove(const std::vector<uint64_t>& inodes) {
+    auto txn = db_.begin();
+    if (!txn)
+        return txn.error();
+    auto erase = db_.cached("DELETE FROM inodes WHERE inode = ?");
+    if (!erase)
+        return erase.error();
+    for (uint64_t inode : inodes) {
+        if (Status status = erase->bind(1, i64(inode)).run())
+            return status;
+    }
+    return txn->commit();
+}
+
+Result<std::optional<InodeRecord>> InodeIndex::find(uint64_t inode) {
+    auto stmt = db_.cached(kFindByInode);
+    if (!stmt)
+        return stmt.error();
+    auto row = stmt->bind(1, i64(inode)).step();
+    if (!row)
+        return row.error();
+    if (!row.value())
+        return std::optional<InodeRecord>();
+    return std::optional<InodeRecord>(readInode(stmt.value()));
+}
+
+Result<std::optional<std::string>> InodeIndex::path(
+    uint64_t inode, const std::function<const std::string*(uint64_t)>& rootPath) {
+    auto stmt = db_.cached("SELECT parent, name FROM inodes WHERE inode = ?");
+    if (!stmt)
+        return stmt.error();
+    std::vector<std::string> names;
+    std::unordered_set<uint64_t> seen;
+    // The index may be damaged: a cycle or an endless chain ends the walk, never the process.
+    for (uint64_t current = inode; current != 0;) {
+        if (const std::string* top = rootPath(current)) {
+            std::string path = *top;
+            for (auto name = names.rbegin(); name != names.rend(); ++name) {
+                if (path.back() != '/')
+                    path += '/';
+                path += *name;
+            }
+            return std::optional<std::string>(std::move(path));
+        }
+        if (names.size() == kMaxPathComponents || !seen.insert(current).second)
+            break;
+        auto row = stmt->bind(1, i64(current)).step();
+        if (!row)
+            return row.error();
+        if (!row.value())
+            break;
+        std::string name = stmt->columnText(1);
+        if (!isEntryName(name))
+            break;  // never let the index name a path outside its root
+        names.push_back(std::move(name));
+        current = u64(stmt->columnInt64(0));
+        stmt->reset();
+    }
+    return std::optional<std::string>();
+}
+
+Result<std::vector<InodeRecord>> InodeIndex::children(uint64_t parent) {
+    auto stmt = db_.cached(kFindByParent);
+    if (!stmt)
+        return stmt.error();
+    stmt->bind(1, i64(parent));
+    std::vector<InodeRecord> result;
+    Result<bool> r = stmt->step();
+    for (; r.ok() && r.value(); r = stmt->step()) result.push_back(readInode(stmt.value()));
+    if (!r)
+        return r.error();
+    return result;
+}
+
+// ---- Document IDs ----
+
+Result<std::optional<uint32_t>> InodeIndex::documentIdForInode(uint64_t inode) {
+    auto stmt = db_.cached("SELECT doc_id FROM documents WHERE inode = ?");
+    if (!stmt)
+        return stmt.error();
+    auto row = stmt->bind(1, i64(inode)).step();
+    if (!row)
+        return row.error();
+    if (!row.value())
+        return std::optional<uint32_t>();
+    return std::optional<uint32_t>(static_cast<uint32_t>(stmt->columnInt64(0)));
+}
+
+Result<std::optional<uint64_t>> InodeIndex::inodeForDocumentId(uint32_t docID) {
+    auto stmt = db_.cached("SELECT inode FROM documents WHERE doc_id = ?");
+    if (!stmt)
+        return stmt.error();
+    auto row = stmt->bind(1, int64_t{docID}).step();
+    if (!row)
+        return row.error();
+    if (!row.value())
+        return std::optional<uint64_t>();
+    return std::optional<uint64_t>(u64(stmt->columnInt64(0)));
+}
+
+Result<uint32_t> InodeIndex::allocateDocumentId(uint64_t inode) {
+    if (inode == 0)
+        return Error::invalidParameter("inode", "0");
+    auto existing = documentIdForInode(inode);
+    if (!existing)
+        return existing.error();
+    if (existing.value())
+        return *existing.value();
+    if (nextDocumentId_ > std::numeric_limits<uint32_t>::max()) {
+        return Error(kPosixErrorDomain, EOVERFLOW,
+                     {{"description", "Every document ID of this volume has been used"}});
+    }
+    // The counter moves in the same transaction as the row, so a crash cannot reuse an ID.
+    auto txn = db_.begin();
+    if (!txn)
+        return txn.error();
+    auto insert = db_.cached("INSERT INTO documents(doc_id, inode) VALUES(?, ?)");
+    if (!insert)
+        return insert.error();
+    if (Status status = insert->bind(1, i64(nextDocumentId_)).bind(2, i64(inode)).run())
+        return *status;
+    auto meta = db_.cached("UPDATE meta SET next_document_id = ? WHERE id = 1");
+    if (!meta)
+        return meta.error();
+    if (Status status = meta->bind(1, i64(nextDocumentId_ + 1)).run())
+        return *status;
+    if (Status status = txn->commit())
+        return *status;
+    return static_cast<uint32_t>(nextDocumentId_++);
+}
+
+Status InodeIndex::moveDocumentId(uint32_t docID, uint64_t newInode) {
+    if (newInode == 0)
+        return Error::invalidParameter("inode", "0");
+    auto holder = documentIdForInode(newInode);
+    if (!holder)
+        return holder.error();
+    if (holder.value() == docID)
+        return std::nullopt;
+    if (holder.value()) {
+        return Error(
+            kPosixErrorDomain, EEXIST,
+            {{"description", "Inode " + std::to_string(newInode) + " already has the document ID " +
+                                 std::to_string(*holder.value())}});
+    }
+    auto update = db_.cached("UPDATE documents SET inode = ? WHERE doc_id = ?");
+    if (!update)
+        return update.error();
+    if (Status status = update->bind(1, i64(newInode)).bind(2, int64_t{docID}).run())
+        return status;
+    if (db_.changes() == 0) {
+        return Error(kPosixErrorDomain, ENOENT,
+                     {{"description", "No document has the ID " + std::to_string(docID)}});
+    }
+    return std::nullopt;
+}
+
+Status InodeIndex::clearDocumentId(uint32_t docID) {
+    auto erase = db_.cached("DELETE FROM documents WHERE doc_id = ?");
+    if (!erase)
+        return erase.error();
+    return erase->bind(1, int64_t{docID}).run();
+}
+
+}  // namespace tamber

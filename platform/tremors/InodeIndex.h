@@ -1,0 +1,56 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/tremors/InodeRecord.h"
+#include "platform/tremors/SqliteDatabase.h"
+#include "support/Result.h"
+
+namespace tamber {
+
+// The index of the watched trees, kept in the journal's database: for each inode its parent,
+// name and kind, and the document IDs (docID -> inode, at most one per inode). The document-ID
+// counter lives in the journal's meta row, next to the event counter.
+//
+// Not locked: TremorStore owns it and serialises every call.
+class InodeIndex {
+public:
+    static constexpr size_t kMaxPathComponents = 4096;
+    // Its tables, created with the rest of the journal's schema.
+    static const char* schema();
+
+    explicit InodeIndex(SqliteDatabase& db) : db_(db) {}
+
+    // Reads the document-ID counter and checks that no ID was handed out beyond it.
+    Status load();
+
+    // See TremorStore for the meaning of each call.
+    Status upsert(const std::vector<InodeRecord>& records);
+    Status remove(const std::vector<uint64_t>& inodes);
+    Result<std::optional<InodeRecord>> find(uint64_t inode);
+    // `rootPath` names the watched root whose top is that inode, or returns nullptr.
+    Result<std::optional<std::string>> path(
+        uint64_t inode, const std::function<const std::string*(uint64_t)>& rootPath);
+    Result<std::vector<InodeRecord>> children(uint64_t parent);
+
+    Result<uint32_t> allocateDocumentId(uint64_t inode);
+    Result<std::optional<uint64_t>> inodeForDocumentId(uint32_t docID);
+    Result<std::optional<uint32_t>> documentIdForInode(uint64_t inode);
+    Status moveDocumentId(uint32_t docID, uint64_t newInode);
+    Status clearDocumentId(uint32_t docID);
+
+    // A name readdir could return: not empty, ".", ".." or containing '/' or NUL.
+    static bool isEntryName(std::string_view name);
+
+private:
+    SqliteDatabase& db_;
+    uint64_t nextDocumentId_ = 1;
+};
+
+}  // namespace tamber

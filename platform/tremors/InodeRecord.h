@@ -1,0 +1,21 @@
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+namespace tamber {
+
+// One entry of the index of the watched trees: where an inode sits and its document ID.
+struct InodeRecord {
+    enum Kind : uint8_t { kFile = 1, kDirectory = 2, kSymlink = 3, kOther = 4 };
+
+    uint64_t inode = 0;
+    uint64_t parent = 0;  // the containing directory's inode
+    std::string name;     // the name within the parent
+    uint8_t kind = kOther;
+    uint32_t docID = 0;  // 0: none
+
+    friend bool operator==(const InodeRecord&, const InodeRecord&) = default;
+};
+
+}  // namespace tamber

@@ -1,0 +1,524 @@
+#include "platform/tremors/TremorStore.h"
+
+#include <sys/random.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+
+#include "support/Log.h"
+
+namespace tamber {
+
+namespace {
+
+// SQLite integers are signed; inodes and IDs round-trip through the same 64 bits.
+int64_t i64(uint64_t v) {
+    return static_cast<int64_t>(v);
+}
+uint64_t u64(int64_t v) {
+    return static_cast<uint64_t>(v);
+}
+
+constexpr const char* kSchema = R"sql(
+CREATE TABLE meta(
+    id INTEGER PRIMARY KEY CHECK (id = 1),
+    uuid TEXT NOT NULL,
+    next_event_id INTEGER NOT NULL,
+    oldest_event_id INTEGER NOT NULL,
+    next_document_id INTEGER NOT NULL);
+CREATE TABLE events(
+    id INTEGER PRIMARY KEY,
+    root INTEGER NOT NULL,
+    path TEXT NOT NULL,
+    file_id INTEGER NOT NULL,
+    flags INTEGER NOT NULL);
+CREATE INDEX events_by_root ON events(root, id);
+)sql";
+
+Error corrupt(const std::string& what) {
+    return SqliteDatabase::makeError(SQLITE_CORRUPT, "checking the event journal", what);
+}
+
+// Errors that say nothing about the file itself: moving it aside would lose a good journal.
+bool isTransient(const Error& error) {
+    if (error.domain() != kSqliteErrorDomain)
+        return true;
+    switch (error.code() & 0xff) {
+        case SQLITE_NOMEM:
+        case SQLITE_FULL:
+        case SQLITE_BUSY:
+        case SQLITE_LOCKED:
+        case SQLITE_INTERRUPT:
+            return true;
+        default:
+            return false;
+    }
+}
+
+Result<std::string> randomUuid() {
+    unsigned char bytes[16];
+    size_t got = 0;
+    while (got < sizeof bytes) {
+        ssize_t n = ::getrandom(bytes + got, sizeof bytes - got, 0);
+        if (n < 0) {
+            if (errno == EINTR)
+                continue;
+            return Error::errorWithPOSIXCode(errno);
+        }
+        got += static_cast<size_t>(n);
+    }
+    bytes[6] = static_cast<unsigned char>((bytes[6] & 0x0f) | 0x40);  // version 4
+    bytes[8] = static_cast<unsigned char>((bytes[8] & 0x3f) | 0x80);  // RFC 4122 variant
+    char text[37];
+    std::snprintf(text, sizeof text,
+                  "%02X%02X%02X%02X-%02X%02X-%02X%02X-%02X%02X-%02X%02X%02X%02X%02X%02X", bytes[0],
+                  bytes[1], bytes[2], bytes[3], bytes[4], bytes[5], bytes[6], bytes[7], bytes[8],
+                  bytes[9], bytes[10], bytes[11], bytes[12], bytes[13], bytes[14], bytes[15]);
+    return std::string(text);
+}
+
+}  // namespace
+
+// ---- Opening ----
+
+Result<std::unique_ptr<TremorStore>> TremorStore::open(const std::string& stateDir, uint64_t fsid) {
+    auto dir = TremorStoreDirectory::acquire(stateDir, fsid);
+    if (!dir)
+        return dir.error();
+    std::unique_ptr<TremorStore> store(new TremorStore(std::move(dir).value()));
+    Status status = store->load();
+    if (!status)
+        return store;
+
+    std::string database = store->dir_->databasePath();
+    if (isTransient(*status)) {
+        logError("Cannot open the event journal " + database + ": " + status->description());
+        return *status;
+    }
+    logError("The event journal " + database + " is unusable (" + status->description() +
+             "); moving it aside and starting a new one");
+    store->index_.reset();
+    store->roots_.reset();
+    store->db_.reset();
+    auto moved = store->dir_->moveDatabaseAside();
+    if (!moved)
+        return moved.error();
+    status = store->load();
+    if (status) {
+        logError("Cannot create the event journal " + database + ": " + status->description());
+        return *status;
+    }
+    return store;
+}
+
+TremorStore::~TremorStore() {
+    std::lock_guard lock(mutex_);
+    index_.reset();
+    roots_.reset();
+    db_.reset();  // before the directory lock goes
+}
+
+Status TremorStore::load() {
+    dir_->removeOrphanedSidecars();
+    auto db = SqliteDatabase::open(dir_->databasePath());
+    if (!db)
+        return db.error();
+    db_ = std::move(db).value();
+    roots_ = std::make_unique<WatchedRoots>(*db_);
+    index_ = std::make_unique<InodeIndex>(*db_);
+    if (Status status = configure())
+        return status;
+
+    auto version = db_->queryInt64("PRAGMA user_version");
+    if (!version)
+        return version.error();
+    if (version.value() == 0) {
+        auto objects = db_->queryInt64("SELECT count(*) FROM sqlite_schema");
+        if (!objects)
+            return objects.error();
+        if (objects.value() != 0)
+            return corrupt("tables without a schema version");
+        if (Status status = createSchema())
+            return status;
+    } else if (version.value() != kSchemaVersion) {
+        return corrupt("schema version " + std::to_string(version.value()) + ", expected " +
+                       std::to_string(kSchemaVersion));
+    } else {
+        auto check = db_->queryText("PRAGMA quick_check(1)");
+        if (!check)
+            return check.error();
+        if (check.value() != "ok") {
+            std::string found = check.value();
+            std::replace(found.begin(), found.end(), '\n', ' ');  // one log line
+            return corrupt("quick check: " + found);
+        }
+    }
+    return readState();
+}
+
+Status TremorStore::configure() {
+    // The directory lock already keeps every other Tamber process out, so the connection may
+    // keep its file locks for good: that saves two fcntl calls per statement, and with WAL
+    // entered in this mode the WAL index lives in memory rather than in a -shm file.
+    if (Status status = db_->exec("PRAGMA busy_timeout = 5000; PRAGMA locking_mode = EXCLUSIVE"))
+        return status;
+    auto mode = db_->queryText("PRAGMA journal_mode = WAL");
+    if (!mode)
+        return mode.error();
+    if (mode.value() != "wal") {
+        return SqliteDatabase::makeError(SQLITE_ERROR, "switching to WAL", "mode " + mode.value());
+    }
+    // Losing the last transactions in a power cut is acceptable (anchors into them expire);
+    // the larger cache keeps random inode-index writes off the disk.
+    return db_->exec("PRAGMA synchronous = NORMAL; PRAGMA cache_size = -32768");
+}
+
+Status TremorStore::createSchema() {
+    auto uuid = randomUuid();
+    if (!uuid)
+        return uuid.error();
+    auto txn = db_->begin();
+    if (!txn)
+        return txn.error();
+    if (Status status =
+            db_->exec(std::string(kSchema) + WatchedRoots::schema() + InodeIndex::schema()))
+        return status;
+    auto insert = db_->prepare(
+        "INSERT INTO meta(id, uuid, next_event_id, oldest_event_id, next_document_id) "
+        "VALUES(1, ?, 1, 1, 1)");
+    if (!insert)
+        return insert.error();
+    if (Status status = insert->bind(1, uuid.value()).run())
+        return status;
+    if (Status status = db_->exec("PRAGMA user_version = " + std::to_string(kSchemaVersion)))
+        return status;
+    if (Status status = txn->commit())
+        return status;
+    logInfo("Started a new event journal " + uuid.value() + " in " + dir_->path());
+    return std::nullopt;
+}
+
+Status TremorStore::readState() {
+    auto meta = db_->prepare("SELECT uuid, next_event_id, oldest_event_id FROM meta WHERE id = 1");
+    if (!meta)
+        return meta.error();
+    auto row = meta->step();
+    if (!row)
+        return row.error();
+    if (!row.value())
+        return corrupt("no meta row");
+    uuid_ = meta->columnText(0);
+    int64_t next = meta->columnInt64(1), oldest = meta->columnInt64(2);
+    meta->reset();
+    if (uuid_.size() != 36 || next < 1 || oldest < 1 || oldest > next) {
+        return corrupt("inconsistent meta row");
+    }
+    // Rows beyond the counter would make the next append reuse their IDs.
+    auto range = db_->prepare("SELECT min(id), max(id) FROM events");
+    if (!range)
+        return range.error();
+    if (auto r = range->step(); !r)
+        return r.error();
+    if (!range->columnIsNull(0) &&
+        (range->columnInt64(0) < oldest || range->columnInt64(1) >= next)) {
+        return corrupt("events outside the kept range");
+    }
+    if (Status status = index_->load())
+        return status;
+    nextEventId_ = u64(next);
+    oldestEventId_ = u64(oldest);
+    return roots_->load();
+}
+
+uint64_t TremorStore::lastEventId() const {
+    std::lock_guard lock(mutex_);
+    return nextEventId_ - 1;
+}
+
+uint64_t TremorStore::oldestEventId() const {
+    std::lock_guard lock(mutex_);
+    return oldestEventId_;
+}
+
+uint64_t TremorStore::commitCount() const {
+    std::lock_guard lock(mutex_);
+    return db_->commitCount();
+}
+
+// ---- Journal ----
+
+Result<uint64_t> TremorStore::append(std::vector<JournalEvent>& events) {
+    std::lock_guard lock(mutex_);
+    if (events.empty())
+        return nextEventId_ - 1;
+    auto txn = db_->begin();
+    if (!txn)
+        return txn.error();
+    auto insert =
+        db_->cached("INSERT INTO events(id, root, path, file_id, flags) VALUES(?, ?, ?, ?, ?)");
+    if (!insert)
+        return insert.error();
+    uint64_t id = nextEventId_;
+    for (const JournalEvent& event : events) {
+        insert->bind(1, i64(id++))
+            .bind(2, i64(roots_->idFor(event.path)))
+            .bind(3, event.path)
+            .bind(4, i64(event.fileID))
+            .bind(5, static_cast<int64_t>(event.flags));
+        if (Status status = insert->run())
+            return *status;
+    }
+    auto meta = db_->cached("UPDATE meta SET next_event_id = ? WHERE id = 1");
+    if (!meta)
+        return meta.error();
+    if (Status status = meta->bind(1, i64(id)).run())
+        return *status;
+    if (Status status = txn->commit())
+        return *status;
+    for (JournalEvent& event : events) event.id = nextEventId_++;
+    return nextEventId_ - 1;
+}
+
+// Reads one root's events (or all events, for root -1) in ID order, a chunk at a time.
+struct TremorStore::Cursor {
+    int64_t root;
+    uint64_t after;
+    std::vector<JournalEvent> buffered;
+    size_t next = 0;  // the first of `buffered` not yet delivered
+    bool exhausted = false;
+
+    bool empty() const { return next == buffered.size(); }
+    const JournalEvent& front() const { return buffered[next]; }
+};
+
+Status TremorStore::fetch(Cursor& cursor, size_t chunk, uint64_t upTo) {
+    std::lock_guard lock(mutex_);
+    // The planner prefers the primary key for "ORDER BY id"; for one root the index is far
+    // cheaper, so it is forced.
+    auto stmt = cursor.root < 0 ? db_->cached(
+                                      "SELECT id, path, file_id, flags FROM events "
+                                      "WHERE id > ?1 AND id <= ?2 ORDER BY id LIMIT ?3")
+                                : db_->cached(
+                                      "SELECT id, path, file_id, flags FROM events "
+                                      "INDEXED BY events_by_root WHERE root = ?4 "
+                                      "AND id > ?1 AND id <= ?2 ORDER BY id LIMIT ?3");
+    if (!stmt)
+        return stmt.error();
+    cursor.buffered.clear();
+    cursor.next = 0;
+    stmt->bind(1, i64(cursor.after)).bind(2, i64(upTo)).bind(3, i64(chunk));
+    if (cursor.root >= 0)
+        stmt->bind(4, cursor.root);
+    size_t rows = 0;
+    Result<bool> r = stmt->step();
+    for (; r.ok() && r.value(); r = stmt->step(), ++rows) {
+        cursor.buffered.push_back({u64(stmt->columnInt64(0)), stmt->columnText(1),
+                                   u64(stmt->columnInt64(2)),
+                                   static_cast<uint32_t>(stmt->columnInt64(3))});
+    }
+    if (!r)
+        return r.error();
+    if (rows < chunk)
+        cursor.exhausted = true;
+    if (!cursor.buffered.empty())
+        cursor.after = cursor.buffered.back().id;
+    return std::nullopt;
+}
+
+Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::string>& paths,
+                           size_t chunk, const std::function<bool(const JournalEvent&)>& each) {
+    if (chunk == 0)
+        chunk = kDefaultReplayChunk;
+    std::vector<std::string> wanted;
+    for (const std::string& path : paths) wanted.push_back(WatchedRoots::normalised(path));
+    bool everything = wanted.empty() || std::count(wanted.begin(), wanted.end(), "/") > 0;
+
+    std::vector<Cursor> cursors;
+    uint64_t upTo;
+    {
+        std::lock_guard lock(mutex_);
+        upTo = nextEventId_ - 1;
+        if (!everything) {
+            for (uint64_t root : roots_->mayHoldEventsBelow(wanted))
+                cursors.push_back({i64(root), sinceExclusive, {}});
+        }
+    }
+    // Every root involved: one scan in ID order is cheaper than merging them all.
+    if (cursors.empty())
+        cursors.push_back({-1, sinceExclusive, {}});
+
+    auto matches = [&](const std::string& path) {
+        if (everything)
+            return true;
+        for (const std::string& base : wanted) {
+            if (WatchedRoots::isAtOrBelow(path, base))
+                return true;
+        }
+        return false;
+    };
+    while (true) {
+        Cursor* next = nullptr;
+        for (Cursor& cursor : cursors) {
+            if (cursor.empty() && !cursor.exhausted) {
+                if (Status status = fetch(cursor, chunk, upTo))
+                    return status;
+            }
+            if (!cursor.empty() && (!next || cursor.front().id < next->front().id)) {
+                next = &cursor;
+            }
+        }
+        if (!next)
+            return std::nullopt;
+        const JournalEvent& event = next->buffered[next->next++];
+        if (matches(event.path) && !each(event))
+            return std::nullopt;
+    }
+}
+
+TremorStore::ReplayCheck TremorStore::replayability(uint64_t sinceEventId,
+                                                    const std::vector<std::string>& paths) const {
+    std::lock_guard lock(mutex_);
+    uint64_t last = nextEventId_ - 1;
+    if (sinceEventId > last) {
+        return {false, "event " + std::to_string(sinceEventId) + " is past the last event " +
+                           std::to_string(last) + " of this journal"};
+    }
+    if (sinceEventId + 1 < oldestEventId_) {
+        return {false, "events up to " + std::to_string(oldestEventId_ - 1) + " were trimmed"};
+    }
+    std::vector<std::string> wanted;
+    for (const std::string& path : paths) wanted.push_back(WatchedRoots::normalised(path));
+    if (wanted.empty())
+        wanted.push_back("/");
+    for (const std::string& path : wanted) {
+        std::optional<uint64_t> watched = roots_->watchedSince(path);
+        if (!watched)
+            return {false, path + " is not under watch"};
+        if (*watched > sinceEventId) {
+            return {false, path + " came under watch at event " + std::to_string(*watched)};
+        }
+    }
+    return {true, {}};
+}
+
+Status TremorStore::trim(uint64_t keepAtMost) {
+    std::lock_guard lock(mutex_);
+    uint64_t last = nextEventId_ - 1;
+    uint64_t oldest = last >= keepAtMost ? last - keepAtMost + 1 : 1;
+    if (oldest <= oldestEventId_)
+        return std::nullopt;
+    auto txn = db_->begin();
+    if (!txn)
+        return txn.error();
+    auto erase = db_->cached("DELETE FROM events WHERE id < ?");
+    if (!erase)
+        return erase.error();
+    if (Status status = erase->bind(1, i64(oldest)).run())
+        return status;
+    auto meta = db_->cached("UPDATE meta SET oldest_event_id = ? WHERE id = 1");
+    if (!meta)
+        return meta.error();
+    if (Status status = meta->bind(1, i64(oldest)).run())
+        return status;
+    if (Status status = txn->commit())
+        return status;
+    oldestEventId_ = oldest;
+    return std::nullopt;
+}
+
+// ---- Roots ----
+
+Status TremorStore::addRoot(const std::string& path, uint64_t sinceEventId, uint64_t inode) {
+    std::lock_guard lock(mutex_);
+    return roots_->add(path, sinceEventId, inode);
+}
+
+Status TremorStore::setRootInode(const std::string& path, uint64_t inode) {
+    std::lock_guard lock(mutex_);
+    return roots_->setInode(path, inode);
+}
+
+Status TremorStore::removeRoot(const std::string& path) {
+    std::lock_guard lock(mutex_);
+    return roots_->remove(path);
+}
+
+std::vector<TremorStore::Root> TremorStore::roots() const {
+    std::lock_guard lock(mutex_);
+    return roots_->watched();
+}
+
+// ---- Index of the watched trees and document IDs ----
+
+namespace {
+
+// Reads that answer "nothing" on failure still leave a trace of why.
+template <class T>
+std::optional<T> orLogged(Result<std::optional<T>> result) {
+    if (!result) {
+        logError(result.error().description());
+        return std::nullopt;
+    }
+    return std::move(result).value();
+}
+
+}  // namespace
+
+Status TremorStore::upsertInodes(const std::vector<InodeRecord>& records) {
+    std::lock_guard lock(mutex_);
+    return index_->upsert(records);
+}
+
+Status TremorStore::removeInodes(const std::vector<uint64_t>& inodes) {
+    std::lock_guard lock(mutex_);
+    return index_->remove(inodes);
+}
+
+std::optional<InodeRecord> TremorStore::inode(uint64_t inode) const {
+    std::lock_guard lock(mutex_);
+    return orLogged(index_->find(inode));
+}
+
+std::optional<std::string> TremorStore::pathForInode(uint64_t inode) const {
+    std::lock_guard lock(mutex_);
+    return orLogged(index_->path(
+        inode, [this](uint64_t candidate) { return roots_->pathOfRootInode(candidate); }));
+}
+
+std::vector<InodeRecord> TremorStore::children(uint64_t parent) const {
+    std::lock_guard lock(mutex_);
+    auto result = index_->children(parent);
+    if (!result) {
+        logError(result.error().description());
+        return {};
+    }
+    return std::move(result).value();
+}
+
+Result<uint32_t> TremorStore::allocateDocumentId(uint64_t inode) {
+    std::lock_guard lock(mutex_);
+    return index_->allocateDocumentId(inode);
+}
+
+std::optional<uint64_t> TremorStore::inodeForDocumentId(uint32_t docID) const {
+    std::lock_guard lock(mutex_);
+    return orLogged(index_->inodeForDocumentId(docID));
+}
+
+std::optional<uint32_t> TremorStore::documentIdForInode(uint64_t inode) const {
+    std::lock_guard lock(mutex_);
+    return orLogged(index_->documentIdForInode(inode));
+}
+
+Status TremorStore::moveDocumentId(uint32_t docID, uint64_t newInode) {
+    std::lock_guard lock(mutex_);
+    return index_->moveDocumentId(docID, newInode);
+}
+
+Status TremorStore::clearDocumentId(uint32_t docID) {
+    std::lock_guard lock(mutex_);
+    return index_->clearDocumentId(docID);
+}
+
+}  // namespace tamber

@@ -1,0 +1,144 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/tremors/InodeIndex.h"
+#include "platform/tremors/InodeRecord.h"
+#include "platform/tremors/JournalEvent.h"
+#include "platform/tremors/SqliteDatabase.h"
+#include "platform/tremors/TremorStoreDirectory.h"
+#include "platform/tremors/WatchedRoots.h"
+#include "support/Result.h"
+
+namespace tamber {
+
+// The persistent state of one volume: the event journal, the watched roots, and the index of
+// the watched trees (inode -> parent, name, kind) with the document IDs.
+//
+// Every call takes an internal mutex, so one writer thread and any number of readers may share
+// a store. replay() releases it while its callback runs.
+//
+// Event IDs and document IDs come from counters kept in the database and updated in the same
+// transaction as the rows that use them: neither is ever handed out twice, whatever was
+// trimmed, cleared or lost in a crash.
+class TremorStore {
+public:
+    using Root = WatchedRoots::Root;
+
+    // Whether replaying from an event ID shows everything that happened since.
+    struct ReplayCheck {
+        bool complete = false;
+        std::string reason;  // why not, for the log
+    };
+
+    static constexpr int kSchemaVersion = 1;
+    static constexpr size_t kDefaultReplayChunk = 1000;
+    static constexpr size_t kMaxPathComponents = InodeIndex::kMaxPathComponents;
+    static constexpr const char* kDocumentIdRoot = "/.docid";
+
+    // Opens <stateDir>/<fsid as 16 hex digits>/journal.sqlite, creating it when missing. A
+    // database that cannot be used (not a database, failing its check, unknown schema) is
+    // logged, moved aside and replaced by a new store with a new UUID: anchors into the old
+    // history then fail the UUID check, which is what must happen.
+    static Result<std::unique_ptr<TremorStore>> open(const std::string& stateDir, uint64_t fsid);
+    ~TremorStore();
+    TremorStore(const TremorStore&) = delete;
+    TremorStore& operator=(const TremorStore&) = delete;
+
+    // Canonical upper-case 8-4-4-4-12, fixed for the life of the database.
+    const std::string& uuid() const { return uuid_; }
+    const std::string& directory() const { return dir_->path(); }
+    // The last ID handed out; 0 for a new store.
+    uint64_t lastEventId() const;
+    // The oldest ID still kept (or the next one, when everything was trimmed).
+    uint64_t oldestEventId() const;
+    // Commits made by this store's connection; one append is one commit.
+    uint64_t commitCount() const;
+
+    // ---- Journal ----
+
+    // Assigns consecutive IDs to `events` and writes them in one transaction. Returns the last
+    // ID. On failure nothing is written and no ID is used up.
+    Result<uint64_t> append(std::vector<JournalEvent>& events);
+
+    // Calls `each` for every event with `sinceExclusive` < id <= lastEventId() at the start of
+    // the call whose path is at or below one of `paths` (by whole components), in ID order,
+    // until `each` returns false. Empty `paths` means the whole volume. Rows are read `chunk`
+    // at a time (0: the default) and the lock is not held while `each` runs, so it may call
+    // the store.
+    Status replay(uint64_t sinceExclusive, const std::vector<std::string>& paths, size_t chunk,
+                  const std::function<bool(const JournalEvent&)>& each);
+    // Incomplete when events after `since` were trimmed, when `since` is not from this history,
+    // or when a path is not under watch or came under watch after `since`.
+    ReplayCheck replayability(uint64_t since, const std::vector<std::string>& paths) const;
+
+    // Deletes the oldest events so that at most `keepAtMost` remain.
+    Status trim(uint64_t keepAtMost);
+
+    // ---- Roots ----
+
+    // Remembers that `path` is watched from event `sinceEventId` on. Adding a watched root again
+    // changes nothing but a given inode; adding a removed one starts its history anew.
+    Status addRoot(const std::string& path, uint64_t sinceEventId, uint64_t inode = 0);
+    Status setRootInode(const std::string& path, uint64_t inode);
+    // The root stops being watched; its events stay replayable.
+    Status removeRoot(const std::string& path);
+    std::vector<Root> roots() const;
+
+    // ---- Index of the watched trees ----
+
+    // Inserts or updates parent, name and kind; `docID` is ignored (document IDs change only
+    // through the calls below, so that a crawl cannot drop them). Names must be real directory
+    // entries: not empty, ".", ".." or containing '/'.
+    Status upsertInodes(const std::vector<InodeRecord>& records);
+    // Removes index entries. Document IDs are left in place: the caller decides whether the
+    // document moved to another inode (moveDocumentId) or was deleted (clearDocumentId), and
+    // journals that first.
+    Status removeInodes(const std::vector<uint64_t>& inodes);
+    std::optional<InodeRecord> inode(uint64_t inode) const;
+    // The absolute path, from the parent chain up to a root's inode. Nothing for inodes outside
+    // the watched roots, broken or cyclic chains, or chains deeper than kMaxPathComponents.
+    std::optional<std::string> pathForInode(uint64_t inode) const;
+    std::vector<InodeRecord> children(uint64_t parent) const;
+
+    // ---- Document IDs ----
+
+    // The inode's document ID, or the next one (from 1, never reused).
+    Result<uint32_t> allocateDocumentId(uint64_t inode);
+    std::optional<uint64_t> inodeForDocumentId(uint32_t docID) const;
+    std::optional<uint32_t> documentIdForInode(uint64_t inode) const;
+    // A safe save: the ID follows the document to `newInode` and the old inode loses it. Fails
+    // when `newInode` already has another ID (clear that one first).
+    Status moveDocumentId(uint32_t docID, uint64_t newInode);
+    // The document was deleted; the ID is not handed out again.
+    Status clearDocumentId(uint32_t docID);
+
+private:
+    struct Cursor;
+
+    explicit TremorStore(std::unique_ptr<TremorStoreDirectory> dir) : dir_(std::move(dir)) {}
+
+    Status load();
+    Status configure();
+    Status createSchema();
+    Status readState();
+    Status fetch(Cursor& cursor, size_t chunk, uint64_t upTo);
+
+    std::unique_ptr<TremorStoreDirectory> dir_;
+    std::unique_ptr<SqliteDatabase> db_;
+    std::unique_ptr<WatchedRoots> roots_;  // uses db_
+    std::unique_ptr<InodeIndex> index_;    // uses db_
+    mutable std::mutex mutex_;
+    std::string uuid_;
+    uint64_t nextEventId_ = 1;
+    uint64_t oldestEventId_ = 1;
+};
+
+}  // namespace tamber

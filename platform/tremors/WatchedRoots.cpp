@@ -1,0 +1,197 @@
+#include "platform/tremors/WatchedRoots.h"
+
+#include <algorithm>
+
+namespace tamber {
+
+namespace {
+
+int64_t i64(uint64_t v) {
+    return static_cast<int64_t>(v);
+}
+uint64_t u64(int64_t v) {
+    return static_cast<uint64_t>(v);
+}
+
+constexpr const char* kSchema = R"sql(
+CREATE TABLE roots(
+    id INTEGER PRIMARY KEY,
+    path TEXT NOT NULL UNIQUE,
+    since_event_id INTEGER NOT NULL,
+    inode INTEGER NOT NULL,
+    active INTEGER NOT NULL);
+)sql";
+
+}  // namespace
+
+const char* WatchedRoots::schema() {
+    return kSchema;
+}
+
+bool WatchedRoots::isAtOrBelow(std::string_view path, std::string_view base) {
+    if (base == "/")
+        return !path.empty() && path.front() == '/';
+    if (path.size() < base.size() || path.compare(0, base.size(), base) != 0)
+        return false;
+    return path.size() == base.size() || path[base.size()] == '/';
+}
+
+std::string WatchedRoots::normalised(std::string path) {
+    while (path.size() > 1 && path.back() == '/') path.pop_back();
+    return path;
+}
+
+Status WatchedRoots::load() {
+    rows_.clear();
+    auto stmt = db_.prepare("SELECT id, path, since_event_id, inode, active FROM roots");
+    if (!stmt)
+        return stmt.error();
+    Result<bool> r = stmt->step();
+    for (; r.ok() && r.value(); r = stmt->step()) {
+        Row row;
+        row.root = {u64(stmt->columnInt64(0)), stmt->columnText(1), u64(stmt->columnInt64(2)),
+                    u64(stmt->columnInt64(3))};
+        row.watched = stmt->columnInt64(4) != 0;
+        rows_.push_back(std::move(row));
+    }
+    if (!r)
+        return r.error();
+    return std::nullopt;
+}
+
+WatchedRoots::Row* WatchedRoots::find(const std::string& path) {
+    auto it = std::find_if(rows_.begin(), rows_.end(),
+                           [&](const Row& row) { return row.root.path == path; });
+    return it == rows_.end() ? nullptr : &*it;
+}
+
+Status WatchedRoots::write(const Row& row) {
+    auto stmt = db_.cached(
+        "INSERT INTO roots(id, path, since_event_id, inode, active) VALUES(?, ?, ?, ?, ?) "
+        "ON CONFLICT(id) DO UPDATE SET since_event_id = excluded.since_event_id, "
+        "inode = excluded.inode, active = excluded.active");
+    if (!stmt)
+        return stmt.error();
+    return stmt->bind(1, i64(row.root.id))
+        .bind(2, row.root.path)
+        .bind(3, i64(row.root.sinceEventId))
+        .bind(4, i64(row.root.inode))
+        .bind(5, int64_t{row.watched})
+        .run();
+}
+
+Status WatchedRoots::add(const std::string& rawPath, uint64_t sinceEventId, uint64_t inode) {
+    std::string path = normalised(rawPath);
+    if (path.empty() || path.front() != '/')
+        return Error::invalidParameter("path", rawPath);
+    Row* existing = find(path);
+    Row updated;
+    if (!existing) {
+        // Root IDs are stored with events, so they are never reused either.
+        uint64_t id = 1;
+        for (const Row& row : rows_) id = std::max(id, row.root.id + 1);
+        updated.root = {id, path, sinceEventId, inode};
+    } else if (existing->watched) {
+        if (inode == 0 || inode == existing->root.inode)
+            return std::nullopt;
+        updated = *existing;
+        updated.root.inode = inode;
+    } else {
+        // Watched again after a gap: its history starts anew.
+        updated = *existing;
+        updated.root.sinceEventId = sinceEventId;
+        updated.root.inode = inode;
+        updated.watched = true;
+    }
+    if (Status status = write(updated))
+        return status;
+    if (existing) {
+        *existing = std::move(updated);
+    } else {
+        rows_.push_back(std::move(updated));
+    }
+    return std::nullopt;
+}
+
+Status WatchedRoots::setInode(const std::string& path, uint64_t inode) {
+    Row* row = find(normalised(path));
+    if (!row || !row->watched)
+        return Error::invalidParameter("root", path);
+    Row updated = *row;
+    updated.root.inode = inode;
+    if (Status status = write(updated))
+        return status;
+    *row = std::move(updated);
+    return std::nullopt;
+}
+
+Status WatchedRoots::remove(const std::string& path) {
+    Row* row = find(normalised(path));
+    if (!row || !row->watched)
+        return std::nullopt;
+    Row updated = *row;
+    updated.watched = false;
+    updated.root.inode = 0;
+    if (Status status = write(updated))
+        return status;
+    *row = std::move(updated);
+    return std::nullopt;
+}
+
+std::vector<WatchedRoots::Root> WatchedRoots::watched() const {
+    std::vector<Root> result;
+    for (const Row& row : rows_) {
+        if (row.watched)
+            result.push_back(row.root);
+    }
+    return result;
+}
+
+uint64_t WatchedRoots::idFor(std::string_view path) const {
+    const Row* best = nullptr;
+    for (const Row& row : rows_) {
+        if (row.watched && isAtOrBelow(path, row.root.path) &&
+            (!best || row.root.path.size() > best->root.path.size())) {
+            best = &row;
+        }
+    }
+    return best ? best->root.id : 0;
+}
+
+std::vector<uint64_t> WatchedRoots::mayHoldEventsBelow(
+    const std::vector<std::string>& paths) const {
+    // An event at or below P was filed under a root at or below P, under a root above P (before
+    // a deeper root existed, or after it was unwatched), or under no root at all.
+    std::vector<uint64_t> ids{0};
+    for (const Row& row : rows_) {
+        for (const std::string& path : paths) {
+            if (isAtOrBelow(row.root.path, path) || isAtOrBelow(path, row.root.path)) {
+                ids.push_back(row.root.id);
+                break;
+            }
+        }
+    }
+    if (ids.size() == rows_.size() + 1)
+        ids.clear();
+    return ids;
+}
+
+std::optional<uint64_t> WatchedRoots::watchedSince(const std::string& path) const {
+    std::optional<uint64_t> since;
+    for (const Row& row : rows_) {
+        if (row.watched && isAtOrBelow(path, row.root.path)) {
+            since = std::min(since.value_or(row.root.sinceEventId), row.root.sinceEventId);
+        }
+    }
+    return since;
+}
+
+const std::string* WatchedRoots::pathOfRootInode(uint64_t inode) const {
+    for (const Row& row : rows_) {
+        if (row.watched && row.root.inode == inode && inode != 0)
+            return &row.root.path;
+    }
+    return nullptr;
+}
+
+}  // namespace tamber
