@@ -63,7 +63,9 @@ Error Error::fileNoSuchFile(const std::string& path) {
 }
 
 Error Error::porterErrorForNonExistentItemWithIdentifier(const std::string& identifier) {
-    return Error(kHostPorterErrorDomain, kHostPorterNoSuchItem, {{"itemIdentifier", identifier}});
+    return Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,
+                 {{"itemIdentifier", identifier},
+                  {"description", "no item with identifier \"" + identifier + "\""}});
 }
 
 Error Error::invalidParameter(const std::string& parameter, const std::string& value) {
