@@ -1,0 +1,89 @@
+#include "platform/strata/TremorStrataService.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+
+#include "platform/FileSystem.h"
+#include "platform/Url.h"
+#include "platform/tremors/TremorService.h"
+
+namespace tamber {
+
+void TremorStrataService::installDocumentIdLookup() {
+    setDocumentIdLookup(&TremorStrataService::lookUpDocumentId);
+}
+
+std::optional<uint32_t> TremorStrataService::lookUpDocumentId(const std::string& path) {
+    // A look-up must not start the journal: it answers only for a running one.
+    auto service = TremorService::sharedIfRunning();
+    if (!service)
+        return std::nullopt;
+    struct statx st {};
+    if (FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, STATX_INO, &st) != 0)
+        return std::nullopt;
+    TremorStore* store = service->storeForDevice(encodeDevice(st.stx_dev_major, st.stx_dev_minor));
+    if (!store)
+        return std::nullopt;
+    return store->documentIdForInode(st.stx_ino);
+}
+
+uint32_t TremorStrataService::getOrAllocateDocumentId(int fd) {
+    // A file saved just before must be in the index before it can be given an ID.
+    service_->sync();
+    struct statx st {};
+    if (FileSystem::current().statx(fd, "", AT_EMPTY_PATH, STATX_INO | STATX_TYPE, &st) != 0)
+        return 0;
+    TremorStore* store = service_->storeForDevice(encodeDevice(st.stx_dev_major, st.stx_dev_minor));
+    if (!store) {
+        errno = EXDEV;
+        return 0;
+    }
+    if (!store->pathForInode(st.stx_ino)) {
+        errno = ENOENT;  // not inside a watched tree
+        return 0;
+    }
+    auto docID = store->allocateDocumentId(st.stx_ino);
+    if (!docID.ok()) {
+        errno = EIO;
+        return 0;
+    }
+    return docID.value();
+}
+
+uint32_t TremorStrataService::documentIdForInode(uint32_t device, uint64_t inode) {
+    TremorStore* store = service_->storeForDevice(device);
+    if (!store) {
+        errno = ENOENT;
+        return 0;
+    }
+    return store->documentIdForInode(inode).value_or(0);
+}
+
+uint64_t TremorStrataService::resolveDocumentId(uint32_t device, uint32_t documentId) {
+    if (!service_->indexReady()) {
+        errno = EAGAIN;
+        return 0;
+    }
+    TremorStore* store = service_->storeForDevice(device);
+    auto inode = store ? store->inodeForDocumentId(documentId) : std::nullopt;
+    if (!inode) {
+        errno = ENOENT;
+        return 0;
+    }
+    return *inode;
+}
+
+bool TremorStrataService::pathForFileId(uint32_t device, uint64_t fileId, std::string& path) {
+    TremorStore* store = service_->storeForDevice(device);
+    auto found = store ? store->pathForInode(fileId) : std::nullopt;
+    if (!found) {
+        errno = ENOENT;
+        return false;
+    }
+    path = std::move(*found);
+    return true;
+}
+
+}  // namespace tamber

@@ -1,0 +1,66 @@
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/tremors/FileChange.h"
+#include "platform/tremors/InodeRecord.h"
+#include "platform/tremors/JournalEvent.h"
+#include "platform/tremors/TremorStore.h"
+#include "support/Result.h"
+
+namespace tamber {
+
+// Turns the changes seen in one volume's watched trees into journal events, and keeps that
+// volume's inode index and document IDs in step with them. Used from one thread at a time.
+//
+// Document IDs follow the document: when a file with an ID vanishes from a path and another
+// inode appears at that path in the same batch (a safe save), the ID moves to the new inode and
+// "/.docid/<dev>/changed/<id>/src=<old>,dst=<new>" is journaled; when it just vanishes, the same
+// path with dst=0 is journaled and the ID is cleared.
+class JournalWriter {
+public:
+    JournalWriter(TremorStore& store, uint32_t device) : store_(store), device_(device) {}
+
+    // Journals one batch in one append; returns the appended events with their IDs.
+    Result<std::vector<JournalEvent>> apply(const std::vector<FileChange>& changes);
+    // Journals one event with `flags` (dropped, must scan) on each of `paths`.
+    Result<std::vector<JournalEvent>> journalDropped(const std::vector<std::string>& paths,
+                                                     uint32_t flags);
+    // Compares the tree at `root` with the index and brings the index up to date. With
+    // `journal`, what differs is journaled as it would have been by live watching (a tree that
+    // is indexed for the first time is not).
+    Result<std::vector<JournalEvent>> reconcile(const std::string& root, bool journal);
+
+    static std::string documentIdPath(uint32_t device, uint32_t docID, uint64_t src, uint64_t dst);
+
+private:
+    struct Found {
+        InodeRecord record;
+        std::string path;
+    };
+
+    void created(const FileChange& change);
+    void removed(const FileChange& change);
+    void renamed(const FileChange& change);
+    void touched(const FileChange& change, uint32_t flag);
+    // The indexed entry at `path`, by walking the index down from the root above it.
+    std::optional<InodeRecord> recordAt(const std::string& path);
+    // Removes `top` and everything indexed below it; their document IDs wait in vanished_.
+    void forgetSubtree(const InodeRecord& top, const std::string& path);
+    // A safe save: the document that vanished from `path` in this batch is now `inode`.
+    void claimDocumentId(const std::string& path, uint64_t inode);
+    // Clears the document IDs of files that vanished for good and journals their deletion.
+    void settleVanished();
+    Result<std::vector<JournalEvent>> commit();
+
+    TremorStore& store_;
+    const uint32_t device_;
+    std::vector<JournalEvent> pending_;
+    std::map<std::string, InodeRecord> vanished_;  // by path, only those with a document ID
+};
+
+}  // namespace tamber

@@ -1,0 +1,463 @@
+#include "platform/tremors/TremorService.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/statvfs.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <utility>
+
+#include "platform/FileSystem.h"
+#include "platform/Url.h"
+#include "platform/strata/StrataService.h"
+#include "platform/strata/TremorStrataService.h"
+#include "platform/tremors/TremorFlags.h"
+#include "platform/tremors/WatchedRoots.h"
+#include "support/Log.h"
+
+namespace tamber {
+
+namespace {
+
+struct Shared {
+    std::mutex mutex;
+    std::string stateDir;
+    std::shared_ptr<InotifyApi> api;
+    std::shared_ptr<TremorService> service;
+    std::shared_ptr<StrataService> strata;
+};
+
+Shared& global() {
+    static Shared shared;
+    return shared;
+}
+
+bool isVolumeDirectoryName(const std::string& name) {
+    if (name.size() != 16)
+        return false;
+    for (char c : name) {
+        if (!((c >= '0' && c <= '9') || (c >= 'a' && c <= 'f')))
+            return false;
+    }
+    return true;
+}
+
+}  // namespace
+
+void TremorService::configure(std::string stateDir, std::shared_ptr<InotifyApi> api) {
+    std::lock_guard lock(global().mutex);
+    global().stateDir = std::move(stateDir);
+    global().api = std::move(api);
+}
+
+std::string TremorService::defaultStateDir() {
+    if (const char* state = std::getenv("XDG_STATE_HOME"); state && *state == '/')
+        return std::string(state) + "/tamber";
+    const char* home = std::getenv("HOME");
+    return std::string(home ? home : "") + "/.local/state/tamber";
+}
+
+Result<std::shared_ptr<TremorService>> TremorService::shared() {
+    Shared& g = global();
+    std::lock_guard lock(g.mutex);
+    if (g.service)
+        return g.service;
+    auto service = create(g.stateDir.empty() ? defaultStateDir() : g.stateDir,
+                          g.api ? g.api : InotifyApi::system());
+    if (!service.ok()) {
+        logError("The event journal could not start: " + service.error().description());
+        return service.error();
+    }
+    g.service = service.value();
+    g.strata = std::make_shared<TremorStrataService>(g.service);
+    StrataService::setCurrent(g.strata);
+    TremorStrataService::installDocumentIdLookup();
+    return g.service;
+}
+
+std::shared_ptr<TremorService> TremorService::sharedIfRunning() {
+    std::lock_guard lock(global().mutex);
+    return global().service;
+}
+
+void TremorService::resetForTesting() {
+    Shared& g = global();
+    std::shared_ptr<TremorService> service;
+    {
+        std::lock_guard lock(g.mutex);
+        service = std::move(g.service);
+        if (g.strata && StrataService::current() == g.strata) {
+            StrataService::setCurrent(nullptr);
+            setDocumentIdLookup(nullptr);
+        }
+        g.strata.reset();
+    }
+    if (service)
+        service->shutdown();
+}
+
+Result<std::shared_ptr<TremorService>> TremorService::create(const std::string& stateDir,
+                                                             std::shared_ptr<InotifyApi> api,
+                                                             size_t queueLimit) {
+    auto backend = InotifyBackend::start(std::move(api));
+    if (!backend.ok())
+        return backend.error();
+    auto service = std::make_shared<TremorService>(Private{}, stateDir, std::move(backend).value(),
+                                                   queueLimit);
+    if (auto error = service->openExistingStores()) {
+        service->shutdown();
+        return *error;
+    }
+    return service;
+}
+
+TremorService::TremorService(Private, std::string stateDir, std::unique_ptr<InotifyBackend> backend,
+                             size_t queueLimit)
+    : stateDir_(std::move(stateDir)), backend_(std::move(backend)), queueLimit_(queueLimit) {
+    reader_ = std::thread([this] { readLoop(); });
+    journaler_ = std::thread([this] { journalLoop(); });
+    journalerId_ = journaler_.get_id();
+}
+
+TremorService::~TremorService() {
+    shutdown();
+}
+
+void TremorService::shutdown() {
+    if (stopped_.exchange(true))
+        return;
+    backend_->requestStop();
+    if (reader_.joinable())
+        reader_.join();
+    {
+        std::lock_guard lock(queueMutex_);
+        stopJournaling_ = true;
+    }
+    queueChanged_.notify_all();
+    if (journaler_.joinable())
+        journaler_.join();
+    barrierPassed_.notify_all();
+}
+
+Status TremorService::openExistingStores() {
+    FileSystem& fs = FileSystem::current();
+    int fd = fs.open(stateDir_, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    std::vector<FileSystem::DirectoryEntry> entries;
+    if (fd >= 0) {
+        fs.readDirectory(fd, entries);
+        fs.close(fd);
+    }
+    std::vector<std::string> remembered;
+    for (const auto& entry : entries) {
+        if (!isVolumeDirectoryName(entry.name))
+            continue;
+        auto store = TremorStore::open(stateDir_, std::stoull(entry.name, nullptr, 16));
+        if (!store.ok())
+            return store.error();
+        for (const auto& root : store.value()->roots()) {
+            if (root.path != TremorStore::kDocumentIdRoot)
+                remembered.push_back(root.path);
+        }
+        // Reopened below through the root's own volume, which also learns its device.
+    }
+    for (const auto& path : remembered) {
+        if (auto error = watch(path, true))
+            logError("A remembered tree is not watched: " + path + ": " + error->description());
+    }
+    indexReady_ = true;
+    return std::nullopt;
+}
+
+Result<TremorService::Volume*> TremorService::openVolume(uint64_t fsid, uint32_t device) {
+    for (auto& volume : volumes_) {
+        if (volume->fsid == fsid) {
+            volume->device = device;
+            return volume.get();
+        }
+    }
+    auto store = TremorStore::open(stateDir_, fsid);
+    if (!store.ok())
+        return store.error();
+    auto volume = std::make_unique<Volume>();
+    volume->fsid = fsid;
+    volume->device = device;
+    volume->store = std::move(store).value();
+    bool hasDocIdRoot = false;
+    for (const auto& root : volume->store->roots())
+        hasDocIdRoot |= root.path == TremorStore::kDocumentIdRoot;
+    if (!hasDocIdRoot) {
+        if (auto error =
+                volume->store->addRoot(TremorStore::kDocumentIdRoot, volume->store->lastEventId()))
+            return *error;
+    }
+    volume->writer = std::make_unique<JournalWriter>(*volume->store, device);
+    volumes_.push_back(std::move(volume));
+    return volumes_.back().get();
+}
+
+Result<TremorService::Volume*> TremorService::volumeFor(const std::string& path) {
+    struct statvfs vfs {};
+    if (::statvfs(path.c_str(), &vfs) != 0)
+        return Error::posix(errno);
+    struct statx st {};
+    if (FileSystem::current().statx(AT_FDCWD, path, 0, STATX_INO, &st) != 0)
+        return Error::posix(errno);
+    std::lock_guard lock(volumesMutex_);
+    return openVolume(static_cast<uint64_t>(vfs.f_fsid),
+                      encodeDevice(st.stx_dev_major, st.stx_dev_minor));
+}
+
+Status TremorService::watchTree(const std::string& path) {
+    if (stopped_)
+        return Error::posix(ESHUTDOWN);
+    return watch(WatchedRoots::normalised(path), false);
+}
+
+Status TremorService::watch(const std::string& path, bool journalDifferences) {
+    if (isWatched(path))
+        return std::nullopt;
+    auto volume = volumeFor(path);
+    if (!volume.ok())
+        return volume.error();
+    Volume& v = *volume.value();
+    std::lock_guard write(writeMutex_);
+    struct statx st {};
+    if (FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, STATX_INO | STATX_TYPE,
+                                    &st) != 0)
+        return Error::posix(errno);
+    if (!S_ISDIR(st.stx_mode))
+        return Error::posix(ENOTDIR);
+    bool remembered = false;
+    for (const auto& root : v.store->roots()) remembered |= root.path == path;
+    if (!remembered) {
+        if (auto error = v.store->addRoot(path, v.store->lastEventId(), st.stx_ino))
+            return error;
+    }
+    {
+        std::lock_guard lock(volumesMutex_);
+        roots_.emplace_back(path, &v);
+    }
+    std::vector<FileChange> discovered;
+    Status watched = backend_->watchTree(path, discovered);
+    if (!discovered.empty())
+        enqueue(std::move(discovered));
+    if (watched) {
+        std::lock_guard lock(volumesMutex_);
+        std::erase_if(roots_, [&](const auto& root) { return root.first == path; });
+        return watched;
+    }
+    // Watched first, then crawled: nothing that changes from now on is missed.
+    publish(v, v.writer->reconcile(path, journalDifferences && remembered));
+    return std::nullopt;
+}
+
+bool TremorService::isWatched(const std::string& path) const {
+    std::lock_guard lock(volumesMutex_);
+    for (const auto& root : roots_) {
+        if (WatchedRoots::isAtOrBelow(path, root.first))
+            return true;
+    }
+    return false;
+}
+
+TremorService::Volume* TremorService::ownerOf(const std::string& path) const {
+    std::lock_guard lock(volumesMutex_);
+    const std::pair<std::string, Volume*>* best = nullptr;
+    for (const auto& root : roots_) {
+        if (WatchedRoots::isAtOrBelow(path, root.first) &&
+            (!best || root.first.size() > best->first.size()))
+            best = &root;
+    }
+    return best ? best->second : nullptr;
+}
+
+std::vector<std::string> TremorService::rootPaths(const Volume& volume) const {
+    std::lock_guard lock(volumesMutex_);
+    std::vector<std::string> paths;
+    for (const auto& root : roots_) {
+        if (root.second == &volume)
+            paths.push_back(root.first);
+    }
+    return paths;
+}
+
+TremorStore* TremorService::storeForDevice(uint32_t device) const {
+    std::lock_guard lock(volumesMutex_);
+    for (const auto& volume : volumes_) {
+        if (volume->device == device)
+            return volume->store.get();
+    }
+    return nullptr;
+}
+
+std::optional<uint32_t> TremorService::deviceForPath(const std::string& path) const {
+    Volume* volume = ownerOf(path);
+    if (!volume)
+        return std::nullopt;
+    std::lock_guard lock(volumesMutex_);
+    return volume->device;
+}
+
+void TremorService::enqueue(std::vector<FileChange> changes) {
+    {
+        std::lock_guard lock(queueMutex_);
+        if (queuedChanges_ + changes.size() > queueLimit_) {
+            // Memory must stay bounded: the loss is journaled and the trees rescanned instead.
+            if (queue_.empty() || queue_.back().kind != Item::Kind::Dropped)
+                queue_.push_back({Item::Kind::Dropped, {}, 0});
+        } else {
+            queuedChanges_ += changes.size();
+            queue_.push_back({Item::Kind::Batch, std::move(changes), 0});
+        }
+    }
+    queueChanged_.notify_one();
+}
+
+void TremorService::readLoop() {
+    while (backend_->wait(-1)) {
+        std::lock_guard read(readMutex_);
+        std::vector<FileChange> changes;
+        backend_->consume(changes);
+        if (!changes.empty())
+            enqueue(std::move(changes));
+    }
+}
+
+void TremorService::sync() {
+    if (stopped_ || std::this_thread::get_id() == journalerId_)
+        return;
+    uint64_t barrier = 0;
+    {
+        std::lock_guard read(readMutex_);
+        std::vector<FileChange> changes;
+        backend_->drain(changes);
+        if (!changes.empty())
+            enqueue(std::move(changes));
+        std::lock_guard lock(queueMutex_);
+        barrier = ++nextBarrier_;
+        queue_.push_back({Item::Kind::Barrier, {}, barrier});
+    }
+    queueChanged_.notify_one();
+    std::unique_lock lock(queueMutex_);
+    barrierPassed_.wait(lock, [&] { return passedBarrier_ >= barrier || stopJournaling_; });
+}
+
+void TremorService::journalLoop() {
+    for (;;) {
+        Item item;
+        {
+            std::unique_lock lock(queueMutex_);
+            queueChanged_.wait(lock, [&] { return !queue_.empty() || stopJournaling_; });
+            if (queue_.empty())
+                break;
+            item = std::move(queue_.front());
+            queue_.pop_front();
+            queuedChanges_ -= item.changes.size();
+            if (item.kind == Item::Kind::Barrier) {
+                passedBarrier_ = item.barrier;
+                barrierPassed_.notify_all();
+                continue;
+            }
+        }
+        journal(item);
+    }
+    std::lock_guard lock(queueMutex_);
+    passedBarrier_ = nextBarrier_;
+    barrierPassed_.notify_all();
+}
+
+void TremorService::journal(Item& item) {
+    std::lock_guard write(writeMutex_);
+    std::vector<Volume*> volumes;
+    {
+        std::lock_guard lock(volumesMutex_);
+        for (auto& volume : volumes_) volumes.push_back(volume.get());
+    }
+    if (item.kind == Item::Kind::Dropped) {
+        for (Volume* volume : volumes) {
+            publish(*volume, volume->writer->journalDropped(
+                                 rootPaths(*volume), kTremorUserDropped | kTremorMustScanSubdirs));
+            reconcileAll(*volume);
+        }
+        return;
+    }
+    std::map<Volume*, std::vector<FileChange>> byVolume;
+    bool overflow = false;
+    for (auto& change : item.changes) {
+        if (change.kind == FileChange::Kind::Overflow) {
+            overflow = true;
+            continue;
+        }
+        Volume* volume = ownerOf(change.kind == FileChange::Kind::Renamed && change.path.empty()
+                                     ? change.fromPath
+                                     : change.path);
+        if (!volume)
+            continue;
+        if (change.kind == FileChange::Kind::WatchFailed) {
+            publish(*volume, volume->writer->apply(byVolume[volume]));
+            byVolume[volume].clear();
+            logError("A tree is not watched: " + change.path);
+            publish(*volume, volume->writer->journalDropped(
+                                 {change.path}, kTremorUserDropped | kTremorMustScanSubdirs));
+            continue;
+        }
+        byVolume[volume].push_back(std::move(change));
+    }
+    for (auto& [volume, changes] : byVolume) publish(*volume, volume->writer->apply(changes));
+    if (overflow) {
+        logError("inotify dropped events; rescanning the watched trees");
+        for (Volume* volume : volumes) {
+            publish(*volume,
+                    volume->writer->journalDropped(rootPaths(*volume),
+                                                   kTremorKernelDropped | kTremorMustScanSubdirs));
+            reconcileAll(*volume);
+        }
+    }
+}
+
+void TremorService::reconcileAll(Volume& volume) {
+    indexReady_ = false;
+    for (const auto& path : rootPaths(volume))
+        publish(volume, volume.writer->reconcile(path, true));
+    indexReady_ = true;
+}
+
+void TremorService::publish(const Volume& volume, Result<std::vector<JournalEvent>> events) {
+    if (!events.ok()) {
+        logError("Could not journal events: " + events.error().description());
+        return;
+    }
+    if (events.value().empty())
+        return;
+    std::lock_guard lock(listenersMutex_);
+    for (auto& [token, listener] : listeners_) listener(volume.device, events.value());
+}
+
+uint64_t TremorService::currentEventId() {
+    sync();
+    std::lock_guard lock(volumesMutex_);
+    uint64_t last = 0;
+    for (const auto& volume : volumes_) last = std::max(last, volume->store->lastEventId());
+    return last;
+}
+
+std::string TremorService::uuidForDevice(uint32_t device) {
+    sync();
+    TremorStore* store = storeForDevice(device);
+    return store ? store->uuid() : std::string();
+}
+
+uint64_t TremorService::addListener(Listener listener) {
+    std::lock_guard lock(listenersMutex_);
+    uint64_t token = nextListener_++;
+    listeners_[token] = std::move(listener);
+    return token;
+}
+
+void TremorService::removeListener(uint64_t token) {
+    std::lock_guard lock(listenersMutex_);
+    listeners_.erase(token);
+}
+
+}  // namespace tamber

@@ -1,0 +1,152 @@
+#pragma once
+
+#include <atomic>
+#include <condition_variable>
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/tremors/FileChange.h"
+#include "platform/tremors/InotifyApi.h"
+#include "platform/tremors/InotifyBackend.h"
+#include "platform/tremors/JournalEvent.h"
+#include "platform/tremors/JournalWriter.h"
+#include "platform/tremors/TremorStore.h"
+#include "support/Result.h"
+
+namespace tamber {
+
+// The file-system event journal of this process: it watches the trees streams ask for (and
+// those remembered from earlier runs), journals their changes in one store per volume, and
+// keeps the inode index and document IDs of those trees.
+//
+// Two threads: one reads inotify into memory and never touches the database (the kernel queue
+// is a fraction of a second of a burst), the other journals what it read, in one append per
+// batch, and then tells the listeners.
+class TremorService {
+public:
+    // Changes read but not journaled yet; above this the reader drops and journals a loss.
+    static constexpr size_t kDefaultQueueLimit = 1 << 20;
+
+    using Listener = std::function<void(uint32_t device, const std::vector<JournalEvent>&)>;
+
+    // Where shared() keeps its state (and, for tests, which inotify calls it makes); tests call
+    // this before the first shared().
+    static void configure(std::string stateDir,
+                          std::shared_ptr<InotifyApi> api = InotifyApi::system());
+    static std::string defaultStateDir();
+    // The process's service, started on first use. Fails (and logs) when the state cannot be
+    // opened, for example because another process holds it.
+    static Result<std::shared_ptr<TremorService>> shared();
+    // The process's service when it is running; never starts one.
+    static std::shared_ptr<TremorService> sharedIfRunning();
+    // Shuts the process's service down; the next shared() starts a fresh one.
+    static void resetForTesting();
+
+    // A service on `stateDir`: opens every store found there, watches the roots they remember
+    // and journals what changed while nothing was watching.
+    static Result<std::shared_ptr<TremorService>> create(
+        const std::string& stateDir, std::shared_ptr<InotifyApi> api = InotifyApi::system(),
+        size_t queueLimit = kDefaultQueueLimit);
+    ~TremorService();
+    TremorService(const TremorService&) = delete;
+    TremorService& operator=(const TremorService&) = delete;
+
+    // Stops both threads after journaling what was read; later calls change nothing.
+    void shutdown();
+
+    // Watches the directory tree at `path`, remembers it, and indexes it.
+    Status watchTree(const std::string& path);
+    bool isWatched(const std::string& path) const;
+
+    // Returns once every event the kernel queued before the call has been journaled.
+    void sync();
+    // The last event ID handed out (after sync), over every volume.
+    uint64_t currentEventId();
+    // The UUID of the store of `device` (after sync); empty when no tree of it is watched.
+    std::string uuidForDevice(uint32_t device);
+    // False while the index is being rebuilt.
+    bool indexReady() const { return indexReady_.load(); }
+
+    // The store of a device, valid while the service lives; null when none.
+    TremorStore* storeForDevice(uint32_t device) const;
+    // The device number of the volume that holds `path`, when one of its trees is watched.
+    std::optional<uint32_t> deviceForPath(const std::string& path) const;
+
+    // Calls `listener` on the journaling thread after each append, in ID order. It must not
+    // block nor call sync().
+    uint64_t addListener(Listener listener);
+    void removeListener(uint64_t token);
+
+private:
+    struct Volume {
+        uint64_t fsid = 0;
+        uint32_t device = 0;
+        std::unique_ptr<TremorStore> store;
+        std::unique_ptr<JournalWriter> writer;
+    };
+    struct Item {
+        enum class Kind { Batch, Barrier, Dropped } kind = Kind::Batch;
+        std::vector<FileChange> changes;
+        uint64_t barrier = 0;
+    };
+    struct Private {};
+
+public:
+    TremorService(Private, std::string stateDir, std::unique_ptr<InotifyBackend> backend,
+                  size_t queueLimit);
+
+private:
+    Status openExistingStores();
+    Result<Volume*> volumeFor(const std::string& path);
+    Result<Volume*> openVolume(uint64_t fsid, uint32_t device);
+    Status watch(const std::string& path, bool journalDifferences);
+    Volume* ownerOf(const std::string& path) const;
+    std::vector<std::string> rootPaths(const Volume& volume) const;
+    void enqueue(std::vector<FileChange> changes);
+    void readLoop();
+    void journalLoop();
+    void journal(Item& item);
+    void publish(const Volume& volume, Result<std::vector<JournalEvent>> events);
+    void reconcileAll(Volume& volume);
+
+    const std::string stateDir_;
+    const std::unique_ptr<InotifyBackend> backend_;
+    const size_t queueLimit_;
+    std::atomic<bool> indexReady_{false};
+    std::atomic<bool> stopped_{false};
+
+    mutable std::mutex volumesMutex_;
+    std::vector<std::unique_ptr<Volume>> volumes_;
+    std::vector<std::pair<std::string, Volume*>> roots_;  // watched roots and their volume
+
+    // Held while changes go from the backend to the queue, so a barrier lands after them.
+    std::mutex readMutex_;
+    std::mutex queueMutex_;
+    std::condition_variable queueChanged_;
+    std::deque<Item> queue_;
+    size_t queuedChanges_ = 0;
+    bool stopJournaling_ = false;
+    uint64_t nextBarrier_ = 0;
+    uint64_t passedBarrier_ = 0;
+    std::condition_variable barrierPassed_;
+
+    // Serialises every use of the writers and the stores' index.
+    std::recursive_mutex writeMutex_;
+    std::mutex listenersMutex_;
+    std::map<uint64_t, Listener> listeners_;
+    uint64_t nextListener_ = 1;
+
+    std::thread reader_;
+    std::thread journaler_;
+    std::thread::id journalerId_;
+};
+
+}  // namespace tamber

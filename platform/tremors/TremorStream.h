@@ -1,0 +1,92 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/objects/Object.h"
+#include "platform/tremors/JournalEvent.h"
+#include "support/DispatchQueue.h"
+
+namespace tamber {
+
+class TremorService;
+class TremorStream;
+using TremorStreamRef = TremorStream*;
+
+struct TremorStreamContext {
+    void* info = nullptr;
+    void* (*retain)(void*) = nullptr;
+    void (*release)(void*) = nullptr;
+};
+
+using TremorStreamCallback = void (*)(TremorStreamRef stream, void* info, size_t numEvents,
+                                      const ObjectRef& paths, const uint32_t* flags,
+                                      const uint64_t* ids);
+
+// One client's view of the journal: the events after its since-when ID under its paths, then
+// one history-done event, then live events, delivered on its queue in batches at most once per
+// latency. It listens before it replays, so that nothing falls between the two and nothing
+// arrives twice.
+class TremorStream : public std::enable_shared_from_this<TremorStream> {
+public:
+    static constexpr uint64_t kSinceNow = UINT64_MAX;
+    static constexpr size_t kReplayBatch = 1000;
+
+    struct Options {
+        TremorStreamCallback callback = nullptr;
+        TremorStreamContext context;
+        std::vector<std::string> paths;  // absolute, or relative to `device`
+        std::optional<uint32_t> device;  // set for streams relative to a device
+        uint64_t since = kSinceNow;
+        double latency = 0;
+        uint32_t flags = 0;
+    };
+
+    static std::shared_ptr<TremorStream> create(std::shared_ptr<TremorService> service,
+                                                Options options);
+    TremorStream(std::shared_ptr<TremorService> service, Options options);
+    ~TremorStream();
+    TremorStream(const TremorStream&) = delete;
+    TremorStream& operator=(const TremorStream&) = delete;
+
+    void setDispatchQueue(std::shared_ptr<DispatchQueue> queue);
+    bool start();
+    void stop();
+    void invalidate();
+
+    // The handle given to callers holds the stream until they release it.
+    void retainHandle(std::shared_ptr<TremorStream> self) { handle_ = std::move(self); }
+    void releaseHandle();
+
+private:
+    bool matches(const JournalEvent& event) const;
+    void onAppended(uint32_t device, const std::vector<JournalEvent>& events);
+    void replay(uint64_t ceiling);
+    void scheduleFlush();
+    void flush();
+    void deliver(const std::vector<JournalEvent>& events);
+
+    const std::shared_ptr<TremorService> service_;
+    Options options_;
+    std::shared_ptr<TremorStream> handle_;
+
+    std::mutex mutex_;
+    std::shared_ptr<DispatchQueue> queue_;
+    uint32_t device_ = 0;
+    bool started_ = false;
+    bool stopped_ = false;
+    bool invalidated_ = false;
+    bool replaying_ = false;
+    bool flushScheduled_ = false;
+    uint64_t ceiling_ = 0;  // replayed up to here; live events start after it
+    uint64_t listener_ = 0;
+    std::vector<JournalEvent> live_;
+    DispatchQueue::Clock::time_point lastDelivery_{};
+};
+
+}  // namespace tamber

@@ -1,0 +1,35 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/tremors/TremorFlags.h"
+#include "platform/tremors/TremorStream.h"
+#include "support/DispatchQueue.h"
+
+namespace tamber {
+
+// The platform's event-stream calls, over the process's TremorService. Creation fails (null)
+// when the service cannot start.
+TremorStreamRef TremorStreamCreate(TremorStreamCallback callback,
+                                   const TremorStreamContext* context,
+                                   const std::vector<std::string>& pathsToWatch, uint64_t sinceWhen,
+                                   double latencySeconds, uint32_t flags);
+TremorStreamRef TremorStreamCreateRelativeToDevice(
+    TremorStreamCallback callback, const TremorStreamContext* context, uint32_t device,
+    const std::vector<std::string>& pathsRelativeToDevice, uint64_t sinceWhen,
+    double latencySeconds, uint32_t flags);
+void TremorStreamSetDispatchQueue(TremorStreamRef stream, std::shared_ptr<DispatchQueue> queue);
+bool TremorStreamStart(TremorStreamRef stream);
+void TremorStreamStop(TremorStreamRef stream);
+void TremorStreamInvalidate(TremorStreamRef stream);
+void TremorStreamRelease(TremorStreamRef stream);
+
+// The last event ID handed out, after the events already queued by the kernel are journaled.
+uint64_t TremorsGetCurrentEventId();
+// The UUID of the journal of `device`; empty when none of its trees is watched.
+std::string TremorsCopyUUIDForDevice(uint32_t device);
+
+}  // namespace tamber
