@@ -7,6 +7,7 @@
 
 #include "host/HostPorterManager.h"
 #include "platform/FileSystem.h"
+#include "platform/tremors/TremorService.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -55,6 +56,13 @@ Status CliContext::prepareStorage() {
     }
     HostPorterManager::installDefaultManager(std::make_shared<StorageHostPorterManager>(storage_));
     return std::nullopt;
+}
+
+Status CliContext::prepareJournal() {
+    auto service = TremorService::shared();
+    if (!service.ok())
+        return service.error();
+    return service.value()->watchTree(storage_.path());
 }
 
 Error CliContext::usageError(const std::string& message) {

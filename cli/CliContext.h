@@ -22,6 +22,9 @@ public:
     // Fails when the folder cannot be created.
     Status prepareStorage();
     const Url& storageURL() const { return storage_; }
+    // Starts the event journal and its document-ID service and watches the storage folder, so
+    // that identifiers can be given and resolved.
+    Status prepareJournal();
 
     std::ostream& out() { return out_; }
     std::ostream& err() { return err_; }

@@ -8,7 +8,10 @@
 #include <CLI/CLI.hpp>
 
 #include "cli/CliContext.h"
+#include "cli/EventsCommand.h"
+#include "cli/IdCommand.h"
 #include "cli/MetaCommand.h"
+#include "cli/PathCommand.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -30,6 +33,9 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
 
     std::vector<std::unique_ptr<Command>> commands;
     commands.push_back(std::make_unique<MetaCommand>());
+    commands.push_back(std::make_unique<IdCommand>());
+    commands.push_back(std::make_unique<PathCommand>());
+    commands.push_back(std::make_unique<EventsCommand>());
     std::vector<std::pair<CLI::App*, Command*>> verbs;
     for (auto& c : commands) verbs.emplace_back(c->add(app), c.get());
 

@@ -1,0 +1,112 @@
+#include "cli/EventsCommand.h"
+
+#include <atomic>
+#include <csignal>
+#include <cstdio>
+#include <ostream>
+
+#include "items/TBFileObjectIdentifier.h"
+#include "platform/objects/Array.h"
+#include "platform/objects/Dictionary.h"
+#include "platform/objects/Number.h"
+#include "platform/objects/String.h"
+#include "platform/tremors/Tremors.h"
+#include "support/DispatchSemaphore.h"
+
+namespace tamber {
+
+namespace {
+
+struct Printer {
+    std::ostream* out;
+    bool json;
+    bool noFollow;
+    DispatchSemaphore done;
+};
+
+void printEvents(TremorStreamRef, void* info, size_t count, const ObjectRef& paths,
+                 const uint32_t* flags, const uint64_t* ids) {
+    auto& printer = *static_cast<Printer*>(info);
+    auto array = objectCast<Array>(paths);
+    for (size_t i = 0; i < count; ++i) {
+        auto entry =
+            array && i < array->count() ? objectCast<Dictionary>(array->objects()[i]) : nullptr;
+        auto path = entry ? objectCast<String>(entry->objectForKey("path")) : nullptr;
+        auto fileID = entry ? objectCast<Number>(entry->objectForKey("fileID")) : nullptr;
+        if (printer.json) {
+            nlohmann::json j{{"id", ids[i]},
+                             {"flags", flags[i]},
+                             {"path", path ? path->value() : ""},
+                             {"fileID", fileID ? nlohmann::json(fileID->uint64Value()) : nullptr}};
+            *printer.out << j.dump() << "\n";
+        } else {
+            char hex[16];
+            std::snprintf(hex, sizeof hex, "0x%05x", flags[i]);
+            *printer.out << ids[i] << " " << hex << " " << (path ? path->value() : "?") << " "
+                         << (fileID ? std::to_string(fileID->uint64Value()) : "-") << "\n";
+        }
+        if (printer.noFollow && (flags[i] & kTremorHistoryDone))
+            printer.done.signal();
+    }
+    printer.out->flush();
+}
+
+// Set from the signal handler: only a lock-free store is safe there.
+std::atomic<bool> gInterrupted{false};
+
+void onSignal(int) {
+    gInterrupted.store(true);
+}
+
+}  // namespace
+
+CLI::App* EventsCommand::add(CLI::App& app) {
+    auto* sub =
+        app.add_subcommand("events", "Replay the event journal for some trees, then follow it");
+    sub->add_option("PATH", paths_, "Trees to show events for (default: the document storage)");
+    sub->add_option("--since", since_, "Replay events after this event ID (default 0: all)");
+    sub->add_flag("--docid", docid_, "Show document-ID events instead of path events");
+    sub->add_flag("--no-follow", noFollow_, "Stop after the history has been replayed");
+    sub->add_flag("--json", json_, "One JSON object per line: id, flags, path, fileID");
+    return sub;
+}
+
+int EventsCommand::run(CliContext& context) {
+    if (auto error = context.prepareJournal())
+        return context.fail(*error, json_);
+    std::vector<std::string> paths;
+    for (const auto& p : paths_) paths.push_back(Url::fileURLWithPath(p).path());
+    if (paths.empty())
+        paths.push_back(context.storageURL().path());
+
+    Printer printer{&context.out(), json_, noFollow_, DispatchSemaphore(0)};
+    TremorStreamContext streamContext;
+    streamContext.info = &printer;
+    uint32_t flags =
+        kTremorCreateUseObjects | kTremorCreateFileEvents | kTremorCreateUseExtendedData;
+    TremorStreamRef stream =
+        docid_ ? TremorStreamCreateRelativeToDevice(
+                     printEvents, &streamContext,
+                     TBFileObjectIdentifier::deviceID(context.storageURL()), {"/.docid"}, since_,
+                     0.1, flags)
+               : TremorStreamCreate(printEvents, &streamContext, paths, since_, 0.1, flags);
+    if (!stream) {
+        return context.fail(
+            Error(kPosixErrorDomain, EIO, {{"description", "can't open the event journal stream"}}),
+            json_);
+    }
+    TremorStreamSetDispatchQueue(stream, DispatchQueue::makeSerial("tamber.cli-events"));
+    gInterrupted.store(false);
+    std::signal(SIGINT, onSignal);
+    std::signal(SIGTERM, onSignal);
+    TremorStreamStart(stream);
+    // Without --no-follow nothing signals `done`: only an interrupt ends the wait.
+    while (!gInterrupted.load() && !printer.done.wait(0.2)) {
+    }
+    TremorStreamStop(stream);
+    TremorStreamInvalidate(stream);
+    TremorStreamRelease(stream);
+    return 0;
+}
+
+}  // namespace tamber

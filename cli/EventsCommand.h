@@ -1,0 +1,28 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "cli/Command.h"
+
+namespace tamber {
+
+// `tamber events [--since ID] [--docid] [--no-follow] [--json] PATH...`: replays the journal
+// for the given trees, then follows it live until interrupted (or stops after the
+// history-done event with --no-follow).
+class EventsCommand : public Command {
+public:
+    CLI::App* add(CLI::App& app) override;
+    int run(CliContext& context) override;
+
+private:
+    std::vector<std::string> paths_;
+    uint64_t since_ = 0;
+    bool docid_ = false;
+    bool noFollow_ = false;
+    bool json_ = false;
+};
+
+}  // namespace tamber

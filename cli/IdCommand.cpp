@@ -1,0 +1,36 @@
+#include "cli/IdCommand.h"
+
+#include <ostream>
+
+#include "items/TBFileObjectIdentifier.h"
+
+namespace tamber {
+
+CLI::App* IdCommand::add(CLI::App& app) {
+    auto* sub = app.add_subcommand("id", "Print the persistent identifier of a file or folder");
+    sub->add_option("PATH", path_, "A file or folder inside the published folders")->required();
+    sub->add_flag("--json", json_, "Print {\"id\": ..., \"path\": ...}");
+    return sub;
+}
+
+int IdCommand::run(CliContext& context) {
+    if (auto error = context.prepareJournal())
+        return context.fail(*error, json_);
+    Url url = Url::fileURLWithPath(path_);
+    auto identifier = TBFileObjectIdentifier::itemIdentifier(url);
+    if (!identifier) {
+        return context.fail(Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,
+                                  {{"description", "no identifier for " + url.path() +
+                                                       " (missing, or outside the published "
+                                                       "folders)"}}),
+                            json_);
+    }
+    if (json_) {
+        context.out() << nlohmann::json{{"id", *identifier}, {"path", url.path()}}.dump() << "\n";
+    } else {
+        context.out() << *identifier << "\n";
+    }
+    return 0;
+}
+
+}  // namespace tamber

@@ -1,0 +1,32 @@
+#include "cli/PathCommand.h"
+
+#include <ostream>
+
+#include "items/TBFileObjectIdentifier.h"
+
+namespace tamber {
+
+CLI::App* PathCommand::add(CLI::App& app) {
+    auto* sub = app.add_subcommand("path", "Print the path of the item an identifier names");
+    sub->add_option("ID", identifier_, "An identifier: fid=N, did=N or the root container")
+        ->required();
+    sub->add_flag("--json", json_, "Print {\"id\": ..., \"path\": ...}");
+    return sub;
+}
+
+int PathCommand::run(CliContext& context) {
+    if (auto error = context.prepareJournal())
+        return context.fail(*error, json_);
+    auto url = TBFileObjectIdentifier::fileURLWithItemIdentifier(identifier_);
+    if (!url) {
+        return context.fail(Error::porterErrorForNonExistentItemWithIdentifier(identifier_), json_);
+    }
+    if (json_) {
+        context.out() << nlohmann::json{{"id", identifier_}, {"path", url->path()}}.dump() << "\n";
+    } else {
+        context.out() << url->path() << "\n";
+    }
+    return 0;
+}
+
+}  // namespace tamber
