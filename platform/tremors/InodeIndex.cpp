@@ -8,14 +8,6 @@ namespace tamber {
 
 namespace {
 
-// SQLite integers are signed; inodes round-trip through the same 64 bits.
-int64_t i64(uint64_t v) {
-    return static_cast<int64_t>(v);
-}
-uint64_t u64(int64_t v) {
-    return static_cast<uint64_t>(v);
-}
-
 constexpr const char* kSchema = R"sql(
 CREATE TABLE inodes(
     inode INTEGER PRIMARY KEY,
@@ -38,8 +30,8 @@ constexpr const char* kFindByParent =
 
 InodeRecord readInode(const SqliteDatabase::Statement& stmt) {
     InodeRecord record;
-    record.inode = u64(stmt.columnInt64(0));
-    record.parent = u64(stmt.columnInt64(1));
+    record.inode = fromSqlite(stmt.columnInt64(0));
+    record.parent = fromSqlite(stmt.columnInt64(1));
     record.name = stmt.columnText(2);
     record.kind = static_cast<uint8_t>(stmt.columnInt64(3));
     record.docID = static_cast<uint32_t>(stmt.columnInt64(4));  // NULL reads as 0
@@ -68,7 +60,7 @@ Status InodeIndex::load() {
         return SqliteDatabase::makeError(SQLITE_CORRUPT, "checking the event journal",
                                          "document IDs beyond the counter");
     }
-    nextDocumentId_ = u64(next.value());
+    nextDocumentId_ = fromSqlite(next.value());
     return std::nullopt;
 }
 
@@ -90,8 +82,8 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
     if (!upsert)
         return upsert.error();
     for (const InodeRecord& record : records) {
-        upsert->bind(1, i64(record.inode))
-            .bind(2, i64(record.parent))
+        upsert->bind(1, toSqlite(record.inode))
+            .bind(2, toSqlite(record.parent))
             .bind(3, record.name)
             .bind(4, int64_t{record.kind});
         if (Status status = upsert->run())
@@ -108,7 +100,7 @@ Status InodeIndex::remove(const std::vector<uint64_t>& inodes) {
     if (!erase)
         return erase.error();
     for (uint64_t inode : inodes) {
-        if (Status status = erase->bind(1, i64(inode)).run())
+        if (Status status = erase->bind(1, toSqlite(inode)).run())
             return status;
     }
     return txn->commit();
@@ -118,7 +110,7 @@ Result<std::optional<InodeRecord>> InodeIndex::find(uint64_t inode) {
     auto stmt = db_.cached(kFindByInode);
     if (!stmt)
         return stmt.error();
-    auto row = stmt->bind(1, i64(inode)).step();
+    auto row = stmt->bind(1, toSqlite(inode)).step();
     if (!row)
         return row.error();
     if (!row.value())
@@ -146,7 +138,7 @@ Result<std::optional<std::string>> InodeIndex::path(
         }
         if (names.size() == kMaxPathComponents || !seen.insert(current).second)
             break;
-        auto row = stmt->bind(1, i64(current)).step();
+        auto row = stmt->bind(1, toSqlite(current)).step();
         if (!row)
             return row.error();
         if (!row.value())
@@ -155,7 +147,7 @@ Result<std::optional<std::string>> InodeIndex::path(
         if (!isEntryName(name))
             break;  // never let the index name a path outside its root
         names.push_back(std::move(name));
-        current = u64(stmt->columnInt64(0));
+        current = fromSqlite(stmt->columnInt64(0));
         stmt->reset();
     }
     return std::optional<std::string>();
@@ -165,7 +157,7 @@ Result<std::vector<InodeRecord>> InodeIndex::children(uint64_t parent) {
     auto stmt = db_.cached(kFindByParent);
     if (!stmt)
         return stmt.error();
-    stmt->bind(1, i64(parent));
+    stmt->bind(1, toSqlite(parent));
     std::vector<InodeRecord> result;
     Result<bool> r = stmt->step();
     for (; r.ok() && r.value(); r = stmt->step()) result.push_back(readInode(stmt.value()));
@@ -180,7 +172,7 @@ Result<std::optional<uint32_t>> InodeIndex::documentIdForInode(uint64_t inode) {
     auto stmt = db_.cached("SELECT doc_id FROM documents WHERE inode = ?");
     if (!stmt)
         return stmt.error();
-    auto row = stmt->bind(1, i64(inode)).step();
+    auto row = stmt->bind(1, toSqlite(inode)).step();
     if (!row)
         return row.error();
     if (!row.value())
@@ -197,7 +189,7 @@ Result<std::optional<uint64_t>> InodeIndex::inodeForDocumentId(uint32_t docID) {
         return row.error();
     if (!row.value())
         return std::optional<uint64_t>();
-    return std::optional<uint64_t>(u64(stmt->columnInt64(0)));
+    return std::optional<uint64_t>(fromSqlite(stmt->columnInt64(0)));
 }
 
 Result<uint32_t> InodeIndex::allocateDocumentId(uint64_t inode) {
@@ -219,12 +211,12 @@ Result<uint32_t> InodeIndex::allocateDocumentId(uint64_t inode) {
     auto insert = db_.cached("INSERT INTO documents(doc_id, inode) VALUES(?, ?)");
     if (!insert)
         return insert.error();
-    if (Status status = insert->bind(1, i64(nextDocumentId_)).bind(2, i64(inode)).run())
+    if (Status status = insert->bind(1, toSqlite(nextDocumentId_)).bind(2, toSqlite(inode)).run())
         return *status;
     auto meta = db_.cached("UPDATE meta SET next_document_id = ? WHERE id = 1");
     if (!meta)
         return meta.error();
-    if (Status status = meta->bind(1, i64(nextDocumentId_ + 1)).run())
+    if (Status status = meta->bind(1, toSqlite(nextDocumentId_ + 1)).run())
         return *status;
     if (Status status = txn->commit())
         return *status;
@@ -248,7 +240,7 @@ Status InodeIndex::moveDocumentId(uint32_t docID, uint64_t newInode) {
     auto update = db_.cached("UPDATE documents SET inode = ? WHERE doc_id = ?");
     if (!update)
         return update.error();
-    if (Status status = update->bind(1, i64(newInode)).bind(2, int64_t{docID}).run())
+    if (Status status = update->bind(1, toSqlite(newInode)).bind(2, int64_t{docID}).run())
         return status;
     if (db_.changes() == 0) {
         return Error(kPosixErrorDomain, ENOENT,

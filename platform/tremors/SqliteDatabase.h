@@ -12,6 +12,15 @@
 
 namespace tamber {
 
+// SQLite integers are signed; unsigned 64-bit values (inodes, event IDs) round-trip through the
+// same bits.
+inline int64_t toSqlite(uint64_t v) {
+    return static_cast<int64_t>(v);
+}
+inline uint64_t fromSqlite(int64_t v) {
+    return static_cast<uint64_t>(v);
+}
+
 // Errors reported by SQLite: the code is the extended result code, the description names the
 // operation and carries SQLite's own message.
 inline constexpr const char* kSqliteErrorDomain = "SqliteErrorDomain";

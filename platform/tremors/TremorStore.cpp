@@ -12,14 +12,6 @@ namespace tamber {
 
 namespace {
 
-// SQLite integers are signed; inodes and IDs round-trip through the same 64 bits.
-int64_t i64(uint64_t v) {
-    return static_cast<int64_t>(v);
-}
-uint64_t u64(int64_t v) {
-    return static_cast<uint64_t>(v);
-}
-
 constexpr const char* kSchema = R"sql(
 CREATE TABLE meta(
     id INTEGER PRIMARY KEY CHECK (id = 1),
@@ -226,8 +218,8 @@ Status TremorStore::readState() {
     }
     if (Status status = index_->load())
         return status;
-    nextEventId_ = u64(next);
-    oldestEventId_ = u64(oldest);
+    nextEventId_ = fromSqlite(next);
+    oldestEventId_ = fromSqlite(oldest);
     return roots_->load();
 }
 
@@ -261,10 +253,10 @@ Result<uint64_t> TremorStore::append(std::vector<JournalEvent>& events) {
         return insert.error();
     uint64_t id = nextEventId_;
     for (const JournalEvent& event : events) {
-        insert->bind(1, i64(id++))
-            .bind(2, i64(roots_->idFor(event.path)))
+        insert->bind(1, toSqlite(id++))
+            .bind(2, toSqlite(roots_->idFor(event.path)))
             .bind(3, event.path)
-            .bind(4, i64(event.fileID))
+            .bind(4, toSqlite(event.fileID))
             .bind(5, static_cast<int64_t>(event.flags));
         if (Status status = insert->run())
             return *status;
@@ -272,7 +264,7 @@ Result<uint64_t> TremorStore::append(std::vector<JournalEvent>& events) {
     auto meta = db_->cached("UPDATE meta SET next_event_id = ? WHERE id = 1");
     if (!meta)
         return meta.error();
-    if (Status status = meta->bind(1, i64(id)).run())
+    if (Status status = meta->bind(1, toSqlite(id)).run())
         return *status;
     if (Status status = txn->commit())
         return *status;
@@ -307,14 +299,14 @@ Status TremorStore::fetch(Cursor& cursor, size_t chunk, uint64_t upTo) {
         return stmt.error();
     cursor.buffered.clear();
     cursor.next = 0;
-    stmt->bind(1, i64(cursor.after)).bind(2, i64(upTo)).bind(3, i64(chunk));
+    stmt->bind(1, toSqlite(cursor.after)).bind(2, toSqlite(upTo)).bind(3, toSqlite(chunk));
     if (cursor.root >= 0)
         stmt->bind(4, cursor.root);
     size_t rows = 0;
     Result<bool> r = stmt->step();
     for (; r.ok() && r.value(); r = stmt->step(), ++rows) {
-        cursor.buffered.push_back({u64(stmt->columnInt64(0)), stmt->columnText(1),
-                                   u64(stmt->columnInt64(2)),
+        cursor.buffered.push_back({fromSqlite(stmt->columnInt64(0)), stmt->columnText(1),
+                                   fromSqlite(stmt->columnInt64(2)),
                                    static_cast<uint32_t>(stmt->columnInt64(3))});
     }
     if (!r)
@@ -341,7 +333,7 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
         upTo = nextEventId_ - 1;
         if (!everything) {
             for (uint64_t root : roots_->mayHoldEventsBelow(wanted))
-                cursors.push_back({i64(root), sinceExclusive, {}});
+                cursors.push_back({toSqlite(root), sinceExclusive, {}});
         }
     }
     // Every root involved: one scan in ID order is cheaper than merging them all.
@@ -414,12 +406,12 @@ Status TremorStore::trim(uint64_t keepAtMost) {
     auto erase = db_->cached("DELETE FROM events WHERE id < ?");
     if (!erase)
         return erase.error();
-    if (Status status = erase->bind(1, i64(oldest)).run())
+    if (Status status = erase->bind(1, toSqlite(oldest)).run())
         return status;
     auto meta = db_->cached("UPDATE meta SET oldest_event_id = ? WHERE id = 1");
     if (!meta)
         return meta.error();
-    if (Status status = meta->bind(1, i64(oldest)).run())
+    if (Status status = meta->bind(1, toSqlite(oldest)).run())
         return status;
     if (Status status = txn->commit())
         return status;

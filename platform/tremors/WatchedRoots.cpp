@@ -6,13 +6,6 @@ namespace tamber {
 
 namespace {
 
-int64_t i64(uint64_t v) {
-    return static_cast<int64_t>(v);
-}
-uint64_t u64(int64_t v) {
-    return static_cast<uint64_t>(v);
-}
-
 constexpr const char* kSchema = R"sql(
 CREATE TABLE roots(
     id INTEGER PRIMARY KEY,
@@ -49,8 +42,8 @@ Status WatchedRoots::load() {
     Result<bool> r = stmt->step();
     for (; r.ok() && r.value(); r = stmt->step()) {
         Row row;
-        row.root = {u64(stmt->columnInt64(0)), stmt->columnText(1), u64(stmt->columnInt64(2)),
-                    u64(stmt->columnInt64(3))};
+        row.root = {fromSqlite(stmt->columnInt64(0)), stmt->columnText(1),
+                    fromSqlite(stmt->columnInt64(2)), fromSqlite(stmt->columnInt64(3))};
         row.watched = stmt->columnInt64(4) != 0;
         rows_.push_back(std::move(row));
     }
@@ -72,10 +65,10 @@ Status WatchedRoots::write(const Row& row) {
         "inode = excluded.inode, active = excluded.active");
     if (!stmt)
         return stmt.error();
-    return stmt->bind(1, i64(row.root.id))
+    return stmt->bind(1, toSqlite(row.root.id))
         .bind(2, row.root.path)
-        .bind(3, i64(row.root.sinceEventId))
-        .bind(4, i64(row.root.inode))
+        .bind(3, toSqlite(row.root.sinceEventId))
+        .bind(4, toSqlite(row.root.inode))
         .bind(5, int64_t{row.watched})
         .run();
 }
