@@ -95,7 +95,8 @@ int EventsCommand::run(CliContext& context) {
             Error(kPosixErrorDomain, EIO, {{"description", "can't open the event journal stream"}}),
             json_);
     }
-    TremorStreamSetDispatchQueue(stream, DispatchQueue::makeSerial("tamber.cli-events"));
+    auto queue = DispatchQueue::makeSerial("tamber.cli-events");
+    TremorStreamSetDispatchQueue(stream, queue);
     gInterrupted.store(false);
     std::signal(SIGINT, onSignal);
     std::signal(SIGTERM, onSignal);
@@ -104,6 +105,9 @@ int EventsCommand::run(CliContext& context) {
     while (!gInterrupted.load() && !printer.done.wait(0.2)) {
     }
     TremorStreamStop(stream);
+    // A batch may still be printing on the stream's queue; once this barrier passes none is,
+    // and a stopped stream starts no other, so `printer` can go.
+    queue->sync([] {});
     TremorStreamInvalidate(stream);
     TremorStreamRelease(stream);
     return 0;
