@@ -193,7 +193,7 @@ Result<SqliteDatabase::Statement> SqliteDatabase::cached(std::string_view sql) {
     return Statement(db_, it->second.stmt_, false);
 }
 
-Result<int64_t> SqliteDatabase::queryInt64(std::string_view sql) {
+Result<SqliteDatabase::Statement> SqliteDatabase::firstRow(std::string_view sql) {
     auto stmt = prepare(sql);
     if (!stmt)
         return stmt.error();
@@ -202,18 +202,20 @@ Result<int64_t> SqliteDatabase::queryInt64(std::string_view sql) {
         return row.error();
     if (!row.value())
         return makeError(SQLITE_ERROR, sql, "no row");
+    return std::move(stmt.value());
+}
+
+Result<int64_t> SqliteDatabase::queryInt64(std::string_view sql) {
+    auto stmt = firstRow(sql);
+    if (!stmt)
+        return stmt.error();
     return stmt->columnInt64(0);
 }
 
 Result<std::string> SqliteDatabase::queryText(std::string_view sql) {
-    auto stmt = prepare(sql);
+    auto stmt = firstRow(sql);
     if (!stmt)
         return stmt.error();
-    auto row = stmt->step();
-    if (!row)
-        return row.error();
-    if (!row.value())
-        return makeError(SQLITE_ERROR, sql, "no row");
     return stmt->columnText(0);
 }
 

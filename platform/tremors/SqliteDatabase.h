@@ -119,6 +119,8 @@ public:
     static Error makeError(int rc, std::string_view what, std::string_view message);
 
 private:
+    // A statement stepped onto its first row; an error when the query has none.
+    Result<Statement> firstRow(std::string_view sql);
     SqliteDatabase(sqlite3* db, std::string path);
     static int onCommit(void* self);
 

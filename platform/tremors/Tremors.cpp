@@ -22,34 +22,40 @@ TremorStreamRef createStream(TremorStream::Options options) {
 
 }  // namespace
 
-TremorStreamRef TremorStreamCreate(TremorStreamCallback callback,
-                                   const TremorStreamContext* context,
-                                   const std::vector<std::string>& pathsToWatch, uint64_t sinceWhen,
-                                   double latencySeconds, uint32_t flags) {
+namespace {
+
+TremorStream::Options streamOptions(TremorStreamCallback callback,
+                                    const TremorStreamContext* context,
+                                    const std::vector<std::string>& paths, uint64_t sinceWhen,
+                                    double latencySeconds, uint32_t flags) {
     TremorStream::Options options;
     options.callback = callback;
     if (context)
         options.context = *context;
-    options.paths = pathsToWatch;
+    options.paths = paths;
     options.since = sinceWhen;
     options.latency = latencySeconds;
     options.flags = flags;
-    return createStream(std::move(options));
+    return options;
+}
+
+}  // namespace
+
+TremorStreamRef TremorStreamCreate(TremorStreamCallback callback,
+                                   const TremorStreamContext* context,
+                                   const std::vector<std::string>& pathsToWatch, uint64_t sinceWhen,
+                                   double latencySeconds, uint32_t flags) {
+    return createStream(
+        streamOptions(callback, context, pathsToWatch, sinceWhen, latencySeconds, flags));
 }
 
 TremorStreamRef TremorStreamCreateRelativeToDevice(
     TremorStreamCallback callback, const TremorStreamContext* context, uint32_t device,
     const std::vector<std::string>& pathsRelativeToDevice, uint64_t sinceWhen,
     double latencySeconds, uint32_t flags) {
-    TremorStream::Options options;
-    options.callback = callback;
-    if (context)
-        options.context = *context;
-    options.paths = pathsRelativeToDevice;
+    TremorStream::Options options =
+        streamOptions(callback, context, pathsRelativeToDevice, sinceWhen, latencySeconds, flags);
     options.device = device;
-    options.since = sinceWhen;
-    options.latency = latencySeconds;
-    options.flags = flags;
     return createStream(std::move(options));
 }
 

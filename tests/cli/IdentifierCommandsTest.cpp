@@ -4,8 +4,8 @@
 #include <nlohmann/json.hpp>
 #include <sstream>
 
-#include "cli/CommandLine.h"
 #include "platform/tremors/TremorService.h"
+#include "tests/common/CliRunner.h"
 #include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
 
@@ -15,11 +15,7 @@ namespace {
 using nlohmann::json;
 using testing::TempDir;
 
-struct CliRun {
-    int status;
-    std::string out;
-    std::string err;
-};
+using testing::CliRun;
 
 class IdentifierCommandsTest : public ::testing::Test {
 protected:
@@ -31,14 +27,8 @@ protected:
     void TearDown() override { TremorService::resetForTesting(); }
 
     CliRun tamber(std::vector<std::string> args) {
-        args.insert(args.begin(), {"tamber", "--storage", storage});
-        std::vector<char*> argv;
-        for (auto& a : args) argv.push_back(a.data());
-        argv.push_back(nullptr);
-        std::ostringstream out, err;
-        testing::ScopedLogCapture quiet;
-        int status = runCommandLine(static_cast<int>(args.size()), argv.data(), out, err);
-        return {status, out.str(), err.str()};
+        args.insert(args.begin(), {"--storage", storage});
+        return testing::runTamber(std::move(args));
     }
     std::string line(const CliRun& r) {
         EXPECT_EQ(r.status, 0) << r.out << r.err;

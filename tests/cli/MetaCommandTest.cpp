@@ -5,7 +5,7 @@
 #include <nlohmann/json.hpp>
 #include <sstream>
 
-#include "cli/CommandLine.h"
+#include "tests/common/CliRunner.h"
 #include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
 
@@ -15,21 +15,10 @@ namespace {
 using nlohmann::json;
 using testing::TempDir;
 
-struct CliRun {
-    int status;
-    std::string out;
-    std::string err;
-};
+using testing::CliRun;
 
 CliRun tamber(std::vector<std::string> args) {
-    args.insert(args.begin(), "tamber");
-    std::vector<char*> argv;
-    for (auto& a : args) argv.push_back(a.data());
-    argv.push_back(nullptr);
-    std::ostringstream out, err;
-    testing::ScopedLogCapture quiet;  // keep log lines out of the test output
-    int status = runCommandLine(static_cast<int>(args.size()), argv.data(), out, err);
-    return {status, out.str(), err.str()};
+    return testing::runTamber(std::move(args));
 }
 
 class MetaCommandTest : public ::testing::Test {
