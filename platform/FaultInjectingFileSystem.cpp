@@ -42,6 +42,18 @@ std::string_view FaultInjectingFileSystem::operationName(Operation op) {
             return "readDirectory";
         case Operation::Mkdir:
             return "mkdir";
+        case Operation::Read:
+            return "read";
+        case Operation::Write:
+            return "write";
+        case Operation::Fsync:
+            return "fsync";
+        case Operation::Renameat2:
+            return "renameat2";
+        case Operation::Unlinkat:
+            return "unlinkat";
+        case Operation::Statvfs:
+            return "statvfs";
     }
     return "unknown";
 }
@@ -187,6 +199,44 @@ int FaultInjectingFileSystem::mkdir(const std::string& path, mode_t mode) {
     if (shouldFail(Operation::Mkdir, {AT_FDCWD, path}))
         return -1;
     return inner_->mkdir(path, mode);
+}
+
+ssize_t FaultInjectingFileSystem::read(int fd, void* buffer, size_t size) {
+    if (shouldFail(Operation::Read, {fd, {}}))
+        return -1;
+    return inner_->read(fd, buffer, size);
+}
+
+ssize_t FaultInjectingFileSystem::write(int fd, const void* buffer, size_t size) {
+    if (shouldFail(Operation::Write, {fd, {}}))
+        return -1;
+    return inner_->write(fd, buffer, size);
+}
+
+int FaultInjectingFileSystem::fsync(int fd) {
+    if (shouldFail(Operation::Fsync, {fd, {}}))
+        return -1;
+    return inner_->fsync(fd);
+}
+
+// Matched against the destination, which is what a test usually means to refuse.
+int FaultInjectingFileSystem::renameat2(int olddirfd, const std::string& oldpath, int newdirfd,
+                                        const std::string& newpath, unsigned int flags) {
+    if (shouldFail(Operation::Renameat2, {newdirfd, newpath}))
+        return -1;
+    return inner_->renameat2(olddirfd, oldpath, newdirfd, newpath, flags);
+}
+
+int FaultInjectingFileSystem::unlinkat(int dirfd, const std::string& path, int flags) {
+    if (shouldFail(Operation::Unlinkat, {dirfd, path}))
+        return -1;
+    return inner_->unlinkat(dirfd, path, flags);
+}
+
+int FaultInjectingFileSystem::statvfs(const std::string& path, struct statvfs* out) {
+    if (shouldFail(Operation::Statvfs, {AT_FDCWD, path}))
+        return -1;
+    return inner_->statvfs(path, out);
 }
 
 }  // namespace tamber

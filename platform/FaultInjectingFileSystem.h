@@ -30,8 +30,14 @@ public:
         Fremovexattr,
         ReadDirectory,
         Mkdir,
+        Read,
+        Write,
+        Fsync,
+        Renameat2,
+        Unlinkat,
+        Statvfs,
     };
-    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::Mkdir) + 1;
+    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::Statvfs) + 1;
     static std::string_view operationName(Operation op);
 
     explicit FaultInjectingFileSystem(std::shared_ptr<FileSystem> inner);
@@ -64,6 +70,13 @@ public:
     int fremovexattr(int fd, const std::string& name) override;
     bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) override;
     int mkdir(const std::string& path, mode_t mode) override;
+    ssize_t read(int fd, void* buffer, size_t size) override;
+    ssize_t write(int fd, const void* buffer, size_t size) override;
+    int fsync(int fd) override;
+    int renameat2(int olddirfd, const std::string& oldpath, int newdirfd,
+                  const std::string& newpath, unsigned int flags) override;
+    int unlinkat(int dirfd, const std::string& path, int flags) override;
+    int statvfs(const std::string& path, struct statvfs* out) override;
 
 private:
     struct Injection {

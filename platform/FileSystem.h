@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <linux/stat.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <sys/types.h>
 
 #include <memory>
@@ -56,6 +57,15 @@ public:
     virtual bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) = 0;
 
     virtual int mkdir(const std::string& path, mode_t mode) = 0;
+
+    virtual ssize_t read(int fd, void* buffer, size_t size) = 0;
+    virtual ssize_t write(int fd, const void* buffer, size_t size) = 0;
+    virtual int fsync(int fd) = 0;
+    // renameat2(2); `flags` 0 or RENAME_NOREPLACE / RENAME_EXCHANGE.
+    virtual int renameat2(int olddirfd, const std::string& oldpath, int newdirfd,
+                          const std::string& newpath, unsigned int flags) = 0;
+    virtual int unlinkat(int dirfd, const std::string& path, int flags) = 0;
+    virtual int statvfs(const std::string& path, struct statvfs* out) = 0;
 };
 
 }  // namespace tamber

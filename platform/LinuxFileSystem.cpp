@@ -1,5 +1,6 @@
 #include "platform/LinuxFileSystem.h"
 
+#include <stdio.h>
 #include <sys/syscall.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -166,6 +167,31 @@ bool LinuxFileSystem::readDirectory(int dirfd, std::vector<DirectoryEntry>& out)
 
 int LinuxFileSystem::mkdir(const std::string& path, mode_t mode) {
     return ::mkdir(path.c_str(), mode);
+}
+
+ssize_t LinuxFileSystem::read(int fd, void* buffer, size_t size) {
+    return ::read(fd, buffer, size);
+}
+
+ssize_t LinuxFileSystem::write(int fd, const void* buffer, size_t size) {
+    return ::write(fd, buffer, size);
+}
+
+int LinuxFileSystem::fsync(int fd) {
+    return ::fsync(fd);
+}
+
+int LinuxFileSystem::renameat2(int olddirfd, const std::string& oldpath, int newdirfd,
+                               const std::string& newpath, unsigned int flags) {
+    return ::renameat2(olddirfd, oldpath.c_str(), newdirfd, newpath.c_str(), flags);
+}
+
+int LinuxFileSystem::unlinkat(int dirfd, const std::string& path, int flags) {
+    return ::unlinkat(dirfd, path.c_str(), flags);
+}
+
+int LinuxFileSystem::statvfs(const std::string& path, struct statvfs* out) {
+    return ::statvfs(path.c_str(), out);
 }
 
 }  // namespace tamber

@@ -13,20 +13,35 @@ CREATE TABLE inodes(
     inode INTEGER PRIMARY KEY,
     parent INTEGER NOT NULL,
     name TEXT NOT NULL,
-    kind INTEGER NOT NULL);
-CREATE INDEX inodes_by_parent ON inodes(parent);
+    kind INTEGER NOT NULL,
+    birth INTEGER,
+    size INTEGER,
+    mtime INTEGER);
+CREATE INDEX inodes_by_name ON inodes(parent, name);
 CREATE TABLE documents(
     doc_id INTEGER PRIMARY KEY,
     inode INTEGER NOT NULL);
 CREATE UNIQUE INDEX documents_by_inode ON documents(inode);
 )sql";
 
+// Entries indexed by the first schema have no stamps: NULL columns.
+constexpr const char* kUpgradeFromVersion1 = R"sql(
+ALTER TABLE inodes ADD COLUMN birth INTEGER;
+ALTER TABLE inodes ADD COLUMN size INTEGER;
+ALTER TABLE inodes ADD COLUMN mtime INTEGER;
+DROP INDEX inodes_by_parent;
+CREATE INDEX inodes_by_name ON inodes(parent, name);
+)sql";
+
 constexpr const char* kFindByInode =
-    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id FROM inodes i "
+    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime FROM inodes i "
     "LEFT JOIN documents d ON d.inode = i.inode WHERE i.inode = ?";
 constexpr const char* kFindByParent =
-    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id FROM inodes i "
+    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime FROM inodes i "
     "LEFT JOIN documents d ON d.inode = i.inode WHERE i.parent = ?";
+constexpr const char* kFindByName =
+    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime FROM inodes i "
+    "LEFT JOIN documents d ON d.inode = i.inode WHERE i.parent = ? AND i.name = ?";
 
 InodeRecord readInode(const SqliteDatabase::Statement& stmt) {
     InodeRecord record;
@@ -35,6 +50,10 @@ InodeRecord readInode(const SqliteDatabase::Statement& stmt) {
     record.name = stmt.columnText(2);
     record.kind = static_cast<uint8_t>(stmt.columnInt64(3));
     record.docID = static_cast<uint32_t>(stmt.columnInt64(4));  // NULL reads as 0
+    record.stamped = !stmt.columnIsNull(7);
+    record.birth = fromSqlite(stmt.columnInt64(5));
+    record.size = fromSqlite(stmt.columnInt64(6));
+    record.mtime = stmt.columnInt64(7);
     return record;
 }
 
@@ -42,6 +61,10 @@ InodeRecord readInode(const SqliteDatabase::Statement& stmt) {
 
 const char* InodeIndex::schema() {
     return kSchema;
+}
+
+const char* InodeIndex::upgradeFromVersion1() {
+    return kUpgradeFromVersion1;
 }
 
 bool InodeIndex::isEntryName(std::string_view name) {
@@ -72,13 +95,17 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
             return Error::invalidParameter("name", record.name);
         }
     }
+    if (records.empty())
+        return std::nullopt;
     auto txn = db_.begin();
     if (!txn)
         return txn.error();
     auto upsert = db_.cached(
-        "INSERT INTO inodes(inode, parent, name, kind) VALUES(?, ?, ?, ?) "
+        "INSERT INTO inodes(inode, parent, name, kind, birth, size, mtime) "
+        "VALUES(?, ?, ?, ?, ?, ?, ?) "
         "ON CONFLICT(inode) DO UPDATE SET parent = excluded.parent, name = excluded.name, "
-        "kind = excluded.kind");
+        "kind = excluded.kind, birth = excluded.birth, size = excluded.size, "
+        "mtime = excluded.mtime");
     if (!upsert)
         return upsert.error();
     for (const InodeRecord& record : records) {
@@ -86,6 +113,11 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
             .bind(2, toSqlite(record.parent))
             .bind(3, record.name)
             .bind(4, int64_t{record.kind});
+        if (record.stamped) {
+            upsert->bind(5, toSqlite(record.birth))
+                .bind(6, toSqlite(record.size))
+                .bind(7, record.mtime);
+        }  // else left NULL
         if (Status status = upsert->run())
             return status;
     }
@@ -93,6 +125,8 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
 }
 
 Status InodeIndex::remove(const std::vector<uint64_t>& inodes) {
+    if (inodes.empty())
+        return std::nullopt;
     auto txn = db_.begin();
     if (!txn)
         return txn.error();
@@ -106,16 +140,21 @@ Status InodeIndex::remove(const std::vector<uint64_t>& inodes) {
     return txn->commit();
 }
 
-Result<std::optional<InodeRecord>> InodeIndex::find(uint64_t inode) {
-    auto stmt = db_.cached(kFindByInode);
+template <class T, class Read>
+Result<std::optional<T>> InodeIndex::findOne(std::string_view sql, int64_t key, Read read) {
+    auto stmt = db_.cached(sql);
     if (!stmt)
         return stmt.error();
-    auto row = stmt->bind(1, toSqlite(inode)).step();
+    auto row = stmt->bind(1, key).step();
     if (!row)
         return row.error();
     if (!row.value())
-        return std::optional<InodeRecord>();
-    return std::optional<InodeRecord>(readInode(stmt.value()));
+        return std::optional<T>();
+    return std::optional<T>(read(stmt.value()));
+}
+
+Result<std::optional<InodeRecord>> InodeIndex::find(uint64_t inode) {
+    return findOne<InodeRecord>(kFindByInode, toSqlite(inode), readInode);
 }
 
 Result<std::optional<std::string>> InodeIndex::path(
@@ -157,10 +196,20 @@ Result<std::vector<InodeRecord>> InodeIndex::children(uint64_t parent) {
     auto stmt = db_.cached(kFindByParent);
     if (!stmt)
         return stmt.error();
-    stmt->bind(1, toSqlite(parent));
+    return readAll(stmt->bind(1, toSqlite(parent)));
+}
+
+Result<std::vector<InodeRecord>> InodeIndex::childrenNamed(uint64_t parent, std::string_view name) {
+    auto stmt = db_.cached(kFindByName);
+    if (!stmt)
+        return stmt.error();
+    return readAll(stmt->bind(1, toSqlite(parent)).bind(2, name));
+}
+
+Result<std::vector<InodeRecord>> InodeIndex::readAll(SqliteDatabase::Statement& stmt) {
     std::vector<InodeRecord> result;
-    Result<bool> r = stmt->step();
-    for (; r.ok() && r.value(); r = stmt->step()) result.push_back(readInode(stmt.value()));
+    Result<bool> r = stmt.step();
+    for (; r.ok() && r.value(); r = stmt.step()) result.push_back(readInode(stmt));
     if (!r)
         return r.error();
     return result;
@@ -169,27 +218,15 @@ Result<std::vector<InodeRecord>> InodeIndex::children(uint64_t parent) {
 // ---- Document IDs ----
 
 Result<std::optional<uint32_t>> InodeIndex::documentIdForInode(uint64_t inode) {
-    auto stmt = db_.cached("SELECT doc_id FROM documents WHERE inode = ?");
-    if (!stmt)
-        return stmt.error();
-    auto row = stmt->bind(1, toSqlite(inode)).step();
-    if (!row)
-        return row.error();
-    if (!row.value())
-        return std::optional<uint32_t>();
-    return std::optional<uint32_t>(static_cast<uint32_t>(stmt->columnInt64(0)));
+    return findOne<uint32_t>(
+        "SELECT doc_id FROM documents WHERE inode = ?", toSqlite(inode),
+        [](SqliteDatabase::Statement& stmt) { return static_cast<uint32_t>(stmt.columnInt64(0)); });
 }
 
 Result<std::optional<uint64_t>> InodeIndex::inodeForDocumentId(uint32_t docID) {
-    auto stmt = db_.cached("SELECT inode FROM documents WHERE doc_id = ?");
-    if (!stmt)
-        return stmt.error();
-    auto row = stmt->bind(1, int64_t{docID}).step();
-    if (!row)
-        return row.error();
-    if (!row.value())
-        return std::optional<uint64_t>();
-    return std::optional<uint64_t>(fromSqlite(stmt->columnInt64(0)));
+    return findOne<uint64_t>(
+        "SELECT inode FROM documents WHERE doc_id = ?", int64_t{docID},
+        [](SqliteDatabase::Statement& stmt) { return fromSqlite(stmt.columnInt64(0)); });
 }
 
 Result<uint32_t> InodeIndex::allocateDocumentId(uint64_t inode) {

@@ -22,8 +22,10 @@ namespace tamber {
 class InodeIndex {
 public:
     static constexpr size_t kMaxPathComponents = 4096;
-    // Its tables, created with the rest of the journal's schema.
+    // Its tables, created with the rest of the journal's schema, and what brings the tables of
+    // the first schema up to date.
     static const char* schema();
+    static const char* upgradeFromVersion1();
 
     explicit InodeIndex(SqliteDatabase& db) : db_(db) {}
 
@@ -38,6 +40,7 @@ public:
     Result<std::optional<std::string>> path(
         uint64_t inode, const std::function<const std::string*(uint64_t)>& rootPath);
     Result<std::vector<InodeRecord>> children(uint64_t parent);
+    Result<std::vector<InodeRecord>> childrenNamed(uint64_t parent, std::string_view name);
 
     Result<uint32_t> allocateDocumentId(uint64_t inode);
     Result<std::optional<uint64_t>> inodeForDocumentId(uint32_t docID);
@@ -49,6 +52,12 @@ public:
     static bool isEntryName(std::string_view name);
 
 private:
+    static Result<std::vector<InodeRecord>> readAll(SqliteDatabase::Statement& stmt);
+    // The first row of `sql` with `key` bound to its one parameter, read by `read`; nothing
+    // when there is no such row.
+    template <class T, class Read>
+    Result<std::optional<T>> findOne(std::string_view sql, int64_t key, Read read);
+
     SqliteDatabase& db_;
     uint64_t nextDocumentId_ = 1;
 };

@@ -15,6 +15,14 @@ struct InodeRecord {
     uint8_t kind = kOther;
     uint32_t docID = 0;  // 0: none
 
+    // How the file looked when it was last seen, so that a restart can tell a file changed while
+    // nothing watched, and an inode number reused by another file, from the file itself.
+    // Entries indexed before these were kept have `stamped` false.
+    uint64_t birth = 0;  // see JournalWriter::birthOf; 0: unknown
+    uint64_t size = 0;
+    int64_t mtime = 0;  // nanoseconds since the epoch
+    bool stamped = false;
+
     friend bool operator==(const InodeRecord&, const InodeRecord&) = default;
 };
 

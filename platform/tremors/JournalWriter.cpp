@@ -17,11 +17,16 @@ namespace tamber {
 
 namespace {
 
-constexpr size_t kUpsertBatch = 1000;
+// What an index entry keeps of a file.
+constexpr unsigned kStampMask =
+    STATX_INO | STATX_TYPE | STATX_BTIME | STATX_CTIME | STATX_MTIME | STATX_SIZE;
 
 bool statPath(const std::string& path, struct statx& st) {
-    return FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, STATX_INO | STATX_TYPE,
-                                       &st) == 0;
+    return FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, kStampMask, &st) == 0;
+}
+
+int64_t nanoseconds(const struct statx_timestamp& t) {
+    return t.tv_sec * 1'000'000'000 + t.tv_nsec;
 }
 
 uint8_t kindOf(uint32_t mode) {
@@ -47,6 +52,20 @@ uint32_t kindFlag(uint8_t kind) {
     }
 }
 
+// The same file: a reused inode number of another kind or birth is another file. Entries
+// without a birth (indexed before it was kept, or on a file system without one) can only be
+// told apart by kind.
+bool sameFile(const InodeRecord& indexed, const InodeRecord& found) {
+    return indexed.kind == found.kind && (!indexed.stamped || indexed.birth == 0 ||
+                                          found.birth == 0 || indexed.birth == found.birth);
+}
+
+// A directory's own size and time change with its entries, which are reported one by one.
+bool changedWhileAway(const InodeRecord& indexed, const InodeRecord& found) {
+    return indexed.stamped && indexed.kind != InodeRecord::kDirectory &&
+           (indexed.size != found.size || indexed.mtime != found.mtime);
+}
+
 std::string parentOf(const std::string& path) {
     size_t slash = path.rfind('/');
     return slash == 0 || slash == std::string::npos ? "/" : path.substr(0, slash);
@@ -62,7 +81,32 @@ void logIfFailed(const Status& status, std::string_view what) {
         logError(std::string(what) + ": " + status->description());
 }
 
+// Whether the index must be told about `found`, a newer look at the entry it keeps as `indexed`.
+bool differs(const InodeRecord& indexed, InodeRecord found) {
+    found.docID = indexed.docID;  // kept apart from the entry
+    return !(found == indexed);
+}
+
 }  // namespace
+
+uint64_t JournalWriter::birthOf(const struct statx& st) {
+    if ((st.stx_mask & STATX_BTIME) && (st.stx_btime.tv_sec != 0 || st.stx_btime.tv_nsec != 0))
+        return static_cast<uint64_t>(nanoseconds(st.stx_btime));
+    // A directory's change time moves with every entry: it would make every folder that changed
+    // while nothing watched read as replaced.
+    if (S_ISDIR(st.stx_mode))
+        return 0;
+    return static_cast<uint64_t>(nanoseconds(st.stx_ctime));
+}
+
+InodeRecord JournalWriter::recordOf(const struct statx& st, uint64_t parent, std::string name) {
+    InodeRecord record{st.stx_ino, parent, std::move(name), kindOf(st.stx_mode), 0};
+    record.birth = birthOf(st);
+    record.size = st.stx_size;
+    record.mtime = nanoseconds(st.stx_mtime);
+    record.stamped = true;
+    return record;
+}
 
 std::string JournalWriter::documentIdPath(uint32_t device, uint32_t docID, uint64_t src,
                                           uint64_t dst) {
@@ -71,51 +115,107 @@ std::string JournalWriter::documentIdPath(uint32_t device, uint32_t docID, uint6
 }
 
 Result<std::vector<JournalEvent>> JournalWriter::apply(const std::vector<FileChange>& changes) {
-    for (const FileChange& change : changes) {
-        switch (change.kind) {
-            case FileChange::Kind::Created:
-                created(change);
-                break;
-            case FileChange::Kind::Removed:
-                removed(change);
-                break;
-            case FileChange::Kind::Renamed:
-                renamed(change);
-                break;
-            case FileChange::Kind::Modified:
-                touched(change, kTremorItemModified);
-                break;
-            case FileChange::Kind::AttributesChanged:
-                touched(change, kTremorItemAttributes);
-                break;
-            case FileChange::Kind::Overflow:
-            case FileChange::Kind::WatchFailed:
-                // The service journals these for the roots they affect.
-                break;
+    return commit([&] {
+        for (const FileChange& change : changes) {
+            switch (change.kind) {
+                case FileChange::Kind::Created:
+                    created(change);
+                    break;
+                case FileChange::Kind::Removed:
+                    removed(change);
+                    break;
+                case FileChange::Kind::Renamed:
+                    renamed(change);
+                    break;
+                case FileChange::Kind::Modified:
+                    touched(change, kTremorItemModified);
+                    break;
+                case FileChange::Kind::AttributesChanged:
+                    touched(change, kTremorItemAttributes);
+                    break;
+                case FileChange::Kind::Overflow:
+                case FileChange::Kind::WatchFailed:
+                    // The service journals these for the roots they affect.
+                    break;
+            }
         }
-    }
-    settleVanished();
-    return commit();
+    });
 }
 
 Result<std::vector<JournalEvent>> JournalWriter::journalDropped(
     const std::vector<std::string>& paths, uint32_t flags) {
     for (const auto& path : paths) pending_.push_back({0, path, 0, flags});
-    return commit();
+    return commit([] {});
 }
 
-Result<std::vector<JournalEvent>> JournalWriter::commit() {
-    std::vector<JournalEvent> events = std::move(pending_);
+Result<std::vector<JournalEvent>> JournalWriter::commit(const std::function<void()>& work) {
+    std::vector<JournalEvent> events;
+    // One transaction for the journal rows and the index: a crash keeps both or neither.
+    Status status = store_.transact([&]() -> Status {
+        work();
+        flushStaged();
+        settleVanished();
+        events = std::move(pending_);
+        if (events.empty())
+            return std::nullopt;
+        auto last = store_.append(events);
+        return last.ok() ? Status() : Status(last.error());
+    });
     pending_.clear();
-    if (events.empty())
-        return events;
-    auto last = store_.append(events);
-    if (!last.ok())
-        return last.error();
+    vanished_.clear();
+    staged_.clear();
+    stagedNames_.clear();
+    if (status)
+        return *status;
     return events;
 }
 
+// ---- Index entries of one batch ----
+
+void JournalWriter::stage(InodeRecord record) {
+    auto [it, inserted] = staged_.try_emplace(record.inode, record);
+    if (!inserted) {
+        auto old = stagedNames_.find({it->second.parent, it->second.name});
+        if (old != stagedNames_.end() && old->second == record.inode)
+            stagedNames_.erase(old);
+        it->second = record;
+    }
+    stagedNames_[{record.parent, record.name}] = record.inode;
+}
+
+void JournalWriter::flushStaged() {
+    if (staged_.empty())
+        return;
+    std::vector<InodeRecord> records;
+    records.reserve(staged_.size());
+    for (auto& [inode, record] : staged_) {
+        if (InodeIndex::isEntryName(record.name))  // one odd name must not cost the batch
+            records.push_back(std::move(record));
+    }
+    staged_.clear();
+    stagedNames_.clear();
+    logIfFailed(store_.upsertInodes(records), "Could not update the file index");
+}
+
+std::optional<InodeRecord> JournalWriter::stagedOrIndexed(uint64_t inode) {
+    if (auto it = staged_.find(inode); it != staged_.end())
+        return it->second;
+    return store_.inode(inode);
+}
+
+std::vector<InodeRecord> JournalWriter::entriesAt(uint64_t parent, const std::string& name) {
+    std::vector<InodeRecord> found;
+    if (auto it = stagedNames_.find({parent, name}); it != stagedNames_.end())
+        found.push_back(staged_.at(it->second));
+    for (auto& record : store_.childrenNamed(parent, name)) {
+        if (!staged_.contains(record.inode))  // else the staged entry is newer
+            found.push_back(std::move(record));
+    }
+    return found;
+}
+
 std::optional<InodeRecord> JournalWriter::recordAt(const std::string& path) {
+    flushStaged();
     const TremorStore::Root* best = nullptr;
     auto roots = store_.roots();
     for (const auto& root : roots) {
@@ -133,23 +233,26 @@ std::optional<InodeRecord> JournalWriter::recordAt(const std::string& path) {
     std::optional<InodeRecord> found;
     while (!rest.empty()) {
         size_t slash = rest.find('/');
-        std::string_view name = rest.substr(0, slash);
+        std::string name(rest.substr(0, slash));
         rest = slash == std::string_view::npos ? std::string_view() : rest.substr(slash + 1);
-        found.reset();
-        for (auto& child : store_.children(parent)) {
-            if (child.name == name) {
-                found = std::move(child);
+        auto entries = store_.childrenNamed(parent, name);
+        if (entries.empty())
+            return std::nullopt;
+        // Lost events may leave a stale twin behind; only a directory can be walked into.
+        found = std::move(entries.front());
+        for (auto& entry : entries) {
+            if (!rest.empty() && entry.kind == InodeRecord::kDirectory) {
+                found = std::move(entry);
                 break;
             }
         }
-        if (!found)
-            return std::nullopt;
         parent = found->inode;
     }
     return found;
 }
 
 void JournalWriter::forgetSubtree(const InodeRecord& top, const std::string& path) {
+    flushStaged();
     std::vector<uint64_t> gone;
     std::vector<std::pair<InodeRecord, std::string>> stack{{top, path}};
     while (!stack.empty()) {
@@ -168,19 +271,25 @@ void JournalWriter::forgetSubtree(const InodeRecord& top, const std::string& pat
     logIfFailed(store_.removeInodes(gone), "Could not update the file index");
 }
 
-void JournalWriter::claimDocumentId(const std::string& path, uint64_t inode) {
+// ---- Document IDs ----
+
+void JournalWriter::claimDocumentId(const std::string& path, uint64_t inode, uint8_t kind) {
     auto it = vanished_.find(path);
-    if (it == vanished_.end() || it->second.inode == inode)
+    if (it == vanished_.end() || it->second.kind != kind)
         return;
-    if (store_.documentIdForInode(inode))
-        return;  // the new file is a document of its own
     uint32_t docID = it->second.docID;
     uint64_t old = it->second.inode;
+    // The new file may have been given the vanished one's inode number: the ID then stays.
+    auto holder = store_.documentIdForInode(inode);
+    if (holder && *holder != docID)
+        return;  // the new file is a document of its own
     vanished_.erase(it);
-    if (auto error = store_.moveDocumentId(docID, inode)) {
-        logError("Could not move document ID " + std::to_string(docID) + ": " +
-                 error->description());
-        return;
+    if (!holder) {
+        if (auto error = store_.moveDocumentId(docID, inode)) {
+            logError("Could not move document ID " + std::to_string(docID) + ": " +
+                     error->description());
+            return;
+        }
     }
     pending_.push_back({0, documentIdPath(device_, docID, old, inode), inode,
                         kTremorItemRenamed | kTremorItemIsFile});
@@ -195,6 +304,8 @@ void JournalWriter::settleVanished() {
     vanished_.clear();
 }
 
+// ---- Live changes ----
+
 void JournalWriter::created(const FileChange& change) {
     uint32_t kind = change.isDirectory ? kTremorItemIsDir : kTremorItemIsFile;
     struct statx st {};
@@ -204,12 +315,16 @@ void JournalWriter::created(const FileChange& change) {
         pending_.push_back({0, change.path, 0, kTremorItemCreated | kind});
         return;
     }
-    if (auto existing = recordAt(change.path); existing && existing->inode != st.stx_ino)
-        forgetSubtree(*existing, change.path);
-    InodeRecord record{st.stx_ino, parent.stx_ino, nameOf(change.path), kindOf(st.stx_mode), 0};
-    logIfFailed(store_.upsertInodes({record}), "Could not update the file index");
-    pending_.push_back({0, change.path, st.stx_ino, kTremorItemCreated | kindFlag(record.kind)});
-    claimDocumentId(change.path, st.stx_ino);
+    std::string name = nameOf(change.path);
+    for (const InodeRecord& existing : entriesAt(parent.stx_ino, name)) {
+        if (existing.inode != st.stx_ino)
+            forgetSubtree(existing, change.path);
+    }
+    InodeRecord record = recordOf(st, parent.stx_ino, std::move(name));
+    uint8_t recordKind = record.kind;
+    stage(std::move(record));
+    pending_.push_back({0, change.path, st.stx_ino, kTremorItemCreated | kindFlag(recordKind)});
+    claimDocumentId(change.path, st.stx_ino, recordKind);
 }
 
 void JournalWriter::removed(const FileChange& change) {
@@ -225,7 +340,7 @@ void JournalWriter::removed(const FileChange& change) {
 }
 
 void JournalWriter::renamed(const FileChange& change) {
-    auto from = recordAt(change.fromPath);
+    auto from = change.fromPath.empty() ? std::nullopt : recordAt(change.fromPath);
     struct statx st {};
     struct statx parent {};
     uint32_t kind = change.isDirectory ? kTremorItemIsDir : kTremorItemIsFile;
@@ -233,18 +348,26 @@ void JournalWriter::renamed(const FileChange& change) {
     bool present = statPath(change.path, st) && statPath(parentOf(change.path), parent);
     if (present)
         inode = st.stx_ino;
-    if (auto existing = recordAt(change.path); existing && existing->inode != inode)
-        forgetSubtree(*existing, change.path);
+    std::vector<InodeRecord> existing;
     if (present) {
-        InodeRecord record{inode, parent.stx_ino, nameOf(change.path), kindOf(st.stx_mode), 0};
+        existing = entriesAt(parent.stx_ino, nameOf(change.path));
+    } else if (auto at = recordAt(change.path)) {
+        existing.push_back(std::move(*at));
+    }
+    for (const InodeRecord& replaced : existing) {
+        if (replaced.inode != inode)
+            forgetSubtree(replaced, change.path);
+    }
+    if (present) {
+        InodeRecord record = recordOf(st, parent.stx_ino, nameOf(change.path));
         kind = kindFlag(record.kind);
-        logIfFailed(store_.upsertInodes({record}), "Could not update the file index");
+        stage(std::move(record));
     }
     if (!change.fromPath.empty())
         pending_.push_back({0, change.fromPath, inode, kTremorItemRenamed | kind});
     pending_.push_back({0, change.path, inode, kTremorItemRenamed | kind});
     if (present)
-        claimDocumentId(change.path, inode);
+        claimDocumentId(change.path, inode, kindOf(st.stx_mode));
 }
 
 void JournalWriter::touched(const FileChange& change, uint32_t flag) {
@@ -254,43 +377,36 @@ void JournalWriter::touched(const FileChange& change, uint32_t flag) {
     if (statPath(change.path, st)) {
         inode = st.stx_ino;
         kind = kindFlag(kindOf(st.stx_mode));
+        // Seen while watched, so the same file whatever its stamps say; the index keeps up, so
+        // that a restart does not report the change again.
+        auto indexed = stagedOrIndexed(inode);
+        if (indexed && indexed->name == nameOf(change.path)) {
+            InodeRecord now = recordOf(st, indexed->parent, indexed->name);
+            if (differs(*indexed, now))
+                stage(std::move(now));
+        }
     }
     pending_.push_back({0, change.path, inode, flag | kind});
 }
+
+// ---- Reconciliation ----
 
 Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& root, bool journal) {
     struct statx top {};
     if (!statPath(root, top))
         return Error::posix(errno);
-    std::map<std::string, TremorStore::Root> rootsByPath;
-    for (const auto& r : store_.roots()) rootsByPath[r.path] = r;
-    auto known = rootsByPath.find(root);
-    uint64_t oldTop = known == rootsByPath.end() ? 0 : known->second.inode;
+    uint64_t oldTop = 0;
+    for (const auto& r : store_.roots()) {
+        if (r.path == root)
+            oldTop = r.inode;
+    }
     if (oldTop != top.stx_ino)
         logIfFailed(store_.setRootInode(root, top.stx_ino), "Could not update a root");
 
-    // What the index says, by inode.
-    std::map<uint64_t, Found> indexed;
-    if (oldTop != 0) {
-        std::vector<std::pair<uint64_t, std::string>> stack{{oldTop, root}};
-        while (!stack.empty()) {
-            auto [dir, at] = std::move(stack.back());
-            stack.pop_back();
-            for (auto& child : store_.children(dir)) {
-                std::string path = at + "/" + child.name;
-                if (child.kind == InodeRecord::kDirectory)
-                    stack.emplace_back(child.inode, path);
-                if (auto docID = store_.documentIdForInode(child.inode))
-                    child.docID = *docID;
-                indexed[child.inode] = {std::move(child), std::move(path)};
-            }
-        }
-    }
-
     // What is on disk, walked relative to each directory's descriptor, never following links.
+    // The walk is done before the index is locked: it can take long.
     FileSystem& fs = FileSystem::current();
     std::map<uint64_t, Found> onDisk;
-    std::vector<InodeRecord> batch;
     std::vector<std::pair<uint64_t, std::string>> stack{{top.stx_ino, root}};
     std::vector<FileSystem::DirectoryEntry> entries;
     while (!stack.empty()) {
@@ -303,30 +419,44 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
         bool listed = fs.readDirectory(fd, entries);
         for (const auto& entry : listed ? entries : std::vector<FileSystem::DirectoryEntry>{}) {
             struct statx st {};
-            if (fs.statx(fd, entry.name, AT_SYMLINK_NOFOLLOW, STATX_INO | STATX_TYPE, &st) != 0)
+            if (fs.statx(fd, entry.name, AT_SYMLINK_NOFOLLOW, kStampMask, &st) != 0)
                 continue;
-            InodeRecord record{st.stx_ino, dir, entry.name, kindOf(st.stx_mode), 0};
+            InodeRecord record = recordOf(st, dir, entry.name);
             std::string path = at + "/" + entry.name;
             if (record.kind == InodeRecord::kDirectory)
                 stack.emplace_back(record.inode, path);
-            batch.push_back(record);
             onDisk[record.inode] = {std::move(record), std::move(path)};
-            if (batch.size() >= kUpsertBatch) {
-                logIfFailed(store_.upsertInodes(batch), "Could not update the file index");
-                batch.clear();
-            }
         }
         fs.close(fd);
     }
-    logIfFailed(store_.upsertInodes(batch), "Could not update the file index");
+    return commit([&] { compareWithIndex(root, oldTop, onDisk, journal); });
+}
+
+void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
+                                     std::map<uint64_t, Found>& onDisk, bool journal) {
+    // What the index says, by inode.
+    std::map<uint64_t, Found> indexed;
+    std::vector<std::pair<uint64_t, std::string>> stack;
+    if (oldTop != 0)
+        stack.emplace_back(oldTop, root);
+    while (!stack.empty()) {
+        auto [dir, at] = std::move(stack.back());
+        stack.pop_back();
+        for (auto& child : store_.children(dir)) {
+            std::string path = at + "/" + child.name;
+            if (child.kind == InodeRecord::kDirectory)
+                stack.emplace_back(child.inode, path);
+            indexed[child.inode] = {std::move(child), std::move(path)};
+        }
+    }
 
     std::vector<uint64_t> gone;
+    std::vector<InodeRecord> updates;
     std::set<uint64_t> replaced;
+    bool unstamped = false;
     for (auto& [inode, found] : indexed) {
         auto it = onDisk.find(inode);
-        // A reused inode number of another kind is another file. (One of the same kind cannot
-        // be told from a rename: the index keeps no generation or birth time.)
-        if (it != onDisk.end() && it->second.record.kind != found.record.kind) {
+        if (it != onDisk.end() && !sameFile(found.record, it->second.record)) {
             replaced.insert(inode);
             it = onDisk.end();
         }
@@ -337,29 +467,37 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
             if (journal)
                 pending_.push_back(
                     {0, found.path, inode, kTremorItemRemoved | kindFlag(found.record.kind)});
-        } else if (journal && it->second.path != found.path) {
-            uint32_t flags = kTremorItemRenamed | kindFlag(it->second.record.kind);
-            pending_.push_back({0, found.path, inode, flags});
-            pending_.push_back({0, it->second.path, inode, flags});
-        }
-    }
-    logIfFailed(store_.removeInodes(gone), "Could not update the file index");
-    if (!replaced.empty()) {
-        // removeInodes dropped them; their new selves are on disk.
-        std::vector<InodeRecord> back;
-        for (uint64_t inode : replaced) back.push_back(onDisk[inode].record);
-        logIfFailed(store_.upsertInodes(back), "Could not update the file index");
-    }
-    for (auto& [inode, found] : onDisk) {
-        if (indexed.count(inode) && !replaced.count(inode))
             continue;
+        }
+        unstamped |= !found.record.stamped;
+        const Found& now = it->second;
+        uint32_t kind = kindFlag(now.record.kind);
+        if (journal && now.path != found.path) {
+            pending_.push_back({0, found.path, inode, kTremorItemRenamed | kind});
+            pending_.push_back({0, now.path, inode, kTremorItemRenamed | kind});
+        }
+        if (journal && changedWhileAway(found.record, now.record))
+            pending_.push_back({0, now.path, inode, kTremorItemModified | kind});
+        if (differs(found.record, now.record))
+            updates.push_back(now.record);
+    }
+    // Removed first: a replaced inode comes back with its new self.
+    logIfFailed(store_.removeInodes(gone), "Could not update the file index");
+    for (auto& [inode, found] : onDisk) {
+        if (indexed.contains(inode) && !replaced.contains(inode))
+            continue;
+        updates.push_back(found.record);
         if (journal)
             pending_.push_back(
                 {0, found.path, inode, kTremorItemCreated | kindFlag(found.record.kind)});
-        claimDocumentId(found.path, inode);
+        claimDocumentId(found.path, inode, found.record.kind);
     }
-    settleVanished();
-    return commit();
+    logIfFailed(store_.upsertInodes(updates), "Could not update the file index");
+    if (journal && unstamped) {
+        // Indexed before contents were tracked: what changed inside files is not known.
+        logInfo("Files in " + root + " may have changed unseen; asking readers to rescan it");
+        pending_.push_back({0, root, 0, kTremorUserDropped | kTremorMustScanSubdirs});
+    }
 }
 
 }  // namespace tamber

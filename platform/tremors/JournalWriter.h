@@ -1,9 +1,14 @@
 #pragma once
 
+#include <sys/stat.h>
+
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <optional>
 #include <string>
+#include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "platform/tremors/FileChange.h"
@@ -15,7 +20,8 @@
 namespace tamber {
 
 // Turns the changes seen in one volume's watched trees into journal events, and keeps that
-// volume's inode index and document IDs in step with them. Used from one thread at a time.
+// volume's inode index and document IDs in step with them: each batch, with its index changes,
+// is one transaction. Used from one thread at a time.
 //
 // Document IDs follow the document: when a file with an ID vanishes from a path and another
 // inode appears at that path in the same batch (a safe save), the ID moves to the new inode and
@@ -37,6 +43,14 @@ public:
 
     static std::string documentIdPath(uint32_t device, uint32_t docID, uint64_t src, uint64_t dst);
 
+    // What tells a file from a later one given the same inode number: its birth time where the
+    // file system keeps one, else (for all but directories) its change time. The change time
+    // also moves when the file is changed or renamed while nothing watches; such a file then
+    // reads as replaced and keeps its document ID only if it is still at its path (the
+    // safe-save rule), which is the safe way to be wrong. 0 when there is nothing to go by.
+    static uint64_t birthOf(const struct statx& st);
+    static InodeRecord recordOf(const struct statx& st, uint64_t parent, std::string name);
+
 private:
     struct Found {
         InodeRecord record;
@@ -47,20 +61,34 @@ private:
     void removed(const FileChange& change);
     void renamed(const FileChange& change);
     void touched(const FileChange& change, uint32_t flag);
+    void compareWithIndex(const std::string& root, uint64_t oldTop,
+                          std::map<uint64_t, Found>& onDisk, bool journal);
+    // Runs `work`, then journals what it left pending, all in one transaction.
+    Result<std::vector<JournalEvent>> commit(const std::function<void()>& work);
+
+    // Index entries of the batch are written together: at its end, or before the index is read
+    // in a way that staged entries could not answer.
+    void stage(InodeRecord record);
+    void flushStaged();
+    std::optional<InodeRecord> stagedOrIndexed(uint64_t inode);
+    // The entries named `name` in the directory `parent`, staged or indexed.
+    std::vector<InodeRecord> entriesAt(uint64_t parent, const std::string& name);
     // The indexed entry at `path`, by walking the index down from the root above it.
     std::optional<InodeRecord> recordAt(const std::string& path);
     // Removes `top` and everything indexed below it; their document IDs wait in vanished_.
     void forgetSubtree(const InodeRecord& top, const std::string& path);
-    // A safe save: the document that vanished from `path` in this batch is now `inode`.
-    void claimDocumentId(const std::string& path, uint64_t inode);
+    // A safe save: the document that vanished from `path` in this batch is now `inode`, a new
+    // entry of the same kind.
+    void claimDocumentId(const std::string& path, uint64_t inode, uint8_t kind);
     // Clears the document IDs of files that vanished for good and journals their deletion.
     void settleVanished();
-    Result<std::vector<JournalEvent>> commit();
 
     TremorStore& store_;
     const uint32_t device_;
     std::vector<JournalEvent> pending_;
     std::map<std::string, InodeRecord> vanished_;  // by path, only those with a document ID
+    std::unordered_map<uint64_t, InodeRecord> staged_;
+    std::map<std::pair<uint64_t, std::string>, uint64_t> stagedNames_;  // (parent, name) -> inode
 };
 
 }  // namespace tamber

@@ -107,18 +107,20 @@ bool SqliteDatabase::Statement::columnIsNull(int index) const {
 // ---- Transaction ----
 
 SqliteDatabase::Transaction::Transaction(Transaction&& other) noexcept
-    : db_(std::exchange(other.db_, nullptr)) {}
+    : db_(std::exchange(other.db_, nullptr)), nested_(other.nested_) {}
 
 SqliteDatabase::Transaction::~Transaction() {
+    // An error may have rolled the whole transaction back already; then there is nothing to undo.
     if (db_ && !sqlite3_get_autocommit(db_->db_)) {
-        sqlite3_exec(db_->db_, "ROLLBACK", nullptr, nullptr, nullptr);
+        sqlite3_exec(db_->db_, nested_ ? "ROLLBACK TO nested; RELEASE nested" : "ROLLBACK", nullptr,
+                     nullptr, nullptr);
     }
 }
 
 Status SqliteDatabase::Transaction::commit() {
     if (!db_)
         return makeError(SQLITE_MISUSE, "COMMIT", "no transaction");
-    Status status = db_->exec("COMMIT");
+    Status status = db_->exec(nested_ ? "RELEASE nested" : "COMMIT");
     if (!status)
         db_ = nullptr;
     return status;
@@ -220,9 +222,10 @@ Result<std::string> SqliteDatabase::queryText(std::string_view sql) {
 }
 
 Result<SqliteDatabase::Transaction> SqliteDatabase::begin() {
-    if (Status status = exec("BEGIN IMMEDIATE"))
+    bool nested = !sqlite3_get_autocommit(db_);
+    if (Status status = exec(nested ? "SAVEPOINT nested" : "BEGIN IMMEDIATE"))
         return *status;
-    return Transaction(this);
+    return Transaction(this, nested);
 }
 
 }  // namespace tamber

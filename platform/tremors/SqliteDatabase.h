@@ -71,7 +71,9 @@ public:
         int bindError_ = SQLITE_OK;
     };
 
-    // A write transaction (BEGIN IMMEDIATE) that rolls back unless committed.
+    // A write transaction (BEGIN IMMEDIATE) that rolls back unless committed. Begun inside
+    // another one, it is a savepoint of it: committing it makes its changes part of the outer
+    // transaction, and only the outer commit writes them.
     class Transaction {
     public:
         Transaction(Transaction&& other) noexcept;
@@ -82,8 +84,9 @@ public:
 
     private:
         friend class SqliteDatabase;
-        explicit Transaction(SqliteDatabase* db) : db_(db) {}
+        Transaction(SqliteDatabase* db, bool nested) : db_(db), nested_(nested) {}
         SqliteDatabase* db_;
+        bool nested_;
     };
 
     // Opens (and by default creates) the database file. Extended result codes are on.

@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <sys/statvfs.h>
 
 #include <cerrno>
 #include <cstdlib>
@@ -198,7 +197,7 @@ Result<TremorService::Volume*> TremorService::openVolume(uint64_t fsid, uint32_t
 
 Result<TremorService::Volume*> TremorService::volumeFor(const std::string& path) {
     struct statvfs vfs {};
-    if (::statvfs(path.c_str(), &vfs) != 0)
+    if (FileSystem::current().statvfs(path, &vfs) != 0)
         return Error::posix(errno);
     struct statx st {};
     if (FileSystem::current().statx(AT_FDCWD, path, 0, STATX_INO, &st) != 0)
@@ -211,7 +210,13 @@ Result<TremorService::Volume*> TremorService::volumeFor(const std::string& path)
 Status TremorService::watchTree(const std::string& path) {
     if (stopped_)
         return Error::posix(ESHUTDOWN);
-    return watch(WatchedRoots::normalised(path), false);
+    std::string root = WatchedRoots::normalised(path);
+    if (isWatched(root))
+        return std::nullopt;
+    // A tree's history starts after what is journaled by now: a replay from before it must not
+    // pass for complete because queued events of other trees got their IDs later.
+    sync();
+    return watch(root, false);
 }
 
 Status TremorService::watch(const std::string& path, bool journalDifferences) {
@@ -296,7 +301,7 @@ std::optional<uint32_t> TremorService::deviceForPath(const std::string& path) co
     if (!volume)
         return std::nullopt;
     std::lock_guard lock(volumesMutex_);
-    return volume->device;
+    return volume->device.load();
 }
 
 void TremorService::enqueue(std::vector<FileChange> changes) {
@@ -431,7 +436,7 @@ void TremorService::publish(const Volume& volume, Result<std::vector<JournalEven
     if (events.value().empty())
         return;
     std::lock_guard lock(listenersMutex_);
-    for (auto& [token, listener] : listeners_) listener(volume.device, events.value());
+    for (auto& [token, listener] : listeners_) listener(volume.device.load(), events.value());
 }
 
 uint64_t TremorService::currentEventId() {

@@ -88,7 +88,8 @@ public:
 private:
     struct Volume {
         uint64_t fsid = 0;
-        uint32_t device = 0;
+        // Read by the journaling thread while a watch on another thread may set it again.
+        std::atomic<uint32_t> device{0};
         std::unique_ptr<TremorStore> store;
         std::unique_ptr<JournalWriter> writer;
     };

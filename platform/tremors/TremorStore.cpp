@@ -133,7 +133,7 @@ Status TremorStore::load() {
             return corrupt("tables without a schema version");
         if (Status status = createSchema())
             return status;
-    } else if (version.value() != kSchemaVersion) {
+    } else if (version.value() < 1 || version.value() > kSchemaVersion) {
         return corrupt("schema version " + std::to_string(version.value()) + ", expected " +
                        std::to_string(kSchemaVersion));
     } else {
@@ -144,6 +144,10 @@ Status TremorStore::load() {
             std::string found = check.value();
             std::replace(found.begin(), found.end(), '\n', ' ');  // one log line
             return corrupt("quick check: " + found);
+        }
+        if (version.value() < kSchemaVersion) {
+            if (Status status = upgrade(version.value()))
+                return status;
         }
     }
     return readState();
@@ -188,6 +192,24 @@ Status TremorStore::createSchema() {
     if (Status status = txn->commit())
         return status;
     logInfo("Started a new event journal " + uuid.value() + " in " + dir_->path());
+    return std::nullopt;
+}
+
+Status TremorStore::upgrade(int64_t from) {
+    // Only the index changed: the journal, the roots and the document IDs stay as they are.
+    auto txn = db_->begin();
+    if (!txn)
+        return txn.error();
+    if (from == 1) {
+        if (Status status = db_->exec(InodeIndex::upgradeFromVersion1()))
+            return status;
+    }
+    if (Status status = db_->exec("PRAGMA user_version = " + std::to_string(kSchemaVersion)))
+        return status;
+    if (Status status = txn->commit())
+        return status;
+    logInfo("Upgraded the event journal in " + dir_->path() + " from schema " +
+            std::to_string(from) + " to " + std::to_string(kSchemaVersion));
     return std::nullopt;
 }
 
@@ -238,12 +260,39 @@ uint64_t TremorStore::commitCount() const {
     return db_->commitCount();
 }
 
+Status TremorStore::transact(const std::function<Status()>& work) {
+    std::lock_guard lock(mutex_);
+    const uint64_t nextEventId = nextEventId_;
+    Status status;
+    {
+        auto txn = db_->begin();
+        if (!txn)
+            return txn.error();
+        status = work();
+        if (!status)
+            status = txn->commit();
+    }  // rolled back unless committed
+    if (status) {
+        // The counters go back with the rows: IDs not written were never handed out.
+        nextEventId_ = nextEventId;
+        if (Status reloaded = index_->load())
+            logError("Cannot reread the document-ID counter: " + reloaded->description());
+    }
+    return status;
+}
+
 // ---- Journal ----
 
 Result<uint64_t> TremorStore::append(std::vector<JournalEvent>& events) {
     std::lock_guard lock(mutex_);
     if (events.empty())
         return nextEventId_ - 1;
+    if (events.size() > kLastEventId + 1 - nextEventId_) {
+        std::string description = "The event journal in " + dir_->path() +
+                                  " has used every event ID; it journals nothing more";
+        logError(description);
+        return Error(kPosixErrorDomain, EOVERFLOW, {{"description", std::move(description)}});
+    }
     auto txn = db_->begin();
     if (!txn)
         return txn.error();
@@ -481,6 +530,17 @@ std::optional<std::string> TremorStore::pathForInode(uint64_t inode) const {
 std::vector<InodeRecord> TremorStore::children(uint64_t parent) const {
     std::lock_guard lock(mutex_);
     auto result = index_->children(parent);
+    if (!result) {
+        logError(result.error().description());
+        return {};
+    }
+    return std::move(result).value();
+}
+
+std::vector<InodeRecord> TremorStore::childrenNamed(uint64_t parent,
+                                                    const std::string& name) const {
+    std::lock_guard lock(mutex_);
+    auto result = index_->childrenNamed(parent, name);
     if (!result) {
         logError(result.error().description());
         return {};

@@ -23,7 +23,7 @@ namespace tamber {
 // the watched trees (inode -> parent, name, kind) with the document IDs.
 //
 // Every call takes an internal mutex, so one writer thread and any number of readers may share
-// a store. replay() releases it while its callback runs.
+// a store. replay() releases it while its callback runs; transact() holds it throughout.
 //
 // Event IDs and document IDs come from counters kept in the database and updated in the same
 // transaction as the rows that use them: neither is ever handed out twice, whatever was
@@ -38,15 +38,17 @@ public:
         std::string reason;  // why not, for the log
     };
 
-    static constexpr int kSchemaVersion = 1;
+    // 2: the index keeps each entry's birth time, size and modification time.
+    static constexpr int kSchemaVersion = 2;
     static constexpr size_t kDefaultReplayChunk = 1000;
     static constexpr size_t kMaxPathComponents = InodeIndex::kMaxPathComponents;
     static constexpr const char* kDocumentIdRoot = "/.docid";
 
-    // Opens <stateDir>/<fsid as 16 hex digits>/journal.sqlite, creating it when missing. A
-    // database that cannot be used (not a database, failing its check, unknown schema) is
-    // logged, moved aside and replaced by a new store with a new UUID: anchors into the old
-    // history then fail the UUID check, which is what must happen.
+    // Opens <stateDir>/<fsid as 16 hex digits>/journal.sqlite, creating it when missing, and
+    // upgrades a database of an older schema in place. A database that cannot be used (not a
+    // database, failing its check, unknown schema) is logged, moved aside and replaced by a new
+    // store with a new UUID: anchors into the old history then fail the UUID check, which is
+    // what must happen.
     static Result<std::unique_ptr<TremorStore>> open(const std::string& stateDir, uint64_t fsid);
     ~TremorStore();
     TremorStore(const TremorStore&) = delete;
@@ -62,10 +64,21 @@ public:
     // Commits made by this store's connection; one append is one commit.
     uint64_t commitCount() const;
 
+    // Runs `work` as one transaction: the appends and index changes it makes from this thread are
+    // all written, or (when it or the commit fails) none is, and no ID it used is handed out
+    // again. Other threads wait until it is done. Roots must not change inside.
+    Status transact(const std::function<Status()>& work);
+
     // ---- Journal ----
 
     // Assigns consecutive IDs to `events` and writes them in one transaction. Returns the last
     // ID. On failure nothing is written and no ID is used up.
+    //
+    // IDs never wrap: past kLastEventId the journal refuses every append (EOVERFLOW, logged)
+    // rather than hand out an ID again, so kTremorEventIdsWrapped is never set. The limit is
+    // below 2^64 - 1 because SQLite keys are signed and because that value means "now" to
+    // streams; at a million events a second it is 290,000 years away.
+    static constexpr uint64_t kLastEventId = INT64_MAX - 1;
     Result<uint64_t> append(std::vector<JournalEvent>& events);
 
     // Calls `each` for every event with `sinceExclusive` < id <= lastEventId() at the start of
@@ -107,6 +120,8 @@ public:
     // the watched roots, broken or cyclic chains, or chains deeper than kMaxPathComponents.
     std::optional<std::string> pathForInode(uint64_t inode) const;
     std::vector<InodeRecord> children(uint64_t parent) const;
+    // The entries indexed under that name in `parent`: one, unless events were lost.
+    std::vector<InodeRecord> childrenNamed(uint64_t parent, const std::string& name) const;
 
     // ---- Document IDs ----
 
@@ -128,6 +143,7 @@ private:
     Status load();
     Status configure();
     Status createSchema();
+    Status upgrade(int64_t from);
     Status readState();
     Status fetch(Cursor& cursor, size_t chunk, uint64_t upTo);
 
@@ -135,7 +151,7 @@ private:
     std::unique_ptr<SqliteDatabase> db_;
     std::unique_ptr<WatchedRoots> roots_;  // uses db_
     std::unique_ptr<InodeIndex> index_;    // uses db_
-    mutable std::mutex mutex_;
+    mutable std::recursive_mutex mutex_;
     std::string uuid_;
     uint64_t nextEventId_ = 1;
     uint64_t oldestEventId_ = 1;

@@ -10,8 +10,8 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
-#include <filesystem>
 
+#include "platform/FileSystem.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -24,8 +24,20 @@ Error failure(int code, std::string description) {
 }
 
 bool exists(const std::string& path) {
-    struct stat st;
-    return ::lstat(path.c_str(), &st) == 0;
+    struct statx st {};
+    return FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &st) == 0;
+}
+
+// Like mkdir -p; 0 or the errno value of the first component that could not be made.
+int makeDirectories(const std::string& path) {
+    FileSystem& fs = FileSystem::current();
+    for (size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
+        std::string prefix = path.substr(0, slash);
+        if (!prefix.empty() && fs.mkdir(prefix, 0700) != 0 && errno != EEXIST)
+            return errno;
+        if (slash == std::string::npos)
+            return 0;
+    }
 }
 
 }  // namespace
@@ -36,27 +48,26 @@ Result<std::unique_ptr<TremorStoreDirectory>> TremorStoreDirectory::acquire(
     std::snprintf(name, sizeof name, "%016" PRIx64, fsid);
     std::string path = stateDir + "/" + name;
 
-    std::error_code ec;
-    std::filesystem::create_directories(path, ec);
-    if (ec) {
-        return failure(ec.value(),
-                       "Cannot create the Tamber state directory " + path + ": " + ec.message());
+    FileSystem& fs = FileSystem::current();
+    if (int code = makeDirectories(path)) {
+        return failure(
+            code, "Cannot create the Tamber state directory " + path + ": " + std::strerror(code));
     }
-    if (::access(path.c_str(), W_OK | X_OK) != 0) {
+    if (fs.faccessat(AT_FDCWD, path, W_OK | X_OK, 0) != 0) {
         int code = errno;
         return failure(code, "The Tamber state directory " + path +
                                  " is not writable: " + std::strerror(code));
     }
 
     std::string lockPath = path + "/lock";
-    int fd = ::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+    int fd = fs.open(lockPath, O_RDWR | O_CREAT | O_CLOEXEC, 0600);
     if (fd < 0) {
         int code = errno;
         return failure(code, "Cannot open the lock file " + lockPath + ": " + std::strerror(code));
     }
     if (::flock(fd, LOCK_EX | LOCK_NB) != 0) {
         int code = errno;
-        ::close(fd);
+        fs.close(fd);
         if (code == EWOULDBLOCK) {
             return failure(code, "Another Tamber process is using the state directory " + path);
         }
@@ -66,7 +77,7 @@ Result<std::unique_ptr<TremorStoreDirectory>> TremorStoreDirectory::acquire(
 }
 
 TremorStoreDirectory::~TremorStoreDirectory() {
-    ::close(lockFd_);  // closing the only descriptor releases the flock
+    FileSystem::current().close(lockFd_);  // closing the only descriptor releases the flock
 }
 
 bool TremorStoreDirectory::databaseExists() const {
@@ -85,7 +96,7 @@ Result<std::string> TremorStoreDirectory::moveDatabaseAside() {
         std::string source = from + suffix;
         if (!exists(source))
             continue;
-        if (::rename(source.c_str(), (to + suffix).c_str()) != 0) {
+        if (FileSystem::current().renameat2(AT_FDCWD, source, AT_FDCWD, to + suffix, 0) != 0) {
             int code = errno;
             return failure(code, "Cannot move " + source + " aside: " + std::strerror(code));
         }
@@ -98,7 +109,7 @@ void TremorStoreDirectory::removeOrphanedSidecars() {
         return;
     for (const char* suffix : {"-wal", "-shm"}) {
         std::string sidecar = databasePath() + suffix;
-        if (exists(sidecar) && ::unlink(sidecar.c_str()) != 0) {
+        if (exists(sidecar) && FileSystem::current().unlinkat(AT_FDCWD, sidecar, 0) != 0) {
             logError("Cannot remove " + sidecar + ": " + std::strerror(errno));
         }
     }

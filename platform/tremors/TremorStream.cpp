@@ -40,18 +40,20 @@ void TremorStream::setDispatchQueue(std::shared_ptr<DispatchQueue> queue) {
 }
 
 bool TremorStream::start() {
+    bool first;
     {
         std::lock_guard lock(mutex_);
-        if (started_ || invalidated_ || !queue_)
+        if (running_ || invalidated_ || !queue_)
             return false;
+        first = !everStarted_;
     }
-    if (options_.device) {
-        device_ = *options_.device;
-        if (!service_->storeForDevice(device_)) {
-            logError("No watched tree on device " + std::to_string(device_));
+    if (first && options_.device) {
+        if (!service_->storeForDevice(*options_.device)) {
+            logError("No watched tree on device " + std::to_string(*options_.device));
             return false;
         }
-    } else {
+        device_ = *options_.device;
+    } else if (first) {
         for (const auto& path : options_.paths) {
             // A stream for a tree nobody watched yet makes the service watch it.
             if (auto error = service_->watchTree(path)) {
@@ -73,19 +75,28 @@ bool TremorStream::start() {
         });
     uint64_t ceiling = store->lastEventId();
     std::shared_ptr<DispatchQueue> queue;
+    uint64_t since;
+    uint64_t run;
     {
         std::lock_guard lock(mutex_);
-        started_ = true;
+        if (first) {
+            everStarted_ = true;
+            historyOwed_ = options_.since != kSinceNow;
+            position_ = historyOwed_ ? options_.since : ceiling;
+        }
+        since = position_;
+        running_ = true;
+        run = ++run_;
         listener_ = token;
         ceiling_ = ceiling;
-        replaying_ = options_.since != kSinceNow;
+        replaying_ = historyOwed_ || since < ceiling;
         queue = queue_;
         // Live events heard before the ceiling was read are in the history already.
         std::erase_if(live_, [&](const JournalEvent& e) { return e.id <= ceiling; });
     }
     auto self = shared_from_this();
-    if (options_.since != kSinceNow)
-        queue->async([self, ceiling] { self->replay(ceiling); });
+    if (replaying_)
+        queue->async([self, since, ceiling, run] { self->replay(since, ceiling, run); });
     return true;
 }
 
@@ -101,44 +112,57 @@ void TremorStream::onAppended(uint32_t device, const std::vector<JournalEvent>& 
     if (device != device_)
         return;
     std::lock_guard lock(mutex_);
-    if (stopped_)
+    if (!running_)
         return;
     for (const auto& event : events) {
-        if ((!started_ || event.id > ceiling_) && matches(event))
+        if (event.id > ceiling_ && matches(event))
             live_.push_back(event);
     }
-    if (!replaying_ && started_ && !live_.empty())
+    if (!replaying_ && !live_.empty())
         scheduleFlush();
 }
 
-void TremorStream::replay(uint64_t ceiling) {
+void TremorStream::replay(uint64_t since, uint64_t ceiling, uint64_t run) {
     TremorStore* store = service_->storeForDevice(device_);
     if (!store)
         return;
-    auto check = store->replayability(options_.since, options_.paths);
+    auto check = store->replayability(since, options_.paths);
     if (!check.complete) {
         // Lost history is never hidden: the client rescans.
         logInfo("Replay for a stream is incomplete: " + check.reason);
-        deliver({{0, options_.paths.front(), 0, kTremorUserDropped | kTremorMustScanSubdirs}});
+        if (!deliver({{0, options_.paths.front(), 0, kTremorUserDropped | kTremorMustScanSubdirs}},
+                     run))
+            return;
     }
     std::vector<JournalEvent> batch;
+    bool going = true;
     auto status =
-        store->replay(options_.since, options_.paths, kReplayBatch, [&](const JournalEvent& event) {
+        store->replay(since, options_.paths, kReplayBatch, [&](const JournalEvent& event) {
             if (event.id > ceiling)
                 return false;  // it comes live
             batch.push_back(event);
             if (batch.size() >= kReplayBatch) {
-                deliver(batch);
+                going = deliver(batch, run);
                 batch.clear();
             }
-            return true;
+            return going;
         });
     if (status)
         logError("Replay failed: " + status->description());
-    deliver(batch);
-    deliver({{ceiling, options_.paths.front(), 0, kTremorHistoryDone}});
+    if (!going || !deliver(batch, run))
+        return;
+    bool owed;
+    {
+        std::lock_guard lock(mutex_);
+        owed = historyOwed_;
+    }
+    if (owed && !deliver({{ceiling, options_.paths.front(), 0, kTremorHistoryDone}}, run))
+        return;
     std::lock_guard lock(mutex_);
+    if (run != run_)
+        return;
     replaying_ = false;
+    position_ = std::max(position_, ceiling);
     if (!live_.empty())
         scheduleFlush();
 }
@@ -150,26 +174,39 @@ void TremorStream::scheduleFlush() {
     auto due = lastDelivery_ + std::chrono::duration_cast<DispatchQueue::Clock::duration>(
                                    std::chrono::duration<double>(options_.latency));
     auto self = shared_from_this();
-    queue_->asyncAt(std::max(due, DispatchQueue::Clock::now()), [self] { self->flush(); });
+    uint64_t run = run_;
+    queue_->asyncAt(std::max(due, DispatchQueue::Clock::now()), [self, run] { self->flush(run); });
 }
 
-void TremorStream::flush() {
+void TremorStream::flush(uint64_t run) {
     std::vector<JournalEvent> events;
     {
         std::lock_guard lock(mutex_);
+        if (run != run_)
+            return;
         flushScheduled_ = false;
+        if (replaying_)
+            return;  // the replay's end flushes them, after the history
         events = std::move(live_);
         live_.clear();
     }
-    deliver(events);
+    deliver(events, run);
 }
 
-void TremorStream::deliver(const std::vector<JournalEvent>& events) {
+bool TremorStream::deliver(const std::vector<JournalEvent>& events, uint64_t run) {
     {
         std::lock_guard lock(mutex_);
-        if (stopped_ || events.empty())
-            return;
+        if (!running_ || run != run_)
+            return false;
+        if (events.empty())
+            return true;
         lastDelivery_ = DispatchQueue::Clock::now();
+        // Counted as delivered now: a stop from here on no longer keeps the call from happening.
+        for (const auto& event : events) {
+            position_ = std::max(position_, event.id);  // 0 for a lost-history notice
+            if (event.flags & kTremorHistoryDone)
+                historyOwed_ = false;
+        }
     }
     bool extended = (options_.flags & kTremorCreateUseExtendedData) != 0;
     std::vector<ObjectRef> paths;
@@ -189,16 +226,20 @@ void TremorStream::deliver(const std::vector<JournalEvent>& events) {
     }
     ObjectRef array = Array::make(std::move(paths));
     options_.callback(this, options_.context.info, events.size(), array, flags.data(), ids.data());
+    return true;
 }
 
 void TremorStream::stop() {
     uint64_t token = 0;
     {
         std::lock_guard lock(mutex_);
-        stopped_ = true;
+        running_ = false;
+        ++run_;
+        replaying_ = false;
+        flushScheduled_ = false;
         token = listener_;
         listener_ = 0;
-        live_.clear();
+        live_.clear();  // not delivered: a restart replays them
     }
     if (token)
         service_->removeListener(token);

@@ -32,6 +32,9 @@ using TremorStreamCallback = void (*)(TremorStreamRef stream, void* info, size_t
 // one history-done event, then live events, delivered on its queue in batches at most once per
 // latency. It listens before it replays, so that nothing falls between the two and nothing
 // arrives twice.
+//
+// Stopped and started again, it goes on after the last event it delivered: what was journaled
+// meanwhile is replayed (the history-done event is not sent twice), then live events follow.
 class TremorStream : public std::enable_shared_from_this<TremorStream> {
 public:
     static constexpr uint64_t kSinceNow = UINT64_MAX;
@@ -66,10 +69,11 @@ public:
 private:
     bool matches(const JournalEvent& event) const;
     void onAppended(uint32_t device, const std::vector<JournalEvent>& events);
-    void replay(uint64_t ceiling);
+    void replay(uint64_t since, uint64_t ceiling, uint64_t run);
     void scheduleFlush();
-    void flush();
-    void deliver(const std::vector<JournalEvent>& events);
+    void flush(uint64_t run);
+    // Calls the client unless the run is over; false when it is.
+    bool deliver(const std::vector<JournalEvent>& events, uint64_t run);
 
     const std::shared_ptr<TremorService> service_;
     Options options_;
@@ -78,12 +82,16 @@ private:
     std::mutex mutex_;
     std::shared_ptr<DispatchQueue> queue_;
     uint32_t device_ = 0;
-    bool started_ = false;
-    bool stopped_ = false;
+    bool everStarted_ = false;
+    bool running_ = false;
     bool invalidated_ = false;
     bool replaying_ = false;
+    bool historyOwed_ = false;  // the history-done event is still to be sent
     bool flushScheduled_ = false;
-    uint64_t ceiling_ = 0;  // replayed up to here; live events start after it
+    // Each start and stop begins a new run; work queued by an earlier run then does nothing.
+    uint64_t run_ = 0;
+    uint64_t ceiling_ = 0;   // replayed up to here; live events start after it
+    uint64_t position_ = 0;  // every event up to here was delivered or passed over
     uint64_t listener_ = 0;
     std::vector<JournalEvent> live_;
     DispatchQueue::Clock::time_point lastDelivery_{};

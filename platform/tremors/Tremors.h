@@ -22,6 +22,8 @@ TremorStreamRef TremorStreamCreateRelativeToDevice(
     const std::vector<std::string>& pathsRelativeToDevice, uint64_t sinceWhen,
     double latencySeconds, uint32_t flags);
 void TremorStreamSetDispatchQueue(TremorStreamRef stream, std::shared_ptr<DispatchQueue> queue);
+// False when the stream is running, invalidated, has no queue or its trees cannot be watched.
+// A stopped stream may be started again: it goes on after the last event it delivered.
 bool TremorStreamStart(TremorStreamRef stream);
 void TremorStreamStop(TremorStreamRef stream);
 void TremorStreamInvalidate(TremorStreamRef stream);
