@@ -1,14 +1,17 @@
 #include "items/ExtendedAttributes.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
-#include <cerrno>
-
-#include "host/UrlOperations.h"
+#include "items/ItemMetadata.h"
+#include "items/LocalItem.h"
 #include "platform/FaultInjectingFileSystem.h"
 #include "platform/LinuxFileSystem.h"
+#include "platform/Tag.h"
+#include "platform/archive/KeyedArchiver.h"
+#include "platform/objects/Array.h"
 #include "tests/common/ScopedFileSystem.h"
 #include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
@@ -16,31 +19,12 @@
 namespace tamber {
 namespace {
 
-using testing::ScopedFileSystem;
 using testing::ScopedLogCapture;
-using testing::TempDir;
 using Op = FaultInjectingFileSystem::Operation;
 
 const std::string kName = "com.velk.test#PS";
 
-// Lets the size query through and fails the copy, as when the attribute vanishes in between.
-class FailingCopyFileSystem : public FaultInjectingFileSystem {
-public:
-    explicit FailingCopyFileSystem(int error)
-        : FaultInjectingFileSystem(std::make_shared<LinuxFileSystem>()), error_(error) {}
-    ssize_t lgetxattr(const std::string& path, const std::string& name, void* value,
-                      size_t size) override {
-        if (value) {
-            errno = error_;
-            return -1;
-        }
-        return FaultInjectingFileSystem::lgetxattr(path, name, value, size);
-    }
-
-private:
-    int error_;
-};
-
+// A file that takes user attributes, on a fault-injecting file system.
 class ExtendedAttributesTest : public ::testing::Test {
 protected:
     void SetUp() override {
@@ -48,76 +32,44 @@ protected:
         if (::setxattr(file.path().c_str(), "user.probe", "1", 1, 0) != 0 && errno == ENOTSUP)
             GTEST_SKIP() << "no user attributes on this file system";
     }
-    Status write(const std::optional<Bytes>& data, const std::string& name = kName) {
-        return WriteXattrAtURL(file, data, name);
+
+    void store(const std::string& name, const ObjectRef& object) {
+        auto data = KeyedArchiver::archivedDataWithRootObject(object);
+        ASSERT_TRUE(data.ok());
+        ASSERT_FALSE(WriteXattrAtURL(file, data.value(), name).has_value());
     }
 
-    TempDir dir;
+    testing::TempDir dir;
     Url file;
+    std::shared_ptr<FaultInjectingFileSystem> fs =
+        std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    testing::ScopedFileSystem scoped{fs};
 };
 
-TEST_F(ExtendedAttributesTest, MissingAttributeReadsAsNothingAndLogsNothing) {
+TEST_F(ExtendedAttributesTest, RoundTripAndMissingAttributesAreSilent) {
     ScopedLogCapture log;
     EXPECT_FALSE(ReadXattrData(kName, file).has_value());
-    EXPECT_TRUE(log->lines().empty());
-}
-
-TEST_F(ExtendedAttributesTest, SetReadRemoveRoundTrip) {
-    ScopedLogCapture log;
     Bytes value{0, 1, 2, 0xff, 0};
-    ASSERT_FALSE(write(value).has_value());
+    ASSERT_FALSE(WriteXattrAtURL(file, value, kName).has_value());
     EXPECT_EQ(ReadXattrData(kName, file), value);
-    // Stored in the user namespace under the same name.
-    char raw[16];
+    char raw[16];  // stored in the user namespace under the same name
     EXPECT_EQ(::getxattr(file.path().c_str(), ("user." + kName).c_str(), raw, sizeof raw), 5);
-
-    ASSERT_FALSE(write(std::nullopt).has_value());
+    ASSERT_FALSE(WriteXattrAtURL(file, std::nullopt, kName).has_value());
     EXPECT_FALSE(ReadXattrData(kName, file).has_value());
-    // Removing what is not there is not an error, and says nothing.
-    EXPECT_FALSE(write(std::nullopt).has_value());
+    EXPECT_FALSE(WriteXattrAtURL(file, std::nullopt, kName).has_value());
     EXPECT_TRUE(log->lines().empty());
 }
 
-TEST_F(ExtendedAttributesTest, ZeroLengthAttributeReadsAsEmptyData) {
-    ASSERT_FALSE(write(Bytes{}).has_value());
-    auto data = ReadXattrData(kName, file);
-    ASSERT_TRUE(data.has_value());
-    EXPECT_TRUE(data->empty());
-}
-
-TEST_F(ExtendedAttributesTest, FoldersTakeAttributesToo) {
-    Url folder = Url::fileURLWithPath(dir.makeDir("folder"));
-    ASSERT_FALSE(WriteXattrAtURL(folder, Bytes{7}, kName).has_value());
-    EXPECT_EQ(ReadXattrData(kName, folder), Bytes{7});
-}
-
-TEST_F(ExtendedAttributesTest, SymbolicLinkIsReadItselfNotItsTarget) {
-    ASSERT_FALSE(write(Bytes{1}).has_value());
-    std::string link = dir / "link";
-    ASSERT_EQ(::symlink(file.path().c_str(), link.c_str()), 0);
+TEST_F(ExtendedAttributesTest, ReadFailureLevels) {
+    {
+        ScopedLogCapture log;
+        EXPECT_FALSE(ReadXattrData(kName, Url::fileURLWithPath(dir / "gone.txt")).has_value());
+        ASSERT_EQ(log->texts(), std::vector<std::string>{"[DEBUG] can't get xattr " + kName + "; " +
+                                                         Error::posix(ENOENT).description()});
+        EXPECT_EQ(log->lines()[0].level, LogLevel::Debug);
+    }
     ScopedLogCapture log;
-    EXPECT_FALSE(ReadXattrData(kName, Url::fileURLWithPath(link)).has_value());
-    EXPECT_TRUE(log->lines().empty());
-    // And writes never go through it either.
-    EXPECT_TRUE(WriteXattrAtURL(Url::fileURLWithPath(link), Bytes{2}, kName).has_value());
-    EXPECT_EQ(ReadXattrData(kName, file), Bytes{1});
-}
-
-TEST_F(ExtendedAttributesTest, VanishedFileLogsAtDebugLevelOnly) {
-    Url gone = Url::fileURLWithPath(dir / "gone.txt");
-    ScopedLogCapture log;
-    EXPECT_FALSE(ReadXattrData(kName, gone).has_value());
-    ASSERT_EQ(log->lines().size(), 1u);
-    EXPECT_EQ(log->lines()[0].level, LogLevel::Debug);
-    EXPECT_EQ(log->lines()[0].text,
-              "[DEBUG] can't get xattr " + kName + "; " + Error::posix(ENOENT).description());
-}
-
-TEST_F(ExtendedAttributesTest, OtherReadFailuresLogAtErrorLevel) {
-    auto fs = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
-    ScopedFileSystem scoped(fs);
     fs->inject(Op::Lgetxattr, EIO);
-    ScopedLogCapture log;
     EXPECT_FALSE(ReadXattrData(kName, file).has_value());
     EXPECT_EQ(
         log->count("[ERROR] can't get xattr " + kName + "; " + Error::posix(EIO).description(),
@@ -125,81 +77,74 @@ TEST_F(ExtendedAttributesTest, OtherReadFailuresLogAtErrorLevel) {
         1u);
 }
 
-TEST_F(ExtendedAttributesTest, FailedCopyLogsWithItsOwnTextAndLevelRule) {
-    ASSERT_FALSE(write(Bytes{1, 2}).has_value());
-    for (auto [error, level] : {std::pair{ENOENT, LogLevel::Debug}, {ERANGE, LogLevel::Error}}) {
-        ScopedFileSystem scoped(std::make_shared<FailingCopyFileSystem>(error));
-        ScopedLogCapture log;
-        EXPECT_FALSE(ReadXattrData(kName, file).has_value());
-        ASSERT_EQ(log->lines().size(), 1u);
-        EXPECT_EQ(log->lines()[0].level, level);
-        std::string prefix = level == LogLevel::Debug ? "[DEBUG] " : "[ERROR] ";
-        EXPECT_EQ(log->lines()[0].text, prefix + "can't copy data for xattr " + kName + "; " +
-                                            Error::posix(error).description());
-    }
-}
-
 TEST_F(ExtendedAttributesTest, RefusedSetIsDebugOtherFailuresAreErrors) {
-    auto fs = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
-    ScopedFileSystem scoped(fs);
     int fd = ::open(file.path().c_str(), O_RDONLY);
     ASSERT_GE(fd, 0);
     struct Case {
         Op op;
         int error;
-        std::optional<Bytes> data;
         std::string line;
     };
-    std::vector<Case> cases = {
-        {Op::Fsetxattr, EACCES, Bytes{1},
-         "[DEBUG] can't set xattr \"" + kName + "\"; " + Error::posix(EACCES).description()},
-        {Op::Fsetxattr, ENOSPC, Bytes{1},
-         "[ERROR] can't set xattr \"" + kName + "\"; " + Error::posix(ENOSPC).description()},
-        {Op::Fremovexattr, EACCES, std::nullopt,
-         "[DEBUG] can't remove xattr \"" + kName + "\"; " + Error::posix(EACCES).description()},
-        {Op::Fremovexattr, EIO, std::nullopt,
-         "[ERROR] can't remove xattr \"" + kName + "\"; " + Error::posix(EIO).description()},
-    };
-    for (const auto& c : cases) {
+    for (const auto& c : std::vector<Case>{
+             {Op::Fsetxattr, EACCES, "[DEBUG] can't set xattr \""},
+             {Op::Fsetxattr, ENOSPC, "[ERROR] can't set xattr \""},
+             {Op::Fremovexattr, EACCES, "[DEBUG] can't remove xattr \""},
+             {Op::Fremovexattr, EIO, "[ERROR] can't remove xattr \""},
+         }) {
         ScopedLogCapture log;
         fs->inject(c.op, c.error);
-        Status status = SetOrRemoveXattr(fd, c.data, kName);
+        auto data = c.op == Op::Fsetxattr ? std::optional(Bytes{1}) : std::nullopt;
+        Status status = SetOrRemoveXattr(fd, data, kName);
         ASSERT_TRUE(status.has_value()) << c.line;
         EXPECT_EQ(*status, Error::posix(c.error));
-        EXPECT_EQ(log->texts(), std::vector<std::string>{c.line});
+        EXPECT_EQ(log->texts(), std::vector<std::string>{c.line + kName + "\"; " +
+                                                         Error::posix(c.error).description()});
     }
     ::close(fd);
 }
 
-TEST_F(ExtendedAttributesTest, FileSystemWithoutUserAttributesGivesAnErrorValue) {
-    auto fs = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
-    ScopedFileSystem scoped(fs);
-    fs->inject(Op::Fsetxattr, ENOTSUP);
-    ScopedLogCapture log;
-    Status status = write(Bytes{1});
-    ASSERT_TRUE(status.has_value());
-    EXPECT_EQ(*status, Error::posix(ENOTSUP));
-    EXPECT_EQ(log->count("[ERROR] can't set xattr " + kName + " on " + file.absoluteString() +
-                             "; " + Error::posix(ENOTSUP).description(),
-                         LogLevel::Error),
-              1u);
+TEST_F(ExtendedAttributesTest, MetadataReadsBackAndOnlyNothingRemovesIt) {
+    ASSERT_FALSE(ItemMetadata::writeTagData(
+        file, GetTagsDataForTags({Tag::make("Red", 6), Tag::make("Home", 0)})));
+    ASSERT_FALSE(ItemMetadata::writeLastUsedDate(file, Date::make(1700000000.25)));
+    ASSERT_FALSE(ItemMetadata::writeFavoriteRank(file, Number::fromInt64(-3)));
+    ItemMetadata m = ItemMetadata::read(file);
+    ASSERT_TRUE(m.lastUsedDate && m.favoriteRank && m.tagData);
+    EXPECT_EQ(m.lastUsedDate->timeIntervalSince1970(), 1700000000.25);
+    EXPECT_EQ(m.favoriteRank->int64Value(), -3);
+    // Tags are stored as labels: colours are dropped, order is kept.
+    EXPECT_EQ(m.tagLabels, (std::vector<std::string>{"Red", "Home"}));
+    auto tags = GetTagsFromTagsData(*m.tagData);
+    ASSERT_TRUE(tags && tags->size() == 2);
+    EXPECT_EQ((*tags)[0]->colour(), 0);
+
+    ASSERT_FALSE(ItemMetadata::writeLastUsedDate(file, nullptr));
+    ASSERT_FALSE(ItemMetadata::writeFavoriteRank(file, nullptr));
+    // Garbage tag data writes an empty list, never removes.
+    ASSERT_FALSE(ItemMetadata::writeTagData(file, Bytes{1, 2}));
+    m = ItemMetadata::read(file);
+    EXPECT_FALSE(m.lastUsedDate || m.favoriteRank);
+    EXPECT_TRUE(ReadXattrData(LocalItem::xattrTagDataName(), file).has_value());
+    EXPECT_EQ(ItemMetadata::readTagLabels(file), std::vector<std::string>{});
 }
 
-TEST_F(ExtendedAttributesTest, WriteToMissingFileReportsTheOpenFailure) {
-    Url gone = Url::fileURLWithPath(dir / "missing.txt");
-    ScopedLogCapture log;
-    Status status = WriteXattrAtURL(gone, Bytes{1}, kName);
-    ASSERT_TRUE(status.has_value());
-    EXPECT_EQ(*status, Error::posix(ENOENT));
-    EXPECT_EQ(log->countStartingWith("[ERROR] can't set xattr " + kName + " on "), 1u);
-}
+TEST_F(ExtendedAttributesTest, ValuesOfTheWrongClassOrGarbageReadAsAbsent) {
+    store(LocalItem::xattrLastUsedDateName(), String::make("yesterday"));
+    store(LocalItem::xattrFavoriteRankName(), Date::make(1));
+    store(LocalItem::xattrTagDataName(), Array::make({Number::fromInt64(1)}));
+    ASSERT_FALSE(WriteXattrAtURL(file, Bytes{'b', 'p', 'l', 'i', 's', 't'},
+                                 LocalItem::xattrTrashPutBackName()));
+    ItemMetadata m = ItemMetadata::read(file);
+    EXPECT_FALSE(m.lastUsedDate || m.favoriteRank || m.putBack);
+    EXPECT_FALSE(m.tagLabels.has_value() || m.tagData.has_value());
 
-TEST(PosixErrorTest, TakesErrnoAndIgnoresItsArgument) {
-    errno = ENOENT;
-    Error error = Error::errorWithPOSIXCode(99);
-    EXPECT_EQ(error.domain(), kPosixErrorDomain);
-    EXPECT_EQ(error.code(), ENOENT);
-    EXPECT_TRUE(Error::errorFileWriteNoPermission().is(kHostPlatformErrorDomain, 513));
+    store(LocalItem::xattrTrashDateName(), String::make("not a date"));
+    ScopedLogCapture log;
+    EXPECT_FALSE(ItemMetadata::readTrashDate(file));
+    ASSERT_EQ(log->lines().size(), 1u);
+    EXPECT_EQ(log->lines()[0].level, LogLevel::Error);
+    EXPECT_EQ(log->countStartingWith("[ERROR] got "), 1u);
+    EXPECT_NE(log->lines()[0].text.find("invalidResultingClass"), std::string::npos);
 }
 
 }  // namespace

@@ -3,7 +3,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <ctime>
 #include <fstream>
 #include <memory>
 
@@ -38,25 +37,22 @@ protected:
         auto s = objectCast<String>(value(url, key));
         return s ? s->value() : "<not a string>";
     }
-    std::optional<uint64_t> unsignedValue(const Url& url, ResourceKey key) {
+    // Numbers must be of `kind`: booleans and counts are told apart.
+    std::optional<uint64_t> number(const Url& url, ResourceKey key,
+                                   Number::Kind kind = Number::Kind::Unsigned) {
         auto n = objectCast<Number>(value(url, key));
         if (!n)
             return std::nullopt;
-        EXPECT_EQ(n->kind(), Number::Kind::Unsigned) << key;
+        EXPECT_EQ(n->kind(), kind) << key;
         return n->uint64Value();
     }
-    std::optional<bool> boolValue(const Url& url, ResourceKey key) {
-        auto n = objectCast<Number>(value(url, key));
-        if (!n)
-            return std::nullopt;
-        EXPECT_EQ(n->kind(), Number::Kind::Boolean) << key;
-        return n->boolValue();
+    std::optional<uint64_t> flag(const Url& url, ResourceKey key) {
+        return number(url, key, Number::Kind::Boolean);
     }
-
-    static struct stat lstatOf(const std::string& path) {
+    static uint64_t inode(const std::string& path) {
         struct stat st {};
         EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
-        return st;
+        return st.st_ino;
     }
 
     testing::TempDir dir_;
@@ -64,120 +60,75 @@ protected:
     testing::ScopedFileSystem scoped_;
 };
 
-TEST_F(UrlResourceValuesTest, RegularFile) {
+TEST_F(UrlResourceValuesTest, FilesFoldersPackagesAndLinks) {
     std::string path = dir_.writeFile("notes/Report.PDF", "12345");
     struct timespec times[2] = {{0, UTIME_OMIT}, {1700000000, 250000000}};
     ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
     ASSERT_EQ(::link(path.c_str(), (dir_ / "notes/hardlink").c_str()), 0);
     Url url = Url::fileURLWithPath(path);
-
     EXPECT_EQ(stringValue(url, K::kName), "Report.PDF");
-    EXPECT_EQ(stringValue(url, K::kLocalizedName), "Report.PDF");
     EXPECT_EQ(stringValue(url, K::kTypeIdentifier), "public.pdf");
-    EXPECT_EQ(unsignedValue(url, K::kFileSize), 5u);
-    EXPECT_EQ(unsignedValue(url, K::kLinkCount), 2u);
-    EXPECT_EQ(unsignedValue(url, K::kFileID), lstatOf(path).st_ino);
-    EXPECT_EQ(boolValue(url, K::kIsDirectory), false);
-    EXPECT_EQ(boolValue(url, K::kIsSymbolicLink), false);
-    EXPECT_EQ(boolValue(url, K::kIsPackage), false);
-    EXPECT_EQ(boolValue(url, K::kIsReadable), true);
-    EXPECT_EQ(boolValue(url, K::kIsWritable), true);
-
+    EXPECT_EQ(number(url, K::kFileSize), 5u);
+    EXPECT_EQ(number(url, K::kLinkCount), 2u);
+    EXPECT_EQ(number(url, K::kFileID), inode(path));
+    EXPECT_EQ(flag(url, K::kIsDirectory), 0u);
+    EXPECT_EQ(flag(url, K::kIsReadable), 1u);
     auto modified = objectCast<Date>(value(url, K::kContentModificationDate));
     ASSERT_TRUE(modified);
     EXPECT_NEAR(modified->timeIntervalSince1970(), 1700000000.25, 1e-6);
-
     auto parent = objectCast<UrlObject>(value(url, K::kParentDirectoryURL));
     ASSERT_TRUE(parent);
     EXPECT_EQ(parent->url(), Url::fileURLWithPath(dir_ / "notes"));
+    EXPECT_EQ(value(url, K::kDocumentID), nullptr) << "no document ID until one is provided";
 
-    // The creation date is there exactly when the file system reports birth times.
-    struct statx st {};
-    ASSERT_EQ(::statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BTIME, &st), 0);
-    ObjectRef created = value(url, K::kCreationDate);
-    if (st.stx_mask & STATX_BTIME) {
-        ASSERT_TRUE(objectCast<Date>(created));
-        EXPECT_NEAR(objectCast<Date>(created)->timeIntervalSince1970(),
-                    double(st.stx_btime.tv_sec) + st.stx_btime.tv_nsec / 1e9, 1e-6);
-    } else {
-        EXPECT_EQ(created, nullptr);
-    }
-
-    // Nothing is cached for the document ID until something provides one.
-    EXPECT_EQ(value(url, K::kDocumentID), nullptr);
-}
-
-TEST_F(UrlResourceValuesTest, FoldersAndPackages) {
-    Url folder = Url::fileURLWithPath(dir_.makeDir("Plain.folder"));
-    EXPECT_EQ(stringValue(folder, K::kTypeIdentifier), "public.folder");
-    EXPECT_EQ(boolValue(folder, K::kIsDirectory), true);
-    EXPECT_EQ(boolValue(folder, K::kIsPackage), false);
-    EXPECT_EQ(value(folder, K::kFileSize), nullptr);
-
+    // Both package families are packages only as folders; a link is never one.
     dir_.writeFile("Talk.Lumen/slides.json", "{}");
-    Url package = Url::fileURLWithPath(dir_ / "Talk.Lumen");
-    EXPECT_EQ(stringValue(package, K::kTypeIdentifier), "com.velk.lumen.presentation");
-    EXPECT_EQ(boolValue(package, K::kIsDirectory), true);
-    EXPECT_EQ(boolValue(package, K::kIsPackage), true);
-    EXPECT_EQ(value(package, K::kFileSize), nullptr);
-
-    // A plain file with a package name is not a package.
-    Url fake = Url::fileURLWithPath(dir_.writeFile("file.lumen", "x"));
-    EXPECT_EQ(boolValue(fake, K::kIsPackage), false);
-    EXPECT_EQ(stringValue(fake, K::kTypeIdentifier), "public.data");
-
-    Url root = Url::fileURLWithPath("/");
-    EXPECT_EQ(value(root, K::kParentDirectoryURL), nullptr);
-    EXPECT_EQ(stringValue(root, K::kName), "/");
-}
-
-TEST_F(UrlResourceValuesTest, SymbolicLinksDescribeThemselves) {
-    dir_.writeFile("Target.lumen/content", "0123456789");
-    std::string link = dir_ / "link.lumen";
-    ASSERT_EQ(::symlink((dir_ / "Target.lumen").c_str(), link.c_str()), 0);
-    Url url = Url::fileURLWithPath(link);
-    EXPECT_EQ(stringValue(url, K::kTypeIdentifier), "public.symlink");
-    EXPECT_EQ(boolValue(url, K::kIsSymbolicLink), true);
-    EXPECT_EQ(boolValue(url, K::kIsDirectory), false);
-    EXPECT_EQ(boolValue(url, K::kIsPackage), false);
-    EXPECT_EQ(unsignedValue(url, K::kFileID), lstatOf(link).st_ino);
-    // A link's size is the length of what it points to.
-    EXPECT_EQ(unsignedValue(url, K::kFileSize), (dir_ / "Target.lumen").size());
-
-    std::string dangling = dir_ / "dangling";
-    ASSERT_EQ(::symlink("does/not/exist", dangling.c_str()), 0);
-    Url danglingUrl = Url::fileURLWithPath(dangling);
-    EXPECT_EQ(boolValue(danglingUrl, K::kIsSymbolicLink), true);
-    EXPECT_EQ(unsignedValue(danglingUrl, K::kFileSize), std::string("does/not/exist").size());
-    EXPECT_EQ(boolValue(danglingUrl, K::kIsReadable), true);
-    EXPECT_EQ(stringValue(danglingUrl, K::kTypeIdentifier), "public.symlink");
+    dir_.writeFile("Song.resona/track", "x");
+    dir_.makeDir("Plain.folder");
+    dir_.writeFile("file.lumen", "x");
+    ASSERT_EQ(::symlink((dir_ / "Talk.Lumen").c_str(), (dir_ / "link.lumen").c_str()), 0);
+    const std::tuple<const char*, const char*, uint64_t> kinds[] = {
+        {"Talk.Lumen", "com.velk.lumen.presentation", 1},
+        {"Song.resona", "com.velk.resona.song", 1},
+        {"Plain.folder", "public.folder", 0},
+        {"file.lumen", "public.data", 0},
+        {"link.lumen", "public.symlink", 0},
+    };
+    for (const auto& [name, type, isPackage] : kinds) {
+        Url item = Url::fileURLWithPath(dir_ / name);
+        EXPECT_EQ(stringValue(item, K::kTypeIdentifier), type) << name;
+        EXPECT_EQ(flag(item, K::kIsPackage), isPackage) << name;
+    }
+    Url link = Url::fileURLWithPath(dir_ / "link.lumen");
+    EXPECT_EQ(flag(link, K::kIsSymbolicLink), 1u);
+    EXPECT_EQ(flag(link, K::kIsDirectory), 0u);
+    EXPECT_EQ(number(link, K::kFileSize), (dir_ / "Talk.Lumen").size()) << "the target's length";
+    EXPECT_EQ(value(Url::fileURLWithPath(dir_ / "Talk.Lumen"), K::kFileSize), nullptr);
+    EXPECT_EQ(value(Url::fileURLWithPath("/"), K::kParentDirectoryURL), nullptr);
 }
 
 TEST_F(UrlResourceValuesTest, MissingFilesAndFailures) {
     for (std::string path : {dir_ / "absent", dir_.writeFile("file") + "/below"}) {
-        Url url = Url::fileURLWithPath(path);
-        for (ResourceKey key : {K::kName, K::kFileSize, K::kIsDirectory}) {
-            Result<ObjectRef> result = url.resourceValue(key);
-            ASSERT_FALSE(result.ok()) << path << " " << key;
-            EXPECT_TRUE(result.error().is(kHostPlatformErrorDomain, kHostPlatformFileNoSuchFile));
-            EXPECT_EQ(result.error().userInfo().at("path"), path);
-        }
-        std::optional<Error> prefetch = url.prefetchResourceValues({K::kFileSize});
+        Result<ObjectRef> result = Url::fileURLWithPath(path).resourceValue(K::kFileSize);
+        ASSERT_FALSE(result.ok()) << path;
+        EXPECT_TRUE(result.error().is(kHostPlatformErrorDomain, kHostPlatformFileNoSuchFile));
+        EXPECT_EQ(result.error().userInfo().at("path"), path);
+        std::optional<Error> prefetch =
+            Url::fileURLWithPath(path).prefetchResourceValues({K::kName});
         ASSERT_TRUE(prefetch);
         EXPECT_EQ(prefetch->code(), kHostPlatformFileNoSuchFile);
     }
 
     Url file = Url::fileURLWithPath(dir_.writeFile("present", "abc"));
     fs_->inject(Op::Statx, EIO);
-    Result<ObjectRef> failed = file.resourceValue(K::kFileSize);
-    ASSERT_FALSE(failed.ok());
-    EXPECT_TRUE(failed.error().is(kPosixErrorDomain, EIO));
-    // The failure was not cached: the next read reaches the disk and succeeds.
-    EXPECT_EQ(unsignedValue(file, K::kFileSize), 3u);
+    std::optional<Error> failed = file.prefetchResourceValues({K::kFileSize});
+    ASSERT_TRUE(failed);
+    EXPECT_TRUE(failed->is(kPosixErrorDomain, EIO));
+    EXPECT_EQ(number(file, K::kFileSize), 3u) << "the failure was not cached";
 
     // Access checks: a denial is "no", any other failure an error.
     fs_->inject(Op::Faccessat, EACCES);
-    EXPECT_EQ(boolValue(file, K::kIsWritable), false);
+    EXPECT_EQ(flag(file, K::kIsWritable), 0u);
     fs_->inject(Op::Faccessat, EIO);
     Result<ObjectRef> access = file.resourceValue(K::kIsReadable);
     ASSERT_FALSE(access.ok());
@@ -189,53 +140,47 @@ TEST_F(UrlResourceValuesTest, MissingFilesAndFailures) {
     ASSERT_FALSE(Url::parse("https://example.invalid/")->resourceValue(K::kName).ok());
 }
 
-TEST_F(UrlResourceValuesTest, CachedValuesStayUntilRemoved) {
+TEST_F(UrlResourceValuesTest, CachedValuesServeLaterReadsUntilRemoved) {
     std::string path = dir_.writeFile("grows.txt", "ab");
     Url url = Url::fileURLWithPath(path);
     Url copy = url;
-    EXPECT_EQ(unsignedValue(url, K::kFileSize), 2u);
-    EXPECT_EQ(boolValue(url, K::kIsDirectory), false);
-
+    fs_->resetCalls();
+    ASSERT_FALSE(url.prefetchResourceValues({K::kFileSize, K::kIsDirectory, K::kFileSize}));
+    EXPECT_EQ(fs_->calls(Op::Statx), 1u);
     std::ofstream(path, std::ios::app) << "cdef";
-    EXPECT_EQ(unsignedValue(url, K::kFileSize), 2u);
-    EXPECT_EQ(unsignedValue(copy, K::kFileSize), 2u) << "copies share the cache";
+    EXPECT_EQ(number(url, K::kFileSize), 2u);
+    EXPECT_EQ(number(copy, K::kFileSize), 2u) << "copies share the cache";
+    EXPECT_EQ(flag(url, K::kIsDirectory), 0u);
+    ASSERT_FALSE(url.prefetchResourceValues({K::kFileSize}));
+    EXPECT_EQ(fs_->calls(Op::Statx), 1u) << "cached values need no system call";
     // A URL made anew, even for the same path, and a derived one start empty.
-    EXPECT_EQ(unsignedValue(Url::fileURLWithPath(path), K::kFileSize), 6u);
-    EXPECT_EQ(unsignedValue(url.deletingLastPathComponent().appendingPathComponent("grows.txt"),
-                            K::kFileSize),
-              6u);
+    EXPECT_EQ(number(Url::fileURLWithPath(path), K::kFileSize), 6u);
+    EXPECT_EQ(
+        number(url.deletingLastPathComponent().appendingPathComponent("grows.txt"), K::kFileSize),
+        6u);
+    EXPECT_EQ(fs_->calls(Op::Statx), 3u);
 
     copy.removeCachedResourceValue(K::kFileSize);
-    EXPECT_EQ(unsignedValue(url, K::kFileSize), 6u);
-
-    // Removing everything drops the other keys too.
+    EXPECT_EQ(number(url, K::kFileSize), 6u);
     ASSERT_EQ(::unlink(path.c_str()), 0);
     ASSERT_EQ(::mkdir(path.c_str(), 0755), 0);
-    EXPECT_EQ(boolValue(url, K::kIsDirectory), false);
+    EXPECT_EQ(flag(url, K::kIsDirectory), 0u);
     url.removeAllCachedResourceValues();
-    EXPECT_EQ(boolValue(url, K::kIsDirectory), true);
-    EXPECT_EQ(value(url, K::kFileSize), nullptr);
-}
+    EXPECT_EQ(flag(url, K::kIsDirectory), 1u);
 
-TEST_F(UrlResourceValuesTest, OnlyIdentifiersCanBeSetAndTheyStayInMemory) {
-    Url url = Url::fileURLWithPath(dir_.writeFile("ids"));
+    // Only identifiers can be set, and they stay in memory.
     fs_->resetCalls();
     EXPECT_FALSE(url.setResourceValue(Number::fromUInt64(4242), K::kFileID));
     EXPECT_FALSE(url.setResourceValue(Number::fromUInt64(17), K::kDocumentID));
-    EXPECT_EQ(unsignedValue(url, K::kFileID), 4242u);
-    EXPECT_EQ(unsignedValue(url, K::kDocumentID), 17u);
+    EXPECT_EQ(number(url, K::kFileID), 4242u);
+    EXPECT_EQ(number(url, K::kDocumentID), 17u);
     EXPECT_EQ(fs_->calls(Op::Statx), 0u);
     EXPECT_EQ(fs_->calls(Op::Fsetxattr), 0u);
-
     std::optional<Error> refused = url.setResourceValue(String::make("x"), K::kName);
     ASSERT_TRUE(refused);
     EXPECT_TRUE(refused->is(kPosixErrorDomain, EINVAL));
-    EXPECT_EQ(stringValue(url, K::kName), "ids");
-    EXPECT_TRUE(url.setResourceValue(Number::fromUInt64(1), K::kFileSize));
-
-    // Once dropped, the file ID comes from the disk again.
     url.removeCachedResourceValue(K::kFileID);
-    EXPECT_EQ(unsignedValue(url, K::kFileID), lstatOf(url.path()).st_ino);
+    EXPECT_EQ(number(url, K::kFileID), inode(path));
 }
 
 std::optional<uint32_t> lookupFor(const std::string& path) {
@@ -253,50 +198,15 @@ TEST_F(UrlResourceValuesTest, DocumentIdsComeFromTheInstalledLookup) {
         ~Uninstall() { setDocumentIdLookup(nullptr); }
     } uninstall;
     setDocumentIdLookup(&lookupFor);
-    EXPECT_EQ(unsignedValue(known, K::kDocumentID), 99u);
+    EXPECT_EQ(number(known, K::kDocumentID), 99u);
     EXPECT_EQ(value(unknown, K::kDocumentID), nullptr);
     setDocumentIdLookup(nullptr);
-    EXPECT_EQ(unsignedValue(known, K::kDocumentID), 99u) << "a found ID is cached";
+    EXPECT_EQ(number(known, K::kDocumentID), 99u) << "a found ID is cached";
     // Only the answers "no ID" looked at the disk, to tell a vanished file from a new one.
     EXPECT_EQ(fs_->calls(Op::Statx), 2u);
     auto gone = Url::fileURLWithPath(dir_ / "gone").resourceValue(K::kDocumentID);
     ASSERT_FALSE(gone.ok());
     EXPECT_TRUE(gone.error().is(kHostPlatformErrorDomain, 260));
-}
-
-TEST_F(UrlResourceValuesTest, OneStatxServesAPrefetch) {
-    dir_.writeFile("Song.resona/track", "x");
-    Url url = Url::fileURLWithPath(dir_ / "Song.resona");
-    const std::vector<ResourceKey> keys = {
-        K::kName,        K::kTypeIdentifier, K::kFileSize,  K::kContentModificationDate,
-        K::kIsDirectory, K::kIsPackage,      K::kLinkCount, K::kFileID,
-        K::kIsReadable,  K::kIsSymbolicLink, K::kFileSize,
-    };
-    fs_->resetCalls();
-    ASSERT_FALSE(url.prefetchResourceValues(keys));
-    EXPECT_EQ(fs_->calls(Op::Statx), 1u);
-    EXPECT_EQ(fs_->calls(Op::Faccessat), 1u);
-
-    EXPECT_EQ(stringValue(url, K::kTypeIdentifier), "com.velk.resona.song");
-    EXPECT_EQ(boolValue(url, K::kIsPackage), true);
-    EXPECT_EQ(unsignedValue(url, K::kLinkCount), 2u);
-    EXPECT_TRUE(objectCast<Date>(value(url, K::kContentModificationDate)));
-    EXPECT_EQ(fs_->calls(Op::Statx), 1u) << "prefetched values are served from the cache";
-
-    // A second prefetch only reads what is missing; none is.
-    ASSERT_FALSE(url.prefetchResourceValues(keys));
-    EXPECT_EQ(fs_->calls(Op::Statx), 1u);
-    // An uncached key costs one more statx, whatever else is asked for with it.
-    ASSERT_FALSE(url.prefetchResourceValues({K::kName, K::kCreationDate, K::kParentDirectoryURL}));
-    EXPECT_EQ(fs_->calls(Op::Statx), 2u);
-
-    // A failed prefetch caches nothing.
-    Url other = Url::fileURLWithPath(dir_.writeFile("other", "abcd"));
-    fs_->inject(Op::Statx, EIO);
-    std::optional<Error> failed = other.prefetchResourceValues({K::kFileSize});
-    ASSERT_TRUE(failed);
-    EXPECT_TRUE(failed->is(kPosixErrorDomain, EIO));
-    EXPECT_EQ(unsignedValue(other, K::kFileSize), 4u);
 }
 
 }  // namespace

@@ -5,9 +5,9 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <mutex>
-#include <optional>
 #include <thread>
 #include <vector>
 
@@ -27,104 +27,73 @@ double seconds(D d) {
     return std::chrono::duration<double>(d).count();
 }
 
-// Records every start of the handler.
-class Runs {
-public:
-    explicit Runs(std::shared_ptr<DispatchQueue> queue) : queue_(std::move(queue)) {}
-
-    std::function<void()> handler(std::function<void()> during = {}) {
-        return [this, during] {
+// Records every start of the handler, which must run on the pacer's queue.
+struct Runs {
+    std::function<void()> handler(std::shared_ptr<DispatchQueue> queue,
+                                  std::function<void()> during = {}) {
+        return [this, queue, during] {
+            EXPECT_TRUE(queue->isCurrent());
             {
-                std::lock_guard lock(mutex_);
-                starts_.push_back(Clock::now());
-                if (!queue_->isCurrent())
-                    offQueue_ = true;
+                std::lock_guard lock(mutex);
+                starts.push_back(Clock::now());
             }
-            started_.signal();
+            started.signal();
             if (during)
                 during();
         };
     }
-
-    bool waitForRun(double timeout = kPatience) { return started_.wait(timeout); }
-    std::vector<Clock::time_point> starts() const {
-        std::lock_guard lock(mutex_);
-        return starts_;
+    bool wait(double timeout = kPatience) { return started.wait(timeout); }
+    std::vector<Clock::time_point> all() {
+        std::lock_guard lock(mutex);
+        return starts;
     }
-    bool offQueue() const {
-        std::lock_guard lock(mutex_);
-        return offQueue_;
-    }
-
-private:
-    std::shared_ptr<DispatchQueue> queue_;
-    mutable std::mutex mutex_;
-    std::vector<Clock::time_point> starts_;
-    bool offQueue_ = false;
-    DispatchSemaphore started_;
+    std::mutex mutex;
+    std::vector<Clock::time_point> starts;
+    DispatchSemaphore started;
 };
 
-TEST(PacerTest, BurstOfSignalsGivesOneRunOnTheQueueAfterTheInterval) {
+TEST(PacerTest, BurstGivesOneRunAfterTheIntervalAndASignalDuringARunExactlyOneMore) {
     auto queue = DispatchQueue::makeSerial("test.pacer");
-    Runs runs(queue);
+    Runs runs;
+    DispatchSemaphore release;
+    std::atomic<bool> hold{false};
     Pacer pacer("burst", queue, kInterval);
-    pacer.setEventHandler(runs.handler());
+    pacer.setEventHandler(runs.handler(queue, [&] {
+        if (hold.exchange(false))
+            release.wait(kPatience);
+    }));
 
     auto firstSignal = Clock::now();
     for (int i = 0; i < 10; ++i) {
         pacer.signal();
         std::this_thread::sleep_for(5ms);
     }
-    ASSERT_TRUE(runs.waitForRun());
-    EXPECT_FALSE(runs.waitForRun(3 * kInterval)) << "no further run without a further signal";
+    ASSERT_TRUE(runs.wait());
+    EXPECT_FALSE(runs.wait(3 * kInterval)) << "no further run without a further signal";
+    ASSERT_EQ(runs.all().size(), 1u);
+    EXPECT_GE(seconds(runs.all()[0] - firstSignal), kInterval);
 
-    auto starts = runs.starts();
-    ASSERT_EQ(starts.size(), 1u);
-    EXPECT_GE(seconds(starts[0] - firstSignal), kInterval);
-    EXPECT_FALSE(runs.offQueue());
-}
-
-TEST(PacerTest, NothingRunsWithoutASignal) {
-    auto queue = DispatchQueue::makeSerial("test.pacer-idle");
-    Runs runs(queue);
-    Pacer pacer("idle", queue, kInterval);
-    pacer.setEventHandler(runs.handler());
-    EXPECT_FALSE(runs.waitForRun(3 * kInterval));
-}
-
-TEST(PacerTest, SignalDuringARunCausesExactlyOneMoreRunAnIntervalLater) {
-    auto queue = DispatchQueue::makeSerial("test.pacer-rerun");
-    Runs runs(queue);
-    DispatchSemaphore release;
-    std::atomic<bool> first{true};
-    Pacer pacer("rerun", queue, kInterval);
-    pacer.setEventHandler(runs.handler([&] {
-        if (first.exchange(false))
-            release.wait(kPatience);
-    }));
-
+    hold = true;
     pacer.signal();
-    ASSERT_TRUE(runs.waitForRun());
+    ASSERT_TRUE(runs.wait());
     auto signalledDuringRun = Clock::now();
     for (int i = 0; i < 3; ++i) pacer.signal();
     release.signal();
-
-    ASSERT_TRUE(runs.waitForRun()) << "the signal during the run was lost";
-    EXPECT_FALSE(runs.waitForRun(3 * kInterval)) << "one more run serves all those signals";
-    auto starts = runs.starts();
-    ASSERT_EQ(starts.size(), 2u);
-    EXPECT_GE(seconds(starts[1] - starts[0]), kInterval);
-    EXPECT_GE(seconds(starts[1] - signalledDuringRun), kInterval);
+    ASSERT_TRUE(runs.wait()) << "the signal during the run was lost";
+    EXPECT_FALSE(runs.wait(3 * kInterval)) << "one more run serves all those signals";
+    auto starts = runs.all();
+    ASSERT_EQ(starts.size(), 3u);
+    EXPECT_GE(seconds(starts[2] - starts[1]), kInterval);
+    EXPECT_GE(seconds(starts[2] - signalledDuringRun), kInterval);
 }
 
 TEST(PacerTest, SteadySignalsFromManyThreadsRunAtMostOncePerIntervalAndLoseNone) {
     constexpr double kShortInterval = 0.1;
     auto queue = DispatchQueue::global();
-    Runs runs(queue);
+    Runs runs;
     Pacer pacer("steady", queue, kShortInterval);
-    pacer.setEventHandler(runs.handler());
+    pacer.setEventHandler(runs.handler(queue));
 
-    constexpr auto kStorm = 1s;
     std::atomic<bool> stop{false};
     std::vector<Clock::time_point> lastSignal(3);
     std::vector<std::thread> signallers;
@@ -137,7 +106,7 @@ TEST(PacerTest, SteadySignalsFromManyThreadsRunAtMostOncePerIntervalAndLoseNone)
             }
         });
     }
-    std::this_thread::sleep_for(kStorm);
+    std::this_thread::sleep_for(1s);
     stop = true;
     for (auto& s : signallers) s.join();
     auto stormEnd = Clock::now();
@@ -145,46 +114,37 @@ TEST(PacerTest, SteadySignalsFromManyThreadsRunAtMostOncePerIntervalAndLoseNone)
 
     // Wait for the run that serves the last signal.
     auto deadline = Clock::now() + std::chrono::duration<double>(kPatience);
-    std::vector<Clock::time_point> starts;
-    do {
-        starts = runs.starts();
-        if (!starts.empty() && starts.back() > last)
-            break;
-    } while (runs.waitForRun(std::max(0.0, seconds(deadline - Clock::now()))));
-
+    while ((runs.all().empty() || runs.all().back() <= last) &&
+           runs.wait(std::max(0.0, seconds(deadline - Clock::now())))) {
+    }
+    auto starts = runs.all();
     ASSERT_FALSE(starts.empty());
     EXPECT_GT(starts.back(), last) << "the last signal was never served";
     EXPECT_GE(std::count_if(starts.begin(), starts.end(), [&](auto s) { return s < stormEnd; }), 2)
         << "steady signals must not postpone the runs indefinitely";
-    for (size_t i = 1; i < starts.size(); ++i) {
+    for (size_t i = 1; i < starts.size(); ++i)
         EXPECT_GE(seconds(starts[i] - starts[i - 1]), kShortInterval) << "runs " << i;
-    }
 }
 
-TEST(PacerTest, DestroyingThePacerCancelsItsPendingRun) {
+TEST(PacerTest, DestroyingThePacerCancelsAPendingRunAndWaitsForOneUnderWay) {
     auto queue = DispatchQueue::makeSerial("test.pacer-cancel");
-    Runs runs(queue);
+    Runs cancelled, busy;
     {
         Pacer pacer("cancelled", queue, kInterval);
-        pacer.setEventHandler(runs.handler());
+        pacer.setEventHandler(cancelled.handler(queue));
         pacer.signal();
     }
-    EXPECT_FALSE(runs.waitForRun(3 * kInterval));
-    EXPECT_TRUE(runs.starts().empty());
-}
+    EXPECT_FALSE(cancelled.wait(3 * kInterval));
 
-TEST(PacerTest, DestroyingThePacerWaitsForARunUnderWay) {
-    auto queue = DispatchQueue::makeSerial("test.pacer-busy");
-    Runs runs(queue);
     std::atomic<bool> runFinished{false};
     {
         Pacer pacer("busy", queue, 0.0);
-        pacer.setEventHandler(runs.handler([&] {
+        pacer.setEventHandler(busy.handler(queue, [&] {
             std::this_thread::sleep_for(100ms);
             runFinished = true;
         }));
         pacer.signal();
-        ASSERT_TRUE(runs.waitForRun());
+        ASSERT_TRUE(busy.wait());
     }
     EXPECT_TRUE(runFinished);
 }
