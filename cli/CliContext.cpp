@@ -5,8 +5,10 @@
 #include <cstring>
 #include <ostream>
 
+#include "applibraries/SharedAppLibraryLookup.h"
+#include "applibraries/TBPAppLibraryManager.h"
 #include "host/HostPorterManager.h"
-#include "platform/FileSystem.h"
+#include "platform/FileContents.h"
 #include "platform/tremors/TremorService.h"
 #include "support/Log.h"
 
@@ -21,33 +23,13 @@ std::string defaultStoragePath() {
     return std::string(home && *home ? home : "/") + "/Documents";
 }
 
-// mkdir -p through the platform layer.
-bool makeDirectories(const std::string& path) {
-    FileSystem& fs = FileSystem::current();
-    for (size_t pos = 1; pos <= path.size(); ++pos) {
-        if (pos != path.size() && path[pos] != '/')
-            continue;
-        std::string prefix = path.substr(0, pos);
-        if (fs.mkdir(prefix, 0755) != 0 && errno != EEXIST)
-            return false;
-    }
-    struct statx st {};
-    if (fs.statx(AT_FDCWD, path, 0, STATX_TYPE, &st) != 0)
-        return false;
-    if (!S_ISDIR(st.stx_mode)) {
-        errno = ENOTDIR;
-        return false;
-    }
-    return true;
-}
-
 }  // namespace
 
 Status CliContext::prepareStorage() {
     std::string path = storagePath.empty() ? defaultStoragePath() : storagePath;
     storage_ = Url::fileURLWithPath(path);
-    if (!makeDirectories(storage_.path())) {
-        Error error = Error::errorWithPOSIXCode(errno);
+    if (auto failure = FileContents::createDirectory(storage_)) {
+        const Error& error = *failure;
         logError("can't create document storage folder " + storage_.path() + "; " +
                  error.description());
         return Error(error.domain(), error.code(),
@@ -63,6 +45,24 @@ Status CliContext::prepareJournal() {
     if (!service.ok())
         return service.error();
     return service.value()->watchTree(storage_.path());
+}
+
+Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
+    if (porter_)
+        return porter_;
+    if (auto error = prepareJournal())
+        return *error;
+    SharedAppLibraryLookup::install();
+    auto porter = LocalPorter::create();
+    refreshOutcome_ = porter->refreshAppLibraries();
+    // Identifiers inside app libraries need their trees journaled like the storage folder.
+    auto service = TremorService::shared();
+    for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries()) {
+        if (auto error = service.value()->watchTree(root.path()))
+            logError("can't watch app library " + root.path() + "; " + error->description());
+    }
+    porter_ = porter;
+    return porter_;
 }
 
 Error CliContext::usageError(const std::string& message) {

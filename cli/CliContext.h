@@ -1,11 +1,13 @@
 #pragma once
 
 #include <iosfwd>
+#include <memory>
 #include <string>
 
 #include <nlohmann/json.hpp>
 
 #include "platform/Url.h"
+#include "provider/LocalPorter.h"
 #include "support/Error.h"
 
 namespace tamber {
@@ -17,6 +19,7 @@ public:
 
     std::string storagePath;  // --storage; empty means ~/Documents
     bool debug = false;       // --debug
+    bool verbose = false;     // --verbose
 
     // Resolves and creates the document storage folder and installs the host manager for it.
     // Fails when the folder cannot be created.
@@ -25,6 +28,11 @@ public:
     // Starts the event journal and its document-ID service and watches the storage folder, so
     // that identifiers can be given and resolved.
     Status prepareJournal();
+    // Runs the provider as a small host would: starts the journal, refreshes the app libraries
+    // from the installed applications, upgrades the shared manager, watches every published
+    // tree, and hands back the provider. Later calls return the same provider.
+    Result<std::shared_ptr<LocalPorter>> prepareProvider();
+    const LocalPorter::AppRefreshOutcome& appRefreshOutcome() const { return refreshOutcome_; }
 
     std::ostream& out() { return out_; }
     std::ostream& err() { return err_; }
@@ -43,6 +51,8 @@ private:
     std::ostream& out_;
     std::ostream& err_;
     Url storage_;
+    std::shared_ptr<LocalPorter> porter_;
+    LocalPorter::AppRefreshOutcome refreshOutcome_;
 };
 
 }  // namespace tamber

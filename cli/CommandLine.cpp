@@ -7,12 +7,15 @@
 
 #include <CLI/CLI.hpp>
 
+#include "cli/AppsCommand.h"
 #include "cli/CliContext.h"
 #include "cli/EventsCommand.h"
 #include "cli/IdCommand.h"
+#include "cli/ItemCommand.h"
 #include "cli/MetaCommand.h"
 #include "cli/PathCommand.h"
 #include "support/Log.h"
+#include "support/StderrLogSink.h"
 
 namespace tamber {
 
@@ -29,6 +32,8 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
     app.add_option("--storage", context.storagePath,
                    "The document storage folder (default ~/Documents; created when missing)");
     app.add_flag("--debug", context.debug, "Write debug log lines");
+    app.add_flag("--verbose", context.verbose,
+                 "Write informational log lines to standard error (only errors by default)");
     app.require_subcommand(1);
 
     std::vector<std::unique_ptr<Command>> commands;
@@ -36,6 +41,8 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
     commands.push_back(std::make_unique<IdCommand>());
     commands.push_back(std::make_unique<PathCommand>());
     commands.push_back(std::make_unique<EventsCommand>());
+    commands.push_back(std::make_unique<ItemCommand>());
+    commands.push_back(std::make_unique<AppsCommand>());
     std::vector<std::pair<CLI::App*, Command*>> verbs;
     for (auto& c : commands) verbs.emplace_back(c->add(app), c.get());
 
@@ -45,6 +52,11 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
         return app.exit(e, out, err);
     }
     Log::shared().setDebugEnabled(context.debug);
+    // Without a system journal the log goes to the terminal, where a command shows only its
+    // errors unless asked for more.
+    if (!context.debug && !context.verbose &&
+        std::dynamic_pointer_cast<StderrLogSink>(Log::shared().sink()))
+        Log::shared().setSink(std::make_shared<StderrLogSink>(LogLevel::Error));
     if (auto error = context.prepareStorage()) {
         bool json = false;
         for (int i = 1; i < argc; ++i) json = json || std::string_view(argv[i]) == "--json";

@@ -1,6 +1,7 @@
 #include "cli/EventsCommand.h"
 
 #include <atomic>
+#include <cerrno>
 #include <csignal>
 #include <cstdio>
 #include <ostream>
@@ -10,6 +11,7 @@
 #include "platform/objects/Dictionary.h"
 #include "platform/objects/Number.h"
 #include "platform/objects/String.h"
+#include "platform/tremors/TremorService.h"
 #include "platform/tremors/Tremors.h"
 #include "support/DispatchSemaphore.h"
 
@@ -60,6 +62,25 @@ void onSignal(int) {
 
 }  // namespace
 
+Status EventsCommand::watchUncovered(CliContext& context, const std::vector<std::string>& paths) {
+    auto service = TremorService::shared();
+    if (!service.ok())
+        return service.error();
+    for (const auto& path : paths) {
+        if (service.value()->isWatched(path))
+            continue;
+        if (auto error = service.value()->watchTree(path)) {
+            return Error(
+                error->domain(), error->code(),
+                {{"description", "can't watch " + path + ": " + CliContext::errorMessage(*error)}});
+        }
+        // Its earlier history was never journaled: say so rather than show an empty replay.
+        context.err() << "tamber: warning: " << path
+                      << " was not in a watched tree; watching it from now on\n";
+    }
+    return std::nullopt;
+}
+
 CLI::App* EventsCommand::add(CLI::App& app) {
     auto* sub =
         app.add_subcommand("events", "Replay the event journal for some trees, then follow it");
@@ -78,6 +99,11 @@ int EventsCommand::run(CliContext& context) {
     for (const auto& p : paths_) paths.push_back(Url::fileURLWithPath(p).path());
     if (paths.empty())
         paths.push_back(context.storageURL().path());
+
+    if (!docid_) {
+        if (auto error = watchUncovered(context, paths))
+            return context.fail(*error, json_);
+    }
 
     Printer printer{&context.out(), json_, noFollow_, DispatchSemaphore(0)};
     TremorStreamContext streamContext;
@@ -100,7 +126,12 @@ int EventsCommand::run(CliContext& context) {
     gInterrupted.store(false);
     std::signal(SIGINT, onSignal);
     std::signal(SIGTERM, onSignal);
-    TremorStreamStart(stream);
+    if (!TremorStreamStart(stream)) {
+        TremorStreamRelease(stream);
+        return context.fail(Error(kPosixErrorDomain, EIO,
+                                  {{"description", "can't start the event journal stream"}}),
+                            json_);
+    }
     // Without --no-follow nothing signals `done`: only an interrupt ends the wait.
     while (!gInterrupted.load() && !printer.done.wait(0.2)) {
     }

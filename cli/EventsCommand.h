@@ -6,18 +6,23 @@
 #include <vector>
 
 #include "cli/Command.h"
+#include "support/Result.h"
 
 namespace tamber {
 
 // `tamber events [--since ID] [--docid] [--no-follow] [--json] PATH...`: replays the journal
 // for the given trees, then follows it live until interrupted (or stops after the
-// history-done event with --no-follow).
+// history-done event with --no-follow). A path outside every watched tree is watched from then
+// on, with a warning: its replay then starts with a lost-history event.
 class EventsCommand : public Command {
 public:
     CLI::App* add(CLI::App& app) override;
     int run(CliContext& context) override;
 
 private:
+    // Watches each of `paths` that no watched tree covers, with a warning on standard error.
+    static Status watchUncovered(CliContext& context, const std::vector<std::string>& paths);
+
     std::vector<std::string> paths_;
     uint64_t since_ = 0;
     bool docid_ = false;

@@ -14,8 +14,8 @@ CLI::App* IdCommand::add(CLI::App& app) {
 }
 
 int IdCommand::run(CliContext& context) {
-    if (auto error = context.prepareJournal())
-        return context.fail(*error, json_);
+    if (auto porter = context.prepareProvider(); !porter.ok())
+        return context.fail(porter.error(), json_);
     Url url = Url::fileURLWithPath(path_);
     auto identifier = TBFileObjectIdentifier::itemIdentifier(url);
     if (!identifier) {

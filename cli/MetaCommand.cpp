@@ -4,6 +4,7 @@
 #include <ctime>
 #include <ostream>
 
+#include "cli/JsonValues.h"
 #include "platform/objects/Number.h"
 
 namespace tamber {
@@ -25,26 +26,6 @@ CLI::App* MetaCommand::add(CLI::App& app) {
 }
 
 namespace {
-
-nlohmann::json dateJson(const std::shared_ptr<const Date>& date) {
-    return date ? nlohmann::json(date->iso8601()) : nlohmann::json(nullptr);
-}
-
-nlohmann::json numberJson(const std::shared_ptr<const Number>& n) {
-    if (!n)
-        return nullptr;
-    switch (n->kind()) {
-        case Number::Kind::Unsigned:
-            return n->uint64Value();
-        case Number::Kind::Signed:
-            return n->int64Value();
-        case Number::Kind::Floating:
-            return n->doubleValue();
-        case Number::Kind::Boolean:
-            return n->boolValue();
-    }
-    return nullptr;
-}
 
 std::vector<std::string> splitLabels(const std::string& text) {
     std::vector<std::string> labels;

@@ -15,8 +15,8 @@ CLI::App* PathCommand::add(CLI::App& app) {
 }
 
 int PathCommand::run(CliContext& context) {
-    if (auto error = context.prepareJournal())
-        return context.fail(*error, json_);
+    if (auto porter = context.prepareProvider(); !porter.ok())
+        return context.fail(porter.error(), json_);
     auto url = TBFileObjectIdentifier::fileURLWithItemIdentifier(identifier_);
     if (!url) {
         return context.fail(Error::porterErrorForNonExistentItemWithIdentifier(identifier_), json_);

@@ -6,7 +6,9 @@
 
 namespace tamber {
 
-void StderrLogSink::write(LogLevel, std::string_view line) {
+void StderrLogSink::write(LogLevel level, std::string_view line) {
+    if (level < minimum_)
+        return;
     std::string text;
     text.reserve(line.size() + 8);
     text.append("tamber: ").append(line).push_back('\n');

@@ -6,12 +6,16 @@
 
 namespace tamber {
 
-// Writes "tamber[LEVEL] line" to standard error, one whole line per write.
+// Writes "tamber: line" to standard error, one whole line per write, leaving out lines below
+// `minimum` (a command line shows only errors unless asked for more).
 class StderrLogSink : public LogSink {
 public:
+    explicit StderrLogSink(LogLevel minimum = LogLevel::Debug) : minimum_(minimum) {}
     void write(LogLevel level, std::string_view line) override;
+    LogLevel minimum() const { return minimum_; }
 
 private:
+    const LogLevel minimum_;
     std::mutex mutex_;
 };
 

@@ -1,0 +1,58 @@
+#include "cli/AppsCommand.h"
+
+#include <algorithm>
+#include <ostream>
+
+#include "applibraries/LocalAppLibraryManager.h"
+#include "items/LocalAppLibraryItem.h"
+#include "provider/LocalPorter.h"
+
+namespace tamber {
+
+CLI::App* AppsCommand::add(CLI::App& app) {
+    auto* sub = app.add_subcommand("apps", "List the app libraries (installed apps' Documents)");
+    sub->add_flag("--refresh", refresh_,
+                  "Report whether reading the installed applications changed the list");
+    sub->add_flag("--json", json_,
+                  "Print {\"versionToken\": N, \"libraries\": [{\"identifier\", \"name\", "
+                  "\"bundleIdentifier\", \"root\"}]}");
+    return sub;
+}
+
+int AppsCommand::run(CliContext& context) {
+    // Preparing the provider already refreshes from the registry, as every verb does.
+    auto porter = context.prepareProvider();
+    if (!porter.ok())
+        return context.fail(porter.error(), json_);
+    auto manager = LocalAppLibraryManager::shared();
+    auto items = manager->allItems();
+    std::sort(items.begin(), items.end(), [](const auto& a, const auto& b) {
+        return a->itemIdentifier() < b->itemIdentifier();
+    });
+    if (refresh_ && !json_) {
+        context.err() << (context.appRefreshOutcome().rootChanged ? "app list changed"
+                                                                  : "app list unchanged")
+                      << "\n";
+    }
+    nlohmann::json libraries = nlohmann::json::array();
+    for (const auto& item : items) {
+        libraries.push_back({{"identifier", item->itemIdentifier()},
+                             {"name", item->filename()},
+                             {"bundleIdentifier", item->itemIdentifier().substr(1)},
+                             {"root", item->fileURL().path()}});
+    }
+    uint64_t token = manager->versionToken();
+    if (json_) {
+        context.out() << nlohmann::json{{"versionToken", token}, {"libraries", libraries}}.dump()
+                      << "\n";
+        return 0;
+    }
+    context.out() << "version token " << token << "\n";
+    for (const auto& library : libraries)
+        context.out() << library["identifier"].get<std::string>() << "\t"
+                      << library["name"].get<std::string>() << "\t"
+                      << library["root"].get<std::string>() << "\n";
+    return 0;
+}
+
+}  // namespace tamber

@@ -1,0 +1,103 @@
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <nlohmann/json.hpp>
+
+#include "platform/tremors/TremorService.h"
+#include "tests/common/AppLibraryTest.h"
+#include "tests/common/CliRunner.h"
+#include "tests/common/TempDir.h"
+
+namespace tamber {
+namespace {
+
+using nlohmann::json;
+using testing::CliRun;
+using testing::TempDir;
+
+// One installed application, described by a real desktop entry, whose library is
+// <dir>/container/Documents.
+class ItemAndAppsCommandTest : public testing::AppLibraryTest {
+protected:
+    void SetUp() override {
+        AppLibraryTest::SetUp();
+        // The real registry reads the desktop entry below.
+        AppRegistry::setDefaultRegistry(nullptr);
+        TremorService::resetForTesting();
+        TremorService::configure(state.path());
+        storage = dir.makeDir("Documents");
+        if (const char* dirs = std::getenv("XDG_DATA_DIRS"))
+            previousDataDirs = dirs;
+        setenv("XDG_DATA_DIRS", systemData.path().c_str(), 1);
+        library = dir.makeDir("container/Documents");
+        dir.writeFile("applications/com.example.Notes.desktop",
+                      "[Desktop Entry]\nType=Application\nName=Notes\nExec=true\n"
+                      "X-Tamber-Data-Container=" +
+                          dir.path() + "/container\nX-Tamber-Supports-Document-Browser=true\n");
+    }
+    void TearDown() override {
+        TremorService::resetForTesting();
+        if (previousDataDirs)
+            setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
+        else
+            unsetenv("XDG_DATA_DIRS");
+        AppLibraryTest::TearDown();
+    }
+
+    json tamberJson(std::vector<std::string> args, int expectedStatus = 0) {
+        args.insert(args.begin(), {"--storage", storage});
+        args.push_back("--json");
+        CliRun run = testing::runTamber(std::move(args));
+        EXPECT_EQ(run.status, expectedStatus) << run.out << run.err;
+        return json::parse(run.out, nullptr, false);
+    }
+
+    TempDir state, systemData;
+    std::optional<std::string> previousDataDirs;
+    std::string storage;
+    std::string library;
+};
+
+TEST_F(ItemAndAppsCommandTest, InstalledAppIsListedAndItsFilesResolve) {
+    json listed = {{"versionToken", 1},
+                   {"libraries", json::array({json{{"identifier", "#com.example.Notes"},
+                                                   {"bundleIdentifier", "com.example.Notes"},
+                                                   {"name", "Notes"},
+                                                   {"root", library}}})}};
+    EXPECT_EQ(tamberJson({"apps", "--refresh"}), listed);
+    EXPECT_EQ(tamberJson({"apps"}), listed) << "nothing changed: the list keeps its version";
+
+    json libraryItem = tamberJson({"item", "#com.example.Notes"});
+    EXPECT_EQ(libraryItem["parentIdentifier"], "HostPorterRootContainerItemIdentifier");
+    EXPECT_EQ(libraryItem["filename"], "Notes");
+    EXPECT_EQ(libraryItem["path"], library);
+    EXPECT_EQ(libraryItem["capabilities"], 0x03);
+
+    std::string note = dir.writeFile("container/Documents/todo.txt", "milk");
+    json byPath = tamberJson({"item", note});
+    std::string identifier = byPath["identifier"];
+    EXPECT_EQ(identifier.rfind("did=", 0), 0u);
+    EXPECT_EQ(byPath["parentIdentifier"], "#com.example.Notes");
+    EXPECT_EQ(byPath["documentSize"], 4);
+    EXPECT_EQ(byPath["capabilities"], 0x3F);
+    EXPECT_EQ(tamberJson({"item", identifier})["path"], note);
+}
+
+TEST_F(ItemAndAppsCommandTest, UnknownItemsAreErrors) {
+    for (const auto& item : {std::string("#com.example.absent"), dir.writeFile("elsewhere.txt")}) {
+        json error = tamberJson({"item", item}, 1)["error"];
+        EXPECT_EQ(error["domain"], "LocalPorter.Error") << item;
+        EXPECT_EQ(error["code"], 0) << item;
+    }
+}
+
+TEST_F(ItemAndAppsCommandTest, RemovedAppLeavesTheListAndBumpsTheToken) {
+    ASSERT_EQ(tamberJson({"apps"})["libraries"].size(), 1u);
+    std::remove((dir / "applications/com.example.Notes.desktop").c_str());
+    EXPECT_EQ(tamberJson({"apps", "--refresh"}),
+              (json{{"versionToken", 2}, {"libraries", json::array()}}));
+    EXPECT_EQ(tamberJson({"item", "#com.example.Notes"}, 1)["error"]["code"], 0);
+}
+
+}  // namespace
+}  // namespace tamber

@@ -1,0 +1,371 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <deque>
+#include <filesystem>
+#include <tuple>
+
+#include "host/RecordingHostPorterManager.h"
+#include "items/AppLibraryLookup.h"
+#include "items/LocalAppLibraryItem.h"
+#include "items/LocalItem.h"
+#include "items/TBFileObjectIdentifier.h"
+#include "platform/FaultInjectingFileSystem.h"
+#include "platform/LinuxFileSystem.h"
+#include "tests/common/FakeAppLibraryLookup.h"
+#include "tests/common/FakeStrataService.h"
+#include "tests/common/ScopedFileSystem.h"
+#include "tests/common/ScopedLogCapture.h"
+#include "tests/common/TempDir.h"
+
+namespace tamber {
+namespace {
+
+using testing::ScopedLogCapture;
+
+// A document storage folder "Documents" and one app library, "Apps/app/Documents" of
+// "com.example.app", on a real temporary folder, with a fault-injecting file system installed.
+class ItemTest : public ::testing::Test {
+protected:
+    using Op = FaultInjectingFileSystem::Operation;
+
+    // Reports a chosen link count for one path, as other file systems would count.
+    class LinkCountFileSystem : public FaultInjectingFileSystem {
+    public:
+        LinkCountFileSystem(std::string path, uint32_t links)
+            : FaultInjectingFileSystem(std::make_shared<LinuxFileSystem>()),
+              path_(std::move(path)),
+              links_(links) {}
+        int statx(int dirfd, const std::string& path, int flags, unsigned int mask,
+                  struct statx* out) override {
+            int result = FaultInjectingFileSystem::statx(dirfd, path, flags, mask, out);
+            if (result == 0 && path == path_)
+                out->stx_nlink = links_;
+            return result;
+        }
+
+    private:
+        std::string path_;
+        uint32_t links_;
+    };
+
+    void SetUp() override {
+        storage = dir.makeDir("Documents");
+        library = dir.makeDir("Apps/app/Documents");
+        libraries->libraries.emplace_back(Url::fileURLWithPath(library), "com.example.app");
+        previousManager = HostPorterManager::installDefaultManager(
+            std::make_shared<RecordingHostPorterManager>(Url::fileURLWithPath(storage)));
+        previousStrata = StrataService::setCurrent(strata);
+        previousLibraries = AppLibraryLookup::setCurrent(libraries);
+    }
+    void TearDown() override {
+        HostPorterManager::installDefaultManager(previousManager);
+        StrataService::setCurrent(previousStrata);
+        AppLibraryLookup::setCurrent(previousLibraries);
+    }
+    static std::string fid(const std::string& path) {
+        struct stat st {};
+        EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
+        return "fid=" + std::to_string(st.st_ino);
+    }
+
+    LocalItemRef make(const std::string& path, const LocalItemOptions& options = {}) {
+        return LocalItem::make(Url::fileURLWithPath(path), options);
+    }
+    BundleRecordRef libraryRecord(std::optional<std::string> container) {
+        BundleRecord::Fields fields{"com.example.app", "Example", std::nullopt, std::nullopt};
+        if (container)
+            fields.dataContainerURL = Url::fileURLWithPath(*container);
+        return BundleRecord::make(std::move(fields));
+    }
+    static std::optional<uint64_t> count(const std::shared_ptr<const LocalItem>& item) {
+        if (!item || !item->childItemCount())
+            return std::nullopt;
+        return item->childItemCount()->uint64Value();
+    }
+    std::optional<std::string> idOf(const std::string& path) {
+        return TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(path));
+    }
+    std::optional<Url> urlOf(const std::string& identifier) {
+        return TBFileObjectIdentifier::fileURLWithItemIdentifier(identifier);
+    }
+
+    testing::TempDir dir;
+    std::string storage;
+    std::string library;
+    std::shared_ptr<testing::FakeStrataService> strata =
+        std::make_shared<testing::FakeStrataService>();
+    std::shared_ptr<testing::FakeAppLibraryLookup> libraries =
+        std::make_shared<testing::FakeAppLibraryLookup>();
+    std::shared_ptr<FaultInjectingFileSystem> fs =
+        std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    testing::ScopedFileSystem scopedFileSystem{fs};
+    std::shared_ptr<HostPorterManager> previousManager;
+    std::shared_ptr<StrataService> previousStrata;
+    std::shared_ptr<AppLibraryLookup> previousLibraries;
+};
+
+TEST_F(ItemTest, RecordsAndIdentifierForms) {
+    std::string folder = dir.makeDir("Documents/Projects");
+    dir.makeDir("Documents/Projects/a");
+    dir.makeDir("Documents/Projects/b");
+    std::string file = dir.writeFile("Documents/Projects/plan.txt", "hello");
+    std::string package = dir.makeDir("Documents/Talk.lumen");
+    std::string link = storage + "/link";
+    ASSERT_EQ(::symlink(file.c_str(), link.c_str()), 0);
+    std::string fifo = storage + "/pipe";
+    ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+    std::string inLibrary = dir.makeDir("Apps/app/Documents/sub");
+
+    EXPECT_EQ(idOf(storage), HostPorterRootContainerItemIdentifier);
+    EXPECT_EQ(urlOf(HostPorterRootContainerItemIdentifier)->path(), storage);
+    EXPECT_EQ(idOf(folder), fid(folder));
+    EXPECT_EQ(idOf(file), "did=1");
+    EXPECT_EQ(idOf(package), "did=2");
+    EXPECT_EQ(idOf(link), fid(link));
+    EXPECT_EQ(idOf(fifo), fid(fifo));
+    EXPECT_EQ(idOf(library), "#com.example.app");
+    EXPECT_EQ(idOf(inLibrary), fid(inLibrary));
+
+    // A document keeps its ID: a fresh URL finds it without allocating again.
+    auto item = make(file);
+    ASSERT_TRUE(item);
+    EXPECT_EQ(item->itemIdentifier(), "did=1");
+    EXPECT_EQ(strata->allocations(), 2);
+    EXPECT_EQ(item->parentItemIdentifier(), fid(folder));
+    EXPECT_EQ(item->typeIdentifier(), "public.plain-text");
+    EXPECT_EQ(item->documentSize()->uint64Value(), 5u);
+    // The version follows the modification date.
+    ASSERT_TRUE(item->versionIdentifier());
+    EXPECT_EQ(make(file)->versionIdentifier(), item->versionIdentifier());
+    std::filesystem::last_write_time(
+        file, std::filesystem::last_write_time(file) - std::chrono::hours(1));
+    EXPECT_NE(make(file)->versionIdentifier(), item->versionIdentifier());
+
+    auto projects = make(folder);
+    ASSERT_TRUE(projects);
+    EXPECT_EQ(projects->parentItemIdentifier(), HostPorterRootContainerItemIdentifier);
+    EXPECT_EQ(count(projects), 2u);  // the two sub-folders
+    EXPECT_EQ(make(storage)->parentItemIdentifier(), HostPorterRootContainerItemIdentifier);
+
+    ScopedLogCapture log;
+    std::string outside = dir.writeFile("elsewhere.txt", "x");
+    EXPECT_FALSE(idOf(outside));
+    EXPECT_EQ(log->count("can't compute file object identifier because \"" + outside +
+                             "\" is not part of Tamber",
+                         LogLevel::Info),
+              1u);
+    EXPECT_EQ(strata->allocations(), 2);
+}
+
+TEST_F(ItemTest, Capabilities) {
+    // The root is never more than readable; a library folder takes only two.
+    EXPECT_EQ(make(storage)->capabilities(), 0x01u);
+    EXPECT_EQ(make(dir.writeFile("Documents/a.txt", "x"))->capabilities(), 0x3Fu);
+    auto inLibrary = make(dir.writeFile("Apps/app/Documents/notes.txt", "x"));
+    EXPECT_EQ(inLibrary->parentItemIdentifier(), "#com.example.app");
+    EXPECT_EQ(inLibrary->capabilities(), 0x3Fu);
+    EXPECT_EQ(LocalAppLibraryItem::initFrom(libraryRecord(dir / "Apps/app"))->capabilities(),
+              0x03u);
+
+    std::string locked = dir.writeFile("Documents/locked.txt", "x");
+    fs->inject(Op::Faccessat, EACCES, -1, locked);
+    EXPECT_EQ(make(locked)->capabilities(), 0x01u);
+    fs->inject(Op::Faccessat, EACCES, -1, library);
+    EXPECT_EQ(LocalAppLibraryItem::initFrom(libraryRecord(dir / "Apps/app"))->capabilities(),
+              0x01u);
+}
+
+TEST_F(ItemTest, InboxIsHiddenOnlyDirectlyUnderTheRootOrALibrary) {
+    ScopedLogCapture log;
+    EXPECT_FALSE(make(dir.makeDir("Documents/Inbox")));
+    EXPECT_FALSE(make(dir.makeDir("Apps/app/Documents/Inbox")));
+    EXPECT_EQ(
+        log->count("[DEBUG] can't create an item for the \"Inbox\" directory", LogLevel::Debug),
+        2u);
+    EXPECT_TRUE(make(dir.makeDir("Documents/Sub/Inbox")));
+    EXPECT_TRUE(make(dir.makeDir("Apps/app/Documents/Sub/Inbox")));
+}
+
+TEST_F(ItemTest, OnlyContentsOfATopLevelTrashAreTrashed) {
+    EXPECT_TRUE(make(dir.writeFile("Documents/.Trash/old.txt"))->isTrashed());
+    EXPECT_TRUE(make(dir.writeFile("Apps/app/Documents/.Trash/Old/deep.txt"))->isTrashed());
+    EXPECT_FALSE(make(storage + "/.Trash")->isTrashed());
+    EXPECT_FALSE(make(dir.writeFile("Documents/Sub/.Trash/kept.txt"))->isTrashed());
+}
+
+TEST_F(ItemTest, OnlyLumenAndResonaPackagesReportTheirSummedSize) {
+    dir.writeFile("Documents/Talk.lumen/slides.txt", "abc");
+    dir.writeFile("Documents/Talk.lumen/media/clip", "defg");
+    dir.writeFile("Documents/Song.resona/track", "hi");
+    dir.writeFile("Documents/Tool.bundle/binary", "12345");
+    dir.writeFile("Documents/Broken.lumen/x", "12345");
+    auto size = [&](const std::string& name) -> std::optional<uint64_t> {
+        auto item = make(storage + "/" + name);
+        EXPECT_TRUE(item) << name;
+        if (!item || !item->documentSize())
+            return std::nullopt;
+        return item->documentSize()->uint64Value();
+    };
+    EXPECT_EQ(size("Talk.lumen"), 7u);
+    EXPECT_EQ(size("Song.resona"), 2u);
+    EXPECT_EQ(size("Tool.bundle"), std::nullopt);
+    // A walk that fails leaves the size out, not the record.
+    fs->inject(Op::ReadDirectory, EIO, 1, "Broken.lumen");
+    EXPECT_EQ(size("Broken.lumen"), std::nullopt);
+    EXPECT_EQ(fs->pendingInjections(), 0u);
+}
+
+TEST_F(ItemTest, ChildCountComesFromTheLinkCountAsSixteenBits) {
+    std::string folder = dir.makeDir("Documents/Counted");
+    auto countWith = [&](uint32_t links) {
+        testing::ScopedFileSystem scoped(std::make_shared<LinkCountFileSystem>(folder, links));
+        return count(make(folder));
+    };
+    EXPECT_EQ(countWith(1), std::nullopt);  // file systems that don't count sub-folders
+    EXPECT_EQ(countWith(2), 0u);
+    EXPECT_EQ(countWith(65539), 1u);
+}
+
+TEST_F(ItemTest, AppLibraryCountLeavesOutOnlyHiddenFolders) {
+    std::string container = dir / "Apps/app";
+    dir.makeDir("Apps/app/Documents/.Trash");
+    dir.makeDir("Apps/app/Documents/Work");
+    dir.writeFile("Apps/app/Documents/a.txt");
+    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(container))), 1u);
+    dir.makeDir("Apps/app/Documents/Inbox");
+    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(container))), 1u);
+    // A plain file named "Inbox" is listed like any other and not taken off.
+    std::string other = dir.makeDir("Apps/other/Documents");
+    dir.makeDir("Apps/other/Documents/Work");
+    dir.writeFile("Apps/other/Documents/Inbox");
+    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(dir / "Apps/other"))), 1u);
+
+    // A count that says there are no sub-folders while "Inbox" is one stops the process.
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_DEATH(
+        {
+            testing::ScopedFileSystem scoped(std::make_shared<LinkCountFileSystem>(library, 2));
+            LocalAppLibraryItem::initFrom(libraryRecord(container));
+        },
+        "would drop below 0");
+}
+
+TEST_F(ItemTest, AFailedStatusQueryStillGivesARecord) {
+    std::string file = dir.writeFile("Documents/a.txt", "x");
+    Url url = Url::fileURLWithPath(file);
+    ASSERT_FALSE(url.prefetchResourceValues(LocalItem::urlKeys()));
+    ASSERT_TRUE(LocalItem::make(url, {.customItemID = "did=1", .customParentItemID = "fid=2"}));
+    ASSERT_TRUE(LocalItem::make(url));
+    for (int error : {ENOENT, EIO}) {
+        ScopedLogCapture log;
+        fs->inject(Op::Statx, error, 1, file);
+        auto item = LocalItem::make(url);
+        ASSERT_TRUE(item);
+        EXPECT_EQ(fs->pendingInjections(), 0u);
+        EXPECT_EQ(item->itemIdentifier(), "did=1");
+        EXPECT_FALSE(item->fileID());
+        std::string line =
+            "can't find fileID for item \"" + file + "\"; " + Error::posix(error).description();
+        if (error == ENOENT)
+            EXPECT_EQ(log->count("[DEBUG] " + line, LogLevel::Debug), 1u);
+        else
+            EXPECT_EQ(log->count("[ERROR] " + line, LogLevel::Error), 1u);
+    }
+}
+
+TEST_F(ItemTest, EachFailingCheckLogsItsLineAndStops) {
+    std::string outside = dir.writeFile("Elsewhere/x.txt", "x");
+    std::string missing = storage + "/gone.txt";
+    const std::tuple<std::string, LocalItemOptions, std::string> cases[] = {
+        {outside, {}, "[DEBUG] can't create an item without an ID"},
+        {outside,
+         {.customItemID = "did=9"},
+         "[ERROR] can't create an item without a parent ID (itemIdentifier: did=9)"},
+        {missing,
+         {.customItemID = "did=9", .customParentItemID = "fid=1"},
+         "[ERROR] can't create an item without a filename (itemIdentifier: did=9, "
+         "parentItemIdentifier: fid=1)"},
+        {missing,
+         {.customItemID = "did=9", .customParentItemID = "fid=1", .customFilename = "x"},
+         "[ERROR] can't create an item without a type identifier (itemIdentifier: did=9, "
+         "parentItemIdentifier: fid=1, filename: x)"},
+        {"", {}, "[ERROR] can't create an app library item without a data container URL"},
+    };
+    for (const auto& [path, options, line] : cases) {
+        ScopedLogCapture log;
+        EXPECT_FALSE(path.empty() ? !!LocalAppLibraryItem::initFrom(libraryRecord(std::nullopt))
+                                  : !!make(path, options))
+            << line;
+        auto lines = log->lines();
+        ASSERT_FALSE(lines.empty());
+        EXPECT_EQ(lines.back().text, line);
+        bool error = line.starts_with("[ERROR]");
+        EXPECT_EQ(lines.back().level, error ? LogLevel::Error : LogLevel::Debug);
+        EXPECT_EQ(log->countStartingWith("[ERROR] can't create"), error ? 1u : 0u);
+    }
+}
+
+TEST_F(ItemTest, IdentifiersResolveBackOrAreRejected) {
+    std::string folder = dir.makeDir("Documents/F");
+    std::string file = dir.writeFile("Documents/F/doc.txt", "x");
+    strata->publish(folder);
+    strata->publish(file);
+    EXPECT_EQ(urlOf(*idOf(file))->path(), file);
+    EXPECT_EQ(urlOf(*idOf(folder))->path(), folder);
+
+    std::string outside = dir.writeFile("outside.txt");
+    for (const auto& [identifier, line] : std::vector<std::pair<std::string, std::string>>{
+             {"fid=1=2", "invalid identifier; identifier should have 2 components, not 3"},
+             {"fid", "invalid identifier; identifier should have 2 components, not 1"},
+             {"#com.example.app", "invalid identifier; identifier should have 2 components, not 1"},
+             {"xid=5", "invalid host for identifier \"xid=5\""},
+             {"=5", "invalid host for identifier \"=5\""},
+             {fid(outside), ""}}) {
+        ScopedLogCapture log;
+        EXPECT_FALSE(urlOf(identifier)) << identifier;
+        if (line.empty())  // an inode the index does not know never resolves
+            EXPECT_EQ(log->countStartingWith("can't resolve path matching file ID \""), 1u);
+        else
+            EXPECT_EQ(log->count(line, LogLevel::Error), 1u) << identifier;
+    }
+}
+
+TEST_F(ItemTest, DocumentResolutionRetriesOnlyPassingFailures) {
+    std::string file = dir.writeFile("Documents/doc.txt", "x");
+    strata->publish(file);
+    ASSERT_EQ(idOf(file), "did=1");
+    struct Case {
+        std::deque<int> errors;
+        int expectedResolutions;
+        bool resolves;
+    };
+    for (const auto& c : std::vector<Case>{
+             {{EAGAIN, EAGAIN, EAGAIN, EAGAIN, EAGAIN, EAGAIN, EAGAIN}, 6, false},
+             {{ENOENT}, 1, false},
+             {{EBUSY, ESTALE}, 3, true},
+             {{EAGAIN, EAGAIN, EAGAIN, EAGAIN, EAGAIN}, 6, true},
+         }) {
+        int before = strata->resolutions();
+        strata->failResolutions(c.errors);
+        ScopedLogCapture log;
+        auto url = urlOf("did=1");
+        EXPECT_EQ(strata->resolutions() - before, c.expectedResolutions);
+        EXPECT_EQ(url.has_value(), c.resolves);
+        if (c.errors.front() == ENOENT) {
+            EXPECT_EQ(log->countStartingWith("can't resolve doc ID \"1\"; [2: "), 1u);
+        } else if (!c.resolves) {
+            EXPECT_EQ(log->count("doc ID resolution failed with errno(" + std::to_string(EAGAIN) +
+                                     "), let's try again after resting",
+                                 LogLevel::Info),
+                      5u);
+            EXPECT_EQ(log->count("can't resolve doc ID \"1\" after five attempts", LogLevel::Info),
+                      1u);
+        }
+    }
+}
+
+}  // namespace
+}  // namespace tamber

@@ -1,0 +1,139 @@
+#include "provider/LocalPorter.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <thread>
+
+#include "platform/FaultInjectingFileSystem.h"
+#include "platform/LinuxFileSystem.h"
+#include "provider/LocalPorterError.h"
+#include "tests/common/AppLibraryTest.h"
+#include "tests/common/FakeStrataService.h"
+#include "tests/common/ScopedFileSystem.h"
+
+namespace tamber {
+namespace {
+
+using namespace testing;
+
+// The fixture's storage and recording host, a fake registry, fresh caches and a porter.
+class LocalPorterTest : public AppLibraryTest {
+protected:
+    void SetUp() override {
+        AppLibraryTest::SetUp();
+        storage = host->documentStorageURL().path();
+        previousStrata = StrataService::setCurrent(strata);
+        porter = LocalPorter::create();
+    }
+    void TearDown() override {
+        porter.reset();
+        StrataService::setCurrent(previousStrata);
+        AppLibraryTest::TearDown();
+    }
+    size_t signalsFor(const HostPorterItemIdentifier& container) {
+        auto signals = host->signals();
+        return std::count(signals.begin(), signals.end(), container);
+    }
+    void expectInvalidIdentifier(const auto& item) {
+        ASSERT_FALSE(item.ok());
+        EXPECT_EQ(item.error().domain(), kLocalPorterErrorDomain);
+        EXPECT_EQ(item.error().code(),
+                  static_cast<int64_t>(LocalPorterError::invalidItemIdentifier));
+    }
+
+    std::string storage;
+    std::shared_ptr<FakeStrataService> strata = std::make_shared<FakeStrataService>();
+    std::shared_ptr<StrataService> previousStrata;
+    std::shared_ptr<LocalPorter> porter;
+};
+
+TEST_F(LocalPorterTest, FailedLookupsGiveInvalidIdentifierAndOneErrorLine) {
+    for (const std::string identifier : {"#com.example.absent", "did=4242", "fid=1=2", ""}) {
+        log->clear();
+        expectInvalidIdentifier(porter->itemForIdentifier(identifier));
+        EXPECT_EQ(log->count("[ERROR] item lookup failed for identifier \"" + identifier + "\"",
+                             LogLevel::Error),
+                  1u);
+        // The URL lookups of the same identifier answer nothing, with the host's error.
+        auto url = porter->urlForIdentifierLogged(identifier);
+        ASSERT_FALSE(url.ok());
+        EXPECT_EQ(url.error().code(), kHostPorterNoSuchItem);
+        EXPECT_FALSE(porter->URLForItemWithPersistentIdentifier(identifier));
+    }
+    log->clear();
+    std::string missing = storage + "/missing.txt";
+    expectInvalidIdentifier(porter->itemForURL(Url::fileURLWithPath(missing)));
+    EXPECT_EQ(
+        log->count("[ERROR] identifier lookup failed for URL \"" + missing + "\"", LogLevel::Error),
+        1u);
+}
+
+TEST_F(LocalPorterTest, TemporaryLocalFolderIsCreatedOnDemand) {
+    std::string folder = storage + "/.TemporaryLocalFolder";
+    ASSERT_FALSE(std::filesystem::exists(folder));
+    for (int attempt = 0; attempt < 2; ++attempt) {
+        auto item = porter->itemForIdentifierLogged(HostPorterTemporaryLocalFolderItemIdentifier);
+        ASSERT_TRUE(item.ok()) << item.error().description();
+        EXPECT_EQ(item.value()->fileURL().path(), folder);
+        EXPECT_TRUE(std::filesystem::is_directory(folder));
+    }
+
+    std::filesystem::remove(folder);
+    auto faults = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    faults->inject(FaultInjectingFileSystem::Operation::Mkdir, EACCES, -1, ".TemporaryLocalFolder");
+    ScopedFileSystem scoped(faults);
+    log->clear();
+    expectInvalidIdentifier(
+        porter->itemForIdentifier(HostPorterTemporaryLocalFolderItemIdentifier));
+    EXPECT_EQ(log->countStartingWith("[ERROR] can't create temporary directory; "), 1u);
+}
+
+TEST_F(LocalPorterTest, AppLibraryDocumentsFolderIsItsHashIdentifier) {
+    install({"com.example.notes"});
+    porter->refreshAppLibraries();
+    Url library = documents("com.example.notes");
+
+    EXPECT_EQ(porter->persistentIdentifierForItemAtURL(library), "#com.example.notes");
+    auto viaURL = porter->itemForURL(library);
+    ASSERT_TRUE(viaURL.ok());
+    EXPECT_EQ(viaURL.value()->itemIdentifier(), "#com.example.notes");
+    auto viaIdentifier = porter->itemForIdentifierLogged("#com.example.notes");
+    ASSERT_TRUE(viaIdentifier.ok());
+    EXPECT_EQ(viaIdentifier.value()->fileURL(), library);
+}
+
+TEST_F(LocalPorterTest, RefreshSignalsOnlyTheContainersThatChanged) {
+    install({"com.example.one"});
+    porter->refreshAppLibraries();
+    EXPECT_EQ(signalsFor(HostPorterRootContainerItemIdentifier), 1u);
+    EXPECT_EQ(signalsFor(HostPorterWorkingSetContainerItemIdentifier), 1u);
+
+    auto unchanged = porter->refreshAppLibraries();
+    EXPECT_FALSE(unchanged.rootChanged || unchanged.workingSetChanged);
+    EXPECT_EQ(signalsFor(HostPorterRootContainerItemIdentifier), 1u);
+    EXPECT_EQ(signalsFor(HostPorterWorkingSetContainerItemIdentifier), 1u);
+}
+
+TEST_F(LocalPorterTest, BurstOfRefreshRequestsRunsOneRefreshAndCallsEveryHandler) {
+    install({"com.example.one"});
+    porter->refreshAppLibraries();
+    log->clear();
+    std::atomic<int> called{0};
+    for (int i = 0; i < 10; ++i)
+        porter->_refreshInstalledAppsWithCompletionHandler([&] { ++called; });
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while (called < 10 && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    porter->appRefreshQueue()->sync([] {});
+    EXPECT_EQ(called, 10);
+    size_t sections = 0;
+    for (const auto& text : log->texts()) sections += text.ends_with(" pacer event");
+    EXPECT_EQ(sections, 1u);
+}
+
+}  // namespace
+}  // namespace tamber
