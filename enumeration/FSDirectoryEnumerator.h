@@ -1,0 +1,41 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <vector>
+
+#include "platform/Url.h"
+#include "support/Error.h"
+
+namespace tamber {
+
+// The walk flags of a directory listing.
+using DirectoryEnumerationOptions = uint32_t;
+namespace DirectoryEnumerationOption {
+inline constexpr DirectoryEnumerationOptions kSkipsSubdirectoryDescendants = 1;
+inline constexpr DirectoryEnumerationOptions kSkipsPackageDescendants = 2;
+inline constexpr DirectoryEnumerationOptions kSkipsHiddenFiles = 4;
+}  // namespace DirectoryEnumerationOption
+
+// One paged walk over some roots: skips `offset` entries (without reading anything of them
+// beyond their directory entry), then delivers at most `limit`. Entries come in a stable order
+// (by name, byte order, depth first), so that an offset means the same between calls.
+struct FSDirectoryEnumerator {
+    std::vector<Url> urls;
+    bool recursively = false;
+    uint64_t offset = 0;
+    uint64_t limit = 0;
+    // Called for entries that can't be read; true means go on.
+    std::function<bool(const Url& url, const Error& error)> errorHandler;
+    // A per-root override of the walk options; nothing means the default.
+    std::function<std::optional<DirectoryEnumerationOptions>(const Url& root)>
+        directoryEnumerationOptionsFor;
+
+    // Walks and hands each delivered URL (its resource values for the item record prefetched)
+    // to `deliver`; returns the counter: `offset` plus the entries delivered, or less when the
+    // walk ran out before `offset`.
+    uint64_t enumerate(const std::function<void(const Url& url)>& deliver) const;
+};
+
+}  // namespace tamber

@@ -1,0 +1,81 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "fs/TremorReaderDelegate.h"
+#include "platform/Url.h"
+#include "platform/tremors/TremorStream.h"
+#include "support/DispatchQueue.h"
+
+namespace tamber {
+
+enum class TremorReaderMode : uint8_t { pathBased = 0, docIDBased = 1 };
+const char* tremorReaderModeName(TremorReaderMode mode);  // "pathBased" / "docIDBased"
+
+// What the replay since a page token's event says about resuming a gather phase.
+struct TremorReaderGatherPhaseResumeStatus {
+    enum class Kind : uint8_t { deletionOccurred, canResume, cantReplayHistoricalTremors };
+    Kind kind = Kind::canResume;
+    // For deletionOccurred: "[<identifier>, path:'<path>']" (the path part only when known).
+    std::string deletion;
+};
+
+// Turns the file-system event stream of some trees into item-level reports to a delegate:
+// one stream, read from `lastProcessedTremorID` on, every callback and report on
+// `streamQueue`. Owners must stop() a started reader before letting it go.
+class TremorReader : public std::enable_shared_from_this<TremorReader> {
+    struct Private {};
+
+public:
+    static std::shared_ptr<TremorReader> make(std::vector<Url> urls, uint64_t since,
+                                              TremorReaderMode mode, bool verbose);
+    TremorReader(Private, std::vector<Url> urls, uint64_t since, TremorReaderMode mode,
+                 bool verbose);
+    ~TremorReader();
+    TremorReader(const TremorReader&) = delete;
+    TremorReader& operator=(const TremorReader&) = delete;
+
+    // Opens and starts the stream from `lastProcessedTremorID`. A stream that can't be made
+    // is fatal.
+    void start();
+    // Stops, invalidates and releases the stream; nothing when none is open. May be called
+    // from a block on `streamQueue` (the usual way to stop from a delegate call is an async
+    // block there).
+    void stop();
+
+    void setDelegate(std::weak_ptr<TremorReaderDelegate> delegate);
+    // Read on `streamQueue`, or once the reader is stopped.
+    uint64_t lastProcessedTremorID() const;
+    const std::vector<Url>& urls() const { return urls_; }
+    TremorReaderMode mode() const { return mode_; }
+    bool verbose() const { return verbose_; }
+    const std::shared_ptr<DispatchQueue>& streamQueue() const { return streamQueue_; }
+    // "<TremorReader:0x... since:12 urls:[/a, /b] mode:pathBased>"
+    std::string description() const;
+
+    // Replays the history of `urls` since `previousEventID` and says whether a gather phase
+    // that started there may resume, with the current event ID read before the replay.
+    // Blocks the caller until the replay is judged; never call it on a reader's queue.
+    static std::pair<TremorReaderGatherPhaseResumeStatus, uint64_t> canResumeGatherPhase(
+        const std::vector<Url>& urls, uint64_t previousEventID);
+    static uint64_t currentEventID();
+    // The event-store UUID of the volume holding `url`, canonical upper-case text; empty when
+    // the volume has none.
+    static std::optional<std::string> deviceUUID(const Url& url);
+
+private:
+    // Members beyond these are the implementation's to add.
+    std::vector<Url> urls_;
+    TremorReaderMode mode_;
+    bool verbose_;
+    std::shared_ptr<DispatchQueue> streamQueue_;
+};
+
+using TremorReaderRef = std::shared_ptr<TremorReader>;
+
+}  // namespace tamber
