@@ -21,6 +21,7 @@ namespace {
 
 struct Printer {
     std::ostream* out;
+    std::ostream* err;
     bool json;
     bool noFollow;
     DispatchSemaphore done;
@@ -46,6 +47,15 @@ void printEvents(TremorStreamRef, void* info, size_t count, const ObjectRef& pat
             std::snprintf(hex, sizeof hex, "0x%05x", flags[i]);
             *printer.out << ids[i] << " " << hex << " " << (path ? path->value() : "?") << " "
                          << (fileID ? std::to_string(fileID->uint64Value()) : "-") << "\n";
+        }
+        if (flags[i] & (kTremorUserDropped | kTremorKernelDropped)) {
+            // Lost history (an overflow, a tree that could not be watched, a replay from before
+            // the oldest kept event): say so, since the lines above may not be complete.
+            *printer.err << "tamber: warning: events under " << (path ? path->value() : "?")
+                         << " were lost ("
+                         << ((flags[i] & kTremorKernelDropped) ? "kernel" : "user")
+                         << " side); a rescan of that tree is needed\n";
+            printer.err->flush();
         }
         if (printer.noFollow && (flags[i] & kTremorHistoryDone))
             printer.done.signal();
@@ -105,7 +115,7 @@ int EventsCommand::run(CliContext& context) {
             return context.fail(*error, json_);
     }
 
-    Printer printer{&context.out(), json_, noFollow_, DispatchSemaphore(0)};
+    Printer printer{&context.out(), &context.err(), json_, noFollow_, DispatchSemaphore(0)};
     TremorStreamContext streamContext;
     streamContext.info = &printer;
     uint32_t flags =
