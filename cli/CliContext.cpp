@@ -36,7 +36,16 @@ Status CliContext::prepareStorage() {
                      {{"description", "can't use document storage folder " + storage_.path() +
                                           ": " + std::strerror(static_cast<int>(error.code()))}});
     }
-    HostPorterManager::installDefaultManager(std::make_shared<StorageHostPorterManager>(storage_));
+    std::weak_ptr<SignalSlot> weakSlot = signals_;
+    HostPorterManager::installDefaultManager(std::make_shared<StorageHostPorterManager>(
+        storage_, [weakSlot](const HostPorterItemIdentifier& container) {
+            auto slot = weakSlot.lock();
+            if (!slot)
+                return;
+            std::lock_guard lock(slot->mutex);
+            if (slot->handler)
+                slot->handler(container);
+        }));
     return std::nullopt;
 }
 
@@ -63,6 +72,11 @@ Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
     }
     porter_ = porter;
     return porter_;
+}
+
+void CliContext::setSignalHandler(SignalHandler handler) {
+    std::lock_guard lock(signals_->mutex);
+    signals_->handler = std::move(handler);
 }
 
 Error CliContext::usageError(const std::string& message) {

@@ -1,7 +1,9 @@
 #pragma once
 
+#include <functional>
 #include <iosfwd>
 #include <memory>
+#include <mutex>
 #include <string>
 
 #include <nlohmann/json.hpp>
@@ -34,6 +36,11 @@ public:
     Result<std::shared_ptr<LocalPorter>> prepareProvider();
     const LocalPorter::AppRefreshOutcome& appRefreshOutcome() const { return refreshOutcome_; }
 
+    // Receives the container signals the provider sends to the host (a watching verb prints
+    // them); may be called on any thread.
+    using SignalHandler = std::function<void(const HostPorterItemIdentifier&)>;
+    void setSignalHandler(SignalHandler handler);
+
     std::ostream& out() { return out_; }
     std::ostream& err() { return err_; }
 
@@ -52,6 +59,11 @@ private:
     std::ostream& err_;
     Url storage_;
     std::shared_ptr<LocalPorter> porter_;
+    struct SignalSlot {
+        std::mutex mutex;
+        SignalHandler handler;
+    };
+    std::shared_ptr<SignalSlot> signals_ = std::make_shared<SignalSlot>();
     LocalPorter::AppRefreshOutcome refreshOutcome_;
 };
 

@@ -7,13 +7,17 @@
 
 #include <CLI/CLI.hpp>
 
+#include "cli/AnchorCommand.h"
 #include "cli/AppsCommand.h"
+#include "cli/ChangesCommand.h"
 #include "cli/CliContext.h"
 #include "cli/EventsCommand.h"
 #include "cli/IdCommand.h"
 #include "cli/ItemCommand.h"
+#include "cli/ListCommand.h"
 #include "cli/MetaCommand.h"
 #include "cli/PathCommand.h"
+#include "cli/WatchCommand.h"
 #include "support/Log.h"
 #include "support/StderrLogSink.h"
 
@@ -43,6 +47,10 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
     commands.push_back(std::make_unique<EventsCommand>());
     commands.push_back(std::make_unique<ItemCommand>());
     commands.push_back(std::make_unique<AppsCommand>());
+    commands.push_back(std::make_unique<ListCommand>());
+    commands.push_back(std::make_unique<ChangesCommand>());
+    commands.push_back(std::make_unique<AnchorCommand>());
+    commands.push_back(std::make_unique<WatchCommand>());
     std::vector<std::pair<CLI::App*, Command*>> verbs;
     for (auto& c : commands) verbs.emplace_back(c->add(app), c.get());
 

@@ -1,10 +1,10 @@
 #include "cli/EventsCommand.h"
 
-#include <atomic>
 #include <cerrno>
-#include <csignal>
 #include <cstdio>
 #include <ostream>
+
+#include "cli/Interrupt.h"
 
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/objects/Array.h"
@@ -61,13 +61,6 @@ void printEvents(TremorStreamRef, void* info, size_t count, const ObjectRef& pat
             printer.done.signal();
     }
     printer.out->flush();
-}
-
-// Set from the signal handler: only a lock-free store is safe there.
-std::atomic<bool> gInterrupted{false};
-
-void onSignal(int) {
-    gInterrupted.store(true);
 }
 
 }  // namespace
@@ -133,9 +126,7 @@ int EventsCommand::run(CliContext& context) {
     }
     auto queue = DispatchQueue::makeSerial("tamber.cli-events");
     TremorStreamSetDispatchQueue(stream, queue);
-    gInterrupted.store(false);
-    std::signal(SIGINT, onSignal);
-    std::signal(SIGTERM, onSignal);
+    catchInterrupts();
     if (!TremorStreamStart(stream)) {
         TremorStreamRelease(stream);
         return context.fail(Error(kPosixErrorDomain, EIO,
@@ -143,7 +134,7 @@ int EventsCommand::run(CliContext& context) {
                             json_);
     }
     // Without --no-follow nothing signals `done`: only an interrupt ends the wait.
-    while (!gInterrupted.load() && !printer.done.wait(0.2)) {
+    while (!interrupted() && !printer.done.wait(0.2)) {
     }
     TremorStreamStop(stream);
     // A batch may still be printing on the stream's queue; once this barrier passes none is,

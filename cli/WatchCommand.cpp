@@ -1,0 +1,51 @@
+#include "cli/WatchCommand.h"
+
+#include <chrono>
+#include <mutex>
+#include <ostream>
+#include <thread>
+
+#include "cli/ContainerArgument.h"
+#include "cli/Interrupt.h"
+#include "platform/objects/Date.h"
+
+namespace tamber {
+
+CLI::App* WatchCommand::add(CLI::App& app) {
+    auto* sub = app.add_subcommand(
+        "watch", "Print each change signal the provider sends for a container, until Ctrl-C");
+    sub->add_option("ID", container_,
+                    "A folder's identifier or path, or root (default), working-set, "
+                    "all-directories");
+    sub->add_flag("--json", json_, R"(One {"container": ID, "date": ISO-8601} a line)");
+    return sub;
+}
+
+int WatchCommand::run(CliContext& context) {
+    auto porter = context.prepareProvider();
+    if (!porter.ok())
+        return context.fail(porter.error(), json_);
+    std::mutex outMutex;
+    // Installed before the enumerator exists, so that no signal of its start is missed.
+    context.setSignalHandler([&](const HostPorterItemIdentifier& container) {
+        std::lock_guard lock(outMutex);
+        std::string date = Date::now()->iso8601();
+        if (json_)
+            context.out() << nlohmann::json{{"container", container}, {"date", date}}.dump();
+        else
+            context.out() << date << "\t" << container;
+        context.out() << std::endl;
+    });
+    auto container = ContainerArgument::resolve(*porter.value(), container_);
+    if (!container.ok()) {
+        context.setSignalHandler({});
+        return context.fail(container.error(), json_);
+    }
+    catchInterrupts();
+    while (!interrupted()) std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    container.value().enumerator->invalidate();
+    context.setSignalHandler({});
+    return 0;
+}
+
+}  // namespace tamber
