@@ -36,9 +36,11 @@ int AppsCommand::run(CliContext& context) {
     }
     nlohmann::json libraries = nlohmann::json::array();
     for (const auto& item : items) {
+        // The record's own bundle identifier: null when it has none, not "(null)".
+        const auto& bundle = item->pt_appContainerBundleIdentifier();
         libraries.push_back({{"identifier", item->itemIdentifier()},
                              {"name", item->filename()},
-                             {"bundleIdentifier", item->itemIdentifier().substr(1)},
+                             {"bundleIdentifier", bundle ? nlohmann::json(*bundle) : nullptr},
                              {"root", item->fileURL().path()}});
     }
     uint64_t token = manager->versionToken();
