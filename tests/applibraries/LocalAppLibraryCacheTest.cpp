@@ -59,6 +59,38 @@ TEST_F(LocalAppLibraryCacheTest, MissingFileAndRoundTrip) {
     EXPECT_EQ(bundlesOf(load(kWorkingSet).bundleRecords), Identifiers{"org.a"});
 }
 
+TEST_F(LocalAppLibraryCacheTest, LogLinesNameTheFileByItsLastFourComponents) {
+    auto cache = LocalAppLibraryCache::mainCache();
+    EXPECT_EQ(cache->queue().label(), "tamber.app-library-cache.main");
+    EXPECT_EQ(LocalAppLibraryCache::workingSetCache()->queue().label(),
+              "tamber.app-library-cache.working-set");
+    cache->queue().sync([&] {
+        auto abbreviated = [&](const std::string& path) {
+            return cache->abbreviatedPath(Url::fileURLWithPath(path));
+        };
+        EXPECT_EQ(abbreviated("/a/b/c/d/e/f.plist"), "~/c/d/e/f.plist");
+        EXPECT_EQ(abbreviated("/c/d/e/f.plist"), "~/c/d/e/f.plist");
+        EXPECT_EQ(abbreviated("/e/f.plist"), "~/e/f.plist");
+        EXPECT_EQ(abbreviated("/f.plist"), "~/f.plist");
+    });
+
+    std::filesystem::path file = mainPath();
+    std::string shown = "~/" + file.parent_path().parent_path().parent_path().filename().string() +
+                        "/" + file.parent_path().parent_path().filename().string() +
+                        "/Tamber/app-libraries.plist";
+    ASSERT_TRUE(save(kMain, {app("org.a")}, 2).ok());
+    std::string bytes = std::to_string(std::filesystem::file_size(file));
+    EXPECT_EQ(log->texts(),
+              std::vector<std::string>{"[DEBUG] wrote on disk " + bytes + " bytes at " + shown});
+    log->clear();
+    LocalAppLibraryCache::resetSharedForTesting();
+    EXPECT_EQ(load(kMain).versionToken, 2u);
+    EXPECT_EQ(log->texts(),
+              (std::vector<std::string>{"[DEBUG] read from disk " + bytes + " bytes at " + shown,
+                                        "[DEBUG] loaded 1 app library items from data",
+                                        "[DEBUG] version token was set to 2 after load"}));
+}
+
 TEST_F(LocalAppLibraryCacheTest, DamagedFilesYieldNothingAndAreLeftAlone) {
     const std::string badToken =
         "[DEBUG] version token invalid; data on disk is corrupted let's reset";

@@ -1,5 +1,7 @@
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <chrono>
 #include <cstdio>
 #include <future>
 #include <thread>
@@ -94,6 +96,73 @@ TEST_F(LocalAppLibraryManagerTest, UpgradeReportsChangesAndDeletesIndexOnlyWhenA
     EXPECT_TRUE(log->contains("[DEBUG] items from domains (#org.b, #org.c) removed from index"));
     EXPECT_EQ(manager->versionToken(), 3u);
     EXPECT_TRUE(manager->rootURLs().empty());
+}
+
+// Answers index deletions late, from another thread, with an error.
+class LateFailingHost : public RecordingHostPorterManager {
+public:
+    using RecordingHostPorterManager::RecordingHostPorterManager;
+    ~LateFailingHost() override {
+        for (auto& thread : threads_) thread.join();
+    }
+    void deleteSearchableItemsWithDomainIdentifiers(const std::vector<std::string>& identifiers,
+                                                    Completion completion) override {
+        threads_.emplace_back([this, identifiers, completion = std::move(completion)] {
+            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+            RecordingHostPorterManager::deleteSearchableItemsWithDomainIdentifiers(identifiers,
+                                                                                   nullptr);
+            completed = true;
+            completion(Error::posix(EIO));
+        });
+    }
+    std::atomic<bool> completed{false};
+
+private:
+    std::vector<std::thread> threads_;
+};
+
+TEST_F(LocalAppLibraryManagerTest, ManagerAheadOfTheMainCacheTakesItsContentAnyway) {
+    ASSERT_TRUE(save(kWorkingSet, {app("org.a"), app("org.b")}, 5).ok());
+    ASSERT_TRUE(save(kMain, {app("org.a")}, 2).ok());
+    auto manager = LocalAppLibraryManager::init(kWorkingSet);
+    char address[32];
+    std::snprintf(address, sizeof address, "%p", static_cast<const void*>(manager.get()));
+    const std::string ahead = "<LocalAppLibraryManager:" + std::string(address) +
+                              " versionToken:5 cache-source:working-set cache app-libraries:2>";
+    EXPECT_EQ(manager->description(), ahead);
+    auto texts = log->texts();
+    EXPECT_EQ(std::count_if(texts.begin(), texts.end(),
+                            [](const std::string& text) {
+                                return text.starts_with("[DEBUG] \u250f") &&
+                                       text.ends_with(
+                                           " loading bundle proxies from "
+                                           "working-set cache");
+                            }),
+              1);
+    EXPECT_NE(LocalAppLibraryManager::shared()->description().find(" SHARED versionToken:5 "),
+              std::string::npos);
+
+    auto late = std::make_shared<LateFailingHost>(host->documentStorageURL());
+    HostPorterManager::installDefaultManager(late);
+    log->clear();
+    EXPECT_TRUE(manager->upgradeFromMainCache(nullptr, true));
+    // The upgrade waited for the host, and its failure did not stop the upgrade.
+    EXPECT_TRUE(late->completed);
+    EXPECT_EQ(late->deletions(), std::vector<Identifiers>{{"#org.b"}});
+    EXPECT_EQ(log->count("[ERROR] version token shouldn't be greater than the main's cache "
+                         "version (5 vs 2); " +
+                             ahead,
+                         LogLevel::Error),
+              1u);
+    EXPECT_EQ(log->count("[ERROR] can't delete searchable items from (#org.b); " +
+                             Error::posix(EIO).description(),
+                         LogLevel::Error),
+              1u);
+    EXPECT_EQ(manager->versionToken(), 2u);
+    EXPECT_TRUE(
+        log->contains("[DEBUG] upgraded manager <LocalAppLibraryManager:" + std::string(address) +
+                      " versionToken:2 cache-source:working-set cache app-libraries:1>"));
+    EXPECT_FALSE(manager->upgradeFromMainCache(nullptr, true));
 }
 
 // Reads the manager while it is being told, as a root enumerator would.

@@ -3,12 +3,14 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdio>
 #include <deque>
 #include <filesystem>
 #include <tuple>
 
 #include "host/RecordingHostPorterManager.h"
 #include "items/AppLibraryLookup.h"
+#include "items/ItemMetadata.h"
 #include "items/LocalAppLibraryItem.h"
 #include "items/LocalItem.h"
 #include "items/TBFileObjectIdentifier.h"
@@ -194,6 +196,35 @@ TEST_F(ItemTest, OnlyContentsOfATopLevelTrashAreTrashed) {
     EXPECT_TRUE(make(dir.writeFile("Apps/app/Documents/.Trash/Old/deep.txt"))->isTrashed());
     EXPECT_FALSE(make(storage + "/.Trash")->isTrashed());
     EXPECT_FALSE(make(dir.writeFile("Documents/Sub/.Trash/kept.txt"))->isTrashed());
+}
+
+TEST_F(ItemTest, DescriptionNamesParentTypeTrashAndRank) {
+    auto address = [](const void* object) {
+        char text[32];
+        std::snprintf(text, sizeof text, "%p", object);
+        return std::string(text);
+    };
+    auto plain = make(dir.writeFile("Documents/a.txt", "x"));
+    ASSERT_TRUE(plain);
+    EXPECT_EQ(plain->description(), "<LocalItem:" + address(plain.get()) + " " +
+                                        plain->itemIdentifier() +
+                                        " name:\"a.txt\" parent:root type:public.plain-text>");
+
+    std::string old = dir.writeFile("Documents/.Trash/old.txt", "x");
+    if (ItemMetadata::writeFavoriteRank(Url::fileURLWithPath(old), Number::fromInt64(3)))
+        GTEST_SKIP() << "no user attributes on this file system";
+    auto trashed = make(old);
+    ASSERT_TRUE(trashed);
+    EXPECT_EQ(trashed->description(), "<LocalItem:" + address(trashed.get()) + " " +
+                                          trashed->itemIdentifier() +
+                                          " name:\"old.txt\" parent:" + fid(storage + "/.Trash") +
+                                          " type:public.plain-text trashed favorite:3>");
+
+    auto libraryItem = LocalAppLibraryItem::initFrom(libraryRecord(dir / "Apps/app"));
+    ASSERT_TRUE(libraryItem);
+    EXPECT_EQ(libraryItem->description(),
+              "<LocalAppLibraryItem:" + address(libraryItem.get()) +
+                  " #com.example.app name:\"Example\" parent:root type:public.folder>");
 }
 
 TEST_F(ItemTest, OnlyLumenAndResonaPackagesReportTheirSummedSize) {

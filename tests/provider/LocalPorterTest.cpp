@@ -6,6 +6,7 @@
 #include <atomic>
 #include <chrono>
 #include <filesystem>
+#include <fstream>
 #include <thread>
 
 #include "platform/FaultInjectingFileSystem.h"
@@ -70,6 +71,78 @@ TEST_F(LocalPorterTest, FailedLookupsGiveInvalidIdentifierAndOneErrorLine) {
     EXPECT_EQ(
         log->count("[ERROR] identifier lookup failed for URL \"" + missing + "\"", LogLevel::Error),
         1u);
+}
+
+// Whole lines of one lookup: its numbered section around what it logged.
+std::vector<std::string> sectionLines(const std::vector<std::string>& texts,
+                                      const std::string& title) {
+    for (size_t i = 0; i < texts.size(); ++i) {
+        const std::string& open = texts[i];
+        if (!open.starts_with("[DEBUG] \u250f") || !open.ends_with(" " + title))
+            continue;
+        std::string number = open.substr(std::string("[DEBUG] \u250f").size());
+        number = number.substr(0, number.size() - title.size() - 1);
+        for (size_t j = i + 1; j < texts.size(); ++j) {
+            if (texts[j] == "[DEBUG] \u2517" + number)
+                return std::vector<std::string>(texts.begin() + i + 1, texts.begin() + j);
+        }
+    }
+    ADD_FAILURE() << "no closed section \"" << title << "\"";
+    return {};
+}
+
+TEST_F(LocalPorterTest, LookupsRunInTitledSectionsAndLogWhatTheyFound) {
+    std::string file = storage + "/a.txt";
+    std::ofstream(file) << "x";
+    strata->publish(file);
+    Url url = Url::fileURLWithPath(file);
+
+    auto identifier = porter->persistentIdentifierForItemAtURL(url);
+    ASSERT_TRUE(identifier);
+    EXPECT_EQ(sectionLines(log->texts(), "fetching item identifier for \"" + file + "\""),
+              std::vector<std::string>{"[DEBUG] found " + *identifier});
+
+    log->clear();
+    auto item = porter->itemForIdentifier(*identifier);
+    ASSERT_TRUE(item.ok());
+    EXPECT_EQ(sectionLines(log->texts(), "fetching item's properties for \"" + *identifier + "\""),
+              std::vector<std::string>{"[DEBUG] found " + item.value()->description()});
+
+    log->clear();
+    auto found = porter->URLForItemWithPersistentIdentifier(*identifier);
+    ASSERT_TRUE(found);
+    EXPECT_EQ(found->path(), file);
+    EXPECT_EQ(sectionLines(log->texts(), "fetching URL for \"" + *identifier + "\""),
+              std::vector<std::string>{"[DEBUG] found " + found->absoluteString()});
+
+    // A failure is logged after its section has closed, with the host error's code.
+    log->clear();
+    EXPECT_FALSE(porter->URLForItemWithPersistentIdentifier("#com.example.absent"));
+    EXPECT_TRUE(sectionLines(log->texts(), "fetching URL for \"#com.example.absent\"").empty());
+    EXPECT_EQ(log->texts().back(),
+              "[ERROR] can't find URL matching identifier "
+              "#com.example.absent; " +
+                  std::to_string(kHostPorterNoSuchItem));
+}
+
+TEST_F(LocalPorterTest, FilesAreLocalSoProvidingDoesNothing) {
+    std::string file = storage + "/missing.txt";
+    Url url = Url::fileURLWithPath(file);
+    log->clear();
+    int calls = 0;
+    auto completion = [&](std::optional<Error> error) {
+        ++calls;
+        EXPECT_FALSE(error);
+    };
+    porter->providePlaceholderAtURL(url, completion);
+    EXPECT_EQ(calls, 1);  // at once, on the caller's thread
+    porter->startProvidingItemAtURL(url, completion);
+    EXPECT_EQ(calls, 2);
+    porter->itemChangedAtURL(url);
+    porter->stopProvidingItemAtURL(url);
+    EXPECT_FALSE(std::filesystem::exists(file));
+    EXPECT_TRUE(std::filesystem::is_empty(storage));
+    EXPECT_TRUE(log->texts().empty());
 }
 
 TEST_F(LocalPorterTest, TemporaryLocalFolderIsCreatedOnDemand) {
