@@ -83,6 +83,17 @@ TEST_F(ItemAndAppsCommandTest, InstalledAppIsListedAndItsFilesResolve) {
     EXPECT_EQ(tamberJson({"item", identifier})["path"], note);
 }
 
+TEST_F(ItemAndAppsCommandTest, TheStorageFolderNamedDocumentsIsTheRootByPath) {
+    json byPath = tamberJson({"item", storage});
+    EXPECT_EQ(byPath["identifier"], "HostPorterRootContainerItemIdentifier");
+    EXPECT_EQ(byPath["capabilities"], 0x01);
+    EXPECT_EQ(byPath, tamberJson({"item", "root"}));
+    // Any other folder of that name is looked up as an app library root, and fails when it is
+    // none.
+    std::string nested = dir.makeDir("Documents/Work/Documents");
+    EXPECT_EQ(tamberJson({"item", nested}, 1)["error"]["domain"], "LocalPorter.Error");
+}
+
 TEST_F(ItemAndAppsCommandTest, UnknownItemsAreErrors) {
     for (const auto& item : {std::string("#com.example.absent"), dir.writeFile("elsewhere.txt")}) {
         json error = tamberJson({"item", item}, 1)["error"];
