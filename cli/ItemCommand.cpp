@@ -4,7 +4,6 @@
 
 #include "cli/ItemArgument.h"
 #include "cli/ItemJson.h"
-#include "host/UrlOperations.h"
 #include "provider/LocalPorter.h"
 
 namespace tamber {
@@ -24,13 +23,6 @@ int ItemCommand::run(CliContext& context) {
     if (!porter.ok())
         return context.fail(porter.error(), json_);
     ItemArgument argument = ItemArgument::parse(item_);
-    // The provider reads any folder named "Documents" as an app library, and the storage folder
-    // usually has that name: by path, it is asked for as the root.
-    if (argument.kind == ItemArgument::Kind::Path &&
-        pt_relationshipToItemAtURL(context.storageURL(), argument.url) == UrlRelationship::Same) {
-        argument.kind = ItemArgument::Kind::Identifier;
-        argument.identifier = HostPorterRootContainerItemIdentifier;
-    }
     auto item = argument.kind == ItemArgument::Kind::Path
                     ? porter.value()->itemForURL(argument.url)
                     : porter.value()->itemForIdentifierLogged(argument.identifier);

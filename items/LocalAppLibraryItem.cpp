@@ -1,5 +1,7 @@
 #include "items/LocalAppLibraryItem.h"
 
+#include <string_view>
+
 #include "platform/FileSystem.h"
 #include "support/Log.h"
 
@@ -7,16 +9,16 @@ namespace tamber {
 
 namespace {
 
-// Whether `url` names a folder. The child count comes from the link count, to which only
-// folders add (a symbolic link or a plain file named "Inbox" does not), so only a folder may
-// be taken off it.
-bool isReachableFolder(const Url& url) {
+// Whether the entry `name` of `library` is one that listings leave out of the library: its
+// ".Trash" (whatever it is), and "Inbox" when it is a folder (a plain file of that name is
+// listed like any other). The count holds every entry, so only what is left out comes off.
+bool isLeftOutOfListing(const Url& library, const char* name) {
     struct statx st {};
-    if (FileSystem::current().statx(AT_FDCWD, url.path(), AT_SYMLINK_NOFOLLOW, STATX_TYPE, &st) !=
-        0) {
+    if (FileSystem::current().statx(AT_FDCWD, library.appendingPathComponent(name).path(),
+                                    AT_SYMLINK_NOFOLLOW, STATX_TYPE, &st) != 0) {
         return false;
     }
-    return S_ISDIR(st.stx_mode);
+    return std::string_view(name) == ".Trash" || S_ISDIR(st.stx_mode);
 }
 
 }  // namespace
@@ -49,7 +51,7 @@ std::shared_ptr<const LocalAppLibraryItem> LocalAppLibraryItem::initFrom(
     if (auto count = item->childItemCount()) {
         uint64_t children = count->uint64Value();
         for (const char* hidden : {"Inbox", ".Trash"}) {
-            if (!isReachableFolder(url.appendingPathComponent(hidden)))
+            if (!isLeftOutOfListing(url, hidden))
                 continue;
             if (children == 0) {
                 fatalError("child item count of " + url.path() + " would drop below 0 for \"" +

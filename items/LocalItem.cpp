@@ -1,5 +1,6 @@
 #include "items/LocalItem.h"
 
+#include <algorithm>
 #include <atomic>
 #include <bit>
 #include <cerrno>
@@ -127,11 +128,28 @@ struct StatusFields {
     std::shared_ptr<const Number> childItemCount;
 };
 
-// The status query: the inode number, and for folders the child count from the link count.
+// The number of entries of a folder, hidden ones included. Linux counts only sub-folders in a
+// folder's link count (and btrfs always says 1), so the count that other systems read from the
+// link count is read from the folder itself here. Nothing when it can't be read.
+std::shared_ptr<const Number> countEntries(const Url& url) {
+    FileSystem& fs = FileSystem::current();
+    int fd = fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC, 0);
+    if (fd < 0)
+        return nullptr;
+    std::vector<FileSystem::DirectoryEntry> entries;
+    bool read = fs.readDirectory(fd, entries);
+    fs.close(fd);
+    if (!read)
+        return nullptr;
+    // A 16-bit count, as the host's is; a larger folder says the most it can.
+    return Number::fromUInt64(std::min<uint64_t>(entries.size(), UINT16_MAX));
+}
+
+// The status query: the inode number, and for folders the number of children.
 StatusFields readStatus(const Url& url, const std::string& type) {
     struct statx st {};
     if (FileSystem::current().statx(AT_FDCWD, url.path(), AT_SYMLINK_NOFOLLOW,
-                                    STATX_TYPE | STATX_INO | STATX_NLINK, &st) != 0) {
+                                    STATX_TYPE | STATX_INO, &st) != 0) {
         Error error = Error::errorWithPOSIXCode(errno);
         auto message = [&] {
             return "can't find fileID for item \"" + url.path() + "\"; " + error.description();
@@ -144,9 +162,8 @@ StatusFields readStatus(const Url& url, const std::string& type) {
         return {};
     }
     StatusFields status{st.stx_ino, nullptr};
-    // A 16-bit count, as the host's is.
-    if (isFolderType(type) && st.stx_nlink >= 2)
-        status.childItemCount = Number::fromUInt64(static_cast<uint16_t>(st.stx_nlink - 2));
+    if (isFolderType(type) && S_ISDIR(st.stx_mode))
+        status.childItemCount = countEntries(url);
     return status;
 }
 

@@ -1,6 +1,7 @@
 #include "provider/LocalPorter.h"
 
 #include "host/HostPorterManager.h"
+#include "items/AppLibraryLookup.h"
 #include "items/LocalAppLibraryItem.h"
 #include "items/TBFileObjectIdentifier.h"
 #include "items/TBPFileObjectIdentifier.h"
@@ -13,6 +14,11 @@
 namespace tamber {
 
 namespace {
+
+bool isAppLibraryRoot(const Url& url) {
+    auto lookup = AppLibraryLookup::current();
+    return lookup && lookup->bundleIdentifierForRoot(url, UrlRelationship::Same).has_value();
+}
 
 constexpr double kAppRefreshMinimumInterval = 0.5;
 const char* const kTemporaryLocalFolderName = ".TemporaryLocalFolder";
@@ -103,7 +109,10 @@ std::optional<Url> LocalPorter::URLForItemWithPersistentIdentifier(
 }
 
 std::optional<HostPorterItemIdentifier> LocalPorter::identifierForURL(const Url& url) {
-    if (url.lastPathComponent() == "Documents")
+    // An app's library is named by its app. On Linux the document storage itself (~/Documents)
+    // and any user folder may be named "Documents" too: those are ordinary items, not missing
+    // libraries.
+    if (url.lastPathComponent() == "Documents" && isAppLibraryRoot(url))
         return TBPFileObjectIdentifier::fromAppLibraryDataContainerURL(url);
     auto item = LocalItem::make(url);
     if (!item)

@@ -33,24 +33,28 @@ class ItemTest : public ::testing::Test {
 protected:
     using Op = FaultInjectingFileSystem::Operation;
 
-    // Reports a chosen link count for one path, as other file systems would count.
-    class LinkCountFileSystem : public FaultInjectingFileSystem {
+    // Lists one folder as empty, as a count read before its entries appeared would be.
+    class EmptyListingFileSystem : public FaultInjectingFileSystem {
     public:
-        LinkCountFileSystem(std::string path, uint32_t links)
+        explicit EmptyListingFileSystem(std::string path)
             : FaultInjectingFileSystem(std::make_shared<LinuxFileSystem>()),
-              path_(std::move(path)),
-              links_(links) {}
-        int statx(int dirfd, const std::string& path, int flags, unsigned int mask,
-                  struct statx* out) override {
-            int result = FaultInjectingFileSystem::statx(dirfd, path, flags, mask, out);
-            if (result == 0 && path == path_)
-                out->stx_nlink = links_;
-            return result;
+              path_(std::move(path)) {}
+        int open(const std::string& path, int flags, mode_t mode) override {
+            int fd = FaultInjectingFileSystem::open(path, flags, mode);
+            if (path == path_)
+                emptyFd_ = fd;
+            return fd;
+        }
+        bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) override {
+            bool read = FaultInjectingFileSystem::readDirectory(dirfd, out);
+            if (read && dirfd == emptyFd_)
+                out.clear();
+            return read;
         }
 
     private:
         std::string path_;
-        uint32_t links_;
+        int emptyFd_ = -1;
     };
 
     void SetUp() override {
@@ -149,7 +153,7 @@ TEST_F(ItemTest, RecordsAndIdentifierForms) {
     auto projects = make(folder);
     ASSERT_TRUE(projects);
     EXPECT_EQ(projects->parentItemIdentifier(), HostPorterRootContainerItemIdentifier);
-    EXPECT_EQ(count(projects), 2u);  // the two sub-folders
+    EXPECT_EQ(count(projects), 3u);  // two sub-folders and a file
     EXPECT_EQ(make(storage)->parentItemIdentifier(), HostPorterRootContainerItemIdentifier);
 
     ScopedLogCapture log;
@@ -249,36 +253,39 @@ TEST_F(ItemTest, OnlyLumenAndResonaPackagesReportTheirSummedSize) {
     EXPECT_EQ(fs->pendingInjections(), 0u);
 }
 
-TEST_F(ItemTest, ChildCountComesFromTheLinkCountAsSixteenBits) {
+TEST_F(ItemTest, ChildCountIsEveryEntryOfAFolder) {
     std::string folder = dir.makeDir("Documents/Counted");
-    auto countWith = [&](uint32_t links) {
-        testing::ScopedFileSystem scoped(std::make_shared<LinkCountFileSystem>(folder, links));
-        return count(make(folder));
-    };
-    EXPECT_EQ(countWith(1), std::nullopt);  // file systems that don't count sub-folders
-    EXPECT_EQ(countWith(2), 0u);
-    EXPECT_EQ(countWith(65539), 1u);
+    EXPECT_EQ(count(make(folder)), 0u);
+    dir.makeDir("Documents/Counted/a");
+    dir.writeFile("Documents/Counted/b.txt");
+    dir.writeFile("Documents/Counted/.hidden");
+    EXPECT_EQ(count(make(folder)), 3u);
+    EXPECT_EQ(count(make(dir.writeFile("Documents/file.txt"))), std::nullopt);
+    // A folder that can't be read has no count, and still a record.
+    fs->inject(Op::ReadDirectory, EACCES, 1, "Counted");
+    auto unreadable = make(folder);
+    ASSERT_TRUE(unreadable);
+    EXPECT_EQ(count(unreadable), std::nullopt);
 }
 
-TEST_F(ItemTest, AppLibraryCountLeavesOutOnlyHiddenFolders) {
+TEST_F(ItemTest, AppLibraryCountLeavesOutWhatListingsLeaveOut) {
     std::string container = dir / "Apps/app";
     dir.makeDir("Apps/app/Documents/.Trash");
     dir.makeDir("Apps/app/Documents/Work");
     dir.writeFile("Apps/app/Documents/a.txt");
-    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(container))), 1u);
+    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(container))), 2u);
     dir.makeDir("Apps/app/Documents/Inbox");
-    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(container))), 1u);
+    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(container))), 2u);
     // A plain file named "Inbox" is listed like any other and not taken off.
-    std::string other = dir.makeDir("Apps/other/Documents");
     dir.makeDir("Apps/other/Documents/Work");
     dir.writeFile("Apps/other/Documents/Inbox");
-    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(dir / "Apps/other"))), 1u);
+    EXPECT_EQ(count(LocalAppLibraryItem::initFrom(libraryRecord(dir / "Apps/other"))), 2u);
 
-    // A count that says there are no sub-folders while "Inbox" is one stops the process.
+    // A count that says there is nothing while ".Trash" is there stops the process.
     GTEST_FLAG_SET(death_test_style, "threadsafe");
     EXPECT_DEATH(
         {
-            testing::ScopedFileSystem scoped(std::make_shared<LinkCountFileSystem>(library, 2));
+            testing::ScopedFileSystem scoped(std::make_shared<EmptyListingFileSystem>(library));
             LocalAppLibraryItem::initFrom(libraryRecord(container));
         },
         "would drop below 0");

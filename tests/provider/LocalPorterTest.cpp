@@ -10,6 +10,7 @@
 #include <thread>
 
 #include "platform/FaultInjectingFileSystem.h"
+#include "platform/FileContents.h"
 #include "platform/LinuxFileSystem.h"
 #include "provider/LocalPorterError.h"
 #include "tests/common/AppLibraryTest.h"
@@ -177,6 +178,14 @@ TEST_F(LocalPorterTest, AppLibraryDocumentsFolderIsItsHashIdentifier) {
     auto viaIdentifier = porter->itemForIdentifierLogged("#com.example.notes");
     ASSERT_TRUE(viaIdentifier.ok());
     EXPECT_EQ(viaIdentifier.value()->fileURL(), library);
+
+    // Any other folder named "Documents" (a user's, or the storage itself) is an ordinary item.
+    Url folder = Url::fileURLWithPath(storage + "/Documents");
+    ASSERT_FALSE(FileContents::createDirectory(folder));
+    auto plain = porter->persistentIdentifierForItemAtURL(folder);
+    ASSERT_TRUE(plain);
+    EXPECT_EQ(plain->rfind("fid=", 0), 0u) << *plain;
+    EXPECT_EQ(log->countStartingWith("[ERROR]"), 0u);
 }
 
 TEST_F(LocalPorterTest, RefreshSignalsOnlyTheContainersThatChanged) {
