@@ -37,6 +37,10 @@ LocalPorter::LocalPorter()
 std::shared_ptr<LocalPorter> LocalPorter::create() {
     auto porter = std::make_shared<LocalPorter>();
     porter->installPacerHandler();
+    // The host may hold a working set from an earlier run: have it ask what changed since.
+    logInfo("auto notify changes on HostPorterWorkingSetContainerItemIdentifier at startup");
+    HostPorterManager::defaultManager()->signalEnumeratorForContainerItemIdentifier(
+        HostPorterWorkingSetContainerItemIdentifier, [](std::optional<Error>) {});
     return porter;
 }
 

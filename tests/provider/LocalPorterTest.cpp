@@ -29,7 +29,16 @@ protected:
         AppLibraryTest::SetUp();
         storage = host->documentStorageURL().path();
         previousStrata = StrataService::setCurrent(strata);
+        log->clear();
         porter = LocalPorter::create();
+        // A new provider asks the host to look at its working set once, and nothing else.
+        EXPECT_EQ(host->signals(), std::vector<HostPorterItemIdentifier>{
+                                       HostPorterWorkingSetContainerItemIdentifier});
+        EXPECT_EQ(log->count("[INFO] auto notify changes on "
+                             "HostPorterWorkingSetContainerItemIdentifier at startup",
+                             LogLevel::Info),
+                  1u);
+        host->clear();
     }
     void TearDown() override {
         porter.reset();
