@@ -54,6 +54,14 @@ std::string_view FaultInjectingFileSystem::operationName(Operation op) {
             return "unlinkat";
         case Operation::Statvfs:
             return "statvfs";
+        case Operation::Mkdirat:
+            return "mkdirat";
+        case Operation::CopyFileRange:
+            return "copy_file_range";
+        case Operation::Readlinkat:
+            return "readlinkat";
+        case Operation::Symlinkat:
+            return "symlinkat";
     }
     return "unknown";
 }
@@ -237,6 +245,33 @@ int FaultInjectingFileSystem::statvfs(const std::string& path, struct statvfs* o
     if (shouldFail(Operation::Statvfs, {AT_FDCWD, path}))
         return -1;
     return inner_->statvfs(path, out);
+}
+
+int FaultInjectingFileSystem::mkdirat(int dirfd, const std::string& name, mode_t mode) {
+    if (shouldFail(Operation::Mkdirat, {dirfd, name}))
+        return -1;
+    return inner_->mkdirat(dirfd, name, mode);
+}
+
+// Matched against the descriptor written to.
+ssize_t FaultInjectingFileSystem::copy_file_range(int fdIn, int fdOut, size_t length) {
+    if (shouldFail(Operation::CopyFileRange, {fdOut, {}}))
+        return -1;
+    return inner_->copy_file_range(fdIn, fdOut, length);
+}
+
+ssize_t FaultInjectingFileSystem::readlinkat(int dirfd, const std::string& name, char* buffer,
+                                             size_t size) {
+    if (shouldFail(Operation::Readlinkat, {dirfd, name}))
+        return -1;
+    return inner_->readlinkat(dirfd, name, buffer, size);
+}
+
+int FaultInjectingFileSystem::symlinkat(const std::string& target, int newdirfd,
+                                        const std::string& name) {
+    if (shouldFail(Operation::Symlinkat, {newdirfd, name}))
+        return -1;
+    return inner_->symlinkat(target, newdirfd, name);
 }
 
 }  // namespace tamber

@@ -36,8 +36,12 @@ public:
         Renameat2,
         Unlinkat,
         Statvfs,
+        Mkdirat,
+        CopyFileRange,
+        Readlinkat,
+        Symlinkat,
     };
-    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::Statvfs) + 1;
+    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::Symlinkat) + 1;
     static std::string_view operationName(Operation op);
 
     explicit FaultInjectingFileSystem(std::shared_ptr<FileSystem> inner);
@@ -77,6 +81,10 @@ public:
                   const std::string& newpath, unsigned int flags) override;
     int unlinkat(int dirfd, const std::string& path, int flags) override;
     int statvfs(const std::string& path, struct statvfs* out) override;
+    int mkdirat(int dirfd, const std::string& name, mode_t mode) override;
+    ssize_t copy_file_range(int fdIn, int fdOut, size_t length) override;
+    ssize_t readlinkat(int dirfd, const std::string& name, char* buffer, size_t size) override;
+    int symlinkat(const std::string& target, int newdirfd, const std::string& name) override;
 
 private:
     struct Injection {

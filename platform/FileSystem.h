@@ -66,6 +66,13 @@ public:
                           const std::string& newpath, unsigned int flags) = 0;
     virtual int unlinkat(int dirfd, const std::string& path, int flags) = 0;
     virtual int statvfs(const std::string& path, struct statvfs* out) = 0;
+
+    virtual int mkdirat(int dirfd, const std::string& name, mode_t mode) = 0;
+    // copy_file_range(2) from each descriptor's current offset (which both advance).
+    virtual ssize_t copy_file_range(int fdIn, int fdOut, size_t length) = 0;
+    // readlinkat(2): the target, not NUL-terminated, truncated to `size`.
+    virtual ssize_t readlinkat(int dirfd, const std::string& name, char* buffer, size_t size) = 0;
+    virtual int symlinkat(const std::string& target, int newdirfd, const std::string& name) = 0;
 };
 
 }  // namespace tamber

@@ -194,4 +194,20 @@ int LinuxFileSystem::statvfs(const std::string& path, struct statvfs* out) {
     return ::statvfs(path.c_str(), out);
 }
 
+int LinuxFileSystem::mkdirat(int dirfd, const std::string& name, mode_t mode) {
+    return ::mkdirat(dirfd, name.c_str(), mode);
+}
+
+ssize_t LinuxFileSystem::copy_file_range(int fdIn, int fdOut, size_t length) {
+    return ::copy_file_range(fdIn, nullptr, fdOut, nullptr, length, 0);
+}
+
+ssize_t LinuxFileSystem::readlinkat(int dirfd, const std::string& name, char* buffer, size_t size) {
+    return ::readlinkat(dirfd, name.c_str(), buffer, size);
+}
+
+int LinuxFileSystem::symlinkat(const std::string& target, int newdirfd, const std::string& name) {
+    return ::symlinkat(target.c_str(), newdirfd, name.c_str());
+}
+
 }  // namespace tamber

@@ -28,6 +28,10 @@ public:
                   const std::string& newpath, unsigned int flags) override;
     int unlinkat(int dirfd, const std::string& path, int flags) override;
     int statvfs(const std::string& path, struct statvfs* out) override;
+    int mkdirat(int dirfd, const std::string& name, mode_t mode) override;
+    ssize_t copy_file_range(int fdIn, int fdOut, size_t length) override;
+    ssize_t readlinkat(int dirfd, const std::string& name, char* buffer, size_t size) override;
+    int symlinkat(const std::string& target, int newdirfd, const std::string& name) override;
 };
 
 }  // namespace tamber
