@@ -26,7 +26,8 @@ struct FSDirectoryEnumerator {
     bool recursively = false;
     uint64_t offset = 0;
     uint64_t limit = 0;
-    // Called for entries that can't be read; true means go on.
+    // Called for entries that can't be read; true means go on. Nothing means
+    // logEnumerationError.
     std::function<bool(const Url& url, const Error& error)> errorHandler;
     // A per-root override of the walk options; nothing means the default.
     std::function<std::optional<DirectoryEnumerationOptions>(const Url& root)>
@@ -36,6 +37,12 @@ struct FSDirectoryEnumerator {
     // to `deliver`; returns the counter: `offset` plus the entries delivered, or less when the
     // walk ran out before `offset`.
     uint64_t enumerate(const std::function<void(const Url& url)>& deliver) const;
+
+    // The usual error handler: "can't enumerate <path>; <error>", a debug line for a file that
+    // vanished and an error line otherwise; always goes on.
+    static bool logEnumerationError(const Url& url, const Error& error);
+    // Skip hidden files and package contents; and subdirectories' contents unless recursive.
+    static DirectoryEnumerationOptions defaultOptions(bool recursively);
 };
 
 }  // namespace tamber

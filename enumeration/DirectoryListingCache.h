@@ -1,0 +1,86 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <list>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/FileSystem.h"
+#include "support/Result.h"
+
+namespace tamber {
+
+// The sorted entries of recently listed directories, kept between the pages of a listing so
+// that page N of a large folder does not read and sort the whole folder again. A kept listing
+// is handed out only while the directory is provably unchanged: same file system object, same
+// device and inode, same modification and change times, and those times old enough that a
+// change within the same timestamp tick can't hide behind them. Bounded by a few listings and
+// a total entry count; the least recently used goes first.
+class DirectoryListingCache {
+public:
+    struct Entries {
+        std::vector<FileSystem::DirectoryEntry> all;
+        // Indices (into `all`) of the entries whose name does not begin with ".", so that a
+        // walk that skips hidden entries can jump to an offset without looking at each one.
+        std::vector<uint32_t> visible;
+    };
+    using Listing = std::shared_ptr<const Entries>;
+
+    static constexpr size_t kDefaultMaxListings = 16;
+    static constexpr size_t kDefaultMaxEntries = 400'000;
+
+    // The process-wide cache.
+    static DirectoryListingCache& shared();
+
+    DirectoryListingCache(size_t maxListings, size_t maxEntries);
+    DirectoryListingCache(const DirectoryListingCache&) = delete;
+    DirectoryListingCache& operator=(const DirectoryListingCache&) = delete;
+
+    // The entries of the directory at `path` (absolute), sorted by name in byte order, "." and
+    // ".." left out. Never follows a final symbolic link. A missing directory is
+    // HostPlatformErrorDomain 260; any other failure (ENOTDIR, ELOOP, EACCES...) its POSIX
+    // error.
+    Result<Listing> listing(const std::string& path);
+
+    void clear();
+    size_t listingCount() const;
+
+    // How long after a directory's last change its listing may be kept, for file systems with
+    // nanosecond stamps and with whole-second ones.
+    static constexpr int64_t kFineMarginNanoseconds = 50'000'000;
+    static constexpr int64_t kCoarseMarginNanoseconds = 2'000'000'000;
+
+private:
+    struct Stamp {
+        uint32_t deviceMajor = 0;
+        uint32_t deviceMinor = 0;
+        uint64_t inode = 0;
+        int64_t mtimeSeconds = 0;
+        uint32_t mtimeNanoseconds = 0;
+        int64_t ctimeSeconds = 0;
+        uint32_t ctimeNanoseconds = 0;
+        friend bool operator==(const Stamp&, const Stamp&) = default;
+    };
+    struct Kept {
+        const FileSystem* fileSystem;
+        std::weak_ptr<FileSystem> fileSystemAlive;
+        Stamp stamp;
+        Listing listing;
+    };
+
+    static Result<Stamp> stampOf(FileSystem& fs, int fd, const std::string& path);
+    static bool oldEnoughToKeep(const Stamp& stamp);
+    Listing find(const FileSystem* fs, const Stamp& stamp);
+    void keep(const std::shared_ptr<FileSystem>& fs, const Stamp& stamp, Listing listing);
+
+    const size_t maxListings_;
+    const size_t maxEntries_;
+    mutable std::mutex mutex_;
+    std::list<Kept> kept_;  // most recently used first
+    size_t keptEntries_ = 0;
+};
+
+}  // namespace tamber
