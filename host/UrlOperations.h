@@ -2,6 +2,8 @@
 
 #include <cstdint>
 #include <functional>
+#include <optional>
+#include <string>
 
 #include "platform/Url.h"
 #include "support/Result.h"
@@ -26,5 +28,50 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url);
 // directories included), runs `body` with the descriptor and closes it. False when the open
 // failed or `body` returned false; errno is then the one of the failing call.
 bool pt_withReadWriteAccess(const Url& url, const std::function<bool(int fd)>& body);
+
+// The file operations below run on the calling thread and call their completion exactly once,
+// before returning, with the resulting URL or an error (never both, never neither).
+//
+// A name given by the caller that is empty, ".", "..", or holds "/" or NUL fails with the host
+// framework's invalid-parameter error; other failures are the POSIX error of the failing call.
+// Names never replace an existing item: where an operation "bounces", a taken name becomes
+// "name 2.ext", "name 3.ext", ... (a folder, or a name without extension: "name 2"); where it
+// does not, the operation fails with EEXIST and leaves both items alone. The item operated on
+// is never followed when it is a symbolic link, and walks never follow links inside a folder.
+// Moves are single renames: an item is never left in two places or in none, and a move to
+// another file system fails with EXDEV instead of copying.
+using UrlCompletion = std::function<void(std::optional<Url>, std::optional<Error>)>;
+using ErrorCompletion = std::function<void(std::optional<Error>)>;
+
+// Copies `source` (a file, a folder with everything below it, or a symbolic link as a link)
+// into `folder` under its own name, bouncing. The copy is assembled under a hidden temporary
+// name in `folder` and renamed into place, so the final name never holds a partial copy; on
+// failure the temporary copy is removed. The source is never changed.
+void pt_importUnderFolder(const Url& source, const Url& folder, const UrlCompletion& completion);
+
+// Creates the folder `name` in `folder`, bouncing.
+void pt_createSubFolder(const Url& folder, const std::string& name,
+                        const UrlCompletion& completion);
+
+// Gives the item a new name in its folder; fails on a taken name. The same name is a no-op.
+void pt_renameWithNewName(const Url& url, const std::string& name, const UrlCompletion& completion);
+
+// Moves the item into `folder`, under `newName` or its own name; fails on a taken name.
+void pt_reparentUnderFolder(const Url& url, const Url& folder,
+                            const std::optional<std::string>& newName,
+                            const UrlCompletion& completion);
+// (Keeps a string literal from choosing the bouncing overload below; null means no new name.)
+void pt_reparentUnderFolder(const Url& url, const Url& folder, const char* newName,
+                            const UrlCompletion& completion);
+// Moves the item into `folder` under its own name, bouncing when `allowBouncing`.
+void pt_reparentUnderFolder(const Url& url, const Url& folder, bool allowBouncing,
+                            const UrlCompletion& completion);
+
+// Moves the item into the (existing) trash folder, bouncing.
+void pt_trashUnderFolder(const Url& url, const Url& trashFolder, const UrlCompletion& completion);
+
+// Deletes the item; a folder with everything below it. Symbolic links are removed, never
+// followed. A failure part-way leaves what was not yet removed in place.
+void pt_deleteWithCompletionHandler(const Url& url, const ErrorCompletion& completion);
 
 }  // namespace tamber

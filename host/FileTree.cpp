@@ -1,0 +1,279 @@
+#include "host/FileTree.h"
+
+#include <dirent.h>
+
+#include <cerrno>
+#include <climits>
+#include <functional>
+#include <vector>
+
+#include "host/ScopedFd.h"
+#include "platform/FileSystem.h"
+
+namespace tamber::filetree {
+
+namespace {
+
+Error lastError() {
+    return Error::errorWithPOSIXCode(errno);
+}
+
+}  // namespace
+
+std::optional<ItemType> itemTypeAt(int dirfd, const std::string& name) {
+    struct statx st {};
+    if (FileSystem::current().statx(dirfd, name, AT_SYMLINK_NOFOLLOW,
+                                    STATX_TYPE | STATX_MODE | STATX_INO, &st) != 0)
+        return std::nullopt;
+    return ItemType{st.stx_mode, (uint64_t(st.stx_dev_major) << 32) | st.stx_dev_minor, st.stx_ino};
+}
+
+// Walks through descriptors opened without following links, so that a link found inside is
+// removed as a link and never entered.
+Status removeItem(int dirfd, const std::string& name) {
+    FileSystem& fs = FileSystem::current();
+    auto type = itemTypeAt(dirfd, name);
+    if (!type)
+        return lastError();
+    if (!S_ISDIR(type->mode)) {
+        if (fs.unlinkat(dirfd, name, 0) != 0)
+            return lastError();
+        return std::nullopt;
+    }
+
+    struct Frame {
+        int fd;
+        std::string name;  // in the folder below it on the stack (or `dirfd`)
+        std::vector<FileSystem::DirectoryEntry> entries;
+        size_t next = 0;
+    };
+    std::vector<Frame> stack;
+    auto closeAll = [&] {
+        int saved = errno;
+        for (Frame& frame : stack) fs.close(frame.fd);
+        errno = saved;
+    };
+    // Opens a folder and reads it; false with errno set when either fails.
+    auto enter = [&](int parent, const std::string& child) {
+        int fd = fs.openat(parent, child, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+        if (fd < 0)
+            return false;
+        std::vector<FileSystem::DirectoryEntry> entries;
+        if (!fs.readDirectory(fd, entries)) {
+            int saved = errno;
+            fs.close(fd);
+            errno = saved;
+            return false;
+        }
+        stack.push_back({fd, child, std::move(entries)});
+        return true;
+    };
+
+    if (!enter(dirfd, name))
+        return lastError();
+    while (!stack.empty()) {
+        Frame& top = stack.back();
+        if (top.next == top.entries.size()) {
+            std::string done = std::move(top.name);
+            fs.close(top.fd);
+            stack.pop_back();
+            int parent = stack.empty() ? dirfd : stack.back().fd;
+            if (fs.unlinkat(parent, done, AT_REMOVEDIR) != 0 && errno != ENOENT) {
+                Error error = lastError();
+                closeAll();
+                return error;
+            }
+            continue;
+        }
+        const FileSystem::DirectoryEntry& entry = top.entries[top.next++];
+        int parent = top.fd;
+        bool isDirectory = entry.type == DT_DIR;
+        if (entry.type == DT_UNKNOWN) {
+            auto entryType = itemTypeAt(parent, entry.name);
+            isDirectory = entryType && S_ISDIR(entryType->mode);
+        }
+        std::string child = entry.name;  // `entry` dies when a frame is pushed
+        if (isDirectory && enter(parent, child))
+            continue;
+        // Not a folder, or no longer one (replaced by a link or a file since it was listed).
+        if (isDirectory && errno != ENOTDIR && errno != ELOOP && errno != ENOENT) {
+            Error error = lastError();
+            closeAll();
+            return error;
+        }
+        if (fs.unlinkat(parent, child, 0) != 0 && errno != ENOENT) {
+            Error error = lastError();
+            closeAll();
+            return error;
+        }
+    }
+    return std::nullopt;
+}
+
+// Copies the bytes of one open file into another, in the kernel when it can, else by reading
+// and writing (file systems and kernels that refuse copy_file_range between them).
+static Status copyBytes(int in, int out) {
+    FileSystem& fs = FileSystem::current();
+    for (;;) {
+        ssize_t n = fs.copy_file_range(in, out, size_t(1) << 30);
+        if (n > 0)
+            continue;
+        if (n == 0)
+            return std::nullopt;
+        if (errno == EINTR)
+            continue;
+        if (errno != EXDEV && errno != EINVAL && errno != ENOSYS && errno != EOPNOTSUPP)
+            return lastError();
+        break;
+    }
+    std::vector<char> buffer(128 * 1024);
+    for (;;) {
+        ssize_t n = fs.read(in, buffer.data(), buffer.size());
+        if (n < 0 && errno == EINTR)
+            continue;
+        if (n < 0)
+            return lastError();
+        if (n == 0)
+            return std::nullopt;
+        for (ssize_t done = 0; done < n;) {
+            ssize_t w = fs.write(out, buffer.data() + done, size_t(n - done));
+            if (w < 0 && errno == EINTR)
+                continue;
+            if (w < 0)
+                return lastError();
+            done += w;
+        }
+    }
+}
+
+// Copies a file's bytes into `out` and makes them durable, so that a crash after the copy is
+// renamed into place cannot publish an empty or partial file.
+Status copyFileInto(int fromDir, const std::string& from, int out) {
+    FileSystem& fs = FileSystem::current();
+    // Non-blocking in case a pipe took the file's place since it was looked at.
+    ScopedFd in(fs.openat(fromDir, from, O_RDONLY | O_NOFOLLOW | O_NONBLOCK));
+    if (!in.ok())
+        return lastError();
+    if (Status copied = copyBytes(in.get(), out))
+        return copied;
+    if (fs.fsync(out) != 0)
+        return lastError();
+    return std::nullopt;
+}
+
+// Imported documents stay editable by their owner, whatever the source allowed.
+mode_t copyMode(mode_t mode) {
+    return (mode & 0777) | S_IWUSR;
+}
+
+static Status copyFile(int fromDir, const std::string& from, int toDir, const std::string& to,
+                       mode_t mode) {
+    ScopedFd out(FileSystem::current().openat(toDir, to, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW,
+                                              copyMode(mode)));
+    if (!out.ok())
+        return lastError();
+    return copyFileInto(fromDir, from, out.get());
+}
+
+Result<std::string> readLink(int dirfd, const std::string& name) {
+    std::string target(PATH_MAX, '\0');
+    ssize_t n = FileSystem::current().readlinkat(dirfd, name, target.data(), target.size());
+    if (n < 0)
+        return lastError();
+    if (size_t(n) == target.size())
+        return Error::posix(ENAMETOOLONG);  // possibly cut short
+    target.resize(size_t(n));
+    return target;
+}
+
+static Status copyLink(int fromDir, const std::string& from, int toDir, const std::string& to) {
+    auto target = readLink(fromDir, from);
+    if (!target.ok())
+        return target.error();
+    if (FileSystem::current().symlinkat(*target, toDir, to) != 0)
+        return lastError();
+    return std::nullopt;
+}
+
+// Copies what the folder `from` of `fromDir` holds into the existing empty folder `to` of
+// `toDir`: folders, files and links; other kinds of file (pipes, sockets, devices) are left
+// out. When the copy is made inside the folder being copied, the walk leaves the copy out.
+Status copyFolderInto(int fromDir, const std::string& from, int toDir, const std::string& to) {
+    FileSystem& fs = FileSystem::current();
+    struct Frame {
+        int from;
+        int to;
+        std::vector<FileSystem::DirectoryEntry> entries;
+        size_t next = 0;
+    };
+    std::vector<Frame> stack;
+    auto closeAll = [&] {
+        int saved = errno;
+        for (Frame& frame : stack) {
+            fs.close(frame.from);
+            fs.close(frame.to);
+        }
+        stack.clear();
+        errno = saved;
+    };
+    // Opens both sides of one folder (making the copy unless `create` is null); false with
+    // errno set.
+    auto enter = [&](int parentFrom, const std::string& name, int parentTo,
+                     const std::string& copyName, std::optional<mode_t> create) {
+        if (create && fs.mkdirat(parentTo, copyName, copyMode(*create) | S_IRWXU) != 0)
+            return false;
+        int in = fs.openat(parentFrom, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
+        int out = in < 0 ? -1 : fs.openat(parentTo, copyName, O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        std::vector<FileSystem::DirectoryEntry> entries;
+        if (out < 0 || !fs.readDirectory(in, entries)) {
+            int saved = errno;
+            if (in >= 0)
+                fs.close(in);
+            if (out >= 0)
+                fs.close(out);
+            errno = saved;
+            return false;
+        }
+        stack.push_back({in, out, std::move(entries)});
+        return true;
+    };
+
+    if (!enter(fromDir, from, toDir, to, std::nullopt))
+        return lastError();
+    std::optional<ItemType> copyRoot = itemTypeAt(toDir, to);
+    while (!stack.empty()) {
+        Frame& top = stack.back();
+        if (top.next == top.entries.size()) {
+            fs.close(top.from);
+            fs.close(top.to);
+            stack.pop_back();
+            continue;
+        }
+        std::string name = top.entries[top.next++].name;
+        int in = top.from;
+        int out = top.to;
+        auto type = itemTypeAt(in, name);
+        Status failure;
+        if (!type) {
+            if (errno == ENOENT)
+                continue;  // removed while we copied
+            failure = lastError();
+        } else if (S_ISDIR(type->mode)) {
+            if (copyRoot && type->device == copyRoot->device && type->inode == copyRoot->inode)
+                continue;
+            if (!enter(in, name, out, name, type->mode))
+                failure = lastError();
+        } else if (S_ISREG(type->mode)) {
+            failure = copyFile(in, name, out, name, type->mode);
+        } else if (S_ISLNK(type->mode)) {
+            failure = copyLink(in, name, out, name);
+        }
+        if (failure) {
+            closeAll();
+            return failure;
+        }
+    }
+    return std::nullopt;
+}
+
+}  // namespace tamber::filetree
