@@ -1,7 +1,9 @@
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <utility>
@@ -69,11 +71,34 @@ public:
     static std::optional<std::string> deviceUUID(const Url& url);
 
 private:
+    // The stream's callback. `info` names the reader through a registry, so that a batch still
+    // queued after the reader stopped or went away finds nothing instead of freed memory.
+    static void streamCallback(TremorStreamRef stream, void* info, size_t numEvents,
+                               const ObjectRef& paths, const uint32_t* flags, const uint64_t* ids);
+    void receiveBatch(size_t numEvents, const ObjectRef& paths, const uint32_t* flags,
+                      const uint64_t* ids);
+    void processEvent(const std::string& path, std::optional<uint64_t> fileID, uint32_t flags,
+                      uint64_t eventID, size_t index, size_t count);
+    void classifyEvent(const std::string& path, std::optional<uint64_t> fileID, uint32_t flags,
+                       uint64_t eventID);
+    void processDocIDEvent(const std::string& path, uint64_t eventID);
+    void processPathEvent(const std::string& path, std::optional<uint64_t> fileID,
+                          uint64_t eventID);
+    bool isHidden(const Url& url) const;
+    std::shared_ptr<TremorReaderDelegate> delegate() const;
+    void recordEventID(uint64_t eventID);
+
     // Members beyond these are the implementation's to add.
     std::vector<Url> urls_;
     TremorReaderMode mode_;
     bool verbose_;
     std::shared_ptr<DispatchQueue> streamQueue_;
+
+    std::atomic<uint64_t> lastProcessedTremorID_;
+    mutable std::mutex mutex_;
+    TremorStreamRef stream_ = nullptr;              // guarded by mutex_
+    uint64_t registration_ = 0;                     // guarded by mutex_; 0 while no stream
+    std::weak_ptr<TremorReaderDelegate> delegate_;  // guarded by mutex_
 };
 
 using TremorReaderRef = std::shared_ptr<TremorReader>;

@@ -1,0 +1,55 @@
+#include "fs/DocIDPath.h"
+
+#include <cctype>
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+
+namespace tamber {
+
+namespace {
+
+bool readNumber(const char*& cursor, int64_t& value) {
+    errno = 0;
+    char* end = nullptr;
+    long long number = std::strtoll(cursor, &end, 10);
+    if (errno != 0)
+        return false;
+    value = number;
+    cursor = end;
+    return true;
+}
+
+bool readLiteral(const char*& cursor, const char* end, const char* literal) {
+    size_t length = std::strlen(literal);
+    if (static_cast<size_t>(end - cursor) < length || std::memcmp(cursor, literal, length) != 0)
+        return false;
+    cursor += length;
+    return true;
+}
+
+}  // namespace
+
+std::optional<DocIDPath> DocIDPath::parse(const std::string& path) {
+    // c_str() ends in a NUL, so strtoll never reads past the text; `end` catches embedded NULs.
+    const char* cursor = path.c_str();
+    const char* end = cursor + path.size();
+    while (cursor < end && *cursor == '/') ++cursor;
+    if (!readLiteral(cursor, end, ".docid/"))
+        return std::nullopt;
+    if (cursor < end && std::isdigit(static_cast<unsigned char>(*cursor))) {
+        int64_t device = 0;  // not used: the stream already chose the device
+        if (!readNumber(cursor, device) || !readLiteral(cursor, end, "/"))
+            return std::nullopt;
+    }
+    DocIDPath parsed;
+    if (!readLiteral(cursor, end, "changed/") || !readNumber(cursor, parsed.documentID) ||
+        !readLiteral(cursor, end, "/src=") || !readNumber(cursor, parsed.source) ||
+        !readLiteral(cursor, end, ",dst=") || !readNumber(cursor, parsed.destination))
+        return std::nullopt;
+    if (cursor != end)
+        return std::nullopt;
+    return parsed;
+}
+
+}  // namespace tamber

@@ -1,0 +1,402 @@
+#include "fs/TremorReader.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <map>
+
+#include "applibraries/LocalAppLibraryManager.h"
+#include "fs/CanonicalUUID.h"
+#include "fs/DocIDPath.h"
+#include "fs/TremorChecker.h"
+#include "host/HostPorterManager.h"
+#include "host/UrlOperations.h"
+#include "items/LocalAppLibraryItem.h"
+#include "items/TBFileObjectIdentifier.h"
+#include "items/TBPFileObjectIdentifier.h"
+#include "platform/objects/Array.h"
+#include "platform/objects/Dictionary.h"
+#include "platform/objects/Number.h"
+#include "platform/objects/String.h"
+#include "platform/tremors/Tremors.h"
+#include "support/Log.h"
+#include "support/LogSection.h"
+
+namespace tamber {
+
+namespace {
+
+constexpr double kLatencySeconds = 0.5;
+// Paths as objects, one event per file, and a {"path", "fileID"} dictionary per event.
+constexpr uint32_t kCreateFlags =
+    kTremorCreateUseObjects | kTremorCreateFileEvents | kTremorCreateUseExtendedData;
+constexpr const char* kDocIDRoot = "/.docid";
+constexpr const char* kDocIDMarker = ".docid/";
+
+// Streams hold a number, not the reader: a batch that was already queued when its reader
+// stopped or was destroyed looks the number up, finds nothing and is dropped.
+std::mutex registryMutex;
+std::map<uint64_t, std::weak_ptr<TremorReader>> registry;  // guarded by registryMutex
+uint64_t lastRegistration = 0;                             // guarded by registryMutex
+
+uint64_t registerReader(std::weak_ptr<TremorReader> reader) {
+    std::lock_guard lock(registryMutex);
+    registry.emplace(++lastRegistration, std::move(reader));
+    return lastRegistration;
+}
+
+void unregisterReader(uint64_t registration) {
+    std::lock_guard lock(registryMutex);
+    registry.erase(registration);
+}
+
+std::shared_ptr<TremorReader> registeredReader(uint64_t registration) {
+    std::lock_guard lock(registryMutex);
+    auto it = registry.find(registration);
+    return it == registry.end() ? nullptr : it->second.lock();
+}
+
+// The stream does not own its reader.
+void* retainInfo(void* info) {
+    return info;
+}
+void releaseInfo(void*) {}
+
+std::string joinedPaths(const std::vector<Url>& urls) {
+    std::string text = "[";
+    for (size_t i = 0; i < urls.size(); ++i) {
+        if (i > 0)
+            text += ", ";
+        text += urls[i].path();
+    }
+    return text + "]";
+}
+
+}  // namespace
+
+const char* tremorReaderModeName(TremorReaderMode mode) {
+    return mode == TremorReaderMode::docIDBased ? "docIDBased" : "pathBased";
+}
+
+std::shared_ptr<TremorReader> TremorReader::make(std::vector<Url> urls, uint64_t since,
+                                                 TremorReaderMode mode, bool verbose) {
+    return std::make_shared<TremorReader>(Private{}, std::move(urls), since, mode, verbose);
+}
+
+TremorReader::TremorReader(Private, std::vector<Url> urls, uint64_t since, TremorReaderMode mode,
+                           bool verbose)
+    : urls_(std::move(urls)),
+      mode_(mode),
+      verbose_(verbose),
+      streamQueue_(DispatchQueue::makeSerial("tamber.tremors-stream")),
+      lastProcessedTremorID_(since) {}
+
+TremorReader::~TremorReader() {
+    std::lock_guard lock(mutex_);
+    if (!stream_)
+        return;
+    // The stream stays open (its owner broke the contract); its later batches find no reader.
+    unregisterReader(registration_);
+    logError("stream deleted without being stopped; " + description());
+}
+
+void TremorReader::start() {
+    if (verbose_)
+        logDebug([&] { return "starting " + description(); });
+    std::lock_guard lock(mutex_);
+    if (stream_)
+        return;  // already running
+    registration_ = registerReader(weak_from_this());
+    TremorStreamContext context;
+    context.info = reinterpret_cast<void*>(static_cast<uintptr_t>(registration_));
+    context.retain = retainInfo;
+    context.release = releaseInfo;
+    uint64_t since = lastProcessedTremorID_.load();
+    TremorStreamRef stream = nullptr;
+    if (mode_ == TremorReaderMode::docIDBased) {
+        Url storage = HostPorterManager::defaultManager()->documentStorageURL();
+        uint32_t device = TBFileObjectIdentifier::deviceID(storage);
+        stream =
+            TremorStreamCreateRelativeToDevice(&TremorReader::streamCallback, &context, device,
+                                               {kDocIDRoot}, since, kLatencySeconds, kCreateFlags);
+    } else {
+        std::vector<std::string> paths;
+        paths.reserve(urls_.size());
+        for (const Url& url : urls_) paths.push_back(url.path());
+        stream = TremorStreamCreate(&TremorReader::streamCallback, &context, paths, since,
+                                    kLatencySeconds, kCreateFlags);
+    }
+    if (!stream) {
+        unregisterReader(registration_);
+        fatalError("can't create tremor stream for " + description());
+    }
+    stream_ = stream;
+    TremorStreamSetDispatchQueue(stream, streamQueue_);
+    TremorStreamStart(stream);
+}
+
+void TremorReader::stop() {
+    TremorStreamRef stream;
+    {
+        std::lock_guard lock(mutex_);
+        if (!stream_)
+            return;
+        // From here on, batches the stream already queued find no reader.
+        unregisterReader(registration_);
+        registration_ = 0;
+        stream = stream_;
+        stream_ = nullptr;
+    }
+    TremorStreamStop(stream);
+    TremorStreamInvalidate(stream);
+    TremorStreamRelease(stream);
+    if (verbose_)
+        logDebug([&] { return "stopped " + description(); });
+}
+
+void TremorReader::setDelegate(std::weak_ptr<TremorReaderDelegate> delegate) {
+    std::lock_guard lock(mutex_);
+    delegate_ = std::move(delegate);
+}
+
+std::shared_ptr<TremorReaderDelegate> TremorReader::delegate() const {
+    std::lock_guard lock(mutex_);
+    return delegate_.lock();
+}
+
+uint64_t TremorReader::lastProcessedTremorID() const {
+    return lastProcessedTremorID_.load();
+}
+
+void TremorReader::recordEventID(uint64_t eventID) {
+    lastProcessedTremorID_.store(eventID);
+}
+
+std::string TremorReader::description() const {
+    char address[32];
+    std::snprintf(address, sizeof address, "%p", static_cast<const void*>(this));
+    return std::string("<TremorReader:") + address +
+           " since:" + std::to_string(lastProcessedTremorID_.load()) +
+           " urls:" + joinedPaths(urls_) + " mode:" + tremorReaderModeName(mode_) + ">";
+}
+
+uint64_t TremorReader::currentEventID() {
+    return TremorsGetCurrentEventId();
+}
+
+std::optional<std::string> TremorReader::deviceUUID(const Url& url) {
+    uint32_t device = TBFileObjectIdentifier::deviceID(url);
+    return canonicalUUIDText(TremorsCopyUUIDForDevice(device));
+}
+
+std::pair<TremorReaderGatherPhaseResumeStatus, uint64_t> TremorReader::canResumeGatherPhase(
+    const std::vector<Url>& urls, uint64_t previousEventID) {
+    uint64_t current = currentEventID();
+    auto reader = make(urls, previousEventID, TremorReaderMode::pathBased, false);
+    auto checker = std::make_shared<TremorChecker>();
+    reader->setDelegate(checker);
+    // Never on the reader's queue: the replay that decides runs there.
+    DispatchQueue::global()->async([reader] { reader->start(); });
+    return {checker->wait(), current};
+}
+
+void TremorReader::streamCallback(TremorStreamRef, void* info, size_t numEvents,
+                                  const ObjectRef& paths, const uint32_t* flags,
+                                  const uint64_t* ids) {
+    auto reader = registeredReader(static_cast<uint64_t>(reinterpret_cast<uintptr_t>(info)));
+    if (!reader)
+        return;
+    reader->receiveBatch(numEvents, paths, flags, ids);
+}
+
+void TremorReader::receiveBatch(size_t numEvents, const ObjectRef& paths, const uint32_t* flags,
+                                const uint64_t* ids) {
+    auto array = objectCast<Array>(paths);
+    if (!array || array->count() < numEvents)
+        fatalError("tremor paths are not an array of " + std::to_string(numEvents) + " entries");
+    for (const auto& entry : array->objects()) {
+        if (!objectCast<Dictionary>(entry))
+            fatalError("tremor paths are not an array of dictionaries");
+    }
+    if (verbose_)
+        logDebug([&] { return "tremor: received " + std::to_string(numEvents) + " events"; });
+    for (size_t i = 0; i < numEvents; ++i) {
+        auto entry = objectCast<Dictionary>(array->objects()[i]);
+        auto path = objectCast<String>(entry->objectForKey("path"));
+        if (!path) {
+            logError("ignore event " + std::to_string(ids[i]) +
+                     " because no path can be extracted");
+            continue;
+        }
+        std::optional<uint64_t> fileID;
+        if (auto number = objectCast<Number>(entry->objectForKey("fileID")))
+            fileID = number->uint64Value();
+        processEvent(path->value(), fileID, flags[i], ids[i], i, numEvents);
+    }
+    if (auto target = delegate())
+        target->readerDidFinishBatch(*this);
+}
+
+void TremorReader::processEvent(const std::string& path, std::optional<uint64_t> fileID,
+                                uint32_t flags, uint64_t eventID, size_t index, size_t count) {
+    streamQueue_->assertCurrent();
+    // The title is only built when debug lines are written; the number is taken regardless.
+    std::string title;
+    if (Log::shared().debugEnabled()) {
+        title = description() + " tremors: (" + std::to_string(index + 1) + "/" +
+                std::to_string(count) + ") \"" + path +
+                "\" fileID:" + (fileID ? std::to_string(*fileID) : std::string("unspecified")) +
+                " eventID:" + std::to_string(eventID);
+    }
+    LogSection section(title);
+    classifyEvent(path, fileID, flags, eventID);
+}
+
+void TremorReader::classifyEvent(const std::string& path, std::optional<uint64_t> fileID,
+                                 uint32_t flags, uint64_t eventID) {
+    // Only the stream-level bits decide; per-item bits are ignored on purpose, since whether
+    // the item can still be found tells creation, change and deletion apart.
+    if (flags & kTremorEventIdsWrapped) {
+        if (verbose_)
+            logInfo("tremors id wrapped");
+        if (auto target = delegate())
+            target->readerMustRescan(*this);
+    } else if (flags & (kTremorUserDropped | kTremorKernelDropped)) {
+        if (verbose_)
+            logInfo("dropped tremors");
+        if (auto target = delegate())
+            target->readerMustRescan(*this);
+    } else if (flags & kTremorHistoryDone) {
+        if (verbose_)
+            logDebug("done processing history");
+        if (auto target = delegate())
+            target->readerDidProcessHistory(*this);
+    } else if (path.find(kDocIDMarker) != std::string::npos) {
+        processDocIDEvent(path, eventID);
+    } else {
+        processPathEvent(path, fileID, eventID);
+    }
+}
+
+void TremorReader::processDocIDEvent(const std::string& path, uint64_t eventID) {
+    auto parsed = DocIDPath::parse(path);
+    if (!parsed) {
+        logError("can't parse docID path \"" + path +
+                 "\"; format expected is \"/.docid/$dev/changed/$docid/src=$src,dst=$dst\"");
+        return;
+    }
+    HostPorterItemIdentifier identifier =
+        TBPFileObjectIdentifier::fromDocumentID(static_cast<uint64_t>(parsed->documentID));
+    if (parsed->destination == 0) {
+        if (verbose_)
+            logDebug([&] { return "did delete " + identifier; });
+        if (auto target = delegate())
+            target->readerDidDelete(*this, identifier, std::nullopt);
+        recordEventID(eventID);
+        return;
+    }
+    auto url = TBFileObjectIdentifier::fileURLWithFileIdentifier(
+        static_cast<uint64_t>(parsed->destination));
+    if (!url) {
+        if (verbose_)
+            logDebug([&] { return "can't compute url for " + identifier; });
+        return;
+    }
+    bool monitored = false;
+    for (const Url& root : urls_) {
+        if (pt_relationshipToItemAtURL(root, *url) == UrlRelationship::Contains) {
+            monitored = true;
+            break;
+        }
+    }
+    if (!monitored) {
+        if (verbose_)
+            logDebug(
+                [&] { return "dropping tremor at " + url->path() + "; URL is not monitored"; });
+        return;
+    }
+    if (isHidden(*url)) {
+        if (verbose_)
+            logDebug([&] { return "dropping tremor at " + url->path() + "; URL is hidden"; });
+        return;
+    }
+    auto item = LocalItem::make(*url);
+    if (!item) {
+        logError("dropping tremor at " + url->path() + "; can't create local item");
+        return;
+    }
+    if (item->itemIdentifier() != identifier) {
+        // The document ID now names another file; that is not a change of this document.
+        if (verbose_) {
+            logDebug([&] {
+                return "dropping tremor at " + url->path() + "; fileObjectIDs don't match (" +
+                       item->itemIdentifier() + " vs " + identifier + ")";
+            });
+        }
+        return;
+    }
+    if (verbose_)
+        logDebug([&] { return "did change " + item->description(); });
+    if (auto target = delegate())
+        target->readerDidChange(*this, item, std::nullopt);
+    recordEventID(eventID);
+}
+
+void TremorReader::processPathEvent(const std::string& path, std::optional<uint64_t> fileID,
+                                    uint64_t eventID) {
+    Url url = Url::fileURLWithPath(path);
+    if (isHidden(url)) {
+        if (verbose_)
+            logDebug([&] { return "dropping tremor at " + url.path() + "; URL is hidden"; });
+        return;
+    }
+    if (url.lastPathComponent() == "Documents") {
+        // An app library's root is reported as the library, not as a plain folder.
+        if (auto record =
+                LocalAppLibraryManager::shared()->bundleProxyFor(url, UrlRelationship::Same)) {
+            if (auto library = LocalAppLibraryItem::initFrom(record)) {
+                if (verbose_)
+                    logDebug([&] { return "did change " + library->description(); });
+                if (auto target = delegate())
+                    target->readerDidChange(*this, library, url);
+                recordEventID(eventID);
+                return;
+            }
+        }
+    }
+    LocalItemRef item = fileID ? LocalItem::makeWithFileIdentifier(*fileID) : LocalItem::make(url);
+    if (item) {
+        if (verbose_)
+            logDebug([&] { return "did change " + item->description(); });
+        if (auto target = delegate())
+            target->readerDidChange(*this, item, url);
+    } else if (!fileID) {
+        if (verbose_)
+            logDebug([&] { return "dropping tremor at \"" + path + "\"; No object at path"; });
+    } else {
+        HostPorterItemIdentifier identifier = TBPFileObjectIdentifier::fromFileID(*fileID);
+        if (verbose_)
+            logDebug([&] { return "did delete " + identifier; });
+        if (auto target = delegate())
+            target->readerDidDelete(*this, identifier, url);
+    }
+    recordEventID(eventID);
+}
+
+bool TremorReader::isHidden(const Url& url) const {
+    streamQueue_->assertCurrent();
+    std::vector<std::string> components = url.pathComponents();
+    for (const Url& root : urls_) {
+        std::vector<std::string> rootComponents = root.pathComponents();
+        if (rootComponents.size() > components.size() ||
+            !std::equal(rootComponents.begin(), rootComponents.end(), components.begin()))
+            continue;
+        for (size_t i = rootComponents.size(); i < components.size(); ++i) {
+            if (!components[i].empty() && components[i][0] == '.')
+                return true;
+        }
+        return false;
+    }
+    return false;
+}
+
+}  // namespace tamber

@@ -1,0 +1,268 @@
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <thread>
+
+#include "fs/DocIDPath.h"
+#include "fs/TremorReader.h"
+#include "items/TBFileObjectIdentifier.h"
+#include "platform/tremors/TremorFlags.h"
+#include "tests/fs/FsTest.h"
+
+#if defined(__SANITIZE_ADDRESS__)
+#include <sanitizer/lsan_interface.h>
+#endif
+
+namespace tamber {
+namespace {
+
+using testing::TremorTest;
+using Reports = std::vector<std::string>;
+using Kind = TremorReaderGatherPhaseResumeStatus::Kind;
+
+std::string docIDPath(uint32_t device, uint64_t doc, uint64_t src, uint64_t dst) {
+    return "/.docid/" + std::to_string(device) + "/changed/" + std::to_string(doc) +
+           "/src=" + std::to_string(src) + ",dst=" + std::to_string(dst);
+}
+
+TEST(DocIDPathTest, AcceptsTheGrammarAndNothingAroundIt) {
+    auto full = DocIDPath::parse("/.docid/5/changed/42/src=7,dst=0");
+    ASSERT_TRUE(full);
+    EXPECT_EQ(full->documentID, 42);
+    EXPECT_EQ(full->source, 7);
+    EXPECT_EQ(full->destination, 0);
+    auto bare = DocIDPath::parse(".docid/changed/43/src=1,dst=9");
+    ASSERT_TRUE(bare);
+    EXPECT_EQ(bare->documentID, 43);
+    EXPECT_EQ(bare->destination, 9);
+    // Leading slashes are skipped; a number without digits reads 0.
+    auto empty = DocIDPath::parse("///.docid/changed/1/src=,dst=2");
+    ASSERT_TRUE(empty);
+    EXPECT_EQ(empty->source, 0);
+
+    for (std::string bad : {
+             "/.docid/5/changed/42/src=7,dst=0x",                   // trailing text
+             "/.docid/5/changed/42/src=7,dst=0/",                   // trailing slash
+             "/.docid/5changed/42/src=7,dst=0",                     // device without "/"
+             "/.docid/99999999999999999999/changed/1/src=1,dst=1",  // out of range
+             "/.docid/5/changed/42/src=7;dst=0",                    // wrong separator
+             "/.docid/5/changed/42,src=7,dst=0",                    // wrong separator
+             "/.docid/5/change/42/src=7,dst=0",                     // wrong word
+             "/tmp/.docid/5/changed/42/src=7,dst=0",                // not at the start
+             "/.docid",
+             "",
+         }) {
+        EXPECT_FALSE(DocIDPath::parse(bad)) << bad;
+    }
+    EXPECT_FALSE(DocIDPath::parse(std::string("/.docid/changed/1/src=1,dst=2\0x", 32)));
+}
+
+// Events journaled by the test replay through a real stream, in ID order.
+TEST_F(TremorTest, ClassifiesEventsInOrderAndRecordsOnlyWhatItReported) {
+    std::string a = write("a.txt");
+    auto aID = TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(a));
+    ASSERT_TRUE(aID);
+    std::filesystem::create_directory(storagePath() + "/.hidden");
+    write(".hidden/b.txt");
+    std::string gone = storagePath() + "/gone.txt";
+    std::string gone2 = storagePath() + "/gone2.txt";
+    std::string unparsable = storagePath() + "/.docid/5/changed/42/src=7,dst=0";
+    uint64_t since = currentID();
+    journal({{0, a, 0, kTremorMustScanSubdirs},            // an ordinary item event
+             {0, gone, 0, kTremorItemRemoved},             // nothing there, no file ID
+             {0, gone2, 987654321, kTremorItemRemoved}});  // gone, with its file ID
+    uint64_t lastReported = journal({{0, storagePath() + "/.hidden/b.txt", 0, 0},
+                                     {0, unparsable, 0, 0},
+                                     {0, a, 0, kTremorEventIdsWrapped | kTremorHistoryDone}}) -
+                            3;
+    // The wrapped-IDs event is the last: after it, history done does not come again.
+    Reports expected{"change " + *aID + " " + a, "delete fid=987654321 " + gone2, "rescan"};
+
+    // Quiet: only error lines.
+    auto quiet = TremorReader::make({storageURL()}, since, TremorReaderMode::pathBased, false);
+    quiet->setDelegate(delegate);
+    readers.push_back(quiet);
+    log->clear();
+    quiet->start();
+    ASSERT_TRUE(delegate->waitForBatchWith("rescan"));
+    quiet->stop();
+    EXPECT_EQ(delegate->itemReports(), expected);
+    EXPECT_EQ(delegate->reports().back(), "batch");
+    EXPECT_EQ(delegate->offQueue(), 0);
+    EXPECT_EQ(quiet->lastProcessedTremorID(), lastReported);
+    std::string parseError = "[ERROR] can't parse docID path \"" + unparsable +
+                             "\"; format expected is "
+                             "\"/.docid/$dev/changed/$docid/src=$src,dst=$dst\"";
+    EXPECT_EQ(log->count(parseError, LogLevel::Error), 1u);
+    EXPECT_EQ(log->countStartingWith("[DEBUG] did change"), 0u);
+    EXPECT_EQ(log->countStartingWith("[INFO] tremors id wrapped"), 0u);
+    EXPECT_EQ(log->countStartingWith("[DEBUG] dropping"), 0u);
+    // Every event still gets its section, numbered, with the reader and the event.
+    EXPECT_EQ(log->countStartingWith("[DEBUG] ┏"), 6u);
+    EXPECT_EQ(log->countStartingWith("[DEBUG] ┗"), 6u);
+
+    log->clear();
+    auto verbose = std::make_shared<testing::RecordingReaderDelegate>();
+    auto reader = TremorReader::make({storageURL()}, since, TremorReaderMode::pathBased, true);
+    reader->setDelegate(verbose);
+    readers.push_back(reader);
+    reader->start();
+    ASSERT_TRUE(verbose->waitForBatchWith("rescan"));
+    EXPECT_EQ(verbose->itemReports(), expected);
+    EXPECT_EQ(log->count("[INFO] tremors id wrapped", LogLevel::Info), 1u);
+    EXPECT_EQ(log->count("[DEBUG] dropping tremor at \"" + gone + "\"; No object at path",
+                         LogLevel::Debug),
+              1u);
+    EXPECT_EQ(
+        log->count("[DEBUG] dropping tremor at " + storagePath() + "/.hidden/b.txt; URL is hidden",
+                   LogLevel::Debug),
+        1u);
+    EXPECT_EQ(log->count("[DEBUG] did delete fid=987654321", LogLevel::Debug), 1u);
+    EXPECT_EQ(log->count(parseError, LogLevel::Error), 1u);
+    EXPECT_EQ(log->countStartingWith("[DEBUG] ┏"), 6u);
+    EXPECT_GE(log->countStartingWith("[DEBUG] starting <TremorReader:0x"), 1u);
+    EXPECT_NE(reader->description().find(" urls:[" + storagePath() + "] mode:pathBased>"),
+              std::string::npos);
+}
+
+TEST_F(TremorTest, DroppedEventsAskForARescanAndHistoryDoneIsReported) {
+    std::string a = write("a.txt");
+    uint64_t since = currentID();
+    uint64_t dropped = journal({{0, a, 0, kTremorKernelDropped}});
+    startReader(since);
+    ASSERT_TRUE(delegate->waitForReport("history"));
+    EXPECT_EQ(delegate->itemReports(), (Reports{"rescan", "history"}));
+    // Neither a rescan nor the end of history is an item event to resume after.
+    EXPECT_LT(readers[0]->lastProcessedTremorID(), dropped);
+}
+
+TEST_F(TremorTest, DocumentIDEventsAreJudgedByTheirShapeAndTheDocumentTheyName) {
+    std::string a = write("a.txt");
+    std::string b = write("b.txt");
+    auto aID = TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(a));
+    auto bID = TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(b));
+    ASSERT_TRUE(aID && bID);
+    uint64_t aDoc = std::stoull(aID->substr(4));
+    uint32_t dev = device();
+    uint64_t since = currentID();
+    uint64_t last = journal({
+        {0, docIDPath(dev, 42, 7, 0), 0, 0},                         // deleted
+        {0, docIDPath(dev, aDoc, 1, inodeOf(a)), 0, 0},              // changed
+        {0, docIDPath(dev, aDoc, 1, inodeOf(b)), 0, 0},              // names another file now
+        {0, docIDPath(dev, aDoc, 1, inodeOf(storagePath())), 0, 0},  // the root itself
+        {0, docIDPath(dev, aDoc, 1, 999999999), 0, 0},               // resolves to nothing
+    });
+    auto reader = startReader(since, TremorReaderMode::docIDBased);
+    ASSERT_TRUE(delegate->waitForReport("history"));
+    EXPECT_EQ(delegate->itemReports(),
+              (Reports{"delete did=42 -", "change " + *aID + " -", "history"}));
+    EXPECT_EQ(reader->lastProcessedTremorID(), last - 3);
+    EXPECT_EQ(log->count("[DEBUG] dropping tremor at " + b + "; fileObjectIDs don't match (" +
+                             *bID + " vs " + *aID + ")",
+                         LogLevel::Debug),
+              1u);
+    EXPECT_EQ(log->count("[DEBUG] dropping tremor at " + storagePath() + "; URL is not monitored",
+                         LogLevel::Debug),
+              1u);
+    EXPECT_EQ(log->count("[DEBUG] can't compute url for " + *aID, LogLevel::Debug), 1u);
+}
+
+TEST_F(TremorTest, ReportsLiveCreationChangeAndDeletionOfRealFiles) {
+    auto paths = startReader(currentID());
+    auto docs = std::make_shared<testing::RecordingReaderDelegate>();
+    auto docReader =
+        TremorReader::make({storageURL()}, currentID(), TremorReaderMode::docIDBased, true);
+    docReader->setDelegate(docs);
+    readers.push_back(docReader);
+    docReader->start();
+    ASSERT_TRUE(delegate->waitForReport("history"));
+    ASSERT_TRUE(docs->waitForReport("history"));
+
+    std::string c = write("c.txt", "one");
+    auto id = TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(c));
+    ASSERT_TRUE(id);
+    uint64_t inode = inodeOf(c);
+    ASSERT_TRUE(delegate->waitForReport("change " + *id + " " + c));
+    std::filesystem::remove(c);
+    ASSERT_TRUE(delegate->waitForReport("delete fid=" + std::to_string(inode) + " " + c));
+    ASSERT_TRUE(docs->waitForReport("delete " + *id + " -"));
+    EXPECT_EQ(delegate->offQueue() + docs->offQueue(), 0);
+    EXPECT_GT(paths->lastProcessedTremorID(), 0u);
+}
+
+TEST_F(TremorTest, AnAppLibraryRootIsReportedAsTheLibrary) {
+    install({"com.example.notes"});
+    auto manager = LocalAppLibraryManager::shared();
+    manager->refresh();
+    manager->upgradeFromMainCache(nullptr, false);
+    Url library = documents("com.example.notes");
+    ASSERT_EQ(manager->rootURLs(), std::vector<Url>{library});
+    std::string plain = storagePath() + "/Documents";
+    std::filesystem::create_directory(plain);
+    auto plainID = TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(plain));
+    // Watched before the history starts, or the replay would rightly be incomplete.
+    ASSERT_FALSE(service()->watchTree(library.path()));
+    uint64_t since = currentID();
+    journal({{0, library.path(), 0, 0}, {0, plain, 0, 0}});
+    startReader(since, TremorReaderMode::pathBased, {storageURL(), library});
+    ASSERT_TRUE(delegate->waitForReport("history"));
+    EXPECT_EQ(delegate->itemReports(),
+              (Reports{"change #com.example.notes " + library.path(),
+                       "change " + plainID.value_or("?") + " " + plain, "history"}));
+}
+
+TEST_F(TremorTest, CanResumeGatherPhaseUnlessSomethingWasDeletedOrLost) {
+    std::string c = write("c.txt");
+    uint64_t inode = inodeOf(c);
+    uint64_t before = currentID();
+    write("d.txt");  // a change is no reason to start over
+    uint64_t now = currentID();
+    auto [status, eventID] = TremorReader::canResumeGatherPhase({storageURL()}, before);
+    EXPECT_EQ(status.kind, Kind::canResume);
+    EXPECT_EQ(eventID, now);
+
+    std::filesystem::remove(c);
+    auto deleted = TremorReader::canResumeGatherPhase({storageURL()}, now);
+    EXPECT_EQ(deleted.first.kind, Kind::deletionOccurred);
+    EXPECT_EQ(deleted.first.deletion, "[fid=" + std::to_string(inode) + ", path:'" + c + "']");
+    EXPECT_GT(deleted.second, now);
+
+    uint64_t later = currentID();
+    journal({{0, storagePath() + "/d.txt", 0, kTremorUserDropped}});
+    EXPECT_EQ(TremorReader::canResumeGatherPhase({storageURL()}, later).first.kind,
+              Kind::cantReplayHistoricalTremors);
+    // A replay from now on has nothing to judge but its end.
+    EXPECT_EQ(TremorReader::canResumeGatherPhase({storageURL()}, currentID()).first.kind,
+              Kind::canResume);
+    // The checkers' readers were stopped, not abandoned.
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    EXPECT_EQ(log->countStartingWith("[ERROR] stream deleted without being stopped"), 0u);
+}
+
+TEST_F(TremorTest, AReaderDestroyedWhileRunningSaysSoAndLaterBatchesFindNothing) {
+    auto reader =
+        TremorReader::make({storageURL()}, currentID(), TremorReaderMode::pathBased, true);
+    reader->setDelegate(delegate);
+    {
+#if defined(__SANITIZE_ADDRESS__)
+        // The abandoned stream is never released, by design.
+        __lsan::ScopedDisabler leaksOfTheAbandonedStream;
+#endif
+        reader->start();
+    }
+    ASSERT_TRUE(delegate->waitForBatchWith("history"));
+    reader->streamQueue()->sync([] {});  // the callback has let go of the reader
+    std::string description = reader->description();
+    reader.reset();
+    EXPECT_EQ(
+        log->count("[ERROR] stream deleted without being stopped; " + description, LogLevel::Error),
+        1u);
+    // Events the abandoned stream still delivers must not reach freed memory.
+    size_t before = delegate->reports().size();
+    write("late.txt");
+    std::this_thread::sleep_for(std::chrono::milliseconds(800));
+    EXPECT_EQ(delegate->reports().size(), before);
+}
+
+}  // namespace
+}  // namespace tamber
