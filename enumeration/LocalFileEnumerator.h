@@ -31,6 +31,7 @@ public:
     static std::shared_ptr<LocalFileEnumerator> initWithContainer(
         HostPorterItemIdentifier container, std::vector<Url> urls);
     LocalFileEnumerator(Private, HostPorterItemIdentifier container, std::vector<Url> urls);
+    ~LocalFileEnumerator() override;
 
     void enumerateItemsForObserver(std::shared_ptr<HostPorterEnumerationObserver> observer,
                                    const HostPorterPage& page) override;
@@ -56,13 +57,20 @@ public:
     size_t runningEnumeratorCount() const;
 
 private:
+    void gatherPhase(HostPorterEnumerationObserver& observer,
+                     const std::optional<FSChangeToken>& token);
+    // The roots a page walks, in order, and whether it walks them whole.
+    std::vector<Url> listedRoots() const;
+    bool listsRecursively() const;
+
     HostPorterItemIdentifier container_;
     Url enumeratedItemURL_;
     std::vector<Url> urls_;
     FSChangesNotifierRef notifier_;
-    mutable std::mutex mutex_;  // guards the two below: change enumerations end on their queues
+    mutable std::mutex mutex_;  // guards the three below: change enumerations end on their queues
     std::set<FSChangesEnumeratorRef> enumerators_;
     FSChangeToken currentToken_;
+    bool notifierStarted_ = false;  // guarded by mutex_
 };
 
 using LocalFileEnumeratorRef = std::shared_ptr<LocalFileEnumerator>;
