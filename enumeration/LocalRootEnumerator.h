@@ -45,6 +45,18 @@ public:
     }
 
 private:
+    bool isWorkingSet() const;
+    // The libraries' roots, then the document storage.
+    std::vector<Url> monitoredURLs() const;
+    // Replaces the file enumerator by one over the current monitored URLs.
+    void updateMonitoredURLs();
+    // Brings the host's view of the libraries up to date, and the token's library version with
+    // it; false when the enumeration ended (with an error) instead.
+    bool updateAppLibraries(HostPorterChangeObserver& observer, FSChangeToken& token);
+    void saveWorkingSetCache();
+    std::string versionComparison(uint64_t tokenVersion, uint64_t localVersion,
+                                  uint64_t mainCacheVersion) const;
+
     HostPorterItemIdentifier container_;
     std::shared_ptr<LocalAppLibraryManager> appLibraryManager_;
     mutable std::mutex mutex_;  // guards the two below
