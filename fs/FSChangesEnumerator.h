@@ -2,6 +2,8 @@
 
 #include <cstdint>
 #include <memory>
+#include <mutex>
+#include <optional>
 #include <vector>
 
 #include "fs/FSChangeToken.h"
@@ -52,6 +54,27 @@ public:
     void readerDidFinishBatch(TremorReader& reader) override;
 
 private:
+    // What the gate decided for one change that passed the filters.
+    struct Passage {
+        bool send = false;                               // new for the host: forward it
+        std::optional<HostPorterSyncAnchor> pageAnchor;  // it filled the page: close with this
+        TremorReaderRef reader;  // the reader to stop when the page is closed
+    };
+    // Counts a change and decides, in one step, whether it is sent and whether it closes a page.
+    Passage pass();
+    void forwardUpdate(const LocalItemRef& item, const std::optional<Url>& url);
+    void forwardDeletion(const HostPorterItemIdentifier& identifier);
+    bool pageIsFull() const;  // under mutex_
+    // Whether a report comes from the reader of the current pass of an unfinished request.
+    bool accepts(const TremorReader& reader) const;
+    void reportLibraryRootDeletion(const Url& url);
+    TremorReaderRef currentReader() const;
+    static void stopAsync(TremorReader& reader);
+
+    // The counters and the token are changed on the current reader's queue; the lock keeps a
+    // late task of an earlier pass and the owner's stop() from racing with it.
+    mutable std::mutex mutex_;
+    bool finished_ = false;  // no report is forwarded after the request finished
     FSChangeToken currentToken_;
     uint64_t numberOfChanges_ = 0;
     HostPorterItemIdentifier container_;

@@ -1,0 +1,215 @@
+#include "fs/FSChangesEnumerator.h"
+
+#include <limits>
+
+#include "applibraries/LocalAppLibraryManager.h"
+#include "host/UrlOperations.h"
+#include "items/LocalAppLibraryItem.h"
+#include "support/Log.h"
+
+namespace tamber {
+
+std::shared_ptr<FSChangesEnumerator> FSChangesEnumerator::make(
+    FSChangeToken token, HostPorterItemIdentifier container, std::vector<Url> urls,
+    std::shared_ptr<HostPorterChangeObserver> observer) {
+    if (urls.empty())
+        fatalError("require at least one URL to init a change enumerator");
+    auto enumerator = std::make_shared<FSChangesEnumerator>(
+        Private{}, std::move(token), std::move(container), std::move(urls), std::move(observer));
+    enumerator->reader_->setDelegate(enumerator);
+    return enumerator;
+}
+
+FSChangesEnumerator::FSChangesEnumerator(Private, FSChangeToken token,
+                                         HostPorterItemIdentifier container, std::vector<Url> urls,
+                                         std::shared_ptr<HostPorterChangeObserver> observer)
+    : currentToken_(std::move(token)),
+      container_(std::move(container)),
+      urls_(std::move(urls)),
+      observer_(std::move(observer)),
+      sinceTremorID_(currentToken_.streamEventID),
+      maxTremorID_(currentToken_.streamEventID) {
+    if (urls_.empty())
+        fatalError("require at least one URL to init a change enumerator");
+    reader_ = TremorReader::make(urls_, sinceTremorID_, TremorReaderMode::pathBased, true);
+}
+
+void FSChangesEnumerator::start() {
+    if (auto reader = currentReader())
+        reader->start();
+}
+
+void FSChangesEnumerator::stop() {
+    if (auto reader = currentReader())
+        reader->stop();
+}
+
+TremorReaderRef FSChangesEnumerator::currentReader() const {
+    std::lock_guard lock(mutex_);
+    return reader_;
+}
+
+void FSChangesEnumerator::stopAsync(TremorReader& reader) {
+    // Reports run inside the reader's callback: the stop must wait until it has returned.
+    reader.streamQueue()->async([self = reader.shared_from_this()] { self->stop(); });
+}
+
+bool FSChangesEnumerator::accepts(const TremorReader& reader) const {
+    reader.streamQueue()->assertCurrent();
+    std::lock_guard lock(mutex_);
+    // A stopped pass may still finish the batch it was in; that is not news any more.
+    return !finished_ && &reader == reader_.get();
+}
+
+bool FSChangesEnumerator::pageIsFull() const {
+    return numberOfChanges_ >= currentToken_.offset &&
+           numberOfChanges_ - currentToken_.offset == kPageSize;
+}
+
+FSChangesEnumerator::Passage FSChangesEnumerator::pass() {
+    std::lock_guard lock(mutex_);
+    Passage passage;
+    if (finished_)
+        return passage;
+    if (numberOfChanges_ == std::numeric_limits<uint64_t>::max())
+        fatalError("too many changes for one change enumeration");
+    ++numberOfChanges_;
+    // Changes up to the anchor's offset went out with an earlier page of the same history.
+    passage.send = numberOfChanges_ > currentToken_.offset;
+    if (pageIsFull()) {
+        // The event ID stays the anchor's: the next request replays the same history and
+        // skips what this one sent.
+        finished_ = true;
+        currentToken_.offset = numberOfChanges_;
+        passage.pageAnchor = currentToken_.encode();
+        passage.reader = reader_;
+    }
+    return passage;
+}
+
+void FSChangesEnumerator::forwardUpdate(const LocalItemRef& item, const std::optional<Url>& url) {
+    Passage passage = pass();
+    if (passage.send) {
+        logDebug([&] {
+            return "forward update of " + item->description() +
+                   (url ? " to " + url->path() : std::string());
+        });
+        observer_->didUpdateItems({item});
+    }
+    if (passage.pageAnchor) {
+        stopAsync(*passage.reader);
+        observer_->finishEnumeratingChangesUpToSyncAnchor(*passage.pageAnchor, true);
+    }
+}
+
+void FSChangesEnumerator::forwardDeletion(const HostPorterItemIdentifier& identifier) {
+    Passage passage = pass();
+    if (passage.send) {
+        logDebug([&] { return "forward deletion of " + identifier; });
+        observer_->didDeleteItemsWithIdentifiers({identifier});
+    }
+    if (passage.pageAnchor) {
+        stopAsync(*passage.reader);
+        observer_->finishEnumeratingChangesUpToSyncAnchor(*passage.pageAnchor, true);
+    }
+}
+
+void FSChangesEnumerator::readerDidChange(TremorReader& reader, const LocalItemRef& item,
+                                          const std::optional<Url>& url) {
+    if (!accepts(reader))
+        return;
+    if (container_ == HostPorterAllDirectoriesContainerItemIdentifier && !item->isFolder()) {
+        logDebug([&] {
+            return "ignore update of " + item->description() + "; item is not a directory of " +
+                   container_;
+        });
+        return;
+    }
+    forwardUpdate(item, url);
+}
+
+void FSChangesEnumerator::readerDidDelete(TremorReader& reader,
+                                          const HostPorterItemIdentifier& identifier,
+                                          const std::optional<Url>& url) {
+    if (!accepts(reader))
+        return;
+    bool isLibrary = identifier.find('#') != std::string::npos;
+    if (container_ == HostPorterWorkingSetContainerItemIdentifier) {
+        if (isLibrary) {
+            logDebug(
+                [&] { return "ignore update of " + identifier + "; app library are not indexed"; });
+            return;
+        }
+    } else if (container_ == HostPorterAllDirectoriesContainerItemIdentifier) {
+        if (identifier.find("fid=") == std::string::npos) {
+            logDebug(
+                [&] { return "ignore update of " + identifier + "; item is not a directory"; });
+            return;
+        }
+    } else if (container_ == HostPorterRootContainerItemIdentifier) {
+        forwardDeletion(identifier);
+        if (url && !isLibrary) {
+            // The folder that vanished may have been an app's library root, which the root
+            // container shows as the library itself.
+            reader.streamQueue()->async(
+                [self = shared_from_this(), url = *url] { self->reportLibraryRootDeletion(url); });
+        }
+        return;
+    }
+    forwardDeletion(identifier);
+}
+
+void FSChangesEnumerator::reportLibraryRootDeletion(const Url& url) {
+    {
+        std::lock_guard lock(mutex_);
+        if (finished_ || pageIsFull())
+            return;
+    }
+    auto record = LocalAppLibraryManager::shared()->bundleProxyFor(url, UrlRelationship::Same);
+    if (!record)
+        return;
+    forwardDeletion(appLibraryIdentifier(*record));
+}
+
+void FSChangesEnumerator::readerDidProcessHistory(TremorReader& reader) {
+    if (!accepts(reader))
+        return;
+    stopAsync(reader);
+    std::unique_lock lock(mutex_);
+    maxTremorID_ = std::max(maxTremorID_, reader.lastProcessedTremorID());
+    if (shouldProcessedTremorsDocIDBased_) {
+        logDebug("processed all Tremors path based, carry on with the docID based");
+        shouldProcessedTremorsDocIDBased_ = false;
+        auto next = TremorReader::make(urls_, sinceTremorID_, TremorReaderMode::docIDBased, true);
+        next->setDelegate(weak_from_this());
+        reader_ = next;
+        lock.unlock();
+        next->streamQueue()->async([next] { next->start(); });
+        return;
+    }
+    logDebug("fetching changes did catch up");
+    finished_ = true;
+    currentToken_.streamEventID = maxTremorID_;
+    currentToken_.offset = 0;
+    HostPorterSyncAnchor anchor = currentToken_.encode();
+    lock.unlock();
+    observer_->finishEnumeratingChangesUpToSyncAnchor(anchor, false);
+}
+
+void FSChangesEnumerator::readerMustRescan(TremorReader& reader) {
+    if (!accepts(reader))
+        return;
+    stopAsync(reader);
+    {
+        std::lock_guard lock(mutex_);
+        finished_ = true;
+    }
+    logDebug("fetching changes did finish after reset");
+    observer_->finishEnumeratingWithError(Error::syncAnchorExpired());
+}
+
+void FSChangesEnumerator::readerDidFinishBatch(TremorReader& reader) {
+    reader.streamQueue()->assertCurrent();
+}
+
+}  // namespace tamber
