@@ -8,6 +8,7 @@
 #include "platform/FileContents.h"
 #include "platform/apps/BundleRecord.h"
 #include "provider/LocalPorterError.h"
+#include "provider/TrashLocations.h"
 #include "support/Log.h"
 #include "support/LogSection.h"
 
@@ -37,6 +38,7 @@ LocalPorter::LocalPorter()
 std::shared_ptr<LocalPorter> LocalPorter::create() {
     auto porter = std::make_shared<LocalPorter>();
     porter->installPacerHandler();
+    installPutBackResolver();
     // The host may hold a working set from an earlier run: have it ask what changed since.
     logInfo("auto notify changes on HostPorterWorkingSetContainerItemIdentifier at startup");
     HostPorterManager::defaultManager()->signalEnumeratorForContainerItemIdentifier(

@@ -1,0 +1,192 @@
+#include "host/UrlOperations.h"
+#include "items/ExtendedAttributes.h"
+#include "platform/FileContents.h"
+#include "platform/archive/KeyedArchiver.h"
+#include "platform/objects/Number.h"
+#include "platform/objects/String.h"
+#include "provider/LocalPorter.h"
+#include "provider/LocalPorterError.h"
+#include "provider/TrashLocations.h"
+#include "support/Error.h"
+#include "support/Log.h"
+#include "support/LogSection.h"
+
+namespace tamber {
+
+namespace {
+
+std::string joinedComponents(const std::vector<std::string>& components) {
+    std::string text;
+    for (const auto& component : components) {
+        if (!text.empty())
+            text += ", ";
+        text += component;
+    }
+    return text;
+}
+
+// Records where the item came from, relative to its library, so that it can go back there even
+// if the library moved. Failures are logged only: the item stays trashed either way.
+void setPutBackString(const Url& trashedURL, const Url& originalURL) {
+    logDebug([&] { return "setting putback string on " + trashedURL.absoluteString(); });
+    auto library = documentLibraryContaining(originalURL);
+    if (!library) {
+        logError("couldn't find app library for " + originalURL.absoluteString());
+        return;
+    }
+    auto relative = pathRelativeToBase(originalURL, library->root);
+    if (!relative) {
+        logError("could't compute putback string (path: " + originalURL.path() +
+                 ", basePath: " + library->root.path());
+        return;
+    }
+    auto data = KeyedArchiver::archivedDataWithRootObject(String::make(*relative));
+    if (!data.ok()) {
+        logError("can't archive value for xattr " + LocalItem::xattrTrashPutBackName() + "; " +
+                 data.error().description());
+        return;
+    }
+    logDebug(
+        [&] { return "setting putback '" + *relative + "' on " + trashedURL.absoluteString(); });
+    bool written = pt_withReadWriteAccess(trashedURL, [&](int fd) {
+        return !SetOrRemoveXattr(fd, data.value(), LocalItem::xattrTrashPutBackName());
+    });
+    if (!written) {
+        Error error = Error::errorWithPOSIXCode(errno);
+        logError("couldn't set putback xattr (" + *relative + ") on " +
+                 trashedURL.absoluteString() + "; " + error.description());
+    }
+}
+
+bool isReachableFolder(const Url& url) {
+    auto isDirectory = url.resourceValue(ResourceKeys::kIsDirectory);
+    if (!isDirectory.ok())
+        return false;
+    auto flag = objectCast<Number>(isDirectory.value());
+    return flag && flag->boolValue();
+}
+
+}  // namespace
+
+void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identifier,
+                                          ItemCompletion completion) {
+    withLogSection("trash item \"" + identifier + "\"", [&] {
+        auto url = _urlForItemWithPersistentIdentifier(identifier);
+        if (!url)
+            return completion(nullptr,
+                              Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+        // Trashing a library or the storage itself would move it into its own trash.
+        if (identifier == HostPorterRootContainerItemIdentifier || identifier.starts_with('#'))
+            return completion(nullptr, Error::errorFileWriteNoPermission());
+
+        auto components = componentsThroughFirstDocuments(*url);
+        if (!components) {
+            logError("no Documents directory found in path \"" + url->path() + "\"");
+            return completion(nullptr, Error::invalidParameter("sourceURL", url->path()));
+        }
+        auto documents = urlFromPathComponents(*components);
+        if (!documents) {
+            logError("can't build trash URL from components \"" + joinedComponents(*components) +
+                     "\"");
+            return completion(
+                nullptr, Error::invalidParameter("trashComponents", joinedComponents(*components)));
+        }
+        Url trash = documents->appendingPathComponent(".Trash");
+        logDebug([&] { return "trash is located at \"" + trash.path() + "\""; });
+        if (auto error = FileContents::createDirectory(trash))
+            return completion(nullptr, *error);
+
+        Url original = *url;
+        pt_trashUnderFolder(
+            original, trash,
+            [this, original, completion](std::optional<Url> trashed, std::optional<Error> error) {
+                if (error || !trashed)
+                    return completion(nullptr, error.value_or(Error::errorWithPOSIXCode(EIO)));
+                // The move stands whatever happens to the attributes.
+                (void)writeTrashDate(*trashed, Date::now());
+                setPutBackString(*trashed, original);
+                auto item = itemForURL(*trashed);
+                if (!item.ok())
+                    return completion(nullptr, item.error());
+                completion(item.value(), std::nullopt);
+            });
+    });
+}
+
+void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& identifier,
+                                            const std::optional<HostPorterItemIdentifier>& parent,
+                                            ItemCompletion completion) {
+    withLogSection("untrash item \"" + identifier + "\"", [&] {
+        auto url = _urlForItemWithPersistentIdentifier(identifier);
+        if (!url)
+            return completion(nullptr,
+                              Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+        auto item = itemForURL(*url);
+        if (!item.ok())
+            return completion(nullptr, item.error());
+        if (!item.value()->isTrashed()) {
+            logDebug("item is not in trash");
+            return completion(nullptr, Error::invalidParameter("itemIdentifier", identifier));
+        }
+
+        std::optional<Url> destination;
+        if (parent) {
+            auto parentItem = itemForIdentifierLogged(*parent);
+            if (!parentItem.ok()) {
+                logDebug([&] {
+                    return "can't use provided parent item " + *parent + " because it's unknown; " +
+                           parentItem.error().description();
+                });
+            } else if (parentItem.value()->isTrashed()) {
+                logDebug([&] {
+                    return "can't use provided parent item " + *parent +
+                           " because it's trashed; falling back to the putback location";
+                });
+            } else {
+                destination = parentItem.value()->fileURL();
+            }
+        }
+        if (!destination) {
+            std::optional<Url> putBack = item.value()->putBackURL();
+            if (!putBack) {
+                logDebug("no putback url");
+            } else if (Url folder = putBack->deletingLastPathComponent();
+                       isReachableFolder(folder)) {
+                logDebug([&] { return "putback url is " + putBack->absoluteString(); });
+                destination = folder;
+            } else {
+                logDebug([&] {
+                    return "putback url is not reachable; " + putBack->absoluteString() +
+                           " has no folder to go back to";
+                });
+            }
+        }
+        if (!destination) {
+            if (auto library = documentLibraryContaining(*url)) {
+                logDebug([&] { return "use " + library->name + "'s root as recover location"; });
+                destination = library->root;
+            }
+        }
+        if (!destination) {
+            logError("can't compute valid parent URL for " + url->absoluteString() +
+                     "; it is in no library");
+            return completion(nullptr, makeLocalPorterError(LocalPorterError::invalidItemURL));
+        }
+
+        pt_reparentUnderFolder(
+            *url, *destination, true,
+            [this, completion](std::optional<Url> restored, std::optional<Error> error) {
+                if (error || !restored)
+                    return completion(nullptr, error.value_or(Error::errorWithPOSIXCode(EIO)));
+                // Only the date goes; the next trashing rewrites the put-back path anyway.
+                logDebug("removing trash date xattr");
+                (void)writeTrashDate(*restored, nullptr);
+                auto restoredItem = itemForURL(*restored);
+                if (!restoredItem.ok())
+                    return completion(nullptr, restoredItem.error());
+                completion(restoredItem.value(), std::nullopt);
+            });
+    });
+}
+
+}  // namespace tamber
