@@ -1,0 +1,167 @@
+#include <gtest/gtest.h>
+
+#include "items/ExtendedAttributes.h"
+#include "items/ItemMetadata.h"
+#include "platform/FaultInjectingFileSystem.h"
+#include "platform/LinuxFileSystem.h"
+#include "platform/Tag.h"
+#include "tests/common/ScopedFileSystem.h"
+#include "tests/provider/ProviderOperationsTest.h"
+
+namespace tamber {
+namespace {
+
+using namespace testing;
+using MetadataTest = ProviderOperationsTest;
+
+TEST_F(MetadataTest, LastUsedDateRefusesHashIdentifiersWhileFavoriteRankProceeds) {
+    Url libraryURL = Url::fileURLWithPath(library);
+    ItemOutcome refused;
+    porter->setLastUsedDate(Date::make(1000), kAppIdentifier, refused.handler());
+    EXPECT_EQ(refused.calls, 1);
+    EXPECT_FALSE(refused.item);
+    ASSERT_TRUE(refused.error);
+    EXPECT_EQ(refused.error->code(), kHostPorterInvalidParameter);
+    EXPECT_EQ(refused.error->userInfo().at("parameter"), "itemIdentifier");
+    EXPECT_EQ(refused.error->userInfo().at("value"), kAppIdentifier);
+    EXPECT_FALSE(ReadXattrData(LocalItem::xattrLastUsedDateName(), libraryURL));
+
+    ItemOutcome ranked;
+    porter->setFavoriteRank(Number::fromInt64(7), kAppIdentifier, ranked.handler());
+    EXPECT_EQ(ranked.calls, 1);
+    ASSERT_TRUE(ranked.item) << ranked.error->description();
+    EXPECT_EQ(ranked.item->itemIdentifier(), kAppIdentifier);
+    ASSERT_TRUE(ranked.item->favoriteRank());
+    EXPECT_EQ(ranked.item->favoriteRank()->int64Value(), 7);
+    ASSERT_TRUE(ItemMetadata::readFavoriteRank(libraryURL));
+}
+
+TEST_F(MetadataTest, LastUsedDateAndRankAreWrittenAndCleared) {
+    std::string file = writeFile(library + "/a.txt");
+    HostPorterItemIdentifier identifier = identifierOf(file);
+    Url url = Url::fileURLWithPath(file);
+
+    // Clearing what was never set is no error.
+    ItemOutcome clearedFirst;
+    porter->setLastUsedDate(nullptr, identifier, clearedFirst.handler());
+    EXPECT_EQ(clearedFirst.calls, 1);
+    ASSERT_TRUE(clearedFirst.item);
+    EXPECT_FALSE(clearedFirst.error);
+
+    ItemOutcome set;
+    porter->setLastUsedDate(Date::make(1234.5), identifier, set.handler());
+    ASSERT_TRUE(set.item);
+    ASSERT_TRUE(set.item->lastUsedDate());
+    EXPECT_EQ(set.item->lastUsedDate()->timeIntervalSince1970(), 1234.5);
+    EXPECT_EQ(set.item->itemIdentifier(), identifier);
+
+    ItemOutcome cleared;
+    porter->setLastUsedDate(nullptr, identifier, cleared.handler());
+    ASSERT_TRUE(cleared.item);
+    EXPECT_FALSE(cleared.item->lastUsedDate());
+    EXPECT_FALSE(ReadXattrData(LocalItem::xattrLastUsedDateName(), url));
+
+    ItemOutcome ranked, unranked;
+    porter->setFavoriteRank(Number::fromInt64(2), identifier, ranked.handler());
+    ASSERT_TRUE(ranked.item && ranked.item->favoriteRank());
+    EXPECT_EQ(ranked.item->favoriteRank()->int64Value(), 2);
+    porter->setFavoriteRank(nullptr, identifier, unranked.handler());
+    ASSERT_TRUE(unranked.item);
+    EXPECT_FALSE(unranked.item->favoriteRank());
+    EXPECT_FALSE(ReadXattrData(LocalItem::xattrFavoriteRankName(), url));
+
+    EXPECT_EQ(sectionsTitled("clearing last used date for item \"" + identifier), 2u);
+    EXPECT_EQ(
+        sectionsTitled("set last used date \"1970-01-01T00:20:34.500Z\" to item \"" + identifier),
+        1u);
+    EXPECT_EQ(sectionsTitled("set favorite rank \"nil\" to item \"" + identifier), 1u);
+    EXPECT_EQ(log->countStartingWith("[ERROR]"), 0u);
+}
+
+TEST_F(MetadataTest, TagsKeepOnlyLabelsAndClearingStoresAnEmptyList) {
+    std::string file = writeFile(storage + "/Projects/a.txt");
+    HostPorterItemIdentifier identifier = identifierOf(file);
+    Url url = Url::fileURLWithPath(file);
+
+    Bytes tagData = GetTagsDataForTags({Tag::make("Work", 4), Tag::make("Travel", 6)});
+    ItemOutcome tagged;
+    porter->setTagData(tagData, identifier, tagged.handler());
+    EXPECT_EQ(tagged.calls, 1);
+    ASSERT_TRUE(tagged.item && tagged.item->tagData());
+    EXPECT_EQ(ItemMetadata::readTagLabels(url), (std::vector<std::string>{"Work", "Travel"}));
+    auto tags = GetTagsFromTagsData(*tagged.item->tagData());
+    ASSERT_TRUE(tags);
+    ASSERT_EQ(tags->size(), 2u);
+    EXPECT_EQ((*tags)[0]->label(), "Work");
+    EXPECT_EQ((*tags)[0]->colour(), 0);
+    EXPECT_EQ((*tags)[1]->colour(), 0);
+
+    for (const std::optional<Bytes>& cleared :
+         {std::optional<Bytes>(), std::optional<Bytes>(Bytes{1, 2, 3})}) {
+        ItemOutcome outcome;
+        porter->setTagData(cleared, identifier, outcome.handler());
+        EXPECT_EQ(outcome.calls, 1);
+        ASSERT_TRUE(outcome.item);
+        // Still there, holding an archived empty list.
+        ASSERT_TRUE(ReadXattrData(LocalItem::xattrTagDataName(), url));
+        EXPECT_EQ(ItemMetadata::readTagLabels(url), std::vector<std::string>{});
+        // Put something back so that the next round clears again.
+        porter->setTagData(tagData, identifier, ItemOutcome().handler());
+    }
+}
+
+TEST_F(MetadataTest, UnknownIdentifiersFailOnceWithNoSuchItem) {
+    const HostPorterItemIdentifier unknown = "did=4242";
+    ItemOutcome date, tags, rank;
+    porter->setLastUsedDate(Date::make(1), unknown, date.handler());
+    porter->setTagData(std::nullopt, unknown, tags.handler());
+    porter->setFavoriteRank(Number::fromInt64(1), unknown, rank.handler());
+    for (ItemOutcome* outcome : {&date, &tags, &rank}) {
+        EXPECT_EQ(outcome->calls, 1);
+        EXPECT_FALSE(outcome->item);
+        expectNoSuchItem(outcome->error, unknown);
+    }
+    EXPECT_EQ(log->countStartingWith("[ERROR] can't find URL for item; "), 2u);
+}
+
+TEST_F(MetadataTest, FailedWritesAreLoggedAndTheItemShowsWhatIsOnDisk) {
+    std::string file = writeFile(library + "/a.txt");
+    HostPorterItemIdentifier identifier = identifierOf(file);
+    Url url = Url::fileURLWithPath(file);
+    porter->setFavoriteRank(Number::fromInt64(1), identifier, ItemOutcome().handler());
+    log->clear();
+
+    auto faults = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    ScopedFileSystem scoped(faults);
+    faults->inject(FaultInjectingFileSystem::Operation::Fsetxattr, ENOTSUP, -1);
+
+    ItemOutcome date, tags, rank;
+    porter->setLastUsedDate(Date::make(99), identifier, date.handler());
+    porter->setTagData(GetTagsDataForTags({Tag::make("Work")}), identifier, tags.handler());
+    porter->setFavoriteRank(Number::fromInt64(5), identifier, rank.handler());
+    for (ItemOutcome* outcome : {&date, &tags, &rank}) {
+        EXPECT_EQ(outcome->calls, 1);
+        EXPECT_FALSE(outcome->error);
+        ASSERT_TRUE(outcome->item);
+        EXPECT_EQ(outcome->item->itemIdentifier(), identifier);
+    }
+    EXPECT_FALSE(date.item->lastUsedDate());
+    EXPECT_FALSE(tags.item->tagData());
+    ASSERT_TRUE(rank.item->favoriteRank());
+    EXPECT_EQ(rank.item->favoriteRank()->int64Value(), 1);
+    EXPECT_EQ(faults->calls(FaultInjectingFileSystem::Operation::Fsetxattr), 3u);
+
+    EXPECT_EQ(
+        log->countStartingWith("[ERROR] can't set xattr " + LocalItem::xattrLastUsedDateName() +
+                               " on " + url.absoluteString() + "; "),
+        1u);
+    EXPECT_EQ(
+        log->countStartingWith("[ERROR] can't set xattr " + LocalItem::xattrTagDataName() + "; "),
+        1u);
+    EXPECT_EQ(log->countStartingWith("[ERROR] can't set xattr " +
+                                     LocalItem::xattrFavoriteRankName() + "; "),
+              1u);
+}
+
+}  // namespace
+}  // namespace tamber
