@@ -1,0 +1,100 @@
+#include <algorithm>
+#include <limits>
+
+#include "applibraries/LocalAppLibraryManager.h"
+#include "enumeration/FSDirectoryEnumerator.h"
+#include "host/HostPorterManager.h"
+#include "items/ExtendedAttributes.h"
+#include "items/LocalAppLibraryItem.h"
+#include "items/UnarchiveLogged.h"
+#include "provider/LocalPorter.h"
+#include "provider/TrashLocations.h"
+#include "support/DispatchGroup.h"
+#include "support/Log.h"
+#include "support/LogSection.h"
+
+namespace tamber {
+
+namespace {
+
+// Every trash folder, each once: the app libraries' (in the manager's order), then the shared
+// area's. Two libraries may share a trash folder when one lies inside the other.
+std::vector<Url> trashFoldersToSweep() {
+    std::vector<Url> folders;
+    auto add = [&](const Url& folder) {
+        if (std::find(folders.begin(), folders.end(), folder) == folders.end())
+            folders.push_back(folder);
+    };
+    for (const auto& library : LocalAppLibraryManager::shared()->allItems()) {
+        if (auto trash = trashFolderForURL(library->fileURL()))
+            add(*trash);
+    }
+    add(HostPorterManager::defaultManager()->documentStorageURL().appendingPathComponent(".Trash"));
+    return folders;
+}
+
+// Items whose date is gone or unreadable age from now on instead of never.
+void restamp(const Url& url) {
+    (void)writeTrashDate(url, Date::now());
+}
+
+}  // namespace
+
+void LocalPorter::_removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> referenceDate,
+                                                   std::function<void()> completion) {
+    std::string title = "remove trashed items older than " +
+                        (referenceDate ? referenceDate->description() : std::string("nil"));
+    withLogSection(title, [&] {
+        auto group = std::make_shared<DispatchGroup>();
+
+        FSDirectoryEnumerator walk;
+        walk.urls = trashFoldersToSweep();
+        walk.limit = std::numeric_limits<uint64_t>::max();  // a limit of 0 delivers nothing
+        // Only the top level: what lies inside a trashed folder goes with the folder.
+        walk.directoryEnumerationOptionsFor =
+            [](const Url&) -> std::optional<DirectoryEnumerationOptions> {
+            return DirectoryEnumerationOption::kSkipsHiddenFiles |
+                   DirectoryEnumerationOption::kSkipsPackageDescendants |
+                   DirectoryEnumerationOption::kSkipsSubdirectoryDescendants;
+        };
+        walk.enumerate([&](const Url& url) {
+            auto data = ReadXattrData(LocalItem::xattrTrashDateName(), url);
+            if (!data) {
+                logDebug([&] {
+                    return "can't find trash date for URL \"" + url.path() + "\"; set current date";
+                });
+                return restamp(url);
+            }
+            auto trashDate = UnarchiveLogged<Date>(*data);
+            if (!trashDate) {
+                logError("can't unarchive xattr data for URL \"" + url.path() +
+                         "\"; set current date");
+                return restamp(url);
+            }
+            if (!referenceDate ||
+                !(trashDate->timeIntervalSince1970() < referenceDate->timeIntervalSince1970()))
+                return;
+            auto identifier = identifierForURLLogged(url);
+            if (!identifier) {
+                logError("identifier lookup failed for URL \"" + url.path() + "\"");
+                return;
+            }
+            logDebug([&] {
+                return "item " + *identifier +
+                       " was trashed before reference date, let's remove it";
+            });
+            group->enter();
+            deleteItemWithIdentifier(*identifier,
+                                     [group](std::optional<Error>) { group->leave(); });
+        });
+
+        logDebug("wait until all deletions are complete");
+        group->notify(DispatchQueue::makeSerial("tamber.auto-delete.notifier"),
+                      [completion = std::move(completion)] {
+                          if (completion)
+                              completion();
+                      });
+    });
+}
+
+}  // namespace tamber
