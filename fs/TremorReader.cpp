@@ -25,6 +25,14 @@ namespace tamber {
 
 namespace {
 
+// Whether a removal event names a file ID that now belongs to an item elsewhere. A rename also
+// finds its item elsewhere, but it is flagged as one; a removal that is not a rename can only
+// find another item under the same number.
+bool isReusedFileID(uint32_t flags, const Url& eventURL, const LocalItem& item) {
+    return (flags & kTremorItemRemoved) && !(flags & kTremorItemRenamed) &&
+           item.fileURL().path() != eventURL.path();
+}
+
 constexpr double kLatencySeconds = 0.5;
 // Paths as objects, one event per file, and a {"path", "fileID"} dictionary per event.
 constexpr uint32_t kCreateFlags =
@@ -273,7 +281,7 @@ void TremorReader::classifyEvent(const std::string& path, std::optional<uint64_t
     } else if (path.find(kDocIDMarker) != std::string::npos) {
         processDocIDEvent(path, eventID);
     } else {
-        processPathEvent(path, fileID, eventID);
+        processPathEvent(path, fileID, flags, eventID);
     }
 }
 
@@ -342,7 +350,7 @@ void TremorReader::processDocIDEvent(const std::string& path, uint64_t eventID) 
 }
 
 void TremorReader::processPathEvent(const std::string& path, std::optional<uint64_t> fileID,
-                                    uint64_t eventID) {
+                                    uint32_t flags, uint64_t eventID) {
     Url url = Url::fileURLWithPath(path);
     if (isHidden(url)) {
         if (verbose_)
@@ -364,6 +372,11 @@ void TremorReader::processPathEvent(const std::string& path, std::optional<uint6
         }
     }
     LocalItemRef item = fileID ? LocalItem::makeWithFileIdentifier(*fileID) : LocalItem::make(url);
+    if (item && isReusedFileID(flags, url, *item)) {
+        // Linux hands a freed inode number to the next file made: the item that has this
+        // file ID now is another one, and the one the event is about is gone.
+        item = nullptr;
+    }
     if (item) {
         if (verbose_)
             logDebug([&] { return "did change " + item->description(); });

@@ -82,7 +82,7 @@ private:
     void classifyEvent(const std::string& path, std::optional<uint64_t> fileID, uint32_t flags,
                        uint64_t eventID);
     void processDocIDEvent(const std::string& path, uint64_t eventID);
-    void processPathEvent(const std::string& path, std::optional<uint64_t> fileID,
+    void processPathEvent(const std::string& path, std::optional<uint64_t> fileID, uint32_t flags,
                           uint64_t eventID);
     bool isHidden(const Url& url) const;
     std::shared_ptr<TremorReaderDelegate> delegate() const;

@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <filesystem>
 #include <thread>
@@ -134,6 +135,29 @@ TEST_F(TremorTest, DroppedEventsAskForARescanAndHistoryDoneIsReported) {
     EXPECT_EQ(delegate->itemReports(), (Reports{"rescan", "history"}));
     // Neither a rescan nor the end of history is an item event to resume after.
     EXPECT_LT(readers[0]->lastProcessedTremorID(), dropped);
+}
+
+// Linux gives a freed inode number to the next file made: a removal whose file ID now names
+// an item elsewhere is that item's predecessor going away, while a rename finds the item itself.
+TEST_F(TremorTest, ARemovalWhoseFileIDWasReusedIsADeletion) {
+    std::string now = write("now.txt");
+    struct stat st {};
+    ASSERT_EQ(::lstat(now.c_str(), &st), 0);
+    uint64_t inode = st.st_ino;
+    auto nowID = TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(now));
+    ASSERT_TRUE(nowID);
+    std::string removed = storagePath() + "/removed-folder";
+    std::string renamed = storagePath() + "/renamed-from.txt";
+    uint64_t since = currentID();
+    journal({{0, removed, inode, kTremorItemRemoved | kTremorItemIsDir},
+             {0, renamed, inode, kTremorItemRemoved | kTremorItemRenamed},
+             {0, now, inode, kTremorItemRemoved}});
+    startReader(since);
+    ASSERT_TRUE(delegate->waitForReport("history"));
+    EXPECT_EQ(
+        delegate->itemReports(),
+        (Reports{"delete fid=" + std::to_string(inode) + " " + removed,
+                 "change " + *nowID + " " + renamed, "change " + *nowID + " " + now, "history"}));
 }
 
 TEST_F(TremorTest, DocumentIDEventsAreJudgedByTheirShapeAndTheDocumentTheyName) {
