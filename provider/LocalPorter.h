@@ -5,8 +5,10 @@
 #include <optional>
 #include <vector>
 
+#include "host/HostPorterEnumerator.h"
 #include "host/HostPorterExtension.h"
 #include "items/LocalItem.h"
+#include "platform/apps/AppRecord.h"
 #include "support/DispatchQueue.h"
 #include "support/Pacer.h"
 
@@ -48,6 +50,72 @@ public:
     std::optional<HostPorterItemIdentifier> identifierForURLLogged(const Url& url);
     Result<LocalItemRef> itemForIdentifierLogged(const HostPorterItemIdentifier& identifier);
     Result<LocalItemRef> itemForURL(const Url& url);
+
+    // Enumerators: the root enumerator for the three root-served containers, a folder
+    // enumerator for any other container; either is started before it is returned.
+    Result<HostPorterEnumeratorRef> enumeratorForContainerItemIdentifier(
+        const HostPorterItemIdentifier& identifier) override;
+
+    // Item operations. Every completion is called exactly once, on whatever thread the file
+    // operation finishes.
+    using ItemCompletion = std::function<void(LocalItemRef item, std::optional<Error> error)>;
+    using ErrorCompletion = std::function<void(std::optional<Error> error)>;
+    void importDocumentAtURL(const Url& source, const HostPorterItemIdentifier& parent,
+                             ItemCompletion completion);
+    void createDirectoryWithName(const std::string& name, const HostPorterItemIdentifier& parent,
+                                 ItemCompletion completion);
+    void renameItemWithIdentifier(const HostPorterItemIdentifier& identifier,
+                                  const std::string& name, ItemCompletion completion);
+    void reparentItemWithIdentifier(const HostPorterItemIdentifier& identifier,
+                                    const HostPorterItemIdentifier& parent,
+                                    const std::optional<std::string>& newName,
+                                    ItemCompletion completion);
+    void deleteItemWithIdentifier(const HostPorterItemIdentifier& identifier,
+                                  ErrorCompletion completion);
+
+    // Trash and put-back.
+    void trashItemWithIdentifier(const HostPorterItemIdentifier& identifier,
+                                 ItemCompletion completion);
+    void untrashItemWithIdentifier(const HostPorterItemIdentifier& identifier,
+                                   const std::optional<HostPorterItemIdentifier>& parent,
+                                   ItemCompletion completion);
+    // Removes what was trashed before `referenceDate`, stamps what has no trash date; the
+    // completion runs on "tamber.auto-delete.notifier" once every deletion has finished.
+    void _removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> referenceDate,
+                                          std::function<void()> completion);
+
+    // Metadata.
+    void setLastUsedDate(std::shared_ptr<const Date> date,
+                         const HostPorterItemIdentifier& identifier, ItemCompletion completion);
+    void setTagData(const std::optional<Bytes>& tagData, const HostPorterItemIdentifier& identifier,
+                    ItemCompletion completion);
+    void setFavoriteRank(std::shared_ptr<const Number> rank,
+                         const HostPorterItemIdentifier& identifier, ItemCompletion completion);
+
+    // Thumbnails: only app libraries have one, their app's icon as PNG.
+    struct ThumbnailSize {
+        double width = 0;
+        double height = 0;
+    };
+    using PerThumbnailCompletion =
+        std::function<void(const HostPorterItemIdentifier& identifier, std::optional<Bytes> png,
+                           std::optional<Error> error)>;
+    using PerThumbnailCompletionWithType =
+        std::function<void(const HostPorterItemIdentifier& identifier, std::optional<Bytes> png,
+                           const std::string& typeIdentifier, std::optional<Error> error)>;
+    void fetchThumbnailsForItemIdentifiers(const std::vector<HostPorterItemIdentifier>& identifiers,
+                                           ThumbnailSize requestedSize,
+                                           PerThumbnailCompletion perThumbnailCompletion,
+                                           ErrorCompletion completion);
+    void fetchThumbnailsForItemIdentifiers(const std::vector<HostPorterItemIdentifier>& identifiers,
+                                           ThumbnailSize requestedSize,
+                                           PerThumbnailCompletionWithType perThumbnailCompletion,
+                                           ErrorCompletion completion);
+    std::optional<Bytes> bestIconData(const AppRecord& record);
+
+    // The app library item of one app.
+    void _defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
+                                                         ItemCompletion completion);
 
     // Refreshes the app libraries from the registry, upgrades the shared manager from the main
     // cache, calls the waiting handlers and signals the containers that changed. Runs on the
