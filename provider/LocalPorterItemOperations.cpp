@@ -28,7 +28,7 @@ void finishWithItem(LocalPorter& porter, const std::optional<Url>& url,
                     const std::optional<Error>& error,
                     const LocalPorter::ItemCompletion& completion) {
     if (error || !url) {
-        completion(nullptr, error.value_or(Error::errorWithPOSIXCode(EIO)));
+        completion(nullptr, error.value_or(Error::posix(EIO)));
         return;
     }
     auto item = porter.itemForURL(*url);

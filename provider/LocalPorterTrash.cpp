@@ -101,7 +101,7 @@ void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identi
             original, trash,
             [this, original, completion](std::optional<Url> trashed, std::optional<Error> error) {
                 if (error || !trashed)
-                    return completion(nullptr, error.value_or(Error::errorWithPOSIXCode(EIO)));
+                    return completion(nullptr, error.value_or(Error::posix(EIO)));
                 // The move stands whatever happens to the attributes.
                 (void)writeTrashDate(*trashed, Date::now());
                 setPutBackString(*trashed, original);
@@ -177,7 +177,7 @@ void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& iden
             *url, *destination, true,
             [this, completion](std::optional<Url> restored, std::optional<Error> error) {
                 if (error || !restored)
-                    return completion(nullptr, error.value_or(Error::errorWithPOSIXCode(EIO)));
+                    return completion(nullptr, error.value_or(Error::posix(EIO)));
                 // Only the date goes; the next trashing rewrites the put-back path anyway.
                 logDebug("removing trash date xattr");
                 (void)writeTrashDate(*restored, nullptr);
