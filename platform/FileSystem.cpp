@@ -8,9 +8,11 @@ namespace tamber {
 
 namespace {
 
+// Never destroyed: services that outlive main (the journal closes its store from a static's
+// destructor at exit) still reach a file system, whatever the order of static destruction.
 std::shared_ptr<FileSystem>& slot() {
-    static std::shared_ptr<FileSystem> fs = std::make_shared<LinuxFileSystem>();
-    return fs;
+    static auto* fs = new std::shared_ptr<FileSystem>(std::make_shared<LinuxFileSystem>());
+    return *fs;
 }
 
 }  // namespace

@@ -340,6 +340,11 @@ void TremorService::sync() {
         if (!changes.empty())
             enqueue(std::move(changes));
         std::lock_guard lock(queueMutex_);
+        // Nothing read and nothing left to write: everything before this call is journaled
+        // already, and a round trip through the journaling thread would only cost time (an
+        // identifier asked for every file of a listing passes here).
+        if (queue_.empty() && !journaling_)
+            return;
         barrier = ++nextBarrier_;
         queue_.push_back({Item::Kind::Barrier, {}, barrier});
     }
@@ -364,8 +369,11 @@ void TremorService::journalLoop() {
                 barrierPassed_.notify_all();
                 continue;
             }
+            journaling_ = true;
         }
         journal(item);
+        std::lock_guard lock(queueMutex_);
+        journaling_ = false;
     }
     std::lock_guard lock(queueMutex_);
     passedBarrier_ = nextBarrier_;

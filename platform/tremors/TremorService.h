@@ -137,6 +137,7 @@ private:
     bool stopJournaling_ = false;
     uint64_t nextBarrier_ = 0;
     uint64_t passedBarrier_ = 0;
+    bool journaling_ = false;  // the journaling thread is writing a batch it took off the queue
     std::condition_variable barrierPassed_;
 
     // Serialises every use of the writers and the stores' index.
