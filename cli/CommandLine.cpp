@@ -11,12 +11,19 @@
 #include "cli/AppsCommand.h"
 #include "cli/ChangesCommand.h"
 #include "cli/CliContext.h"
+#include "cli/CreateItemCommand.h"
 #include "cli/EventsCommand.h"
 #include "cli/IdCommand.h"
 #include "cli/ItemCommand.h"
+#include "cli/ItemMetadataCommand.h"
 #include "cli/ListCommand.h"
 #include "cli/MetaCommand.h"
+#include "cli/MoveItemCommand.h"
 #include "cli/PathCommand.h"
+#include "cli/PurgeTrashCommand.h"
+#include "cli/RemoveItemCommand.h"
+#include "cli/ThumbnailCommand.h"
+#include "cli/TrashItemCommand.h"
 #include "cli/WatchCommand.h"
 #include "support/Log.h"
 #include "support/StderrLogSink.h"
@@ -51,6 +58,19 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
     commands.push_back(std::make_unique<ChangesCommand>());
     commands.push_back(std::make_unique<AnchorCommand>());
     commands.push_back(std::make_unique<WatchCommand>());
+    // Acting on items, as the file browser does.
+    commands.push_back(std::make_unique<CreateItemCommand>(CreateItemCommand::Verb::Import));
+    commands.push_back(std::make_unique<CreateItemCommand>(CreateItemCommand::Verb::Mkdir));
+    commands.push_back(std::make_unique<MoveItemCommand>(MoveItemCommand::Verb::Rename));
+    commands.push_back(std::make_unique<MoveItemCommand>(MoveItemCommand::Verb::Move));
+    commands.push_back(std::make_unique<RemoveItemCommand>());
+    commands.push_back(std::make_unique<TrashItemCommand>(TrashItemCommand::Verb::Trash));
+    commands.push_back(std::make_unique<TrashItemCommand>(TrashItemCommand::Verb::Untrash));
+    commands.push_back(std::make_unique<ItemMetadataCommand>(ItemMetadataCommand::Verb::Tag));
+    commands.push_back(std::make_unique<ItemMetadataCommand>(ItemMetadataCommand::Verb::Rank));
+    commands.push_back(std::make_unique<ItemMetadataCommand>(ItemMetadataCommand::Verb::Touch));
+    commands.push_back(std::make_unique<ThumbnailCommand>());
+    commands.push_back(std::make_unique<PurgeTrashCommand>());
     std::vector<std::pair<CLI::App*, Command*>> verbs;
     for (auto& c : commands) verbs.emplace_back(c->add(app), c.get());
 

@@ -1,0 +1,42 @@
+#include "cli/CreateItemCommand.h"
+
+#include "cli/ItemAction.h"
+
+namespace tamber {
+
+CLI::App* CreateItemCommand::add(CLI::App& app) {
+    CLI::App* sub = nullptr;
+    if (verb_ == Verb::Import) {
+        sub = app.add_subcommand("import",
+                                 "Copy a file or folder into a folder (a taken name becomes "
+                                 "\"name 2\", \"name 3\", ...) and print the new item");
+        sub->add_option("SRC", source_, "The file or folder to copy")->required();
+    } else {
+        sub = app.add_subcommand("mkdir", "Create a folder and print it");
+        sub->add_option("NAME", source_, "The new folder's name")->required();
+    }
+    sub->add_option("PARENT", parent_,
+                    "The folder to create it in: an identifier (fid=N, #bundle.id) or a path")
+        ->required();
+    sub->add_flag("--json", json_, "Print the item as `tamber item --json` does");
+    return sub;
+}
+
+int CreateItemCommand::run(CliContext& context) {
+    auto porter = context.prepareProvider();
+    if (!porter.ok())
+        return context.fail(porter.error(), json_);
+    auto parent = ItemAction::identifierFor(*porter.value(), parent_);
+    if (!parent.ok())
+        return context.fail(parent.error(), json_);
+    auto item = ItemAction::waitForItem([&](LocalPorter::ItemCompletion done) {
+        if (verb_ == Verb::Import)
+            porter.value()->importDocumentAtURL(Url::fileURLWithPath(source_), parent.value(),
+                                                std::move(done));
+        else
+            porter.value()->createDirectoryWithName(source_, parent.value(), std::move(done));
+    });
+    return ItemAction::finish(context, item, json_);
+}
+
+}  // namespace tamber
