@@ -51,6 +51,10 @@ protected:
     }
 
     json tamberJson(std::vector<std::string> args, int expectedStatus = 0) {
+        // Verbs run in this one process, one right after the other: let the journal index what
+        // the previous verb changed, as it would have before a separate process started.
+        if (auto service = TremorService::sharedIfRunning())
+            service->sync();
         args.insert(args.begin(), {"--storage", storage});
         args.push_back("--json");
         CliRun run = testing::runTamber(std::move(args));
