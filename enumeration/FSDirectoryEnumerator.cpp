@@ -3,6 +3,9 @@
 #include <dirent.h>
 
 #include <cerrno>
+#include <list>
+#include <mutex>
+#include <optional>
 #include <string>
 
 #include "enumeration/DirectoryListingCache.h"
@@ -64,33 +67,38 @@ struct Pager {
     const ErrorHandler& handleError;
 };
 
-// Walks one root depth first, counting and delivering through `pager`. An error handler that
-// answers false ends the walk of this root.
-void walkRoot(const Url& root, DirectoryEnumerationOptions options, Pager& pager) {
+// The listing of a root to start its walk with; nothing (after logging or handing the error
+// on) when it can't be walked.
+std::optional<std::vector<Frame>> openRoot(const Url& root, Pager& pager) {
     if (!root.isFileURL()) {
         logError("can't create file enumerator at " + root.path());
-        return;
+        return std::nullopt;
     }
+    Result<DirectoryListingCache::Listing> listing =
+        DirectoryListingCache::shared().listing(root.path());
+    if (!listing) {
+        const Error& error = listing.error();
+        if (error.is(kPosixErrorDomain, ENOTDIR) || error.is(kPosixErrorDomain, ELOOP)) {
+            // A file or a link: there is no directory to walk.
+            logError("can't create file enumerator at " + root.path());
+        } else {
+            (void)pager.handleError(root, error);
+        }
+        return std::nullopt;
+    }
+    std::vector<Frame> stack;
+    stack.push_back(Frame{root.path(), std::move(*listing)});
+    return stack;
+}
+
+// Walks a root depth first from `stack`, counting and delivering through `pager`. An error
+// handler that answers false ends the walk of this root. When the page fills, `stack` is left
+// pointing at the first entry not delivered, so that the next page can go on from there.
+void walkFrames(std::vector<Frame>& stack, DirectoryEnumerationOptions options, Pager& pager) {
     const bool skipsHidden = options & Option::kSkipsHiddenFiles;
     const bool skipsPackages = options & Option::kSkipsPackageDescendants;
     const bool skipsSubdirectories = options & Option::kSkipsSubdirectoryDescendants;
-
     DirectoryListingCache& cache = DirectoryListingCache::shared();
-    std::vector<Frame> stack;
-    {
-        Result<DirectoryListingCache::Listing> listing = cache.listing(root.path());
-        if (!listing) {
-            const Error& error = listing.error();
-            if (error.is(kPosixErrorDomain, ENOTDIR) || error.is(kPosixErrorDomain, ELOOP)) {
-                // A file or a link: there is no directory to walk.
-                logError("can't create file enumerator at " + root.path());
-            } else {
-                (void)pager.handleError(root, error);
-            }
-            return;
-        }
-        stack.push_back(Frame{root.path(), std::move(*listing)});
-    }
 
     while (!stack.empty() && pager.keepGoing) {
         Frame& frame = stack.back();
@@ -109,14 +117,19 @@ void walkRoot(const Url& root, DirectoryEnumerationOptions options, Pager& pager
         const FileSystem::DirectoryEntry& entry = frame.at(frame.position++, skipsHidden);
         if (!skipsHidden && (entry.name == "." || entry.name == ".."))
             continue;
+        if (pager.counter >= pager.offset && pager.counter - pager.offset >= pager.limit) {
+            // The entry that hits the limit is neither counted nor delivered: the next page
+            // starts with it.
+            --frame.position;
+            pager.keepGoing = false;
+            return;
+        }
         std::string path = childPath(frame.path, entry.name);
         bool descend = !skipsSubdirectories && isDirectory(entry, path) &&
                        !(skipsPackages && IsPackageName(entry.name));
 
-        if (pager.counter < pager.offset) {
-            ++pager.counter;
-        } else if (pager.counter - pager.offset < pager.limit) {
-            ++pager.counter;
+        ++pager.counter;
+        if (pager.counter > pager.offset) {
             Url url = Url::fileURLWithPath(path);
             if (Status prefetched = url.prefetchResourceValues(LocalItem::urlKeys())) {
                 if (!pager.handleError(url, *prefetched))
@@ -124,10 +137,6 @@ void walkRoot(const Url& root, DirectoryEnumerationOptions options, Pager& pager
             } else {
                 pager.deliver(url);
             }
-        } else {
-            // The entry that hits the limit is neither counted nor delivered.
-            pager.keepGoing = false;
-            return;
         }
 
         if (descend) {
@@ -141,6 +150,70 @@ void walkRoot(const Url& root, DirectoryEnumerationOptions options, Pager& pager
             stack.push_back(Frame{std::move(path), std::move(*listing)});
         }
     }
+}
+
+// Where walks that filled their page stopped, so that the next page of a tree resumes there
+// instead of walking again over everything before its offset (which made listing a tree of
+// 100,000 files page by page quadratic). A stopped walk is found again by its roots, options
+// and counter, and used only while every folder on its path still holds what it held.
+struct Cursor {
+    std::string key;
+    size_t rootIndex = 0;
+    std::vector<Frame> stack;
+    uint64_t counter = 0;
+};
+
+class CursorCache {
+public:
+    static CursorCache& shared() {
+        static auto* cache = new CursorCache;  // used from walks until the process ends
+        return *cache;
+    }
+
+    void keep(Cursor cursor) {
+        std::lock_guard lock(mutex_);
+        cursors_.push_front(std::move(cursor));
+        if (cursors_.size() > kMaxCursors)
+            cursors_.pop_back();
+    }
+
+    std::optional<Cursor> take(const std::string& key, uint64_t counter) {
+        std::lock_guard lock(mutex_);
+        for (auto it = cursors_.begin(); it != cursors_.end(); ++it) {
+            if (it->key == key && it->counter == counter) {
+                Cursor cursor = std::move(*it);
+                cursors_.erase(it);
+                return cursor;
+            }
+        }
+        return std::nullopt;
+    }
+
+private:
+    static constexpr size_t kMaxCursors = 8;
+    std::mutex mutex_;
+    std::list<Cursor> cursors_;
+};
+
+bool sameEntries(const DirectoryListingCache::Entries& a, const DirectoryListingCache::Entries& b) {
+    if (a.all.size() != b.all.size())
+        return false;
+    for (size_t i = 0; i < a.all.size(); ++i) {
+        if (a.all[i].name != b.all[i].name || a.all[i].inode != b.all[i].inode)
+            return false;
+    }
+    return true;
+}
+
+// Whether every folder on the cursor's path lists as it did when the walk stopped.
+bool stillValid(Cursor& cursor) {
+    for (Frame& frame : cursor.stack) {
+        Result<DirectoryListingCache::Listing> now =
+            DirectoryListingCache::shared().listing(frame.path);
+        if (!now || !(*now == frame.listing || sameEntries(**now, *frame.listing)))
+            return false;
+    }
+    return true;
 }
 
 }  // namespace
@@ -167,13 +240,39 @@ uint64_t FSDirectoryEnumerator::enumerate(
     const ErrorHandler& handleError =
         errorHandler ? errorHandler : ErrorHandler(&FSDirectoryEnumerator::logEnumerationError);
     Pager pager{offset, limit, 0, limit != 0, deliver, handleError};
+
+    std::vector<DirectoryEnumerationOptions> options;
+    std::string key;
     for (const Url& root : urls) {
-        if (!pager.keepGoing)
-            break;
-        std::optional<DirectoryEnumerationOptions> options;
+        std::optional<DirectoryEnumerationOptions> override;
         if (directoryEnumerationOptionsFor)
-            options = directoryEnumerationOptionsFor(root);
-        walkRoot(root, options.value_or(defaultOptions(recursively)), pager);
+            override = directoryEnumerationOptionsFor(root);
+        options.push_back(override.value_or(defaultOptions(recursively)));
+        key += root.path() + '\0' + std::to_string(options.back()) + '\0';
+    }
+
+    size_t first = 0;
+    std::optional<Cursor> cursor;
+    if (offset > 0 && pager.keepGoing) {
+        cursor = CursorCache::shared().take(key, offset);
+        if (cursor && stillValid(*cursor)) {
+            first = cursor->rootIndex;
+            pager.counter = offset;
+        } else {
+            cursor.reset();
+        }
+    }
+    for (size_t i = first; i < urls.size() && pager.keepGoing; ++i) {
+        std::optional<std::vector<Frame>> stack;
+        if (cursor && i == first)
+            stack = std::move(cursor->stack);
+        else
+            stack = openRoot(urls[i], pager);
+        if (!stack)
+            continue;
+        walkFrames(*stack, options[i], pager);
+        if (!pager.keepGoing)
+            CursorCache::shared().keep(Cursor{key, i, std::move(*stack), pager.counter});
     }
     return pager.counter;
 }

@@ -173,6 +173,25 @@ TEST_F(FSDirectoryEnumeratorTest,
     EXPECT_EQ(names, (Names{"deep", "x.txt", "y.txt", ".Trash", "only.txt"}));
 }
 
+// A tree's next page goes on where the last one stopped instead of walking everything before
+// its offset again; a folder on that path that changed since makes it count from the start.
+TEST_F(FSDirectoryEnumeratorTest, ANextPageResumesWhereTheLastStoppedUnlessItsFolderChanged) {
+    for (int i = 0; i < 5; ++i) {
+        dir.writeFile("t/a" + std::to_string(i));
+        dir.writeFile("t/sub/b" + std::to_string(i));
+    }
+    letTimestampsSettle();
+    EXPECT_EQ(page({"t"}, true, 0, 4).first, (Names{"t/a0", "t/a1", "t/a2", "t/a3"}));
+    EXPECT_EQ(page({"t"}, true, 4, 4).first, (Names{"t/a4", "t/sub", "t/sub/b0", "t/sub/b1"}));
+
+    dir.writeFile("t/sub/0new");
+    auto [third, counter] = page({"t"}, true, 8, 4);
+    Names all = page({"t"}, true, 0, 100).first;
+    ASSERT_EQ(all.size(), 12u);
+    EXPECT_EQ(third, Names(all.begin() + 8, all.end()));
+    EXPECT_EQ(counter, 12u);
+}
+
 TEST_F(FSDirectoryEnumeratorTest, SkippedEntriesAreNeverStattedAndUnknownTypesAreResolved) {
     for (int i = 0; i < 50; ++i) dir.writeFile("tree/" + numbered(i));
     dir.writeFile("tree/.hidden/secret");
