@@ -7,9 +7,11 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "enumeration/DirectoryListingCache.h"
+#include "enumeration/LocalFileEnumerator.h"
 #include "fs/FSChangeToken.h"
 #include "fs/TremorReader.h"
 #include "host/HostPorterEnumerator.h"
@@ -100,6 +102,16 @@ private:
 // that watches the document storage, so that device UUIDs, event IDs and document IDs are real.
 class EnumerationTest : public AppLibraryTest {
 protected:
+    // The context detaches a finished change enumeration right after the host heard of it.
+    static bool detachesAll(const LocalFileEnumerator& enumerator) {
+        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+        while (enumerator.runningEnumeratorCount() != 0) {
+            if (std::chrono::steady_clock::now() > deadline)
+                return false;
+            std::this_thread::sleep_for(std::chrono::milliseconds(2));
+        }
+        return true;
+    }
     void SetUp() override {
         AppLibraryTest::SetUp();
         TremorService::resetForTesting();

@@ -25,16 +25,6 @@ protected:
         return track(LocalFileEnumerator::initWithContainer(
             "fid=1", {Url::fileURLWithPath(path)}));  // the identifier only names the container
     }
-    // The context detaches a finished change enumeration right after the host heard of it.
-    static bool detachesAll(const LocalFileEnumerator& enumerator) {
-        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-        while (enumerator.runningEnumeratorCount() != 0) {
-            if (std::chrono::steady_clock::now() > deadline)
-                return false;
-            std::this_thread::sleep_for(std::chrono::milliseconds(2));
-        }
-        return true;
-    }
     LocalFileEnumeratorRef track(LocalFileEnumeratorRef enumerator) {
         enumerators.push_back(enumerator);
         return enumerator;
