@@ -66,6 +66,9 @@ uint64_t TremorStrataService::resolveDocumentId(uint32_t device, uint32_t docume
         errno = EAGAIN;
         return 0;
     }
+    // A save or move that completed before the call must be in the index: resolving an
+    // identifier right after the provider moved its file would otherwise find the old place.
+    service_->sync();
     TremorStore* store = service_->storeForDevice(device);
     auto inode = store ? store->inodeForDocumentId(documentId) : std::nullopt;
     if (!inode) {
@@ -76,6 +79,7 @@ uint64_t TremorStrataService::resolveDocumentId(uint32_t device, uint32_t docume
 }
 
 bool TremorStrataService::pathForFileId(uint32_t device, uint64_t fileId, std::string& path) {
+    service_->sync();  // as for document IDs: a rename that completed is in the index
     TremorStore* store = service_->storeForDevice(device);
     auto found = store ? store->pathForInode(fileId) : std::nullopt;
     if (!found) {
