@@ -1,8 +1,10 @@
 #include "fs/FSChangesEnumerator.h"
 
+#include <algorithm>
 #include <limits>
 
 #include "applibraries/LocalAppLibraryManager.h"
+#include "fs/ChangePageResumes.h"
 #include "host/UrlOperations.h"
 #include "items/LocalAppLibraryItem.h"
 #include "support/Log.h"
@@ -31,6 +33,20 @@ FSChangesEnumerator::FSChangesEnumerator(Private, FSChangeToken token,
       maxTremorID_(currentToken_.streamEventID) {
     if (urls_.empty())
         fatalError("require at least one URL to init a change enumerator");
+    if (currentToken_.offset > 0) {
+        // The page before this one stopped at a known event: go on from there, as replaying
+        // the history from the anchor and skipping `offset` changes would, without building
+        // the skipped ones again.
+        auto point = ChangePageResumes::shared().take(
+            ChangePageResumes::keyFor(currentToken_, container_, urls_));
+        if (point) {
+            numberOfChanges_ = currentToken_.offset;
+            maxTremorID_ = std::max(maxTremorID_, point->maxTremorID);
+            shouldProcessedTremorsDocIDBased_ = point->mode == TremorReaderMode::pathBased;
+            reader_ = TremorReader::make(urls_, point->eventID, point->mode, true);
+            return;
+        }
+    }
     reader_ = TremorReader::make(urls_, sinceTremorID_, TremorReaderMode::pathBased, true);
 }
 
@@ -50,7 +66,9 @@ TremorReaderRef FSChangesEnumerator::currentReader() const {
 }
 
 void FSChangesEnumerator::stopAsync(TremorReader& reader) {
-    // Reports run inside the reader's callback: the stop must wait until it has returned.
+    // Reports run inside the reader's callback: the stop must wait until it has returned, and
+    // the rest of the batch is not wanted.
+    reader.stopAfterCurrentEvent();
     reader.streamQueue()->async([self = reader.shared_from_this()] { self->stop(); });
 }
 
@@ -83,6 +101,14 @@ FSChangesEnumerator::Passage FSChangesEnumerator::pass() {
         currentToken_.offset = numberOfChanges_;
         passage.pageAnchor = currentToken_.encode();
         passage.reader = reader_;
+        // A change made by the event in progress (not by a later check of it) marks where the
+        // next page may start.
+        uint64_t eventID = reader_->eventInProgress();
+        if (eventID != 0 && deferredChecks_ == 0) {
+            ChangePageResumes::shared().keep(
+                ChangePageResumes::keyFor(currentToken_, container_, urls_),
+                {reader_->mode(), eventID, maxTremorID_});
+        }
     }
     return passage;
 }
@@ -151,6 +177,10 @@ void FSChangesEnumerator::readerDidDelete(TremorReader& reader,
         if (url && !isLibrary) {
             // The folder that vanished may have been an app's library root, which the root
             // container shows as the library itself.
+            {
+                std::lock_guard lock(mutex_);
+                ++deferredChecks_;
+            }
             reader.streamQueue()->async(
                 [self = shared_from_this(), url = *url] { self->reportLibraryRootDeletion(url); });
         }

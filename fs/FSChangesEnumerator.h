@@ -75,6 +75,9 @@ private:
     // late task of an earlier pass and the owner's stop() from racing with it.
     mutable std::mutex mutex_;
     bool finished_ = false;  // no report is forwarded after the request finished
+    // Checks of vanished folders queued for later on the reader's queue: their changes come
+    // after other events', so a page they touch has no single event to resume from.
+    uint64_t deferredChecks_ = 0;
     FSChangeToken currentToken_;
     uint64_t numberOfChanges_ = 0;
     HostPorterItemIdentifier container_;

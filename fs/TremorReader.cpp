@@ -113,6 +113,7 @@ void TremorReader::start() {
     std::lock_guard lock(mutex_);
     if (stream_)
         return;  // already running
+    stopping_.store(false);
     registration_ = registerReader(weak_from_this());
     TremorStreamContext context;
     context.info = reinterpret_cast<void*>(static_cast<uintptr_t>(registration_));
@@ -227,7 +228,7 @@ void TremorReader::receiveBatch(size_t numEvents, const ObjectRef& paths, const 
     }
     if (verbose_)
         logDebug([&] { return "tremor: received " + std::to_string(numEvents) + " events"; });
-    for (size_t i = 0; i < numEvents; ++i) {
+    for (size_t i = 0; i < numEvents && !stopping_.load(); ++i) {
         auto entry = objectCast<Dictionary>(array->objects()[i]);
         auto path = objectCast<String>(entry->objectForKey("path"));
         if (!path) {
@@ -256,7 +257,9 @@ void TremorReader::processEvent(const std::string& path, std::optional<uint64_t>
                 " eventID:" + std::to_string(eventID);
     }
     LogSection section(title);
+    eventInProgress_ = eventID;
     classifyEvent(path, fileID, flags, eventID);
+    eventInProgress_ = 0;
 }
 
 void TremorReader::classifyEvent(const std::string& path, std::optional<uint64_t> fileID,

@@ -50,9 +50,17 @@ public:
     // block there).
     void stop();
 
+    // Makes the batch in progress end after the event being reported: a delegate that has
+    // what it wanted (a full page) stops the reader asynchronously, and the rest of a replay
+    // batch (up to a thousand events, an item built for each) would be work thrown away.
+    void stopAfterCurrentEvent() { stopping_.store(true); }
+
     void setDelegate(std::weak_ptr<TremorReaderDelegate> delegate);
     // Read on `streamQueue`, or once the reader is stopped.
     uint64_t lastProcessedTremorID() const;
+    // The ID of the event whose report is being made, while a delegate call runs on
+    // `streamQueue`; 0 between events.
+    uint64_t eventInProgress() const { return eventInProgress_; }
     const std::vector<Url>& urls() const { return urls_; }
     TremorReaderMode mode() const { return mode_; }
     bool verbose() const { return verbose_; }
@@ -90,6 +98,8 @@ private:
 
     // Members beyond these are the implementation's to add.
     std::vector<Url> urls_;
+    uint64_t eventInProgress_ = 0;  // on streamQueue_
+    std::atomic<bool> stopping_{false};
     TremorReaderMode mode_;
     bool verbose_;
     std::shared_ptr<DispatchQueue> streamQueue_;

@@ -117,6 +117,26 @@ TEST_F(FSChangesEnumeratorTest, ALongHistoryIsSentInPagesOf200ByChangeCount) {
     EXPECT_EQ(log->count("[DEBUG] processed all Tremors path based, carry on with the docID based",
                          LogLevel::Debug),
               1u);
+    // Each later page went on from the event that filled the one before, not from the anchor.
+    auto startedSince = [&](uint64_t eventID) {
+        size_t n = 0;
+        for (const auto& line : log->texts()) {
+            n += line.starts_with("[DEBUG] starting <TremorReader:") &&
+                 line.find(" since:" + std::to_string(eventID) + " ") != std::string::npos;
+        }
+        return n;
+    };
+    EXPECT_EQ(startedSince(since + 200), 1u);
+    EXPECT_EQ(startedSince(since + 400), 1u);
+
+    // A page asked for again (its answer lost, or by another process) replays the history
+    // from the anchor and skips what went before: the same changes, the same anchor.
+    auto again = request(*first->anchor);
+    EXPECT_EQ(again->updates, second->updates);
+    ASSERT_TRUE(again->anchor);
+    EXPECT_EQ(*again->anchor, *second->anchor);
+    // From the anchor: the first request, the last one's document-ID pass, and this one.
+    EXPECT_EQ(startedSince(since), 3u);
 }
 
 TEST_F(FSChangesEnumeratorTest, ExactlyAFullPageEndsWithAnEmptyCatchUp) {
