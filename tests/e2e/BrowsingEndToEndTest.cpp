@@ -56,13 +56,15 @@ struct PageRecorder : HostPorterEnumerationObserver {
 };
 
 struct BatchRecorder : HostPorterChangeObserver {
+    // Changes in the order they came: a deletion and a later update of the same identifier (a
+    // folder's number reused) must be applied in that order.
     void didUpdateItems(const std::vector<HostPorterItemRef>& items) override {
         std::lock_guard lock(mutex);
-        updated.insert(updated.end(), items.begin(), items.end());
+        for (const auto& item : items) changes.push_back({item, {}});
     }
     void didDeleteItemsWithIdentifiers(const std::vector<HostPorterItemIdentifier>& ids) override {
         std::lock_guard lock(mutex);
-        deleted.insert(deleted.end(), ids.begin(), ids.end());
+        for (const auto& id : ids) changes.push_back({nullptr, id});
     }
     void finishEnumeratingChangesUpToSyncAnchor(const HostPorterSyncAnchor& a, bool more) override {
         {
@@ -80,8 +82,7 @@ struct BatchRecorder : HostPorterChangeObserver {
         done.signal();
     }
     std::mutex mutex;
-    std::vector<HostPorterItemRef> updated;
-    std::vector<HostPorterItemIdentifier> deleted;
+    std::vector<std::pair<HostPorterItemRef, HostPorterItemIdentifier>> changes;
     HostPorterSyncAnchor anchor;
     bool moreComing = false;
     std::optional<Error> error;
@@ -158,8 +159,12 @@ protected:
             EXPECT_FALSE(recorder->error) << recorder->error->description();
             if (recorder->error)
                 return requests;
-            for (const auto& item : recorder->updated) apply(item);
-            for (const auto& id : recorder->deleted) replica.erase(id);
+            for (const auto& [item, deleted] : recorder->changes) {
+                if (item)
+                    apply(item);
+                else
+                    replica.erase(deleted);
+            }
             anchor = recorder->anchor;
             if (!recorder->moreComing)
                 return requests;
