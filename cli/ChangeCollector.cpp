@@ -7,12 +7,14 @@ namespace tamber {
 void ChangeCollector::didUpdateItems(const std::vector<HostPorterItemRef>& items) {
     std::lock_guard lock(mutex_);
     updated.insert(updated.end(), items.begin(), items.end());
+    for (const auto& item : items) changes.push_back({item, {}});
 }
 
 void ChangeCollector::didDeleteItemsWithIdentifiers(
     const std::vector<HostPorterItemIdentifier>& identifiers) {
     std::lock_guard lock(mutex_);
     deleted.insert(deleted.end(), identifiers.begin(), identifiers.end());
+    for (const auto& identifier : identifiers) changes.push_back({nullptr, identifier});
 }
 
 void ChangeCollector::finishEnumeratingChangesUpToSyncAnchor(const HostPorterSyncAnchor& next,

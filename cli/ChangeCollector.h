@@ -25,6 +25,13 @@ public:
     // Read after a successful wait().
     std::vector<HostPorterItemRef> updated;
     std::vector<HostPorterItemIdentifier> deleted;
+    // Both, in the order they came: an identifier deleted and then updated (a folder's number
+    // reused) must be applied in that order.
+    struct Change {
+        HostPorterItemRef item;                // an update, or
+        HostPorterItemIdentifier deletedItem;  // a deletion
+    };
+    std::vector<Change> changes;
     std::optional<HostPorterSyncAnchor> anchor;
     bool moreComing = false;
     std::optional<Error> error;

@@ -18,8 +18,10 @@ CLI::App* ChangesCommand::add(CLI::App& app) {
         ->required();
     sub->add_option("--anchor", anchor_, "The sync anchor (base64, from anchor or changes)")
         ->required();
-    sub->add_flag("--json", json_,
-                  R"(Print {"updated": [...], "deleted": [...], "anchor": A, "moreComing": b})");
+    sub->add_flag(
+        "--json", json_,
+        R"(Print {"updated": [...], "deleted": [...], "changes": [in order], "anchor": A, )"
+        R"("moreComing": b})");
     return sub;
 }
 
@@ -51,22 +53,31 @@ int ChangesCommand::run(CliContext& context) {
     std::string next = collector->anchor ? base64Encode(*collector->anchor) : "";
     if (json_) {
         nlohmann::json updated = nlohmann::json::array();
-        for (const auto& item : collector->updated) {
-            if (auto local = std::dynamic_pointer_cast<const LocalItem>(item))
+        nlohmann::json changes = nlohmann::json::array();
+        for (const auto& change : collector->changes) {
+            auto local = std::dynamic_pointer_cast<const LocalItem>(change.item);
+            if (local) {
                 updated.push_back(itemJson(*local));
+                changes.push_back({{"updated", itemJson(*local)}});
+            } else if (!change.item) {
+                changes.push_back({{"deleted", change.deletedItem}});
+            }
         }
         nlohmann::json result{{"updated", std::move(updated)},
                               {"deleted", collector->deleted},
+                              {"changes", std::move(changes)},
                               {"anchor", next},
                               {"moreComing", collector->moreComing}};
         context.out() << result.dump() << "\n";
         return 0;
     }
-    for (const auto& item : collector->updated) {
-        context.out() << "updated\t" << item->itemIdentifier() << "\t" << item->filename() << "\n";
-    }
-    for (const auto& identifier : collector->deleted) {
-        context.out() << "deleted\t" << identifier << "\n";
+    for (const auto& change : collector->changes) {
+        if (change.item) {
+            context.out() << "updated\t" << change.item->itemIdentifier() << "\t"
+                          << change.item->filename() << "\n";
+        } else {
+            context.out() << "deleted\t" << change.deletedItem << "\n";
+        }
     }
     context.out() << "anchor: " << next << (collector->moreComing ? " (more coming)" : "") << "\n";
     return 0;

@@ -112,6 +112,8 @@ TEST_F(ListingCommandsTest, ChangesSinceAnAnchorReportWhatHappenedAndThenNothing
     EXPECT_TRUE(sawCreated) << batch;
     std::set<std::string> deleted(batch["deleted"].begin(), batch["deleted"].end());
     EXPECT_TRUE(deleted.contains(doomedID)) << batch;
+    // The same changes, in the order they came.
+    EXPECT_EQ(batch["changes"].size(), batch["updated"].size() + batch["deleted"].size());
 
     // From the anchor it handed out, nothing is new.
     json again = tamberJson({"changes", "root", "--anchor", batch["anchor"].get<std::string>()});
