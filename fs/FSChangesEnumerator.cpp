@@ -214,7 +214,17 @@ void FSChangesEnumerator::readerDidProcessHistory(TremorReader& reader) {
         next->setDelegate(weak_from_this());
         reader_ = next;
         lock.unlock();
-        next->streamQueue()->async([next] { next->start(); });
+        // Started from this pass's queue, behind the checks of vanished folders this pass
+        // queued there: the second pass could otherwise catch up and close the request before
+        // a library root's deletion was counted.
+        reader.streamQueue()->async([self = shared_from_this(), next] {
+            {
+                std::lock_guard lock(self->mutex_);
+                if (self->finished_)
+                    return;  // one of those checks filled the page
+            }
+            next->start();
+        });
         return;
     }
     logDebug("fetching changes did catch up");
