@@ -1,25 +1,17 @@
 #include "cli/ContainerArgument.h"
 
-#include "cli/ItemArgument.h"
+#include "cli/ItemAction.h"
 
 namespace tamber {
 
 Result<ContainerArgument> ContainerArgument::resolve(LocalPorter& porter, const std::string& text) {
-    ItemArgument argument = ItemArgument::parse(text);
-    ContainerArgument container;
-    if (argument.kind == ItemArgument::Kind::Path) {
-        auto identifier = porter._persistentIdentifierForItemAt(argument.url);
-        if (!identifier)
-            return Error::porterErrorForNonExistentItemWithIdentifier(argument.url.path());
-        container.identifier = *identifier;
-    } else {
-        container.identifier = argument.identifier;
-    }
-    auto enumerator = porter.enumeratorForContainerItemIdentifier(container.identifier);
+    auto identifier = ItemAction::identifierFor(porter, text);
+    if (!identifier.ok())
+        return identifier.error();
+    auto enumerator = porter.enumeratorForContainerItemIdentifier(identifier.value());
     if (!enumerator.ok())
         return enumerator.error();
-    container.enumerator = enumerator.value();
-    return container;
+    return ContainerArgument{identifier.value(), enumerator.value()};
 }
 
 }  // namespace tamber
