@@ -43,7 +43,8 @@ constexpr const char* kDocIDMarker = ".docid/";
 // Streams hold a number, not the reader: a batch that was already queued when its reader
 // stopped or was destroyed looks the number up, finds nothing and is dropped.
 std::mutex registryMutex;
-std::map<uint64_t, std::weak_ptr<TremorReader>> registry;  // guarded by registryMutex
+// Never destroyed: a stop still queued on a pool thread at exit may reach it after main.
+auto& registry = *new std::map<uint64_t, std::weak_ptr<TremorReader>>;  // guarded by registryMutex
 uint64_t lastRegistration = 0;                             // guarded by registryMutex
 
 uint64_t registerReader(std::weak_ptr<TremorReader> reader) {
