@@ -286,6 +286,18 @@ void JournalWriter::forgetSubtree(const InodeRecord& top, const std::string& pat
     logIfFailed(store_.removeInodes(gone), "Could not update the file index");
 }
 
+void JournalWriter::forgetReusedNumber(const struct statx& st) {
+    // Without a birth time a reused number cannot be told from a move whose event was lost.
+    if (!hasBirthTime(st))
+        return;
+    auto indexed = stagedOrIndexed(st.stx_ino);
+    if (!indexed || isIndexedFile(*indexed, st))
+        return;
+    flushStaged();
+    // Its document waits under its old path for its own new file, later in the batch.
+    forgetSubtree(*indexed, store_.pathForInode(st.stx_ino).value_or(std::string()));
+}
+
 // ---- Document IDs ----
 
 void JournalWriter::vanish(const InodeRecord& record, const std::string& path) {
@@ -362,6 +374,7 @@ void JournalWriter::created(const FileChange& change) {
         if (!isIndexedFile(existing, st))
             forgetSubtree(existing, change.path);
     }
+    forgetReusedNumber(st);
     InodeRecord record = recordOf(st, parent.stx_ino, std::move(name));
     uint8_t recordKind = record.kind;
     stage(std::move(record));
@@ -401,6 +414,7 @@ void JournalWriter::renamed(const FileChange& change) {
             forgetSubtree(replaced, change.path);
     }
     if (present) {
+        forgetReusedNumber(st);
         InodeRecord record = recordOf(st, parent.stx_ino, nameOf(change.path));
         kind = kindFlag(record.kind);
         stage(std::move(record));

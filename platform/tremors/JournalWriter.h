@@ -78,6 +78,10 @@ private:
     std::vector<InodeRecord> entriesAt(uint64_t parent, const std::string& name);
     // The indexed entry at `path`, by walking the index down from the root above it.
     std::optional<InodeRecord> recordAt(const std::string& path);
+    // A batch is applied after the fact: the file it finds at a path may have an inode number
+    // that the index still gives to a file that was deleted or replaced meanwhile. That file is
+    // forgotten, and its document waits for its own new file.
+    void forgetReusedNumber(const struct statx& st);
     // Removes `top` and everything indexed below it; their document IDs wait in vanished_.
     void forgetSubtree(const InodeRecord& top, const std::string& path);
     // The document of `record` left its inode, which is gone or is another file now.

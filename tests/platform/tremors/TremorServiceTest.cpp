@@ -304,47 +304,6 @@ TEST_F(TremorServiceTest, ARestartJournalsWhatChangedWhileStopped) {
     EXPECT_GT(later.front().id, resumed);
 }
 
-// Every file saved, then every file saved again, while stopped: the temporary files of the
-// second round are usually given the inode numbers that the first round freed, of other files.
-TEST_F(TremorServiceTest, DocumentIdsSurviveRepeatedSafeSavesWhileStopped) {
-    constexpr int kFiles = 20;
-    std::vector<std::string> paths;
-    for (int i = 0; i < kFiles; ++i)
-        paths.push_back(root_.writeFile("tree/doc" + std::to_string(i) + ".txt", "v0"));
-    ASSERT_NO_FATAL_FAILURE(startWatching());
-    std::vector<uint32_t> ids;
-    std::vector<uint64_t> inodes;
-    for (const auto& path : paths) {
-        ids.push_back(documentIdOf(path));
-        inodes.push_back(inodeOf(path));
-        ASSERT_NE(ids.back(), 0u);
-    }
-    uint64_t lastBefore = service_->currentEventId();
-    service_->shutdown();
-    strata_.reset();
-    service_.reset();
-
-    for (const char* text : {"v1", "v2"}) {
-        for (const auto& path : paths) safeSave(path, text);
-    }
-
-    ASSERT_NO_FATAL_FAILURE(start());
-    auto events = documentIdEvents(lastBefore);
-    for (int i = 0; i < kFiles; ++i) {
-        EXPECT_EQ(strata_->documentIdForInode(device_, inodeOf(paths[i])), ids[i]) << paths[i];
-        EXPECT_EQ(strata_->resolveDocumentId(device_, ids[i]), inodeOf(paths[i])) << paths[i];
-        if (inodes[i] != inodeOf(paths[i])) {
-            EXPECT_NE(findEvent(events, JournalWriter::documentIdPath(device_, ids[i], inodes[i],
-                                                                      inodeOf(paths[i]))),
-                      nullptr)
-                << paths[i] << "\n"
-                << describe(events);
-        }
-    }
-    for (const auto& event : events)
-        EXPECT_EQ(event.path.find(",dst=0"), std::string::npos) << describe(events);
-}
-
 TEST_F(TremorServiceTest, AFullQueueDropsAndJournalsTheLossInsteadOfGrowing) {
     auto created = TremorService::create(state_.path(), InotifyApi::system(), 1);
     ASSERT_TRUE(created.ok());
