@@ -125,6 +125,9 @@ int MetaCommand::run(CliContext& context) {
             Error(e.domain(), e.code(), {{"description", "no such file or folder: " + url.path()}}),
             json_);
     }
+    // A document saved while nothing watched gets its metadata back when the journal starts;
+    // without one (held by another process, say) the attributes are still read and written.
+    context.prepareJournal();
     if (auto error = applyChanges(url))
         return context.fail(*error, json_);
 

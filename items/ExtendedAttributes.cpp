@@ -5,6 +5,7 @@
 
 #include "host/UrlOperations.h"
 #include "platform/FileSystem.h"
+#include "platform/strata/StrataService.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -13,6 +14,13 @@ namespace {
 
 LogLevel levelUnless(int quietCode, const Error& error) {
     return error.code() == quietCode ? LogLevel::Debug : LogLevel::Error;
+}
+
+// The document's copy of its metadata follows what Tamber writes at once, so that a save right
+// after does not lose it while the attribute event waits in the journal.
+void noteWritten(int fd, const std::optional<Bytes>& data, const std::string& name) {
+    if (auto strata = StrataService::current())
+        strata->metadataAttributeWritten(fd, name, data);
 }
 
 }  // namespace
@@ -43,15 +51,19 @@ std::optional<Bytes> ReadXattrData(const std::string& name, const Url& url) {
 Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::string& name) {
     FileSystem& fs = FileSystem::current();
     if (!data) {
-        if (fs.fremovexattr(fd, name) == 0 || errno == ENODATA)
+        if (fs.fremovexattr(fd, name) == 0 || errno == ENODATA) {
+            noteWritten(fd, data, name);
             return std::nullopt;
+        }
         Error error = Error::errorWithPOSIXCode(errno);
         logAt(levelUnless(EACCES, error),
               "can't remove xattr \"" + name + "\"; " + error.description());
         return error;
     }
-    if (fs.fsetxattr(fd, name, data->data(), data->size(), 0) == 0)
+    if (fs.fsetxattr(fd, name, data->data(), data->size(), 0) == 0) {
+        noteWritten(fd, data, name);
         return std::nullopt;
+    }
     Error error = Error::errorWithPOSIXCode(errno);
     logAt(levelUnless(EACCES, error), "can't set xattr \"" + name + "\"; " + error.description());
     return error;

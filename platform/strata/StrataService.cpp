@@ -23,6 +23,9 @@ std::shared_ptr<StrataService> StrataService::setCurrent(std::shared_ptr<StrataS
     return std::atomic_exchange(&slot(), std::move(service));
 }
 
+void StrataService::metadataAttributeWritten(int, const std::string&,
+                                             const std::optional<std::vector<uint8_t>>&) {}
+
 uint32_t StrataLibraryGetOrAllocateDocumentId(int fd) {
     auto service = StrataService::current();
     if (!service) {

@@ -4,7 +4,9 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
+#include <vector>
 
 namespace tamber {
 
@@ -30,6 +32,12 @@ public:
     // The absolute path of a file ID inside the watched trees; false and errno when none (only
     // files inside the published folders ever resolve).
     virtual bool pathForFileId(uint32_t device, uint64_t fileId, std::string& path) = 0;
+    // Tamber set (or, with no value, removed) the metadata attribute `name` of the open file:
+    // the document's copy of its metadata follows at once, without waiting for the file's
+    // attribute event. Other attributes and files without a document ID are left alone. The
+    // default keeps no copies.
+    virtual void metadataAttributeWritten(int fd, const std::string& name,
+                                          const std::optional<std::vector<uint8_t>>& value);
 };
 
 // The platform's names for the service's calls.

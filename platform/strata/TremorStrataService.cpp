@@ -7,7 +7,9 @@
 
 #include "platform/FileSystem.h"
 #include "platform/Url.h"
+#include "platform/strata/DocumentAttributes.h"
 #include "platform/tremors/TremorService.h"
+#include "support/Log.h"
 
 namespace tamber {
 
@@ -40,14 +42,26 @@ uint32_t TremorStrataService::getOrAllocateDocumentId(int fd) {
         errno = EXDEV;
         return 0;
     }
-    if (!store->pathForInode(st.stx_ino)) {
+    auto path = store->pathForInode(st.stx_ino);
+    if (!path) {
         errno = ENOENT;  // not inside a watched tree
         return 0;
     }
+    if (auto existing = store->documentIdForInode(st.stx_ino))
+        return *existing;
     auto docID = store->allocateDocumentId(st.stx_ino);
     if (!docID.ok()) {
         errno = EIO;
         return 0;
+    }
+    // Metadata the file had before it became a document (given by another program, or copied
+    // in with it) follows it from now on too. Once per document: one listing, usually empty.
+    if (S_ISREG(st.stx_mode)) {
+        auto values = DocumentAttributes::read(*path);
+        if (values && !values->empty()) {
+            if (auto error = store->replaceDocumentAttributes(docID.value(), *values))
+                logError("Could not keep a document's metadata: " + error->description());
+        }
     }
     return docID.value();
 }
@@ -88,6 +102,25 @@ bool TremorStrataService::pathForFileId(uint32_t device, uint64_t fileId, std::s
     }
     path = std::move(*found);
     return true;
+}
+
+void TremorStrataService::metadataAttributeWritten(
+    int fd, const std::string& name, const std::optional<std::vector<uint8_t>>& value) {
+    if (!DocumentAttributes::isKept(name))
+        return;
+    // A save that completed before must be indexed first, or the copy would be kept for the
+    // inode the document just left.
+    service_->sync();
+    struct statx st {};
+    if (FileSystem::current().statx(fd, "", AT_EMPTY_PATH, STATX_INO | STATX_TYPE, &st) != 0 ||
+        !S_ISREG(st.stx_mode))
+        return;
+    TremorStore* store = service_->storeForDevice(encodeDevice(st.stx_dev_major, st.stx_dev_minor));
+    auto docID = store ? store->documentIdForInode(st.stx_ino) : std::nullopt;
+    if (!docID)
+        return;
+    if (auto error = store->setDocumentAttribute(*docID, name, value))
+        logError("Could not keep a document's metadata: " + error->description());
 }
 
 }  // namespace tamber

@@ -27,6 +27,8 @@ public:
     uint32_t documentIdForInode(uint32_t device, uint64_t inode) override;
     uint64_t resolveDocumentId(uint32_t device, uint32_t documentId) override;
     bool pathForFileId(uint32_t device, uint64_t fileId, std::string& path) override;
+    void metadataAttributeWritten(int fd, const std::string& name,
+                                  const std::optional<std::vector<uint8_t>>& value) override;
 
 private:
     const std::shared_ptr<TremorService> service_;

@@ -16,12 +16,18 @@ CREATE TABLE inodes(
     kind INTEGER NOT NULL,
     birth INTEGER,
     size INTEGER,
-    mtime INTEGER);
+    mtime INTEGER,
+    ctime INTEGER);
 CREATE INDEX inodes_by_name ON inodes(parent, name);
 CREATE TABLE documents(
     doc_id INTEGER PRIMARY KEY,
     inode INTEGER NOT NULL);
 CREATE UNIQUE INDEX documents_by_inode ON documents(inode);
+CREATE TABLE document_attributes(
+    doc_id INTEGER NOT NULL,
+    name TEXT NOT NULL,
+    value BLOB NOT NULL,
+    PRIMARY KEY(doc_id, name)) WITHOUT ROWID;
 )sql";
 
 // Entries indexed by the first schema have no stamps: NULL columns.
@@ -33,14 +39,27 @@ DROP INDEX inodes_by_parent;
 CREATE INDEX inodes_by_name ON inodes(parent, name);
 )sql";
 
+// No copies yet and no change times: the next crawl reads the metadata of every document.
+constexpr const char* kUpgradeFromVersion2 = R"sql(
+ALTER TABLE inodes ADD COLUMN ctime INTEGER;
+CREATE TABLE document_attributes(
+    doc_id INTEGER NOT NULL,
+    name TEXT NOT NULL,
+    value BLOB NOT NULL,
+    PRIMARY KEY(doc_id, name)) WITHOUT ROWID;
+)sql";
+
 constexpr const char* kFindByInode =
-    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime FROM inodes i "
+    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime, i.ctime FROM "
+    "inodes i "
     "LEFT JOIN documents d ON d.inode = i.inode WHERE i.inode = ?";
 constexpr const char* kFindByParent =
-    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime FROM inodes i "
+    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime, i.ctime FROM "
+    "inodes i "
     "LEFT JOIN documents d ON d.inode = i.inode WHERE i.parent = ?";
 constexpr const char* kFindByName =
-    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime FROM inodes i "
+    "SELECT i.inode, i.parent, i.name, i.kind, d.doc_id, i.birth, i.size, i.mtime, i.ctime FROM "
+    "inodes i "
     "LEFT JOIN documents d ON d.inode = i.inode WHERE i.parent = ? AND i.name = ?";
 
 InodeRecord readInode(const SqliteDatabase::Statement& stmt) {
@@ -54,6 +73,7 @@ InodeRecord readInode(const SqliteDatabase::Statement& stmt) {
     record.birth = fromSqlite(stmt.columnInt64(5));
     record.size = fromSqlite(stmt.columnInt64(6));
     record.mtime = stmt.columnInt64(7);
+    record.ctime = stmt.columnInt64(8);  // NULL reads as 0
     return record;
 }
 
@@ -63,8 +83,15 @@ const char* InodeIndex::schema() {
     return kSchema;
 }
 
-const char* InodeIndex::upgradeFromVersion1() {
-    return kUpgradeFromVersion1;
+const char* InodeIndex::upgradeFrom(int64_t version) {
+    switch (version) {
+        case 1:
+            return kUpgradeFromVersion1;
+        case 2:
+            return kUpgradeFromVersion2;
+        default:
+            return nullptr;
+    }
 }
 
 bool InodeIndex::isEntryName(std::string_view name) {
@@ -101,11 +128,11 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
     if (!txn)
         return txn.error();
     auto upsert = db_.cached(
-        "INSERT INTO inodes(inode, parent, name, kind, birth, size, mtime) "
-        "VALUES(?, ?, ?, ?, ?, ?, ?) "
+        "INSERT INTO inodes(inode, parent, name, kind, birth, size, mtime, ctime) "
+        "VALUES(?, ?, ?, ?, ?, ?, ?, ?) "
         "ON CONFLICT(inode) DO UPDATE SET parent = excluded.parent, name = excluded.name, "
         "kind = excluded.kind, birth = excluded.birth, size = excluded.size, "
-        "mtime = excluded.mtime");
+        "mtime = excluded.mtime, ctime = excluded.ctime");
     if (!upsert)
         return upsert.error();
     for (const InodeRecord& record : records) {
@@ -117,6 +144,8 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
             upsert->bind(5, toSqlite(record.birth))
                 .bind(6, toSqlite(record.size))
                 .bind(7, record.mtime);
+            if (record.ctime != 0)
+                upsert->bind(8, record.ctime);
         }  // else left NULL
         if (Status status = upsert->run())
             return status;
@@ -263,6 +292,10 @@ Result<uint32_t> InodeIndex::allocateDocumentId(uint64_t inode) {
 Status InodeIndex::moveDocumentId(uint32_t docID, uint64_t newInode) {
     if (newInode == 0)
         return Error::invalidParameter("inode", "0");
+    if (docID == 0 || docID >= nextDocumentId_) {
+        return Error(kPosixErrorDomain, ENOENT,
+                     {{"description", "No document has the ID " + std::to_string(docID)}});
+    }
     auto holder = documentIdForInode(newInode);
     if (!holder)
         return holder.error();
@@ -274,23 +307,78 @@ Status InodeIndex::moveDocumentId(uint32_t docID, uint64_t newInode) {
             {{"description", "Inode " + std::to_string(newInode) + " already has the document ID " +
                                  std::to_string(*holder.value())}});
     }
-    auto update = db_.cached("UPDATE documents SET inode = ? WHERE doc_id = ?");
+    // Also takes back an ID that was detached from its inode (handed out once, so below the
+    // counter).
+    auto update = db_.cached(
+        "INSERT INTO documents(doc_id, inode) VALUES(?, ?) "
+        "ON CONFLICT(doc_id) DO UPDATE SET inode = excluded.inode");
     if (!update)
         return update.error();
-    if (Status status = update->bind(1, toSqlite(newInode)).bind(2, int64_t{docID}).run())
-        return status;
-    if (db_.changes() == 0) {
-        return Error(kPosixErrorDomain, ENOENT,
-                     {{"description", "No document has the ID " + std::to_string(docID)}});
-    }
-    return std::nullopt;
+    return update->bind(1, int64_t{docID}).bind(2, toSqlite(newInode)).run();
 }
 
-Status InodeIndex::clearDocumentId(uint32_t docID) {
+Status InodeIndex::detachDocumentId(uint32_t docID) {
     auto erase = db_.cached("DELETE FROM documents WHERE doc_id = ?");
     if (!erase)
         return erase.error();
     return erase->bind(1, int64_t{docID}).run();
+}
+
+Status InodeIndex::clearDocumentId(uint32_t docID) {
+    if (Status status = detachDocumentId(docID))
+        return status;
+    auto erase = db_.cached("DELETE FROM document_attributes WHERE doc_id = ?");
+    if (!erase)
+        return erase.error();
+    return erase->bind(1, int64_t{docID}).run();
+}
+
+// ---- Copies of the documents' metadata attributes ----
+
+Result<InodeIndex::Attributes> InodeIndex::documentAttributes(uint32_t docID) {
+    auto stmt = db_.cached("SELECT name, value FROM document_attributes WHERE doc_id = ?");
+    if (!stmt)
+        return stmt.error();
+    stmt->bind(1, int64_t{docID});
+    Attributes attributes;
+    Result<bool> r = stmt->step();
+    for (; r.ok() && r.value(); r = stmt->step())
+        attributes.emplace(stmt->columnText(0), stmt->columnBlob(1));
+    if (!r)
+        return r.error();
+    return attributes;
+}
+
+Status InodeIndex::setDocumentAttribute(uint32_t docID, const std::string& name,
+                                        const std::optional<Bytes>& value) {
+    if (!value) {
+        auto erase = db_.cached("DELETE FROM document_attributes WHERE doc_id = ? AND name = ?");
+        if (!erase)
+            return erase.error();
+        return erase->bind(1, int64_t{docID}).bind(2, name).run();
+    }
+    auto upsert = db_.cached(
+        "INSERT INTO document_attributes(doc_id, name, value) VALUES(?, ?, ?) "
+        "ON CONFLICT(doc_id, name) DO UPDATE SET value = excluded.value");
+    if (!upsert)
+        return upsert.error();
+    return upsert->bind(1, int64_t{docID}).bind(2, name).bindBlob(3, *value).run();
+}
+
+Status InodeIndex::replaceDocumentAttributes(uint32_t docID, const Attributes& attributes) {
+    auto txn = db_.begin();
+    if (!txn)
+        return txn.error();
+    auto erase = db_.cached("DELETE FROM document_attributes WHERE doc_id = ?");
+    if (!erase)
+        return erase.error();
+    if (Status status = erase->bind(1, int64_t{docID}).run())
+        return status;
+    for (const auto& [name, value] : attributes) {
+        if (Status status = setDocumentAttribute(docID, name, value))
+            return status;
+    }
+    return txn->commit();
 }
 
 }  // namespace tamber

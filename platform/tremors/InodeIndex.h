@@ -3,11 +3,13 @@
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "platform/objects/Data.h"
 #include "platform/tremors/InodeRecord.h"
 #include "platform/tremors/SqliteDatabase.h"
 #include "support/Result.h"
@@ -15,17 +17,20 @@
 namespace tamber {
 
 // The index of the watched trees, kept in the journal's database: for each inode its parent,
-// name and kind, and the document IDs (docID -> inode, at most one per inode). The document-ID
-// counter lives in the journal's meta row, next to the event counter.
+// name and kind, the document IDs (docID -> inode, at most one per inode) and a copy of each
+// document's metadata attributes (name -> raw bytes), which follows the ID from inode to inode.
+// The document-ID counter lives in the journal's meta row, next to the event counter.
 //
 // Not locked: TremorStore owns it and serialises every call.
 class InodeIndex {
 public:
     static constexpr size_t kMaxPathComponents = 4096;
+    using Attributes = std::map<std::string, Bytes>;
+
     // Its tables, created with the rest of the journal's schema, and what brings the tables of
-    // the first schema up to date.
+    // schema `version` to the next one (null when there is nothing to do).
     static const char* schema();
-    static const char* upgradeFromVersion1();
+    static const char* upgradeFrom(int64_t version);
 
     explicit InodeIndex(SqliteDatabase& db) : db_(db) {}
 
@@ -46,7 +51,13 @@ public:
     Result<std::optional<uint64_t>> inodeForDocumentId(uint32_t docID);
     Result<std::optional<uint32_t>> documentIdForInode(uint64_t inode);
     Status moveDocumentId(uint32_t docID, uint64_t newInode);
+    Status detachDocumentId(uint32_t docID);
     Status clearDocumentId(uint32_t docID);
+
+    Result<Attributes> documentAttributes(uint32_t docID);
+    Status setDocumentAttribute(uint32_t docID, const std::string& name,
+                                const std::optional<Bytes>& value);
+    Status replaceDocumentAttributes(uint32_t docID, const Attributes& attributes);
 
     // A name readdir could return: not empty, ".", ".." or containing '/' or NUL.
     static bool isEntryName(std::string_view name);

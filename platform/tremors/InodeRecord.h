@@ -21,6 +21,9 @@ struct InodeRecord {
     uint64_t birth = 0;  // see JournalWriter::birthOf; 0: unknown
     uint64_t size = 0;
     int64_t mtime = 0;  // nanoseconds since the epoch
+    // Moves with attribute changes too: a restart rereads the kept metadata of a document whose
+    // change time moved. 0: unknown (indexed before it was kept).
+    int64_t ctime = 0;
     bool stamped = false;
 
     friend bool operator==(const InodeRecord&, const InodeRecord&) = default;

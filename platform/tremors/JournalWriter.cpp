@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "platform/FileSystem.h"
+#include "platform/strata/DocumentAttributes.h"
 #include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/WatchedRoots.h"
 #include "support/Log.h"
@@ -52,6 +53,19 @@ uint32_t kindFlag(uint8_t kind) {
     }
 }
 
+bool hasBirthTime(const struct statx& st) {
+    return (st.stx_mask & STATX_BTIME) && (st.stx_btime.tv_sec != 0 || st.stx_btime.tv_nsec != 0);
+}
+
+// Whether the indexed entry is the file `st` describes, as seen while watching: only a birth time
+// tells a reused inode number from the file itself (a change time moves with every write).
+bool isIndexedFile(const InodeRecord& indexed, const struct statx& st) {
+    if (indexed.inode != st.stx_ino || indexed.kind != kindOf(st.stx_mode))
+        return false;
+    return !hasBirthTime(st) || !indexed.stamped || indexed.birth == 0 ||
+           indexed.birth == JournalWriter::birthOf(st);
+}
+
 // The same file: a reused inode number of another kind or birth is another file. Entries
 // without a birth (indexed before it was kept, or on a file system without one) can only be
 // told apart by kind.
@@ -90,7 +104,7 @@ bool differs(const InodeRecord& indexed, InodeRecord found) {
 }  // namespace
 
 uint64_t JournalWriter::birthOf(const struct statx& st) {
-    if ((st.stx_mask & STATX_BTIME) && (st.stx_btime.tv_sec != 0 || st.stx_btime.tv_nsec != 0))
+    if (hasBirthTime(st))
         return static_cast<uint64_t>(nanoseconds(st.stx_btime));
     // A directory's change time moves with every entry: it would make every folder that changed
     // while nothing watched read as replaced.
@@ -104,6 +118,7 @@ InodeRecord JournalWriter::recordOf(const struct statx& st, uint64_t parent, std
     record.birth = birthOf(st);
     record.size = st.stx_size;
     record.mtime = nanoseconds(st.stx_mtime);
+    record.ctime = nanoseconds(st.stx_ctime);
     record.stamped = true;
     return record;
 }
@@ -261,7 +276,7 @@ void JournalWriter::forgetSubtree(const InodeRecord& top, const std::string& pat
         gone.push_back(record.inode);
         if (auto docID = store_.documentIdForInode(record.inode)) {
             record.docID = *docID;
-            vanished_[at] = record;
+            vanish(record, at);
         }
         if (record.kind == InodeRecord::kDirectory) {
             for (auto& child : store_.children(record.inode))
@@ -271,7 +286,26 @@ void JournalWriter::forgetSubtree(const InodeRecord& top, const std::string& pat
     logIfFailed(store_.removeInodes(gone), "Could not update the file index");
 }
 
+void JournalWriter::forgetReusedNumber(const struct statx& st) {
+    // Without a birth time a reused number cannot be told from a move whose event was lost.
+    if (!hasBirthTime(st))
+        return;
+    auto indexed = stagedOrIndexed(st.stx_ino);
+    if (!indexed || isIndexedFile(*indexed, st))
+        return;
+    flushStaged();
+    // Its document waits under its old path for its own new file, later in the batch.
+    forgetSubtree(*indexed, store_.pathForInode(st.stx_ino).value_or(std::string()));
+}
+
 // ---- Document IDs ----
+
+void JournalWriter::vanish(const InodeRecord& record, const std::string& path) {
+    // Detached at once: the inode number may already belong to the file that takes another
+    // document's place in this batch.
+    logIfFailed(store_.detachDocumentId(record.docID), "Could not detach a document ID");
+    vanished_[path] = record;
+}
 
 void JournalWriter::claimDocumentId(const std::string& path, uint64_t inode, uint8_t kind) {
     auto it = vanished_.find(path);
@@ -279,20 +313,40 @@ void JournalWriter::claimDocumentId(const std::string& path, uint64_t inode, uin
         return;
     uint32_t docID = it->second.docID;
     uint64_t old = it->second.inode;
-    // The new file may have been given the vanished one's inode number: the ID then stays.
-    auto holder = store_.documentIdForInode(inode);
-    if (holder && *holder != docID)
+    if (store_.documentIdForInode(inode))
         return;  // the new file is a document of its own
     vanished_.erase(it);
-    if (!holder) {
-        if (auto error = store_.moveDocumentId(docID, inode)) {
-            logError("Could not move document ID " + std::to_string(docID) + ": " +
-                     error->description());
-            return;
-        }
+    if (auto error = store_.moveDocumentId(docID, inode)) {
+        logError("Could not move document ID " + std::to_string(docID) + ": " +
+                 error->description());
+        return;
     }
     pending_.push_back({0, documentIdPath(device_, docID, old, inode), inode,
                         kTremorItemRenamed | kTremorItemIsFile});
+    restoreAttributes(docID, path, inode);
+}
+
+void JournalWriter::restoreAttributes(uint32_t docID, const std::string& path, uint64_t inode) {
+    auto saved = store_.documentAttributes(docID);
+    if (saved.empty())
+        return;  // the common case costs no file-system call
+    auto kept = DocumentAttributes::restore(path, inode, saved);
+    if (kept && *kept != saved) {
+        logIfFailed(store_.replaceDocumentAttributes(docID, *kept),
+                    "Could not update a document's metadata");
+    }
+}
+
+void JournalWriter::refreshAttributes(uint32_t docID, const std::string& path, uint64_t inode) {
+    auto values = DocumentAttributes::read(path);
+    struct statx st {};
+    // Read by path: if another file took the path meanwhile, what was read is not this one's.
+    if (!values || !statPath(path, st) || st.stx_ino != inode)
+        return;
+    if (*values != store_.documentAttributes(docID)) {
+        logIfFailed(store_.replaceDocumentAttributes(docID, *values),
+                    "Could not update a document's metadata");
+    }
 }
 
 void JournalWriter::settleVanished() {
@@ -317,9 +371,10 @@ void JournalWriter::created(const FileChange& change) {
     }
     std::string name = nameOf(change.path);
     for (const InodeRecord& existing : entriesAt(parent.stx_ino, name)) {
-        if (existing.inode != st.stx_ino)
+        if (!isIndexedFile(existing, st))
             forgetSubtree(existing, change.path);
     }
+    forgetReusedNumber(st);
     InodeRecord record = recordOf(st, parent.stx_ino, std::move(name));
     uint8_t recordKind = record.kind;
     stage(std::move(record));
@@ -355,10 +410,11 @@ void JournalWriter::renamed(const FileChange& change) {
         existing.push_back(std::move(*at));
     }
     for (const InodeRecord& replaced : existing) {
-        if (replaced.inode != inode)
+        if (present ? !isIndexedFile(replaced, st) : replaced.inode != inode)
             forgetSubtree(replaced, change.path);
     }
     if (present) {
+        forgetReusedNumber(st);
         InodeRecord record = recordOf(st, parent.stx_ino, nameOf(change.path));
         kind = kindFlag(record.kind);
         stage(std::move(record));
@@ -377,13 +433,18 @@ void JournalWriter::touched(const FileChange& change, uint32_t flag) {
     if (statPath(change.path, st)) {
         inode = st.stx_ino;
         kind = kindFlag(kindOf(st.stx_mode));
-        // Seen while watched, so the same file whatever its stamps say; the index keeps up, so
-        // that a restart does not report the change again.
+        // The index keeps up, so that a restart does not report the change again. Another file
+        // that took the inode number is left to its own creation event.
         auto indexed = stagedOrIndexed(inode);
-        if (indexed && indexed->name == nameOf(change.path)) {
+        if (indexed && indexed->name == nameOf(change.path) && isIndexedFile(*indexed, st)) {
             InodeRecord now = recordOf(st, indexed->parent, indexed->name);
             if (differs(*indexed, now))
                 stage(std::move(now));
+            // Only documents keep a copy of their metadata: other files cost nothing here.
+            if (flag == kTremorItemAttributes && indexed->kind == InodeRecord::kFile) {
+                if (auto docID = store_.documentIdForInode(inode))
+                    refreshAttributes(*docID, change.path, inode);
+            }
         }
     }
     pending_.push_back({0, change.path, inode, flag | kind});
@@ -463,7 +524,7 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
         if (it == onDisk.end()) {
             gone.push_back(inode);
             if (found.record.docID != 0)
-                vanished_[found.path] = found.record;
+                vanish(found.record, found.path);
             if (journal)
                 pending_.push_back(
                     {0, found.path, inode, kTremorItemRemoved | kindFlag(found.record.kind)});
@@ -480,6 +541,10 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
             pending_.push_back({0, now.path, inode, kTremorItemModified | kind});
         if (differs(found.record, now.record))
             updates.push_back(now.record);
+        // Attributes change only the change time; unknown after an upgrade, so read once then.
+        if (found.record.docID != 0 && now.record.kind == InodeRecord::kFile &&
+            (found.record.ctime == 0 || found.record.ctime != now.record.ctime))
+            refreshAttributes(found.record.docID, now.path, inode);
     }
     // Removed first: a replaced inode comes back with its new self.
     logIfFailed(store_.removeInodes(gone), "Could not update the file index");

@@ -26,7 +26,10 @@ namespace tamber {
 // Document IDs follow the document: when a file with an ID vanishes from a path and another
 // inode appears at that path in the same batch (a safe save), the ID moves to the new inode and
 // "/.docid/<dev>/changed/<id>/src=<old>,dst=<new>" is journaled; when it just vanishes, the same
-// path with dst=0 is journaled and the ID is cleared.
+// path with dst=0 is journaled and the ID is cleared. A file is its inode number and its birth
+// time: a number given again to a new file is a new file. The document's metadata attributes
+// follow it too: the index keeps a copy, refreshed when the file's attributes change, and a new
+// inode that lacks them is given them.
 class JournalWriter {
 public:
     JournalWriter(TremorStore& store, uint32_t device) : store_(store), device_(device) {}
@@ -75,11 +78,20 @@ private:
     std::vector<InodeRecord> entriesAt(uint64_t parent, const std::string& name);
     // The indexed entry at `path`, by walking the index down from the root above it.
     std::optional<InodeRecord> recordAt(const std::string& path);
+    // A batch is applied after the fact: the file it finds at a path may have an inode number
+    // that the index still gives to a file that was deleted or replaced meanwhile. That file is
+    // forgotten, and its document waits for its own new file.
+    void forgetReusedNumber(const struct statx& st);
     // Removes `top` and everything indexed below it; their document IDs wait in vanished_.
     void forgetSubtree(const InodeRecord& top, const std::string& path);
+    // The document of `record` left its inode, which is gone or is another file now.
+    void vanish(const InodeRecord& record, const std::string& path);
     // A safe save: the document that vanished from `path` in this batch is now `inode`, a new
-    // entry of the same kind.
+    // entry of the same kind. Its metadata attributes that the new file lacks are written to it.
     void claimDocumentId(const std::string& path, uint64_t inode, uint8_t kind);
+    void restoreAttributes(uint32_t docID, const std::string& path, uint64_t inode);
+    // The document's metadata changed on its own inode: its copy becomes what the file holds.
+    void refreshAttributes(uint32_t docID, const std::string& path, uint64_t inode);
     // Clears the document IDs of files that vanished for good and journals their deletion.
     void settleVanished();
 

@@ -60,6 +60,15 @@ SqliteDatabase::Statement& SqliteDatabase::Statement::bindNull(int index) {
     return *this;
 }
 
+SqliteDatabase::Statement& SqliteDatabase::Statement::bindBlob(int index,
+                                                               std::span<const uint8_t> value) {
+    // A null pointer would bind NULL rather than the empty blob.
+    static const uint8_t kEmpty = 0;
+    const void* bytes = value.data() ? value.data() : &kEmpty;
+    noteBind(sqlite3_bind_blob64(stmt_, index, bytes, value.size(), SQLITE_TRANSIENT));
+    return *this;
+}
+
 Result<bool> SqliteDatabase::Statement::step() {
     if (bindError_ != SQLITE_OK) {
         return makeError(bindError_, std::string("binding ") + sqlite3_sql(stmt_),
@@ -98,6 +107,13 @@ std::string SqliteDatabase::Statement::columnText(int index) const {
     if (!text)
         return {};
     return std::string(text, static_cast<size_t>(sqlite3_column_bytes(stmt_, index)));
+}
+
+std::vector<uint8_t> SqliteDatabase::Statement::columnBlob(int index) const {
+    auto bytes = static_cast<const uint8_t*>(sqlite3_column_blob(stmt_, index));
+    if (!bytes)
+        return {};
+    return std::vector<uint8_t>(bytes, bytes + sqlite3_column_bytes(stmt_, index));
 }
 
 bool SqliteDatabase::Statement::columnIsNull(int index) const {

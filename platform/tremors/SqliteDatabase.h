@@ -5,8 +5,10 @@
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <span>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "support/Result.h"
 
@@ -45,6 +47,7 @@ public:
         Statement& bind(int index, int64_t value);
         Statement& bind(int index, std::string_view value);
         Statement& bindNull(int index);
+        Statement& bindBlob(int index, std::span<const uint8_t> value);
 
         // true: a row is ready; false: the statement is done.
         Result<bool> step();
@@ -56,6 +59,8 @@ public:
         int64_t columnInt64(int index) const;
         // Empty for NULL.
         std::string columnText(int index) const;
+        // Empty for NULL.
+        std::vector<uint8_t> columnBlob(int index) const;
         bool columnIsNull(int index) const;
 
     private:

@@ -200,9 +200,11 @@ Status TremorStore::upgrade(int64_t from) {
     auto txn = db_->begin();
     if (!txn)
         return txn.error();
-    if (from == 1) {
-        if (Status status = db_->exec(InodeIndex::upgradeFromVersion1()))
-            return status;
+    for (int64_t version = from; version < kSchemaVersion; ++version) {
+        if (const char* sql = InodeIndex::upgradeFrom(version)) {
+            if (Status status = db_->exec(sql))
+                return status;
+        }
     }
     if (Status status = db_->exec("PRAGMA user_version = " + std::to_string(kSchemaVersion)))
         return status;
@@ -568,9 +570,35 @@ Status TremorStore::moveDocumentId(uint32_t docID, uint64_t newInode) {
     return index_->moveDocumentId(docID, newInode);
 }
 
+Status TremorStore::detachDocumentId(uint32_t docID) {
+    std::lock_guard lock(mutex_);
+    return index_->detachDocumentId(docID);
+}
+
 Status TremorStore::clearDocumentId(uint32_t docID) {
     std::lock_guard lock(mutex_);
     return index_->clearDocumentId(docID);
+}
+
+TremorStore::Attributes TremorStore::documentAttributes(uint32_t docID) const {
+    std::lock_guard lock(mutex_);
+    auto result = index_->documentAttributes(docID);
+    if (!result) {
+        logError(result.error().description());
+        return {};
+    }
+    return std::move(result).value();
+}
+
+Status TremorStore::setDocumentAttribute(uint32_t docID, const std::string& name,
+                                         const std::optional<Bytes>& value) {
+    std::lock_guard lock(mutex_);
+    return index_->setDocumentAttribute(docID, name, value);
+}
+
+Status TremorStore::replaceDocumentAttributes(uint32_t docID, const Attributes& attributes) {
+    std::lock_guard lock(mutex_);
+    return index_->replaceDocumentAttributes(docID, attributes);
 }
 
 }  // namespace tamber

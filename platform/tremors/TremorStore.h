@@ -39,7 +39,8 @@ public:
     };
 
     // 2: the index keeps each entry's birth time, size and modification time.
-    static constexpr int kSchemaVersion = 2;
+    // 3: and its change time, and a copy of each document's metadata attributes.
+    static constexpr int kSchemaVersion = 3;
     static constexpr size_t kDefaultReplayChunk = 1000;
     static constexpr size_t kMaxPathComponents = InodeIndex::kMaxPathComponents;
     static constexpr const char* kDocumentIdRoot = "/.docid";
@@ -132,8 +133,20 @@ public:
     // A safe save: the ID follows the document to `newInode` and the old inode loses it. Fails
     // when `newInode` already has another ID (clear that one first).
     Status moveDocumentId(uint32_t docID, uint64_t newInode);
-    // The document was deleted; the ID is not handed out again.
+    // The inode that held the ID is another file now; the ID waits, with its copy of the
+    // metadata, to be moved to its document's new inode (or cleared).
+    Status detachDocumentId(uint32_t docID);
+    // The document was deleted; the ID is not handed out again and its metadata copy goes.
     Status clearDocumentId(uint32_t docID);
+
+    // ---- Copies of the documents' metadata attributes (raw bytes by attribute name) ----
+
+    using Attributes = InodeIndex::Attributes;
+    Attributes documentAttributes(uint32_t docID) const;
+    // Nothing as `value` drops that attribute from the copy.
+    Status setDocumentAttribute(uint32_t docID, const std::string& name,
+                                const std::optional<Bytes>& value);
+    Status replaceDocumentAttributes(uint32_t docID, const Attributes& attributes);
 
 private:
     struct Cursor;

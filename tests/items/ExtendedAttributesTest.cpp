@@ -2,8 +2,12 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
+
+#include <set>
+#include <vector>
 
 #include "items/ItemMetadata.h"
 #include "items/LocalItem.h"
@@ -12,6 +16,9 @@
 #include "platform/Tag.h"
 #include "platform/archive/KeyedArchiver.h"
 #include "platform/objects/Array.h"
+#include "platform/strata/DocumentAttributes.h"
+#include "platform/strata/StrataService.h"
+#include "tests/common/FakeStrataService.h"
 #include "tests/common/ScopedFileSystem.h"
 #include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
@@ -145,6 +152,59 @@ TEST_F(ExtendedAttributesTest, ValuesOfTheWrongClassOrGarbageReadAsAbsent) {
     EXPECT_EQ(log->lines()[0].level, LogLevel::Error);
     EXPECT_EQ(log->countStartingWith("[ERROR] got "), 1u);
     EXPECT_NE(log->lines()[0].text.find("invalidResultingClass"), std::string::npos);
+}
+
+// What the document-ID service was told about Tamber's own attribute writes.
+class RecordingStrataService : public testing::FakeStrataService {
+public:
+    struct Write {
+        uint64_t inode;
+        std::string name;
+        std::optional<std::vector<uint8_t>> value;
+        friend bool operator==(const Write&, const Write&) = default;
+    };
+    void metadataAttributeWritten(int fd, const std::string& name,
+                                  const std::optional<std::vector<uint8_t>>& value) override {
+        struct stat st {};
+        ASSERT_EQ(::fstat(fd, &st), 0) << "told with a live descriptor";
+        writes.push_back({st.st_ino, name, value});
+    }
+    std::vector<Write> writes;
+};
+
+TEST_F(ExtendedAttributesTest, TheDocumentIdServiceHearsOfEveryWriteThatHappened) {
+    auto strata = std::make_shared<RecordingStrataService>();
+    auto previous = StrataService::setCurrent(strata);
+    struct stat st {};
+    ASSERT_EQ(::stat(file.path().c_str(), &st), 0);
+    const std::string& tags = LocalItem::xattrTagDataName();
+    Bytes value{1, 2, 3};
+    EXPECT_FALSE(WriteXattrAtURL(file, value, tags));
+    EXPECT_FALSE(WriteXattrAtURL(file, std::nullopt, tags));
+    EXPECT_FALSE(WriteXattrAtURL(file, std::nullopt, tags));  // not there: still a removal
+    {
+        ScopedLogCapture quiet;
+        fs->inject(Op::Fsetxattr, ENOSPC);
+        EXPECT_TRUE(WriteXattrAtURL(file, value, tags));
+        fs->inject(Op::Fremovexattr, EACCES);
+        EXPECT_TRUE(WriteXattrAtURL(file, std::nullopt, tags));
+    }
+    StrataService::setCurrent(previous);
+    using Write = RecordingStrataService::Write;
+    EXPECT_EQ(strata->writes, (std::vector<Write>{{st.st_ino, tags, value},
+                                                  {st.st_ino, tags, std::nullopt},
+                                                  {st.st_ino, tags, std::nullopt}}));
+}
+
+// The journal keeps copies of exactly the attributes that items keep their metadata in.
+TEST(DocumentAttributeNamesTest, AreTheFiveMetadataAttributes) {
+    std::set<std::string> items{LocalItem::xattrLastUsedDateName(), LocalItem::xattrTagDataName(),
+                                LocalItem::xattrFavoriteRankName(), LocalItem::xattrTrashDateName(),
+                                LocalItem::xattrTrashPutBackName()};
+    const auto& kept = DocumentAttributes::names();
+    EXPECT_EQ(std::set<std::string>(kept.begin(), kept.end()), items);
+    EXPECT_EQ(kept.size(), items.size());
+    EXPECT_FALSE(DocumentAttributes::isKept("com.velk.other"));
 }
 
 }  // namespace
