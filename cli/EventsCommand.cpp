@@ -6,6 +6,8 @@
 #include <ostream>
 
 #include "cli/Interrupt.h"
+#include "cli/JsonValues.h"
+#include "cli/TextEscape.h"
 
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/objects/Array.h"
@@ -40,14 +42,14 @@ void printEvents(TremorStreamRef, void* info, size_t count, const ObjectRef& pat
         if (printer.json) {
             nlohmann::json j{{"id", ids[i]},
                              {"flags", flags[i]},
-                             {"path", path ? path->value() : ""},
                              {"fileID", fileID ? nlohmann::json(fileID->uint64Value()) : nullptr}};
-            *printer.out << j.dump() << "\n";
+            setTextWithBytes(j, "path", "pathBytes", path ? path->value() : "");
+            *printer.out << jsonText(j) << "\n";
         } else {
             char hex[16];
             std::snprintf(hex, sizeof hex, "0x%05x", flags[i]);
-            *printer.out << ids[i] << " " << hex << " " << (path ? path->value() : "?") << " "
-                         << (fileID ? std::to_string(fileID->uint64Value()) : "-") << "\n";
+            *printer.out << ids[i] << " " << hex << " " << (path ? escapedText(path->value()) : "?")
+                         << " " << (fileID ? std::to_string(fileID->uint64Value()) : "-") << "\n";
         }
         if (flags[i] & (kTremorUserDropped | kTremorKernelDropped)) {
             // Lost history (an overflow, a tree that could not be watched, a replay from before
