@@ -6,6 +6,7 @@
 
 #include "cli/Base64.h"
 #include "cli/ContainerArgument.h"
+#include "cli/JsonValues.h"
 #include "support/DispatchSemaphore.h"
 
 namespace tamber {
@@ -44,7 +45,7 @@ int AnchorCommand::run(CliContext& context) {
                             json_);
     }
     if (json_)
-        context.out() << nlohmann::json{{"anchor", base64Encode(*anchor)}}.dump() << "\n";
+        context.out() << jsonText(nlohmann::json{{"anchor", base64Encode(*anchor)}}) << "\n";
     else
         context.out() << base64Encode(*anchor) << "\n";
     return 0;

@@ -4,6 +4,7 @@
 #include <ostream>
 
 #include "applibraries/LocalAppLibraryManager.h"
+#include "cli/JsonValues.h"
 #include "items/LocalAppLibraryItem.h"
 #include "provider/LocalPorter.h"
 
@@ -45,7 +46,7 @@ int AppsCommand::run(CliContext& context) {
     }
     uint64_t token = manager->versionToken();
     if (json_) {
-        context.out() << nlohmann::json{{"versionToken", token}, {"libraries", libraries}}.dump()
+        context.out() << jsonText(nlohmann::json{{"versionToken", token}, {"libraries", libraries}})
                       << "\n";
         return 0;
     }

@@ -8,6 +8,8 @@
 #include "cli/ContainerArgument.h"
 #include "cli/Interrupt.h"
 #include "cli/ItemJson.h"
+#include "cli/JsonValues.h"
+#include "cli/TextEscape.h"
 
 namespace tamber {
 
@@ -68,15 +70,15 @@ int ChangesCommand::run(CliContext& context) {
                               {"changes", std::move(changes)},
                               {"anchor", next},
                               {"moreComing", collector->moreComing}};
-        context.out() << result.dump() << "\n";
+        context.out() << jsonText(result) << "\n";
         return 0;
     }
     for (const auto& change : collector->changes) {
         if (change.item) {
-            context.out() << "updated\t" << change.item->itemIdentifier() << "\t"
-                          << change.item->filename() << "\n";
+            context.out() << "updated\t" << escapedText(change.item->itemIdentifier()) << "\t"
+                          << escapedText(change.item->filename()) << "\n";
         } else {
-            context.out() << "deleted\t" << change.deletedItem << "\n";
+            context.out() << "deleted\t" << escapedText(change.deletedItem) << "\n";
         }
     }
     context.out() << "anchor: " << next << (collector->moreComing ? " (more coming)" : "") << "\n";

@@ -7,6 +7,7 @@
 
 #include "applibraries/SharedAppLibraryLookup.h"
 #include "applibraries/TBPAppLibraryManager.h"
+#include "cli/JsonValues.h"
 #include "host/HostPorterManager.h"
 #include "platform/FileContents.h"
 #include "platform/tremors/TremorService.h"
@@ -102,7 +103,7 @@ nlohmann::json CliContext::errorJson(const Error& error) {
 
 int CliContext::fail(const Error& error, bool json) {
     if (json) {
-        out_ << errorJson(error).dump() << "\n";
+        out_ << jsonText(errorJson(error)) << "\n";
     } else {
         err_ << "tamber: " << errorMessage(error) << " (" << error.domain() << " " << error.code()
              << ")\n";

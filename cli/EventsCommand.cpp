@@ -1,10 +1,13 @@
 #include "cli/EventsCommand.h"
 
 #include <cerrno>
+#include <charconv>
 #include <cstdio>
 #include <ostream>
 
 #include "cli/Interrupt.h"
+#include "cli/JsonValues.h"
+#include "cli/TextEscape.h"
 
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/objects/Array.h"
@@ -39,14 +42,14 @@ void printEvents(TremorStreamRef, void* info, size_t count, const ObjectRef& pat
         if (printer.json) {
             nlohmann::json j{{"id", ids[i]},
                              {"flags", flags[i]},
-                             {"path", path ? path->value() : ""},
                              {"fileID", fileID ? nlohmann::json(fileID->uint64Value()) : nullptr}};
-            *printer.out << j.dump() << "\n";
+            setTextWithBytes(j, "path", "pathBytes", path ? path->value() : "");
+            *printer.out << jsonText(j) << "\n";
         } else {
             char hex[16];
             std::snprintf(hex, sizeof hex, "0x%05x", flags[i]);
-            *printer.out << ids[i] << " " << hex << " " << (path ? path->value() : "?") << " "
-                         << (fileID ? std::to_string(fileID->uint64Value()) : "-") << "\n";
+            *printer.out << ids[i] << " " << hex << " " << (path ? escapedText(path->value()) : "?")
+                         << " " << (fileID ? std::to_string(fileID->uint64Value()) : "-") << "\n";
         }
         if (flags[i] & (kTremorUserDropped | kTremorKernelDropped)) {
             // Lost history (an overflow, a tree that could not be watched, a replay from before
@@ -88,16 +91,46 @@ CLI::App* EventsCommand::add(CLI::App& app) {
     auto* sub =
         app.add_subcommand("events", "Replay the event journal for some trees, then follow it");
     sub->add_option("PATH", paths_, "Trees to show events for (default: the document storage)");
-    sub->add_option("--since", since_, "Replay events after this event ID (default 0: all)");
+    since_ = sub->add_option("--since", sinceText_,
+                             "Replay events after this event ID (default 0: all)");
     sub->add_flag("--docid", docid_, "Show document-ID events instead of path events");
     sub->add_flag("--no-follow", noFollow_, "Stop after the history has been replayed");
     sub->add_flag("--json", json_, "One JSON object per line: id, flags, path, fileID");
     return sub;
 }
 
+std::optional<uint64_t> EventsCommand::parseEventID(const std::string& text) {
+    // Digits only: a sign, a space, a base prefix or a trailing letter is a mistake to point
+    // out, not a number to guess at.
+    if (text.empty() || text.find_first_not_of("0123456789") != std::string::npos)
+        return std::nullopt;
+    uint64_t value = 0;
+    auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), value);
+    if (ec != std::errc() || end != text.data() + text.size())
+        return std::nullopt;
+    return value;
+}
+
 int EventsCommand::run(CliContext& context) {
+    std::optional<uint64_t> since = since_->count() ? parseEventID(sinceText_) : uint64_t{0};
+    if (!since) {
+        return context.fail(
+            CliContext::usageError("--since takes an event ID (0 to " + std::to_string(UINT64_MAX) +
+                                   "), not \"" + sinceText_ + "\""),
+            json_);
+    }
     if (auto error = context.prepareJournal())
         return context.fail(*error, json_);
+    // A replay from past the journal's end has nothing to show and never ends: an ID from
+    // another journal, or mistyped.
+    const uint64_t last = TremorsGetCurrentEventId();
+    if (*since > last) {
+        return context.fail(Error(kHostPorterErrorDomain, kHostPorterSyncAnchorExpired,
+                                  {{"description", "--since " + std::to_string(*since) +
+                                                       " is beyond the last event " +
+                                                       std::to_string(last) + " of the journal"}}),
+                            json_);
+    }
     std::vector<std::string> paths;
     for (const auto& p : paths_) paths.push_back(Url::fileURLWithPath(p).path());
     if (paths.empty())
@@ -116,9 +149,9 @@ int EventsCommand::run(CliContext& context) {
     TremorStreamRef stream =
         docid_ ? TremorStreamCreateRelativeToDevice(
                      printEvents, &streamContext,
-                     TBFileObjectIdentifier::deviceID(context.storageURL()), {"/.docid"}, since_,
+                     TBFileObjectIdentifier::deviceID(context.storageURL()), {"/.docid"}, *since,
                      0.1, flags)
-               : TremorStreamCreate(printEvents, &streamContext, paths, since_, 0.1, flags);
+               : TremorStreamCreate(printEvents, &streamContext, paths, *since, 0.1, flags);
     if (!stream) {
         return context.fail(
             Error(kPosixErrorDomain, EIO, {{"description", "can't open the event journal stream"}}),

@@ -23,8 +23,12 @@ private:
     // Watches each of `paths` that no watched tree covers, with a warning on standard error.
     static Status watchUncovered(CliContext& context, const std::vector<std::string>& paths);
 
+    // Nothing unless the text is a whole event ID in decimal.
+    static std::optional<uint64_t> parseEventID(const std::string& text);
+
     std::vector<std::string> paths_;
-    uint64_t since_ = 0;
+    CLI::Option* since_ = nullptr;
+    std::string sinceText_;  // parsed by run(), which can say what is wrong with it
     bool docid_ = false;
     bool noFollow_ = false;
     bool json_ = false;

@@ -2,6 +2,7 @@
 
 #include <ostream>
 
+#include "cli/JsonValues.h"
 #include "items/TBFileObjectIdentifier.h"
 
 namespace tamber {
@@ -26,7 +27,9 @@ int IdCommand::run(CliContext& context) {
                             json_);
     }
     if (json_) {
-        context.out() << nlohmann::json{{"id", *identifier}, {"path", url.path()}}.dump() << "\n";
+        nlohmann::json result{{"id", *identifier}};
+        setTextWithBytes(result, "path", "pathBytes", url.path());
+        context.out() << jsonText(result) << "\n";
     } else {
         context.out() << *identifier << "\n";
     }

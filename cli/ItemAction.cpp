@@ -7,6 +7,7 @@
 
 #include "cli/ItemArgument.h"
 #include "cli/ItemJson.h"
+#include "cli/JsonValues.h"
 #include "support/DispatchSemaphore.h"
 
 namespace tamber {
@@ -78,7 +79,7 @@ void ItemAction::waitFor(const std::function<void(std::function<void()>)>& start
 
 int ItemAction::printItem(CliContext& context, const LocalItem& item, bool json) {
     if (json)
-        context.out() << itemJson(item).dump() << "\n";
+        context.out() << jsonText(itemJson(item)) << "\n";
     else
         printItemText(context.out(), item);
     return 0;

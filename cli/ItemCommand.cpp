@@ -4,6 +4,7 @@
 
 #include "cli/ItemArgument.h"
 #include "cli/ItemJson.h"
+#include "cli/JsonValues.h"
 #include "provider/LocalPorter.h"
 
 namespace tamber {
@@ -29,7 +30,7 @@ int ItemCommand::run(CliContext& context) {
     if (!item.ok())
         return context.fail(item.error(), json_);
     if (json_)
-        context.out() << itemJson(*item.value()).dump() << "\n";
+        context.out() << jsonText(itemJson(*item.value())) << "\n";
     else
         printItemText(context.out(), *item.value());
     return 0;

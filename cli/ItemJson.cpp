@@ -4,6 +4,7 @@
 #include <string_view>
 
 #include "cli/JsonValues.h"
+#include "cli/TextEscape.h"
 #include "platform/Tag.h"
 
 namespace tamber {
@@ -14,7 +15,7 @@ nlohmann::json tagsJson(const LocalItem& item) {
     nlohmann::json labels = nlohmann::json::array();
     if (auto data = item.tagData()) {
         if (auto tags = GetTagsFromTagsData(*data))
-            for (const auto& tag : *tags) labels.push_back(tag->label());
+            for (const auto& tag : *tags) labels.push_back(validUtf8(tag->label()));
     }
     return labels;
 }
@@ -22,20 +23,22 @@ nlohmann::json tagsJson(const LocalItem& item) {
 }  // namespace
 
 nlohmann::json itemJson(const LocalItem& item) {
-    return {{"identifier", item.itemIdentifier()},
-            {"parentIdentifier", item.parentItemIdentifier()},
-            {"filename", item.filename()},
-            {"typeIdentifier", item.typeIdentifier()},
-            {"documentSize", numberJson(item.documentSize())},
-            {"creationDate", dateJson(item.creationDate())},
-            {"contentModificationDate", dateJson(item.contentModificationDate())},
-            {"childItemCount", numberJson(item.childItemCount())},
-            {"capabilities", item.capabilities()},
-            {"tags", tagsJson(item)},
-            {"favoriteRank", numberJson(item.favoriteRank())},
-            {"lastUsedDate", dateJson(item.lastUsedDate())},
-            {"trashed", item.isTrashed()},
-            {"path", item.fileURL().path()}};
+    nlohmann::json json{{"identifier", validUtf8(item.itemIdentifier())},
+                        {"parentIdentifier", validUtf8(item.parentItemIdentifier())},
+                        {"typeIdentifier", item.typeIdentifier()},
+                        {"documentSize", numberJson(item.documentSize())},
+                        {"creationDate", dateJson(item.creationDate())},
+                        {"contentModificationDate", dateJson(item.contentModificationDate())},
+                        {"childItemCount", numberJson(item.childItemCount())},
+                        {"capabilities", item.capabilities()},
+                        {"tags", tagsJson(item)},
+                        {"favoriteRank", numberJson(item.favoriteRank())},
+                        {"lastUsedDate", dateJson(item.lastUsedDate())},
+                        {"trashed", item.isTrashed()}};
+    // Names are bytes: one that is not UTF-8 is shown with U+FFFD and given exactly beside it.
+    setTextWithBytes(json, "filename", "filenameBytes", item.filename());
+    setTextWithBytes(json, "path", "pathBytes", item.fileURL().path());
+    return json;
 }
 
 void printItemText(std::ostream& out, const LocalItem& item) {
@@ -46,14 +49,20 @@ void printItemText(std::ostream& out, const LocalItem& item) {
         "lastUsedDate",   "trashed"};
     nlohmann::json json = itemJson(item);
     for (const char* key : kOrder) {
+        const std::string_view name(key);
         const nlohmann::json& value = json[key];
         out << key << ": ";
-        if (value.is_string())
-            out << value.get<std::string>();
-        else if (std::string_view(key) == "capabilities")
+        // The name and path as they are on disk, escaped: the JSON form has lost bad bytes.
+        if (name == "filename")
+            out << escapedText(item.filename());
+        else if (name == "path")
+            out << escapedText(item.fileURL().path());
+        else if (value.is_string())
+            out << escapedText(value.get<std::string>());
+        else if (name == "capabilities")
             out << "0x" << std::hex << value.get<uint64_t>() << std::dec;
         else
-            out << value.dump();
+            out << jsonText(value);
         out << "\n";
     }
 }

@@ -6,7 +6,9 @@
 #include "cli/Base64.h"
 #include "cli/ContainerArgument.h"
 #include "cli/ItemJson.h"
+#include "cli/JsonValues.h"
 #include "cli/PageCollector.h"
+#include "cli/TextEscape.h"
 
 namespace tamber {
 
@@ -55,8 +57,9 @@ int ListCommand::run(CliContext& context) {
             if (json_) {
                 items.push_back(itemJson(*local));
             } else {
-                context.out() << local->itemIdentifier() << "\t" << local->filename() << "\t"
-                              << local->typeIdentifier() << "\n";
+                context.out() << escapedText(local->itemIdentifier()) << "\t"
+                              << escapedText(local->filename()) << "\t" << local->typeIdentifier()
+                              << "\n";
             }
         }
         next = collector->nextPage;
@@ -71,7 +74,7 @@ int ListCommand::run(CliContext& context) {
     if (json_) {
         nlohmann::json result{{"items", std::move(items)},
                               {"nextPage", next ? nlohmann::json(base64Encode(*next)) : nullptr}};
-        context.out() << result.dump() << "\n";
+        context.out() << jsonText(result) << "\n";
     } else if (next) {
         context.out() << "next page: " << base64Encode(*next) << "\n";
     }

@@ -135,11 +135,11 @@ int MetaCommand::run(CliContext& context) {
     nlohmann::json j = toJson(metadata);
     if (json_) {
         j["path"] = url.path();
-        context.out() << j.dump() << "\n";
+        context.out() << jsonText(j) << "\n";
         return 0;
     }
     auto text = [](const nlohmann::json& v) {
-        return v.is_null() ? std::string("-") : v.is_string() ? v.get<std::string>() : v.dump();
+        return v.is_null() ? std::string("-") : v.is_string() ? v.get<std::string>() : jsonText(v);
     };
     std::string tags;
     for (const auto& t : j["tags"]) tags += (tags.empty() ? "" : ", ") + t.get<std::string>();

@@ -2,6 +2,7 @@
 
 #include <ostream>
 
+#include "cli/JsonValues.h"
 #include "items/TBFileObjectIdentifier.h"
 
 namespace tamber {
@@ -22,7 +23,9 @@ int PathCommand::run(CliContext& context) {
         return context.fail(Error::porterErrorForNonExistentItemWithIdentifier(identifier_), json_);
     }
     if (json_) {
-        context.out() << nlohmann::json{{"id", identifier_}, {"path", url->path()}}.dump() << "\n";
+        nlohmann::json result{{"id", identifier_}};
+        setTextWithBytes(result, "path", "pathBytes", url->path());
+        context.out() << jsonText(result) << "\n";
     } else {
         context.out() << url->path() << "\n";
     }

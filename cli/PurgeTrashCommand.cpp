@@ -9,6 +9,7 @@
 
 #include "applibraries/LocalAppLibraryManager.h"
 #include "cli/ItemAction.h"
+#include "cli/JsonValues.h"
 #include "items/LocalAppLibraryItem.h"
 #include "platform/FileSystem.h"
 #include "platform/objects/Date.h"
@@ -111,7 +112,7 @@ int PurgeTrashCommand::run(CliContext& context) {
     size_t after = countTrashedItems(folders);
     size_t removed = before > after ? before - after : 0;
     if (json_)
-        context.out() << nlohmann::json{{"removed", removed}}.dump() << "\n";
+        context.out() << jsonText(nlohmann::json{{"removed", removed}}) << "\n";
     else
         context.out() << "removed " << removed << (removed == 1 ? " item" : " items") << "\n";
     return 0;

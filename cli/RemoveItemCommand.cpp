@@ -3,6 +3,7 @@
 #include <ostream>
 
 #include "cli/ItemAction.h"
+#include "cli/JsonValues.h"
 
 namespace tamber {
 
@@ -26,7 +27,7 @@ int RemoveItemCommand::run(CliContext& context) {
     if (status)
         return context.fail(*status, json_);
     if (json_)
-        context.out() << nlohmann::json{{"deleted", item.value()}}.dump() << "\n";
+        context.out() << jsonText(nlohmann::json{{"deleted", item.value()}}) << "\n";
     else
         context.out() << "deleted " << item.value() << "\n";
     return 0;

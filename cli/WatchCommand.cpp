@@ -7,6 +7,7 @@
 
 #include "cli/ContainerArgument.h"
 #include "cli/Interrupt.h"
+#include "cli/JsonValues.h"
 #include "platform/objects/Date.h"
 
 namespace tamber {
@@ -31,7 +32,7 @@ int WatchCommand::run(CliContext& context) {
         std::lock_guard lock(outMutex);
         std::string date = Date::now()->iso8601();
         if (json_)
-            context.out() << nlohmann::json{{"container", container}, {"date", date}}.dump();
+            context.out() << jsonText(nlohmann::json{{"container", container}, {"date", date}});
         else
             context.out() << date << "\t" << container;
         context.out() << std::endl;

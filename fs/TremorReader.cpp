@@ -45,7 +45,7 @@ constexpr const char* kDocIDMarker = ".docid/";
 std::mutex registryMutex;
 // Never destroyed: a stop still queued on a pool thread at exit may reach it after main.
 auto& registry = *new std::map<uint64_t, std::weak_ptr<TremorReader>>;  // guarded by registryMutex
-uint64_t lastRegistration = 0;                             // guarded by registryMutex
+uint64_t lastRegistration = 0;                                          // guarded by registryMutex
 
 uint64_t registerReader(std::weak_ptr<TremorReader> reader) {
     std::lock_guard lock(registryMutex);
@@ -112,9 +112,16 @@ void TremorReader::start() {
     if (verbose_)
         logDebug([&] { return "starting " + description(); });
     std::lock_guard lock(mutex_);
-    if (stream_)
+    if (stream_ || lostHistoryOwed_)
         return;  // already running
     stopping_.store(false);
+    if (lastProcessedTremorID_.load() == TremorStream::kSinceNow) {
+        // No journal hands out this ID, and a stream would take it for "from now on", whose
+        // replay never ends: whatever anchor carried it, the history after it is unknown.
+        lostHistoryOwed_ = true;
+        streamQueue_->async([self = shared_from_this()] { self->reportLostHistory(); });
+        return;
+    }
     registration_ = registerReader(weak_from_this());
     TremorStreamContext context;
     context.info = reinterpret_cast<void*>(static_cast<uintptr_t>(registration_));
@@ -148,6 +155,7 @@ void TremorReader::stop() {
     TremorStreamRef stream;
     {
         std::lock_guard lock(mutex_);
+        lostHistoryOwed_ = false;
         if (!stream_)
             return;
         // From here on, batches the stream already queued find no reader.
@@ -161,6 +169,22 @@ void TremorReader::stop() {
     TremorStreamRelease(stream);
     if (verbose_)
         logDebug([&] { return "stopped " + description(); });
+}
+
+void TremorReader::reportLostHistory() {
+    {
+        std::lock_guard lock(mutex_);
+        if (!lostHistoryOwed_)
+            return;  // stopped meanwhile
+        lostHistoryOwed_ = false;
+    }
+    // The batch a stream sends when it cannot replay what was asked for.
+    std::string path = urls_.empty() ? std::string(kDocIDRoot) : urls_.front().path();
+    std::map<std::string, ObjectRef> entry{{"path", String::make(path)}};
+    ObjectRef paths = Array::make({Dictionary::make(std::move(entry))});
+    const uint32_t flags = kTremorUserDropped | kTremorMustScanSubdirs;
+    const uint64_t id = 0;
+    receiveBatch(1, paths, &flags, &id);
 }
 
 void TremorReader::setDelegate(std::weak_ptr<TremorReaderDelegate> delegate) {

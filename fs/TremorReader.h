@@ -92,6 +92,8 @@ private:
     void processDocIDEvent(const std::string& path, uint64_t eventID);
     void processPathEvent(const std::string& path, std::optional<uint64_t> fileID, uint32_t flags,
                           uint64_t eventID);
+    // On streamQueue_: the loss of history owed by a start from an ID no journal hands out.
+    void reportLostHistory();
     bool isHidden(const Url& url) const;
     std::shared_ptr<TremorReaderDelegate> delegate() const;
     void recordEventID(uint64_t eventID);
@@ -108,6 +110,7 @@ private:
     mutable std::mutex mutex_;
     TremorStreamRef stream_ = nullptr;              // guarded by mutex_
     uint64_t registration_ = 0;                     // guarded by mutex_; 0 while no stream
+    bool lostHistoryOwed_ = false;                  // guarded by mutex_; started without stream
     std::weak_ptr<TremorReaderDelegate> delegate_;  // guarded by mutex_
 };
 

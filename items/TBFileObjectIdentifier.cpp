@@ -78,9 +78,9 @@ IdRead readIdResource(const Url& url, ResourceKey key, const char* kind, uint64_
 
 uint64_t parseValue(const std::string& text) {
     uint64_t value = 0;
+    // Trailing text ("1x", "1\n2") makes it no number: it must not name the item of its prefix.
     auto [ptr, ec] = std::from_chars(text.data(), text.data() + text.size(), value);
-    (void)ptr;
-    return ec == std::errc() ? value : 0;
+    return ec == std::errc() && ptr == text.data() + text.size() ? value : 0;
 }
 
 // The device of the document storage folder; 0 after logging why it has none.

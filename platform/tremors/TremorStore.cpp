@@ -382,6 +382,11 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
     {
         std::lock_guard lock(mutex_);
         upTo = nextEventId_ - 1;
+        // Nothing comes after it. Returning here also keeps an ID of 2^63 or more away from
+        // SQLite, whose keys are signed: bound as it is, it would read as a negative number
+        // and replay the whole journal.
+        if (sinceExclusive >= upTo)
+            return std::nullopt;
         if (!everything) {
             for (uint64_t root : roots_->mayHoldEventsBelow(wanted))
                 cursors.push_back({toSqlite(root), sinceExclusive, {}});

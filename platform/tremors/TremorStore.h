@@ -84,7 +84,8 @@ public:
 
     // Calls `each` for every event with `sinceExclusive` < id <= lastEventId() at the start of
     // the call whose path is at or below one of `paths` (by whole components), in ID order,
-    // until `each` returns false. Empty `paths` means the whole volume. Rows are read `chunk`
+    // until `each` returns false; nothing when `sinceExclusive` is at or past the last ID,
+    // whatever its value. Empty `paths` means the whole volume. Rows are read `chunk`
     // at a time (0: the default) and the lock is not held while `each` runs, so it may call
     // the store.
     Status replay(uint64_t sinceExclusive, const std::vector<std::string>& paths, size_t chunk,

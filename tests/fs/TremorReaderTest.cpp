@@ -1,7 +1,9 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <cstdio>
 #include <filesystem>
+#include <future>
 #include <thread>
 
 #include "fs/DocIDPath.h"
@@ -261,6 +263,35 @@ TEST_F(TremorTest, CanResumeGatherPhaseUnlessSomethingWasDeletedOrLost) {
     // The checkers' readers were stopped, not abandoned.
     std::this_thread::sleep_for(std::chrono::milliseconds(100));
     EXPECT_EQ(log->countStartingWith("[ERROR] stream deleted without being stopped"), 0u);
+}
+
+// Event IDs the journal never handed out, from a damaged or foreign anchor: all bits set is
+// also what streams take for "from now on", which has no history to end.
+TEST_F(TremorTest, AReaderFromAnIDNeverHandedOutAsksForARescanAtOnce) {
+    write("a.txt");
+    const uint64_t last = currentID();
+    ASSERT_GT(last, 0u);
+    for (uint64_t since : {last + 1, uint64_t{INT64_MAX} + 1, UINT64_MAX - 1, UINT64_MAX}) {
+        for (auto mode : {TremorReaderMode::pathBased, TremorReaderMode::docIDBased}) {
+            SCOPED_TRACE(std::to_string(since) + " " + tremorReaderModeName(mode));
+            delegate = std::make_shared<testing::RecordingReaderDelegate>();
+            startReader(since, mode);
+            ASSERT_TRUE(delegate->waitForReport("rescan"));
+            for (const std::string& report : delegate->itemReports())
+                EXPECT_TRUE(report == "rescan" || report == "history") << report;
+            readers.back()->stop();
+        }
+        // The gather phase's check gives up on such a page token instead of waiting.
+        auto verdict = std::async(std::launch::async, [&] {
+            return TremorReader::canResumeGatherPhase({storageURL()}, since).first.kind;
+        });
+        if (verdict.wait_for(std::chrono::seconds(30)) != std::future_status::ready) {
+            std::fprintf(stderr, "FAILED: canResumeGatherPhase from %s never ended\n",
+                         std::to_string(since).c_str());
+            std::_Exit(1);  // the blocked check holds the fixture
+        }
+        EXPECT_EQ(verdict.get(), Kind::cantReplayHistoricalTremors);
+    }
 }
 
 TEST_F(TremorTest, AReaderDestroyedWhileRunningSaysSoAndLaterBatchesFindNothing) {

@@ -476,5 +476,26 @@ TEST_F(TremorServiceStreamTest, AnOverflowOrTrimmedHistoryReachesTheStreamAsDrop
     EXPECT_EQ(replayed[1].id, store->lastEventId());
 }
 
+TEST_F(TremorServiceStreamTest, AReplayFromBeyondTheLastEventIsALossAndReplaysNothing) {
+    ASSERT_FALSE(service()->watchTree(tree_));
+    for (int i = 0; i < 5; ++i) writeText(tree_ + "/f" + std::to_string(i), "x");
+    const uint64_t last = TremorsGetCurrentEventId();
+    ASSERT_GT(last, 2u);
+    std::vector<Delivered> streams(4);
+    const uint64_t beyond[] = {last + 1, uint64_t{INT64_MAX} + 1, UINT64_MAX - 2, UINT64_MAX - 1};
+    for (size_t i = 0; i < streams.size(); ++i) open(streams[i], beyond[i]);
+    for (size_t i = 0; i < streams.size(); ++i) {
+        SCOPED_TRACE("since " + std::to_string(beyond[i]));
+        ASSERT_TRUE(eventually([&] { return streams[i].has(kTremorHistoryDone); }));
+        // The loss, then the end of a history that holds nothing.
+        auto events = streams[i].snapshot();
+        ASSERT_EQ(events.size(), 2u) << describe(events);
+        EXPECT_EQ(events[0].flags, kTremorUserDropped | kTremorMustScanSubdirs);
+        EXPECT_EQ(events[1].flags, kTremorHistoryDone);
+    }
+    for (auto stream : streams_) TremorStreamStop(stream);
+    queue_->sync([] {});
+}
+
 }  // namespace
 }  // namespace tamber

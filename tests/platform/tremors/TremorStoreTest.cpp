@@ -327,6 +327,28 @@ TEST_F(TremorStoreTest, ReplayIsBoundedAtItsStartAndLetsTheCallbackUseTheStore) 
     }
 }
 
+TEST_F(TremorStoreTest, ReplayFromBeyondTheLastEventDeliversNothingAndIsIncomplete) {
+    ASSERT_FALSE(store_->addRoot("/w", 0));
+    append({"/w/1", "/w/2", "/w/3"});
+    const uint64_t last = store_->lastEventId();
+    constexpr uint64_t kMax = UINT64_MAX;
+    constexpr uint64_t kSignedMax = INT64_MAX;
+    // IDs are unsigned: none of these may read as a negative number that lies before the
+    // history and replay all of it.
+    for (uint64_t since : {last + 1, kSignedMax - 1, kSignedMax, kSignedMax + 1, kMax - 1, kMax}) {
+        SCOPED_TRACE("since " + std::to_string(since));
+        EXPECT_TRUE(ids(since, {}).empty());
+        EXPECT_TRUE(ids(since, {"/w"}, 1).empty());
+        TremorStore::ReplayCheck check = store_->replayability(since, {"/w"});
+        EXPECT_FALSE(check.complete);
+        EXPECT_NE(check.reason.find("past the last event " + std::to_string(last)),
+                  std::string::npos)
+            << check.reason;
+    }
+    EXPECT_EQ(ids(last - 1, {"/w"}), (Ids{last}));
+    EXPECT_TRUE(store_->replayability(last, {"/w"}).complete);
+}
+
 TEST_F(TremorStoreTest, ADamagedIndexNeverNamesAPathOutsideItsRoot) {
     ASSERT_FALSE(store_->addRoot("/r", 0, 1));
     for (const std::string& name : {std::string(".."), std::string("."), std::string(""),
