@@ -50,6 +50,8 @@ void printItemText(std::ostream& out, const LocalItem& item) {
         out << key << ": ";
         if (value.is_string())
             out << value.get<std::string>();
+        else if (value.is_null())
+            out << "-";
         else if (std::string_view(key) == "capabilities")
             out << "0x" << std::hex << value.get<uint64_t>() << std::dec;
         else
