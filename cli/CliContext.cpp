@@ -11,6 +11,7 @@
 #include "host/HostPorterManager.h"
 #include "platform/FileContents.h"
 #include "platform/tremors/TremorService.h"
+#include "provider/LocalPorterError.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -80,19 +81,48 @@ void CliContext::setSignalHandler(SignalHandler handler) {
     signals_->handler = std::move(handler);
 }
 
+void CliContext::setInvocation(std::string verb, std::vector<std::string> arguments) {
+    verb_ = std::move(verb);
+    arguments_ = std::move(arguments);
+}
+
+namespace {
+
+// Marks the errors made from bad command-line input; their domain and code stay the host
+// framework's invalid-parameter error, as scripts have seen them.
+constexpr const char* kUsageKey = "usage";
+constexpr const char* kInternalErrorDomain = "tamber.InternalError";
+
+}  // namespace
+
 Error CliContext::usageError(const std::string& message) {
-    return Error(kHostPorterErrorDomain, kHostPorterInvalidParameter, {{"description", message}});
+    return Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
+                 {{"description", message}, {kUsageKey, "1"}});
+}
+
+bool CliContext::isUsageError(const Error& error) {
+    return error.userInfo().contains(kUsageKey);
+}
+
+Error CliContext::internalError(const std::string& what) {
+    return Error(kInternalErrorDomain, 1, {{"description", "internal error: " + what}});
+}
+
+int CliContext::exitStatusFor(const Error& error) {
+    if (isUsageError(error))
+        return kExitUsage;
+    const bool notFound =
+        error.is(kHostPorterErrorDomain, kHostPorterNoSuchItem) ||
+        error.is(kHostPlatformErrorDomain, kHostPlatformFileNoSuchFile) ||
+        error.is(kPosixErrorDomain, ENOENT) ||
+        error.is(kLocalPorterErrorDomain, static_cast<int64_t>(LocalPorterError::itemNotFound)) ||
+        error.is(kLocalPorterErrorDomain,
+                 static_cast<int64_t>(LocalPorterError::invalidItemIdentifier));
+    return notFound ? kExitNotFound : kExitFailure;
 }
 
 std::string CliContext::errorMessage(const Error& error) {
-    auto it = error.userInfo().find("description");
-    if (it != error.userInfo().end())
-        return it->second;
-    if (error.domain() == kPosixErrorDomain)
-        return std::strerror(static_cast<int>(error.code()));
-    std::string text = error.description();
-    auto quote = text.find('"');
-    return quote == std::string::npos ? text : text.substr(quote + 1, text.size() - quote - 2);
+    return error.reason();
 }
 
 nlohmann::json CliContext::errorJson(const Error& error) {
@@ -101,14 +131,31 @@ nlohmann::json CliContext::errorJson(const Error& error) {
          {{"domain", error.domain()}, {"code", error.code()}, {"message", errorMessage(error)}}}};
 }
 
+std::string CliContext::failureLine(const Error& error) const {
+    std::string message = errorMessage(error);
+    if (isUsageError(error) || error.domain() == kInternalErrorDomain || verb_.empty())
+        return message;
+    std::string invocation = verb_;
+    for (const auto& argument : arguments_) {
+        if (argument.empty())
+            continue;
+        if (message.find(argument) != std::string::npos)
+            return message;
+        invocation += " " + argument;
+    }
+    return invocation + ": " + message;
+}
+
 int CliContext::fail(const Error& error, bool json) {
     if (json) {
         out_ << jsonText(errorJson(error)) << "\n";
     } else {
-        err_ << "tamber: " << errorMessage(error) << " (" << error.domain() << " " << error.code()
-             << ")\n";
+        err_ << "tamber: " << failureLine(error);
+        if (verbose || debug)
+            err_ << " (" << error.domain() << " " << error.code() << ")";
+        err_ << "\n";
     }
-    return 1;
+    return exitStatusFor(error);
 }
 
 }  // namespace tamber

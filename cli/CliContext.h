@@ -5,6 +5,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <vector>
 
 #include <nlohmann/json.hpp>
 
@@ -44,19 +45,42 @@ public:
     std::ostream& out() { return out_; }
     std::ostream& err() { return err_; }
 
-    // Prints the error (as {"error": {...}} on standard output with --json, else a line on
-    // standard error) and returns the exit status to use.
+    // The exit statuses, the same for every verb; scripts rely on them.
+    static constexpr int kExitSuccess = 0;
+    static constexpr int kExitFailure = 1;   // the verb ran and failed
+    static constexpr int kExitUsage = 2;     // bad option, missing argument, bad value
+    static constexpr int kExitNotFound = 3;  // no such item, identifier or path
+
+    // The verb being run and its positional arguments, so that a failure can say which
+    // argument it was about when its message does not.
+    void setInvocation(std::string verb, std::vector<std::string> arguments);
+
+    // Prints the error (as {"error": {...}} on standard output with --json, else one line
+    // "tamber: <message>" on standard error; with --verbose or --debug the line also names the
+    // error's domain and code) and returns the exit status for it.
     int fail(const Error& error, bool json);
-    // An error for bad command-line input.
+    // The exit status for an error: usage errors 2, errors that say something does not exist
+    // 3, anything else 1.
+    static int exitStatusFor(const Error& error);
+    // An error for bad command-line input; `message` names the option or argument and the
+    // value.
     static Error usageError(const std::string& message);
+    static bool isUsageError(const Error& error);
+    // An unexpected failure (an exception) inside the program.
+    static Error internalError(const std::string& what);
 
     static nlohmann::json errorJson(const Error& error);
     // The message of an error, without the domain and code decoration.
     static std::string errorMessage(const Error& error);
+    // The line printed for an error on standard error, without "tamber: ": the message, led by
+    // the verb and its arguments when the message names none of them.
+    std::string failureLine(const Error& error) const;
 
 private:
     std::ostream& out_;
     std::ostream& err_;
+    std::string verb_;
+    std::vector<std::string> arguments_;
     Url storage_;
     std::shared_ptr<LocalPorter> porter_;
     struct SignalSlot {

@@ -2,6 +2,7 @@
 
 #include <iostream>
 #include <memory>
+#include <string>
 #include <string_view>
 #include <vector>
 
@@ -25,6 +26,7 @@
 #include "cli/ThumbnailCommand.h"
 #include "cli/TrashItemCommand.h"
 #include "cli/WatchCommand.h"
+#include "support/JournalLogSink.h"
 #include "support/Log.h"
 #include "support/StderrLogSink.h"
 
@@ -34,17 +36,75 @@ int runCommandLine(int argc, char** argv) {
     return runCommandLine(argc, argv, std::cout, std::cerr);
 }
 
-int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) {
-    CliContext context(out, err);
+namespace {
+
+// Whether the command line asks for JSON, read before (or without) a successful parse.
+bool wantsJson(int argc, char** argv) {
+    for (int i = 1; i < argc; ++i)
+        if (std::string_view(argv[i]) == "--json")
+            return true;
+    return false;
+}
+
+// The positional arguments a verb was given, as typed.
+std::vector<std::string> positionalArguments(const CLI::App& verb) {
+    std::vector<std::string> arguments;
+    for (const CLI::Option* option : verb.get_options()) {
+        if (option->get_positional())
+            for (const auto& value : option->results()) arguments.push_back(value);
+    }
+    return arguments;
+}
+
+// Log lines are for whoever looks into a problem; what failed is said once, by the verb. So by
+// default they go to the system journal when there is one and nowhere otherwise (the stderr
+// sink the log starts with on a machine without a journal would repeat every failure). With
+// --verbose (information and errors) or --debug (everything) they go to standard error
+// instead, where the person who asked reads them. A sink installed by someone else (a test's
+// capture) is left alone.
+void chooseLogSink(bool verbose, bool debug) {
+    Log& log = Log::shared();
+    auto sink = log.sink();
+    bool builtIn = std::dynamic_pointer_cast<StderrLogSink>(sink) ||
+                   std::dynamic_pointer_cast<JournalLogSink>(sink);
+    if (!builtIn)
+        return;
+    if (verbose || debug)
+        log.setSink(std::make_shared<StderrLogSink>(debug ? LogLevel::Debug : LogLevel::Info));
+    else if (!std::dynamic_pointer_cast<JournalLogSink>(sink))
+        log.setSink(nullptr);
+}
+
+// A parse error as a usage error: one line naming the verb, the option and the value.
+Error usageErrorFor(const CLI::ParseError& e, CLI::App& app,
+                    const std::vector<std::pair<CLI::App*, Command*>>& verbs) {
+    std::string verb;
+    for (const auto& [sub, command] : verbs)
+        if (sub->parsed())
+            verb = sub->get_name();
+    std::string message = e.what();
+    // Without a verb, CLI11 only says that one is required; say what was given instead.
+    if (std::vector<std::string> rest = app.remaining(); verb.empty() && !rest.empty()) {
+        const std::string& first = rest.front();
+        message = (first.starts_with('-') ? "no such option: " : "no such verb: ") +
+                  (first.empty() ? "\"\"" : first);
+    }
+    return CliContext::usageError((verb.empty() ? "" : verb + ": ") + message + " (see tamber " +
+                                  (verb.empty() ? "" : verb + " ") + "--help)");
+}
+
+int runParsed(int argc, char** argv, CliContext& context, std::ostream& out, std::ostream& err) {
     CLI::App app{
         "tamber: publishes a device's documents to a file browser, addressed by "
         "persistent identifiers"};
     app.set_version_flag("--version", std::string("tamber ") + TAMBER_VERSION);
     app.add_option("--storage", context.storagePath,
                    "The document storage folder (default ~/Documents; created when missing)");
-    app.add_flag("--debug", context.debug, "Write debug log lines");
+    app.add_flag("--debug", context.debug,
+                 "Write every log line, debug ones too, to standard error");
     app.add_flag("--verbose", context.verbose,
-                 "Write informational log lines to standard error (only errors by default)");
+                 "Write information and error log lines to standard error (by default they go "
+                 "to the system journal, if there is one)");
     app.require_subcommand(1);
 
     std::vector<std::unique_ptr<Command>> commands;
@@ -77,24 +137,36 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {
-        return app.exit(e, out, err);
+        // --help and --version are answers, not errors.
+        if (e.get_exit_code() == static_cast<int>(CLI::ExitCodes::Success))
+            return app.exit(e, out, err);
+        return context.fail(usageErrorFor(e, app, verbs), wantsJson(argc, argv));
     }
     Log::shared().setDebugEnabled(context.debug);
-    // Without a system journal the log goes to the terminal, where a command shows only its
-    // errors unless asked for more.
-    if (!context.debug && !context.verbose &&
-        std::dynamic_pointer_cast<StderrLogSink>(Log::shared().sink()))
-        Log::shared().setSink(std::make_shared<StderrLogSink>(LogLevel::Error));
-    if (auto error = context.prepareStorage()) {
-        bool json = false;
-        for (int i = 1; i < argc; ++i) json = json || std::string_view(argv[i]) == "--json";
-        return context.fail(*error, json);
-    }
+    chooseLogSink(context.verbose, context.debug);
     for (auto& [sub, command] : verbs) {
-        if (sub->parsed())
-            return command->run(context);
+        if (!sub->parsed())
+            continue;
+        context.setInvocation(sub->get_name(), positionalArguments(*sub));
+        if (auto error = context.prepareStorage())
+            return context.fail(*error, wantsJson(argc, argv));
+        return command->run(context);
     }
-    return 2;
+    return context.fail(CliContext::usageError("no verb given (see tamber --help)"),
+                        wantsJson(argc, argv));
+}
+
+}  // namespace
+
+int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) {
+    CliContext context(out, err);
+    // A verb fails with its own message; anything thrown on the way (a bug, an allocation that
+    // failed) still ends as one line and a failure status, not an abort.
+    try {
+        return runParsed(argc, argv, context, out, err);
+    } catch (const std::exception& e) {
+        return context.fail(CliContext::internalError(e.what()), wantsJson(argc, argv));
+    }
 }
 
 }  // namespace tamber

@@ -59,6 +59,8 @@ void printItemText(std::ostream& out, const LocalItem& item) {
             out << escapedText(item.fileURL().path());
         else if (value.is_string())
             out << escapedText(value.get<std::string>());
+        else if (value.is_null())
+            out << "-";
         else if (name == "capabilities")
             out << "0x" << std::hex << value.get<uint64_t>() << std::dec;
         else

@@ -3,6 +3,7 @@
 #include <charconv>
 
 #include "cli/ItemAction.h"
+#include "cli/TagLabels.h"
 #include "platform/Tag.h"
 #include "platform/objects/Date.h"
 #include "platform/objects/Number.h"
@@ -39,7 +40,7 @@ int ItemMetadataCommand::run(CliContext& context) {
         auto [end, ec] = std::from_chars(rank_.data(), rank_.data() + rank_.size(), value);
         if (ec != std::errc() || end != rank_.data() + rank_.size())
             return context.fail(
-                CliContext::usageError("rank takes an integer or \"none\", not \"" + rank_ + "\""),
+                CliContext::usageError("RANK takes an integer or \"none\", not \"" + rank_ + "\""),
                 json_);
         rank = Number::fromInt64(value);
     }
@@ -55,9 +56,9 @@ int ItemMetadataCommand::run(CliContext& context) {
         switch (verb_) {
             case Verb::Tag: {
                 std::optional<Bytes> data;
-                if (!tags_.empty()) {
+                if (auto labels = TagLabels::cleaned(tags_); !labels.empty()) {
                     std::vector<std::shared_ptr<const Tag>> tags;
-                    for (const auto& label : tags_) tags.push_back(Tag::make(label));
+                    for (const auto& label : labels) tags.push_back(Tag::make(label));
                     data = GetTagsDataForTags(tags);
                 }
                 return provider.setTagData(data, item.value(), std::move(done));

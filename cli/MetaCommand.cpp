@@ -5,6 +5,7 @@
 #include <ostream>
 
 #include "cli/JsonValues.h"
+#include "cli/TagLabels.h"
 #include "platform/objects/Number.h"
 
 namespace tamber {
@@ -109,7 +110,7 @@ Status MetaCommand::applyChanges(const Url& url) {
             return error;
     }
     if (setTags_) {
-        Bytes tagData = ItemMetadata::tagDataForLabels(splitLabels(*setTags_));
+        Bytes tagData = ItemMetadata::tagDataForLabels(TagLabels::cleaned(splitLabels(*setTags_)));
         if (auto error = ItemMetadata::writeTagData(url, tagData))
             return error;
     }

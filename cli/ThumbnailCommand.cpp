@@ -42,10 +42,11 @@ int ThumbnailCommand::run(CliContext& context) {
     if (status)
         return context.fail(*status, json_);
     if (!png)
-        return context.fail(CliContext::usageError(identifier.value() +
-                                                   " has no thumbnail (only app libraries whose "
-                                                   "app has an icon have one)"),
-                            json_);
+        return context.fail(
+            Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
+                  {{"description", identifier.value() + " has no thumbnail (only app libraries "
+                                                        "whose app has an icon have one)"}}),
+            json_);
     if (auto error = FileContents::writeAtomically(Url::fileURLWithPath(output_), *png))
         return context.fail(*error, json_);
     if (!json_)

@@ -16,8 +16,10 @@ constexpr const char* kProviderErrorDomain = "LocalPorter.Error";
 constexpr int64_t kUnableToGetDeviceUUID = 3;
 
 Error unableToGetDeviceUUIDError() {
-    return Error(kProviderErrorDomain, kUnableToGetDeviceUUID,
-                 {{"description", "unableToGetDeviceUUID"}});
+    return Error(
+        kProviderErrorDomain, kUnableToGetDeviceUUID,
+        {{"description", "can't identify the volume (its event journal has no identifier)"},
+         {"case", "unableToGetDeviceUUID"}});
 }
 
 std::string describePaths(const std::vector<Url>& urls) {
@@ -171,7 +173,15 @@ void LocalFileEnumerator::gatherPhase(HostPorterEnumerationObserver& observer,
     walk.recursively = listsRecursively();
     walk.offset = startOffset;
     walk.limit = kPageSize;
-    walk.errorHandler = &FSDirectoryEnumerator::logEnumerationError;
+    // A folder that can't be read at all fails its page: an empty page would say it is empty.
+    // (The roots of the working set and all-directories may be missing; those go on.)
+    std::optional<Error> unreadable;
+    const bool onlyTheFolder = !listsRecursively();
+    walk.errorHandler = [&](const Url& url, const Error& error) {
+        if (onlyTheFolder && url == enumeratedItemURL_ && !unreadable)
+            unreadable = error;
+        return FSDirectoryEnumerator::logEnumerationError(url, error);
+    };
     walk.directoryEnumerationOptionsFor = &trashOverride;
     std::vector<HostPorterItemRef> items;
     items.reserve(kPageSize);
@@ -181,6 +191,14 @@ void LocalFileEnumerator::gatherPhase(HostPorterEnumerationObserver& observer,
             items.push_back(std::move(item));
     });
 
+    if (unreadable) {
+        std::map<std::string, std::string> info = unreadable->userInfo();
+        info["description"] =
+            "can't list " + enumeratedItemURL_.path() + ": " + unreadable->reason();
+        observer.finishEnumeratingWithError(
+            Error(unreadable->domain(), unreadable->code(), std::move(info)));
+        return;
+    }
     logDebug([&] { return "discovered " + std::to_string(items.size()) + " items"; });
     observer.didEnumerateItems(items);
 

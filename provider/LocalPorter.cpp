@@ -148,7 +148,7 @@ Result<LocalPorter::LocalItemRef> LocalPorter::itemForIdentifierUnlogged(
     auto item = itemFromIdentifier(identifier);
     if (!item) {
         logError("item lookup failed for identifier \"" + identifier + "\"");
-        return makeLocalPorterError(LocalPorterError::invalidItemIdentifier);
+        return makeLocalPorterError(LocalPorterError::invalidItemIdentifier, identifier);
     }
     logDebug([&] { return "found " + item->description(); });
     return item;
@@ -172,7 +172,7 @@ Result<LocalPorter::LocalItemRef> LocalPorter::itemForURL(const Url& url) {
     auto identifier = identifierForURLLogged(url);
     if (!identifier) {
         logError("identifier lookup failed for URL \"" + url.path() + "\"");
-        return makeLocalPorterError(LocalPorterError::invalidItemIdentifier);
+        return makeLocalPorterError(LocalPorterError::invalidItemIdentifier, url.path());
     }
     if (isAppLibraryIdentifier(*identifier) ||
         *identifier == HostPorterTemporaryLocalFolderItemIdentifier)
@@ -180,7 +180,7 @@ Result<LocalPorter::LocalItemRef> LocalPorter::itemForURL(const Url& url) {
     auto item = LocalItem::make(url);
     if (!item) {
         logError("can't create item for URL \"" + url.path() + "\"");
-        return makeLocalPorterError(LocalPorterError::invalidItemIdentifier);
+        return makeLocalPorterError(LocalPorterError::invalidItemIdentifier, url.path());
     }
     return item;
 }

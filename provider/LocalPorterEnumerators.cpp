@@ -1,6 +1,10 @@
+#include <cerrno>
+
 #include "enumeration/LocalFileEnumerator.h"
 #include "enumeration/LocalRootEnumerator.h"
+#include "platform/objects/Number.h"
 #include "provider/LocalPorter.h"
+#include "support/Log.h"
 #include "support/LogSection.h"
 
 namespace tamber {
@@ -19,6 +23,19 @@ Result<HostPorterEnumeratorRef> LocalPorter::enumeratorForContainerItemIdentifie
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok())
             return url.error();
+        // A file has no children: listing one would answer with an empty page, which a caller
+        // can't tell from an empty folder. What can't be read here is left to the listing,
+        // which reports it.
+        if (auto isDirectory = url.value().resourceValue(ResourceKeys::kIsDirectory);
+            isDirectory.ok()) {
+            auto flag = objectCast<Number>(isDirectory.value());
+            if (flag && !flag->boolValue()) {
+                logError("can't enumerate " + identifier + "; it is not a folder");
+                return Error(
+                    kPosixErrorDomain, ENOTDIR,
+                    {{"description", "not a folder: " + identifier + " (a file can't be listed)"}});
+            }
+        }
         auto enumerator = LocalFileEnumerator::initWithContainer(identifier, {url.value()});
         enumerator->start();
         return HostPorterEnumeratorRef(enumerator);

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <string>
 #include <string_view>
 
 #include "support/Error.h"
@@ -18,6 +19,8 @@ enum class LocalPorterError : int64_t {
 };
 
 std::string_view localPorterErrorName(LocalPorterError error);
-Error makeLocalPorterError(LocalPorterError error);
+// The error with a description that says what failed, and with `subject` (an identifier or a
+// path) when given: "no such item: did=7". The case's name is kept in the user info ("case").
+Error makeLocalPorterError(LocalPorterError error, const std::string& subject = {});
 
 }  // namespace tamber

@@ -17,23 +17,39 @@ namespace tamber {
 namespace {
 
 // Sets (or, for nothing, removes) one attribute through the item's read-write access. A
-// failure is logged with the attribute's name only; the caller still answers with the item,
-// whose record then shows what is really on disk.
-void writeAttribute(const Url& url, const ObjectRef& value, const std::string& name) {
+// failure is logged with the attribute's name and handed back: a caller that asked for a
+// change must learn that it did not happen.
+Status writeAttribute(const Url& url, const ObjectRef& value, const std::string& name) {
     std::optional<Bytes> data;
     if (value) {
         auto archived = KeyedArchiver::archivedDataWithRootObject(value);
         if (!archived.ok()) {
             logError("can't archive value for xattr " + name + "; " +
                      archived.error().description());
-            return;
+            return archived.error();
         }
         data = std::move(archived.value());
     }
-    if (!pt_withReadWriteAccess(url, [&](int fd) { return !SetOrRemoveXattr(fd, data, name); })) {
-        Error error = Error::errorWithPOSIXCode(errno);
+    Status written;
+    if (!pt_withReadWriteAccess(url, [&](int fd) {
+            written = SetOrRemoveXattr(fd, data, name);
+            return !written;
+        })) {
+        Error error = written.value_or(Error::errorWithPOSIXCode(errno));
         logError("can't set xattr " + name + "; " + error.description());
+        return error;
     }
+    return std::nullopt;
+}
+
+// The error a metadata update answers with when its write failed: says what could not be
+// changed on which item, keeps the cause's domain and code.
+Error updateFailed(const Error& cause, const std::string& what,
+                   const HostPorterItemIdentifier& identifier) {
+    std::map<std::string, std::string> info = cause.userInfo();
+    info["description"] = "can't " + what + " of " + identifier + ": " + cause.reason();
+    info["itemIdentifier"] = identifier;
+    return Error(cause.domain(), cause.code(), std::move(info));
 }
 
 // The labels of tag data, in order; nothing readable gives none. Colours are not kept.
@@ -66,13 +82,18 @@ void LocalPorter::setLastUsedDate(std::shared_ptr<const Date> date,
              : "clearing last used date for item \"" + identifier;
     withLogSection(title, [&] {
         // Libraries and other "#" items are the apps', not the user's documents.
-        if (identifier.find('#') != std::string::npos)
-            return completion(nullptr, Error::invalidParameter("itemIdentifier", identifier));
+        if (identifier.find('#') != std::string::npos) {
+            Error refused = Error::invalidParameter("itemIdentifier", identifier);
+            std::map<std::string, std::string> info = refused.userInfo();
+            info["description"] = "an app library has no last-used date: " + identifier;
+            return completion(nullptr, Error(refused.domain(), refused.code(), std::move(info)));
+        }
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok())
             return completion(nullptr, url.error());
-        // Logged by the writer; the answer is the item as it now is.
-        (void)ItemMetadata::writeLastUsedDate(url.value(), date);
+        // Logged by the writer.
+        if (auto error = ItemMetadata::writeLastUsedDate(url.value(), date))
+            return completion(nullptr, updateFailed(*error, "set the last-used date", identifier));
         completeWithItem(*this, url.value(), completion);
     });
 }
@@ -88,7 +109,9 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
                               Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         }
         // Never removed: no tags is an empty list, so that clearing them is a change too.
-        writeAttribute(url.value(), Array::make(labelsOf(tagData)), LocalItem::xattrTagDataName());
+        if (auto error = writeAttribute(url.value(), Array::make(labelsOf(tagData)),
+                                        LocalItem::xattrTagDataName()))
+            return completion(nullptr, updateFailed(*error, "set the tags", identifier));
         completeWithItem(*this, url.value(), completion);
     });
 }
@@ -96,19 +119,21 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
 void LocalPorter::setFavoriteRank(std::shared_ptr<const Number> rank,
                                   const HostPorterItemIdentifier& identifier,
                                   ItemCompletion completion) {
-    withLogSection("set favorite rank \"" + (rank ? rank->description() : std::string("nil")) +
-                       "\" to item \"" + identifier,
-                   [&] {
-                       auto url = urlForIdentifierLogged(identifier);
-                       if (!url.ok()) {
-                           logError("can't find URL for item; " + url.error().description());
-                           return completion(
-                               nullptr,
-                               Error::porterErrorForNonExistentItemWithIdentifier(identifier));
-                       }
-                       writeAttribute(url.value(), rank, LocalItem::xattrFavoriteRankName());
-                       completeWithItem(*this, url.value(), completion);
-                   });
+    withLogSection(
+        "set favorite rank \"" + (rank ? rank->description() : std::string("nil")) +
+            "\" to item \"" + identifier,
+        [&] {
+            auto url = urlForIdentifierLogged(identifier);
+            if (!url.ok()) {
+                logError("can't find URL for item; " + url.error().description());
+                return completion(nullptr,
+                                  Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+            }
+            if (auto error = writeAttribute(url.value(), rank, LocalItem::xattrFavoriteRankName()))
+                return completion(nullptr,
+                                  updateFailed(*error, "set the favourite rank", identifier));
+            completeWithItem(*this, url.value(), completion);
+        });
 }
 
 }  // namespace tamber

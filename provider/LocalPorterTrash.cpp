@@ -170,7 +170,8 @@ void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& iden
         if (!destination) {
             logError("can't compute valid parent URL for " + url->absoluteString() +
                      "; it is in no library");
-            return completion(nullptr, makeLocalPorterError(LocalPorterError::invalidItemURL));
+            return completion(nullptr,
+                              makeLocalPorterError(LocalPorterError::invalidItemURL, url->path()));
         }
 
         pt_reparentUnderFolder(

@@ -14,33 +14,51 @@ bool Error::is(std::string_view domain, int64_t code) const {
 
 namespace {
 
-std::string reasonFor(const std::string& domain, int64_t code) {
-    if (domain == kPosixErrorDomain) {
-        return std::strerror(static_cast<int>(code));
-    }
+// The user info entry `key`, or nothing.
+std::string infoOr(const std::map<std::string, std::string>& info, const std::string& key) {
+    auto it = info.find(key);
+    return it == info.end() ? std::string() : it->second;
+}
+
+// Says what went wrong and, where the user info knows it, with what: these texts end up in
+// front of a person (the command line prints them), so no bare "invalid parameter".
+std::string reasonFor(const std::string& domain, int64_t code,
+                      const std::map<std::string, std::string>& info) {
+    auto with = [](std::string text, const std::string& subject) {
+        return subject.empty() ? text : text + ": " + subject;
+    };
+    if (domain == kPosixErrorDomain)
+        return with(std::strerror(static_cast<int>(code)), infoOr(info, "path"));
     if (domain == kHostPlatformErrorDomain) {
         if (code == kHostPlatformFileNoSuchFile)
-            return "The file doesn't exist.";
+            return with("no such file", infoOr(info, "path"));
         if (code == kHostPlatformFileWriteNoPermission)
-            return "You don't have permission to save the file.";
+            return with("no permission to write there", infoOr(info, "path"));
     }
     if (domain == kHostPorterErrorDomain) {
         if (code == kHostPorterSyncAnchorExpired)
-            return "The sync anchor expired.";
+            return "the sync anchor or page token expired; list again from the first page";
         if (code == kHostPorterNoSuchItem)
-            return "The item doesn't exist.";
-        if (code == kHostPorterInvalidParameter)
-            return "A parameter is invalid.";
+            return with("no such item", infoOr(info, "itemIdentifier"));
+        if (code == kHostPorterInvalidParameter) {
+            std::string parameter = infoOr(info, "parameter");
+            std::string value = infoOr(info, "value");
+            return with("invalid " + (parameter.empty() ? std::string("argument") : parameter),
+                        value);
+        }
     }
-    return "The operation couldn't be completed.";
+    return "the operation failed (" + domain + " code " + std::to_string(code) + ")";
 }
 
 }  // namespace
 
-std::string Error::description() const {
+std::string Error::reason() const {
     auto it = userInfo_.find("description");
-    std::string reason = it != userInfo_.end() ? it->second : reasonFor(domain_, code_);
-    return "Error Domain=" + domain_ + " Code=" + std::to_string(code_) + " \"" + reason + "\"";
+    return it != userInfo_.end() ? it->second : reasonFor(domain_, code_, userInfo_);
+}
+
+std::string Error::description() const {
+    return "Error Domain=" + domain_ + " Code=" + std::to_string(code_) + " \"" + reason() + "\"";
 }
 
 Error Error::errorWithPOSIXCode(int /*ignored*/) {
@@ -64,8 +82,7 @@ Error Error::fileNoSuchFile(const std::string& path) {
 
 Error Error::porterErrorForNonExistentItemWithIdentifier(const std::string& identifier) {
     return Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,
-                 {{"itemIdentifier", identifier},
-                  {"description", "no item with identifier \"" + identifier + "\""}});
+                 {{"itemIdentifier", identifier}, {"description", "no such item: " + identifier}});
 }
 
 Error Error::invalidParameter(const std::string& parameter, const std::string& value) {

@@ -35,8 +35,11 @@ public:
 
     bool is(std::string_view domain, int64_t code) const;
 
-    // Human-readable: `Error Domain=D Code=C "reason"`. The reason comes from the user info's
-    // "description" entry, or strerror for the POSIX domain, or a fixed text per known code.
+    // What went wrong, for a person: the user info's "description" entry, or strerror for the
+    // POSIX domain, or a text per known code that names the item, path or parameter the user
+    // info holds.
+    std::string reason() const;
+    // Human-readable: `Error Domain=D Code=C "reason"`.
     std::string description() const;
 
     // Builds a POSIX error from the *current* errno. The argument is ignored on purpose: every

@@ -97,7 +97,7 @@ TEST_F(ItemAndAppsCommandTest, TheStorageFolderNamedDocumentsIsTheRootByPath) {
 
 TEST_F(ItemAndAppsCommandTest, UnknownItemsAreErrors) {
     for (const auto& item : {std::string("#com.example.absent"), dir.writeFile("elsewhere.txt")}) {
-        json error = tamberJson({"item", item}, 1)["error"];
+        json error = tamberJson({"item", item}, 3)["error"];
         EXPECT_EQ(error["domain"], "LocalPorter.Error") << item;
         EXPECT_EQ(error["code"], 0) << item;
     }
@@ -108,7 +108,7 @@ TEST_F(ItemAndAppsCommandTest, RemovedAppLeavesTheListAndBumpsTheToken) {
     std::remove((dir / "applications/com.example.Notes.desktop").c_str());
     EXPECT_EQ(tamberJson({"apps", "--refresh"}),
               (json{{"versionToken", 2}, {"libraries", json::array()}}));
-    EXPECT_EQ(tamberJson({"item", "#com.example.Notes"}, 1)["error"]["code"], 0);
+    EXPECT_EQ(tamberJson({"item", "#com.example.Notes"}, 3)["error"]["code"], 0);
 }
 
 }  // namespace

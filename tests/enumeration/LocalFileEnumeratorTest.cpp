@@ -10,7 +10,10 @@
 #include <thread>
 
 #include "enumeration/LocalChangesObserverContext.h"
+#include "platform/FaultInjectingFileSystem.h"
+#include "platform/LinuxFileSystem.h"
 #include "platform/strata/StrataService.h"
+#include "tests/common/ScopedFileSystem.h"
 #include "tests/enumeration/EnumerationTest.h"
 
 namespace tamber {
@@ -175,6 +178,37 @@ TEST_F(LocalFileEnumeratorTest, ResumingAfterADeletionStartsOver) {
     EXPECT_TRUE(isExpired(afterDeletion.error));
     EXPECT_EQ(log->countStartingWith("[DEBUG] deletion of ["), 1u);
     EXPECT_EQ(log->count("[DEBUG] start gather phase", LogLevel::Debug), 1u);
+}
+
+TEST_F(LocalFileEnumeratorTest, AFolderThatCantBeReadFailsItsPageWhileOneInsideItIsSkipped) {
+    fill("locked", 3);
+    fill("open", 2);
+    fill("open/inner", 1);
+    // Permission bits don't stop root, which runs the tests: refuse the reads instead.
+    auto faults = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    testing::ScopedFileSystem scoped(faults);
+    faults->inject(FaultInjectingFileSystem::Operation::ReadDirectory, EACCES, -1, "/locked");
+    faults->inject(FaultInjectingFileSystem::Operation::ReadDirectory, EIO, -1, "/inner");
+
+    auto listed = list(*folderEnumerator(storage + "/locked"), HostPorterInitialPageSortedByName());
+    ASSERT_TRUE(listed.error);
+    EXPECT_TRUE(listed.error->is(kPosixErrorDomain, EACCES)) << listed.error->description();
+    EXPECT_NE(listed.error->reason().find(storage + "/locked"), std::string::npos)
+        << listed.error->reason();
+    EXPECT_TRUE(listed.names.empty());
+    EXPECT_FALSE(listed.next);
+
+    // A listing of a folder's children doesn't read them; a whole tree walks on past the one
+    // it can't read.
+    auto open = list(*folderEnumerator(storage + "/open"), HostPorterInitialPageSortedByName());
+    EXPECT_FALSE(open.error);
+    EXPECT_EQ(open.names, (Names{"inner", "n0000", "n0001"}));
+    auto tree = list(*track(LocalFileEnumerator::initWithContainer(
+                         HostPorterAllDirectoriesContainerItemIdentifier,
+                         {Url::fileURLWithPath(storage + "/open")})),
+                     HostPorterInitialPageSortedByName());
+    EXPECT_FALSE(tree.error);
+    EXPECT_EQ(tree.names, (Names{"inner", "n0000", "n0001"}));
 }
 
 TEST_F(LocalFileEnumeratorTest, NoDeviceUUIDFailsTheListingAndLeavesNoAnchor) {
