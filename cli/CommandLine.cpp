@@ -42,6 +42,10 @@ int runCommandLine(int argc, char** argv, std::ostream& out, std::ostream& err) 
     app.set_version_flag("--version", std::string("tamber ") + TAMBER_VERSION);
     app.add_option("--storage", context.storagePath,
                    "The document storage folder (default ~/Documents; created when missing)");
+    app.add_option("--wait", context.waitSeconds,
+                   "Seconds to wait for another Tamber process that is using the event journal "
+                   "(default 10; 0 fails at once)")
+        ->check(CLI::NonNegativeNumber);
     app.add_flag("--debug", context.debug, "Write debug log lines");
     app.add_flag("--verbose", context.verbose,
                  "Write informational log lines to standard error (only errors by default)");

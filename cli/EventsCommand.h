@@ -12,8 +12,11 @@ namespace tamber {
 
 // `tamber events [--since ID] [--docid] [--no-follow] [--json] PATH...`: replays the journal
 // for the given trees, then follows it live until interrupted (or stops after the
-// history-done event with --no-follow). A path outside every watched tree is watched from then
-// on, with a warning: its replay then starts with a lost-history event.
+// history-done event with --no-follow). A path outside every published tree is watched for
+// that run, with a warning: its replay then starts with a lost-history event.
+//
+// `tamber events --forget PATH`: the journal stops remembering that tree (see
+// TremorService::forget) and says what it dropped.
 class EventsCommand : public Command {
 public:
     CLI::App* add(CLI::App& app) override;
@@ -22,8 +25,10 @@ public:
 private:
     // Watches each of `paths` that no watched tree covers, with a warning on standard error.
     static Status watchUncovered(CliContext& context, const std::vector<std::string>& paths);
+    int forget(CliContext& context);
 
     std::vector<std::string> paths_;
+    std::string forget_;
     uint64_t since_ = 0;
     bool docid_ = false;
     bool noFollow_ = false;
