@@ -4,6 +4,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <ostream>
+#include <utility>
 
 #include "applibraries/SharedAppLibraryLookup.h"
 #include "applibraries/TBPAppLibraryManager.h"
@@ -16,7 +17,18 @@
 
 namespace tamber {
 
-CliContext::CliContext(std::ostream& out, std::ostream& err) : out_(out), err_(err) {}
+CliContext::CliContext(std::ostream& out, std::ostream& err) : out_(out), err_(err) {
+    waitNotice_->err = &err_;
+}
+
+CliContext::~CliContext() {
+    {
+        std::lock_guard lock(waitNotice_->mutex);
+        waitNotice_->err = nullptr;
+    }
+    if (publishing_)
+        publishing_->retireUnwatched();
+}
 
 namespace {
 
@@ -51,8 +63,28 @@ Status CliContext::prepareStorage() {
     return std::nullopt;
 }
 
+Result<std::shared_ptr<TremorService>> CliContext::startJournal() {
+    std::weak_ptr<WaitNotice> weakNotice = waitNotice_;
+    TremorService::setLockWait(
+        {waitSeconds, [weakNotice](pid_t holder, const std::string& directory) {
+             auto notice = weakNotice.lock();
+             if (!notice)
+                 return;
+             std::lock_guard lock(notice->mutex);
+             // Once a run: each volume's journal may make it wait.
+             if (!notice->err || std::exchange(notice->told, true))
+                 return;
+             *notice->err << "tamber: waiting for "
+                          << (holder ? "Tamber process " + std::to_string(holder)
+                                     : std::string("another Tamber process"))
+                          << " to release the state directory " << directory << "\n";
+             notice->err->flush();
+         }});
+    return TremorService::shared();
+}
+
 Status CliContext::prepareJournal() {
-    auto service = TremorService::shared();
+    auto service = startJournal();
     if (!service.ok())
         return service.error();
     return service.value()->watchTree(storage_.path());
@@ -73,6 +105,7 @@ Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
             logError("can't watch app library " + root.path() + "; " + error->description());
     }
     porter_ = porter;
+    publishing_ = service.value();
     return porter_;
 }
 

@@ -100,6 +100,10 @@ int runParsed(int argc, char** argv, CliContext& context, std::ostream& out, std
     app.set_version_flag("--version", std::string("tamber ") + TAMBER_VERSION);
     app.add_option("--storage", context.storagePath,
                    "The document storage folder (default ~/Documents; created when missing)");
+    app.add_option("--wait", context.waitSeconds,
+                   "Seconds to wait for another Tamber process that is using the event journal "
+                   "(default 10; 0 fails at once)")
+        ->check(CLI::NonNegativeNumber);
     app.add_flag("--debug", context.debug,
                  "Write every log line, debug ones too, to standard error");
     app.add_flag("--verbose", context.verbose,

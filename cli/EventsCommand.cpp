@@ -96,7 +96,42 @@ CLI::App* EventsCommand::add(CLI::App& app) {
     sub->add_flag("--docid", docid_, "Show document-ID events instead of path events");
     sub->add_flag("--no-follow", noFollow_, "Stop after the history has been replayed");
     sub->add_flag("--json", json_, "One JSON object per line: id, flags, path, fileID");
+    sub->add_option("--forget", forget_,
+                    "Stop watching a remembered tree and drop its index entries (its "
+                    "identifiers no longer resolve; its events stay)");
     return sub;
+}
+
+int EventsCommand::forget(CliContext& context) {
+    if (!paths_.empty()) {
+        return context.fail(CliContext::usageError("--forget takes one tree and no other PATH"),
+                            json_);
+    }
+    // Nothing is watched for this: forgetting one tree must not cost a crawl of the others.
+    auto service = context.startJournal();
+    if (!service.ok())
+        return context.fail(service.error(), json_);
+    std::string path = Url::fileURLWithPath(forget_).path();
+    auto forgotten = service.value()->forget(path);
+    if (!forgotten.ok()) {
+        return context.fail(
+            Error(forgotten.error().domain(), forgotten.error().code(),
+                  {{"description",
+                    "can't forget " + path + ": " + CliContext::errorMessage(forgotten.error())}}),
+            json_);
+    }
+    const auto& outcome = forgotten.value();
+    if (json_) {
+        context.out() << nlohmann::json{{"forgotten", path},
+                                        {"entries", outcome.entries},
+                                        {"documents", outcome.documents}}
+                             .dump()
+                      << "\n";
+    } else {
+        context.out() << "forgot " << path << ": " << outcome.entries << " index entries, "
+                      << outcome.documents << " document IDs\n";
+    }
+    return 0;
 }
 
 std::optional<uint64_t> EventsCommand::parseEventID(const std::string& text) {
@@ -112,6 +147,8 @@ std::optional<uint64_t> EventsCommand::parseEventID(const std::string& text) {
 }
 
 int EventsCommand::run(CliContext& context) {
+    if (!forget_.empty())
+        return forget(context);
     std::optional<uint64_t> since = since_->count() ? parseEventID(sinceText_) : uint64_t{0};
     if (!since) {
         return context.fail(
@@ -119,8 +156,9 @@ int EventsCommand::run(CliContext& context) {
                                    "), not \"" + sinceText_ + "\""),
             json_);
     }
-    if (auto error = context.prepareJournal())
-        return context.fail(*error, json_);
+    // The trees of this run are those it publishes, and the paths asked for here.
+    if (auto porter = context.prepareProvider(); !porter.ok())
+        return context.fail(porter.error(), json_);
     // A replay from past the journal's end has nothing to show and never ends: an ID from
     // another journal, or mistyped.
     const uint64_t last = TremorsGetCurrentEventId();

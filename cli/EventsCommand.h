@@ -12,8 +12,11 @@ namespace tamber {
 
 // `tamber events [--since ID] [--docid] [--no-follow] [--json] PATH...`: replays the journal
 // for the given trees, then follows it live until interrupted (or stops after the
-// history-done event with --no-follow). A path outside every watched tree is watched from then
-// on, with a warning: its replay then starts with a lost-history event.
+// history-done event with --no-follow). A path outside every published tree is watched for
+// that run, with a warning: its replay then starts with a lost-history event.
+//
+// `tamber events --forget PATH`: the journal stops remembering that tree (see
+// TremorService::forget) and says what it dropped.
 class EventsCommand : public Command {
 public:
     CLI::App* add(CLI::App& app) override;
@@ -22,6 +25,7 @@ public:
 private:
     // Watches each of `paths` that no watched tree covers, with a warning on standard error.
     static Status watchUncovered(CliContext& context, const std::vector<std::string>& paths);
+    int forget(CliContext& context);
 
     // Nothing unless the text is a whole event ID in decimal.
     static std::optional<uint64_t> parseEventID(const std::string& text);
@@ -29,6 +33,7 @@ private:
     std::vector<std::string> paths_;
     CLI::Option* since_ = nullptr;
     std::string sinceText_;  // parsed by run(), which can say what is wrong with it
+    std::string forget_;
     bool docid_ = false;
     bool noFollow_ = false;
     bool json_ = false;

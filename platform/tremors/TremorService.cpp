@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <utility>
@@ -23,6 +24,7 @@ struct Shared {
     std::mutex mutex;
     std::string stateDir;
     std::shared_ptr<InotifyApi> api;
+    TremorStoreDirectory::LockWait lockWait;
     std::shared_ptr<TremorService> service;
     std::shared_ptr<StrataService> strata;
 };
@@ -50,6 +52,11 @@ void TremorService::configure(std::string stateDir, std::shared_ptr<InotifyApi> 
     global().api = std::move(api);
 }
 
+void TremorService::setLockWait(TremorStoreDirectory::LockWait lockWait) {
+    std::lock_guard lock(global().mutex);
+    global().lockWait = std::move(lockWait);
+}
+
 std::string TremorService::defaultStateDir() {
     if (const char* state = std::getenv("XDG_STATE_HOME"); state && *state == '/')
         return std::string(state) + "/tamber";
@@ -63,11 +70,9 @@ Result<std::shared_ptr<TremorService>> TremorService::shared() {
     if (g.service)
         return g.service;
     auto service = create(g.stateDir.empty() ? defaultStateDir() : g.stateDir,
-                          g.api ? g.api : InotifyApi::system());
-    if (!service.ok()) {
-        logError("The event journal could not start: " + service.error().description());
+                          g.api ? g.api : InotifyApi::system(), kDefaultQueueLimit, g.lockWait);
+    if (!service.ok())
         return service.error();
-    }
     g.service = service.value();
     g.strata = std::make_shared<TremorStrataService>(g.service);
     StrataService::setCurrent(g.strata);
@@ -96,14 +101,14 @@ void TremorService::resetForTesting() {
         service->shutdown();
 }
 
-Result<std::shared_ptr<TremorService>> TremorService::create(const std::string& stateDir,
-                                                             std::shared_ptr<InotifyApi> api,
-                                                             size_t queueLimit) {
+Result<std::shared_ptr<TremorService>> TremorService::create(
+    const std::string& stateDir, std::shared_ptr<InotifyApi> api, size_t queueLimit,
+    TremorStoreDirectory::LockWait lockWait) {
     auto backend = InotifyBackend::start(std::move(api));
     if (!backend.ok())
         return backend.error();
     auto service = std::make_shared<TremorService>(Private{}, stateDir, std::move(backend).value(),
-                                                   queueLimit);
+                                                   queueLimit, std::move(lockWait));
     if (auto error = service->openExistingStores()) {
         service->shutdown();
         return *error;
@@ -112,8 +117,11 @@ Result<std::shared_ptr<TremorService>> TremorService::create(const std::string& 
 }
 
 TremorService::TremorService(Private, std::string stateDir, std::unique_ptr<InotifyBackend> backend,
-                             size_t queueLimit)
-    : stateDir_(std::move(stateDir)), backend_(std::move(backend)), queueLimit_(queueLimit) {
+                             size_t queueLimit, TremorStoreDirectory::LockWait lockWait)
+    : stateDir_(std::move(stateDir)),
+      backend_(std::move(backend)),
+      queueLimit_(queueLimit),
+      lockWait_(std::move(lockWait)) {
     reader_ = std::thread([this] { readLoop(); });
     journaler_ = std::thread([this] { journalLoop(); });
     journalerId_ = journaler_.get_id();
@@ -147,41 +155,56 @@ Status TremorService::openExistingStores() {
         fs.readDirectory(fd, entries);
         fs.close(fd);
     }
-    std::vector<std::string> remembered;
+    // Always in the same order, so that two processes waiting for each other's stores cannot
+    // each hold one the other wants.
+    std::vector<std::string> names;
     for (const auto& entry : entries) {
-        if (!isVolumeDirectoryName(entry.name))
-            continue;
-        auto store = TremorStore::open(stateDir_, std::stoull(entry.name, nullptr, 16));
+        if (isVolumeDirectoryName(entry.name))
+            names.push_back(entry.name);
+    }
+    std::sort(names.begin(), names.end());
+    for (const auto& name : names) {
+        uint64_t fsid = std::stoull(name, nullptr, 16);
+        auto store = TremorStore::open(stateDir_, fsid, lockWait_);
         if (!store.ok())
             return store.error();
-        for (const auto& root : store.value()->roots()) {
-            if (root.path != TremorStore::kDocumentIdRoot)
-                remembered.push_back(root.path);
-        }
-        // Reopened below through the root's own volume, which also learns its device.
-    }
-    for (const auto& path : remembered) {
-        if (auto error = watch(path, true))
-            logError("A remembered tree is not watched: " + path + ": " + error->description());
+        pruneVanishedRoots(*store.value());
+        std::lock_guard lock(volumesMutex_);
+        // Kept open: the roots it remembers are watched only when asked for, and the store of
+        // their volume must then be this one, not a second opening.
+        if (auto added = addVolume(fsid, std::move(store).value()); !added.ok())
+            return added.error();
     }
     indexReady_ = true;
     return std::nullopt;
 }
 
-Result<TremorService::Volume*> TremorService::openVolume(uint64_t fsid, uint32_t device) {
-    for (auto& volume : volumes_) {
-        if (volume->fsid == fsid) {
-            volume->device = device;
-            return volume.get();
+void TremorService::pruneVanishedRoots(TremorStore& store) {
+    for (const auto& root : store.rememberedRoots()) {
+        if (root.path == TremorStore::kDocumentIdRoot)
+            continue;
+        struct statx st {};
+        if (FileSystem::current().statx(AT_FDCWD, root.path, AT_SYMLINK_NOFOLLOW, STATX_TYPE,
+                                        &st) == 0
+                ? S_ISDIR(st.stx_mode)
+                : errno != ENOENT && errno != ENOTDIR)
+            continue;  // there, or not known to be gone (unreadable, say)
+        auto forgotten = store.forgetRoot(root.path);
+        if (!forgotten.ok()) {
+            logError("Cannot forget the vanished tree " + root.path + ": " +
+                     forgotten.error().description());
+            continue;
         }
+        logInfo("Forgot the remembered tree " + root.path + ": it no longer exists (" +
+                std::to_string(forgotten.value().entries) + " index entries dropped)");
     }
-    auto store = TremorStore::open(stateDir_, fsid);
-    if (!store.ok())
-        return store.error();
+}
+
+Result<TremorService::Volume*> TremorService::addVolume(uint64_t fsid,
+                                                        std::unique_ptr<TremorStore> store) {
     auto volume = std::make_unique<Volume>();
     volume->fsid = fsid;
-    volume->device = device;
-    volume->store = std::move(store).value();
+    volume->store = std::move(store);
     bool hasDocIdRoot = false;
     for (const auto& root : volume->store->roots())
         hasDocIdRoot |= root.path == TremorStore::kDocumentIdRoot;
@@ -190,9 +213,29 @@ Result<TremorService::Volume*> TremorService::openVolume(uint64_t fsid, uint32_t
                 volume->store->addRoot(TremorStore::kDocumentIdRoot, volume->store->lastEventId()))
             return *error;
     }
-    volume->writer = std::make_unique<JournalWriter>(*volume->store, device);
     volumes_.push_back(std::move(volume));
     return volumes_.back().get();
+}
+
+Result<TremorService::Volume*> TremorService::openVolume(uint64_t fsid, uint32_t device) {
+    Volume* volume = nullptr;
+    for (auto& existing : volumes_) {
+        if (existing->fsid == fsid)
+            volume = existing.get();
+    }
+    if (!volume) {
+        auto store = TremorStore::open(stateDir_, fsid, lockWait_);
+        if (!store.ok())
+            return store.error();
+        auto added = addVolume(fsid, std::move(store).value());
+        if (!added.ok())
+            return added.error();
+        volume = added.value();
+    }
+    volume->device = device;
+    if (!volume->writer)
+        volume->writer = std::make_unique<JournalWriter>(*volume->store, device);
+    return volume;
 }
 
 Result<TremorService::Volume*> TremorService::volumeFor(const std::string& path) {
@@ -216,10 +259,10 @@ Status TremorService::watchTree(const std::string& path) {
     // A tree's history starts after what is journaled by now: a replay from before it must not
     // pass for complete because queued events of other trees got their IDs later.
     sync();
-    return watch(root, false);
+    return watch(root);
 }
 
-Status TremorService::watch(const std::string& path, bool journalDifferences) {
+Status TremorService::watch(const std::string& path) {
     if (isWatched(path))
         return std::nullopt;
     auto volume = volumeFor(path);
@@ -233,9 +276,15 @@ Status TremorService::watch(const std::string& path, bool journalDifferences) {
         return Error::posix(errno);
     if (!S_ISDIR(st.stx_mode))
         return Error::posix(ENOTDIR);
-    bool remembered = false;
-    for (const auto& root : v.store->roots()) remembered |= root.path == path;
-    if (!remembered) {
+    // Watched without a gap until the last run stopped: the history goes on. Anything else
+    // (new, left aside by a run, forgotten) starts anew from here.
+    bool resumed = v.store->resumeRoot(path);
+    if (!resumed) {
+        // A gap in a known tree's history is journaled, so that the history starting here
+        // begins after an ID that no anchor from before the gap can hold.
+        if (v.store->knowsRoot(path))
+            publish(v,
+                    v.writer->journalDropped({path}, kTremorUserDropped | kTremorMustScanSubdirs));
         if (auto error = v.store->addRoot(path, v.store->lastEventId(), st.stx_ino))
             return error;
     }
@@ -250,11 +299,81 @@ Status TremorService::watch(const std::string& path, bool journalDifferences) {
     if (watched) {
         std::lock_guard lock(volumesMutex_);
         std::erase_if(roots_, [&](const auto& root) { return root.first == path; });
+        v.store->releaseRoot(path);
         return watched;
     }
-    // Watched first, then crawled: nothing that changes from now on is missed.
-    publish(v, v.writer->reconcile(path, journalDifferences && remembered));
+    // Watched first, then crawled: nothing that changes from now on is missed. What changed
+    // while no run watched a resumed tree is journaled, as live watching would have.
+    publish(v, v.writer->reconcile(path, resumed));
     return std::nullopt;
+}
+
+Status TremorService::watchRemembered() {
+    std::vector<std::string> paths;
+    {
+        std::lock_guard lock(volumesMutex_);
+        for (const auto& volume : volumes_) {
+            for (const auto& root : volume->store->roots()) {
+                if (root.path != TremorStore::kDocumentIdRoot)
+                    paths.push_back(root.path);
+            }
+        }
+    }
+    Status first;
+    for (const auto& path : paths) {
+        if (auto error = watchTree(path)) {
+            logError("A remembered tree is not watched: " + path + ": " + error->description());
+            if (!first)
+                first = error;
+        }
+    }
+    return first;
+}
+
+std::vector<std::string> TremorService::retireUnwatched() {
+    std::lock_guard write(writeMutex_);
+    std::vector<TremorStore*> stores;
+    {
+        std::lock_guard lock(volumesMutex_);
+        for (const auto& volume : volumes_) stores.push_back(volume->store.get());
+    }
+    std::vector<std::string> all;
+    for (TremorStore* store : stores) {
+        auto retired = store->retireRoots();
+        if (!retired.ok()) {
+            logError("Cannot mark the trees this run left aside: " + retired.error().description());
+            continue;
+        }
+        for (auto& path : retired.value()) {
+            logDebug([&] { return "No longer watched: " + path; });
+            all.push_back(std::move(path));
+        }
+    }
+    return all;
+}
+
+Result<TremorStore::Forgotten> TremorService::forget(const std::string& rawPath) {
+    std::string path = WatchedRoots::normalised(rawPath);
+    std::lock_guard write(writeMutex_);
+    TremorStore* owner = nullptr;
+    {
+        std::lock_guard lock(volumesMutex_);
+        for (const auto& volume : volumes_) {
+            for (const auto& root : volume->store->rememberedRoots()) {
+                if (root.path == path && path != TremorStore::kDocumentIdRoot)
+                    owner = volume->store.get();
+            }
+        }
+        // What the kernel still reports for it is dropped from now on (unless another
+        // watched tree holds it); its kernel watches go with the process.
+        if (owner)
+            std::erase_if(roots_, [&](const auto& root) { return root.first == path; });
+    }
+    if (!owner) {
+        return Error(kPosixErrorDomain, ENOENT,
+                     {{"description", path + " is not a remembered tree of the event journal"}});
+    }
+    return owner->forgetRoot(path);
 }
 
 bool TremorService::isWatched(const std::string& path) const {
@@ -290,7 +409,7 @@ std::vector<std::string> TremorService::rootPaths(const Volume& volume) const {
 TremorStore* TremorService::storeForDevice(uint32_t device) const {
     std::lock_guard lock(volumesMutex_);
     for (const auto& volume : volumes_) {
-        if (volume->device == device)
+        if (device != 0 && volume->device == device)
             return volume->store.get();
     }
     return nullptr;
@@ -380,17 +499,24 @@ void TremorService::journalLoop() {
     barrierPassed_.notify_all();
 }
 
+std::vector<std::pair<TremorService::Volume*, JournalWriter*>> TremorService::journalingVolumes()
+    const {
+    std::lock_guard lock(volumesMutex_);
+    std::vector<std::pair<Volume*, JournalWriter*>> volumes;
+    for (auto& volume : volumes_) {
+        if (volume->writer)
+            volumes.emplace_back(volume.get(), volume->writer.get());
+    }
+    return volumes;
+}
+
 void TremorService::journal(Item& item) {
     std::lock_guard write(writeMutex_);
-    std::vector<Volume*> volumes;
-    {
-        std::lock_guard lock(volumesMutex_);
-        for (auto& volume : volumes_) volumes.push_back(volume.get());
-    }
+    auto volumes = journalingVolumes();
     if (item.kind == Item::Kind::Dropped) {
-        for (Volume* volume : volumes) {
-            publish(*volume, volume->writer->journalDropped(
-                                 rootPaths(*volume), kTremorUserDropped | kTremorMustScanSubdirs));
+        for (auto [volume, writer] : volumes) {
+            publish(*volume, writer->journalDropped(rootPaths(*volume),
+                                                    kTremorUserDropped | kTremorMustScanSubdirs));
             reconcileAll(*volume);
         }
         return;
@@ -420,10 +546,9 @@ void TremorService::journal(Item& item) {
     for (auto& [volume, changes] : byVolume) publish(*volume, volume->writer->apply(changes));
     if (overflow) {
         logError("inotify dropped events; rescanning the watched trees");
-        for (Volume* volume : volumes) {
-            publish(*volume,
-                    volume->writer->journalDropped(rootPaths(*volume),
-                                                   kTremorKernelDropped | kTremorMustScanSubdirs));
+        for (auto [volume, writer] : volumes) {
+            publish(*volume, writer->journalDropped(rootPaths(*volume),
+                                                    kTremorKernelDropped | kTremorMustScanSubdirs));
             reconcileAll(*volume);
         }
     }

@@ -23,9 +23,15 @@
 
 namespace tamber {
 
-// The file-system event journal of this process: it watches the trees streams ask for (and
-// those remembered from earlier runs), journals their changes in one store per volume, and
-// keeps the inode index and document IDs of those trees.
+// The file-system event journal of this process: it watches the trees asked for in this run
+// (the published folders, and what streams ask for), journals their changes in one store per
+// volume, and keeps the inode index and document IDs of those trees.
+//
+// Trees remembered from earlier runs are neither watched nor crawled until asked for again: a
+// tree that this run does not publish must not answer paths nor cost a crawl. One that was
+// watched until the last run stopped goes on with its history (what changed meanwhile is
+// journaled when it is asked for); one that a run left aside starts its history anew, so that
+// a replay from before reports the gap.
 //
 // Two threads: one reads inotify into memory and never touches the database (the kernel queue
 // is a fraction of a second of a burst), the other journals what it read, in one append per
@@ -41,20 +47,23 @@ public:
     // this before the first shared().
     static void configure(std::string stateDir,
                           std::shared_ptr<InotifyApi> api = InotifyApi::system());
+    // How long shared() waits for another process that holds a store (default: not at all).
+    static void setLockWait(TremorStoreDirectory::LockWait lockWait);
     static std::string defaultStateDir();
-    // The process's service, started on first use. Fails (and logs) when the state cannot be
-    // opened, for example because another process holds it.
+    // The process's service, started on first use. Fails when the state cannot be opened, for
+    // example because another process holds it; reporting that is the caller's business.
     static Result<std::shared_ptr<TremorService>> shared();
     // The process's service when it is running; never starts one.
     static std::shared_ptr<TremorService> sharedIfRunning();
     // Shuts the process's service down; the next shared() starts a fresh one.
     static void resetForTesting();
 
-    // A service on `stateDir`: opens every store found there, watches the roots they remember
-    // and journals what changed while nothing was watching.
+    // A service on `stateDir`: opens every store found there (waiting for other processes as
+    // `lockWait` says) and forgets the remembered trees whose folder is gone (an info line
+    // each). It watches nothing until asked.
     static Result<std::shared_ptr<TremorService>> create(
         const std::string& stateDir, std::shared_ptr<InotifyApi> api = InotifyApi::system(),
-        size_t queueLimit = kDefaultQueueLimit);
+        size_t queueLimit = kDefaultQueueLimit, TremorStoreDirectory::LockWait lockWait = {});
     ~TremorService();
     TremorService(const TremorService&) = delete;
     TremorService& operator=(const TremorService&) = delete;
@@ -62,9 +71,21 @@ public:
     // Stops both threads after journaling what was read; later calls change nothing.
     void shutdown();
 
-    // Watches the directory tree at `path`, remembers it, and indexes it.
+    // Watches the directory tree at `path`, remembers it, and indexes it. A tree watched until
+    // the last run stopped goes on with its history and journals what changed meanwhile.
     Status watchTree(const std::string& path);
     bool isWatched(const std::string& path) const;
+    // Watches every tree that was watched until the last run stopped, as asking for each would
+    // (for a process that serves whatever earlier runs published). Returns the first failure;
+    // the other trees are watched all the same.
+    Status watchRemembered();
+    // Marks every remembered tree that this service does not watch as unwatched, and returns
+    // them: called when a run ends, so that the next run that asks for one reports the gap.
+    std::vector<std::string> retireUnwatched();
+    // Stops journaling the tree at `path` (exactly a remembered root), marks it forgotten and
+    // drops its index entries and document IDs, so that its identifiers no longer resolve. Its
+    // events stay in the journal. Fails with ENOENT when `path` is not remembered.
+    Result<TremorStore::Forgotten> forget(const std::string& path);
 
     // Returns once every event the kernel queued before the call has been journaled.
     void sync();
@@ -88,9 +109,11 @@ public:
 private:
     struct Volume {
         uint64_t fsid = 0;
-        // Read by the journaling thread while a watch on another thread may set it again.
+        // Read by the journaling thread while a watch on another thread may set it again; 0
+        // until a tree of the volume is watched.
         std::atomic<uint32_t> device{0};
         std::unique_ptr<TremorStore> store;
+        // Made (once, under volumesMutex_) when the device is known.
         std::unique_ptr<JournalWriter> writer;
     };
     struct Item {
@@ -102,13 +125,18 @@ private:
 
 public:
     TremorService(Private, std::string stateDir, std::unique_ptr<InotifyBackend> backend,
-                  size_t queueLimit);
+                  size_t queueLimit, TremorStoreDirectory::LockWait lockWait);
 
 private:
     Status openExistingStores();
+    // Forgets the remembered trees of `store` whose folder is gone.
+    static void pruneVanishedRoots(TremorStore& store);
     Result<Volume*> volumeFor(const std::string& path);
     Result<Volume*> openVolume(uint64_t fsid, uint32_t device);
-    Status watch(const std::string& path, bool journalDifferences);
+    Result<Volume*> addVolume(uint64_t fsid, std::unique_ptr<TremorStore> store);
+    Status watch(const std::string& path);
+    // The volumes that journal (their device is known), with their writers.
+    std::vector<std::pair<Volume*, JournalWriter*>> journalingVolumes() const;
     Volume* ownerOf(const std::string& path) const;
     std::vector<std::string> rootPaths(const Volume& volume) const;
     void enqueue(std::vector<FileChange> changes);
@@ -121,6 +149,7 @@ private:
     const std::string stateDir_;
     const std::unique_ptr<InotifyBackend> backend_;
     const size_t queueLimit_;
+    const TremorStoreDirectory::LockWait lockWait_;
     std::atomic<bool> indexReady_{false};
     std::atomic<bool> stopped_{false};
 

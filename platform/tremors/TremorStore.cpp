@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <unordered_set>
 
 #include "support/Log.h"
 
@@ -74,8 +75,9 @@ Result<std::string> randomUuid() {
 
 // ---- Opening ----
 
-Result<std::unique_ptr<TremorStore>> TremorStore::open(const std::string& stateDir, uint64_t fsid) {
-    auto dir = TremorStoreDirectory::acquire(stateDir, fsid);
+Result<std::unique_ptr<TremorStore>> TremorStore::open(
+    const std::string& stateDir, uint64_t fsid, const TremorStoreDirectory::LockWait& lockWait) {
+    auto dir = TremorStoreDirectory::acquire(stateDir, fsid, lockWait);
     if (!dir)
         return dir.error();
     std::unique_ptr<TremorStore> store(new TremorStore(std::move(dir).value()));
@@ -492,9 +494,95 @@ Status TremorStore::removeRoot(const std::string& path) {
     return roots_->remove(path);
 }
 
+bool TremorStore::resumeRoot(const std::string& path) {
+    std::lock_guard lock(mutex_);
+    return roots_->resume(path);
+}
+
+void TremorStore::releaseRoot(const std::string& path) {
+    std::lock_guard lock(mutex_);
+    roots_->release(path);
+}
+
+Result<std::vector<std::string>> TremorStore::retireRoots() {
+    std::lock_guard lock(mutex_);
+    return roots_->retire();
+}
+
+Result<TremorStore::Forgotten> TremorStore::forgetRoot(const std::string& rawPath) {
+    std::lock_guard lock(mutex_);
+    std::string path = WatchedRoots::normalised(rawPath);
+    auto forgotten = roots_->forget(path);
+    if (!forgotten)
+        return forgotten.error();
+    Forgotten outcome;
+    uint64_t top = forgotten.value().inode;
+    std::vector<Root> others = roots_->remembered();
+    for (const Root& other : others) {
+        if (other.path != kDocumentIdRoot && WatchedRoots::isAtOrBelow(path, other.path))
+            return outcome;  // the tree is still another root's
+    }
+    if (top == 0)
+        return outcome;  // nothing says where its entries start
+    // The tops of remembered roots inside it end the walk: what is below them is theirs.
+    std::vector<uint64_t> stops;
+    for (const Root& other : others) {
+        if (other.inode != 0 && WatchedRoots::isAtOrBelow(other.path, path))
+            stops.push_back(other.inode);
+    }
+    std::vector<uint64_t> gone;
+    std::unordered_set<uint64_t> seen(stops.begin(), stops.end());
+    std::vector<uint32_t> documents;
+    std::vector<uint64_t> stack{top};
+    while (!stack.empty()) {
+        uint64_t dir = stack.back();
+        stack.pop_back();
+        auto children = index_->children(dir);
+        if (!children)
+            return children.error();
+        for (const InodeRecord& child : children.value()) {
+            if (!seen.insert(child.inode).second)
+                continue;  // another root's, or a cycle left by lost events
+            gone.push_back(child.inode);
+            if (child.docID != 0)
+                documents.push_back(child.docID);
+            if (child.kind == InodeRecord::kDirectory)
+                stack.push_back(child.inode);
+        }
+    }
+    outcome.entries = gone.size();
+    gone.push_back(top);
+    auto topDocument = index_->documentIdForInode(top);
+    if (topDocument && topDocument.value())
+        documents.push_back(*topDocument.value());
+    Status status = transact([&]() -> Status {
+        if (Status removed = index_->remove(gone))
+            return removed;
+        for (uint32_t docID : documents) {
+            if (Status cleared = index_->clearDocumentId(docID))
+                return cleared;
+        }
+        return std::nullopt;
+    });
+    if (status)
+        return *status;
+    outcome.documents = documents.size();
+    return outcome;
+}
+
 std::vector<TremorStore::Root> TremorStore::roots() const {
     std::lock_guard lock(mutex_);
     return roots_->watched();
+}
+
+std::vector<TremorStore::Root> TremorStore::rememberedRoots() const {
+    std::lock_guard lock(mutex_);
+    return roots_->remembered();
+}
+
+bool TremorStore::knowsRoot(const std::string& path) const {
+    std::lock_guard lock(mutex_);
+    return roots_->knows(path);
 }
 
 // ---- Index of the watched trees and document IDs ----

@@ -50,7 +50,10 @@ public:
     // database, failing its check, unknown schema) is logged, moved aside and replaced by a new
     // store with a new UUID: anchors into the old history then fail the UUID check, which is
     // what must happen.
-    static Result<std::unique_ptr<TremorStore>> open(const std::string& stateDir, uint64_t fsid);
+    // Waits for another process that holds the store as `lockWait` says.
+    static Result<std::unique_ptr<TremorStore>> open(
+        const std::string& stateDir, uint64_t fsid,
+        const TremorStoreDirectory::LockWait& lockWait = {});
     ~TremorStore();
     TremorStore(const TremorStore&) = delete;
     TremorStore& operator=(const TremorStore&) = delete;
@@ -99,13 +102,38 @@ public:
 
     // ---- Roots ----
 
-    // Remembers that `path` is watched from event `sinceEventId` on. Adding a watched root again
-    // changes nothing but a given inode; adding a removed one starts its history anew.
+    // What forgetting a root dropped from the index.
+    struct Forgotten {
+        size_t entries = 0;    // index entries (files and folders)
+        size_t documents = 0;  // document IDs, which no longer resolve
+    };
+
+    // Remembers that `path` is watched from event `sinceEventId` on, by this process (live).
+    // Adding a watched root again changes nothing but a given inode; adding a removed,
+    // unwatched or forgotten one starts its history anew.
     Status addRoot(const std::string& path, uint64_t sinceEventId, uint64_t inode = 0);
     Status setRootInode(const std::string& path, uint64_t inode);
     // The root stops being watched; its events stay replayable.
     Status removeRoot(const std::string& path);
+    // A root that was watched until the last run stopped is watched again by this process,
+    // with its history going on. False when it is not such a root.
+    bool resumeRoot(const std::string& path);
+    // This process stopped watching the root (or never managed to).
+    void releaseRoot(const std::string& path);
+    // Marks every watched root that this process does not watch unwatched, and returns them:
+    // their history stops here, so a replay from before a later watch reports the gap.
+    Result<std::vector<std::string>> retireRoots();
+    // Marks the root forgotten and drops its tree from the index, with the document IDs of
+    // what it held, so that none of it answers an identifier any more; its events stay. A tree
+    // inside another remembered root keeps its entries (they are that root's too), and so do
+    // remembered roots inside it. Fails with ENOENT when `path` is not remembered.
+    Result<Forgotten> forgetRoot(const std::string& path);
+    // Watched roots (including "/.docid"): those of this process and those of the last run.
     std::vector<Root> roots() const;
+    // Every root not forgotten, watched or not.
+    std::vector<Root> rememberedRoots() const;
+    // Whether a root at `path` was ever added, forgotten or not.
+    bool knowsRoot(const std::string& path) const;
 
     // ---- Index of the watched trees ----
 

@@ -6,10 +6,12 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <cinttypes>
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <thread>
 
 #include "platform/FileSystem.h"
 #include "support/Log.h"
@@ -43,7 +45,7 @@ int makeDirectories(const std::string& path) {
 }  // namespace
 
 Result<std::unique_ptr<TremorStoreDirectory>> TremorStoreDirectory::acquire(
-    const std::string& stateDir, uint64_t fsid) {
+    const std::string& stateDir, uint64_t fsid, const LockWait& wait) {
     char name[17];
     std::snprintf(name, sizeof name, "%016" PRIx64, fsid);
     std::string path = stateDir + "/" + name;
@@ -59,21 +61,76 @@ Result<std::unique_ptr<TremorStoreDirectory>> TremorStoreDirectory::acquire(
                                  " is not writable: " + std::strerror(code));
     }
 
-    std::string lockPath = path + "/lock";
+    std::string lockPath = path + "/" + kLockName;
     int fd = fs.open(lockPath, O_RDWR | O_CREAT | O_CLOEXEC, 0600);
     if (fd < 0) {
         int code = errno;
         return failure(code, "Cannot open the lock file " + lockPath + ": " + std::strerror(code));
     }
-    if (::flock(fd, LOCK_EX | LOCK_NB) != 0) {
+    using Clock = std::chrono::steady_clock;
+    const auto started = Clock::now();
+    const auto deadline =
+        started + std::chrono::duration_cast<Clock::duration>(
+                      std::chrono::duration<double>(wait.seconds > 0 ? wait.seconds : 0));
+    bool announced = false;
+    while (::flock(fd, LOCK_EX | LOCK_NB) != 0) {
         int code = errno;
-        fs.close(fd);
-        if (code == EWOULDBLOCK) {
-            return failure(code, "Another Tamber process is using the state directory " + path);
+        if (code == EINTR)
+            continue;
+        if (code != EWOULDBLOCK) {
+            fs.close(fd);
+            return failure(code, "Cannot lock " + lockPath + ": " + std::strerror(code));
         }
-        return failure(code, "Cannot lock " + lockPath + ": " + std::strerror(code));
+        auto now = Clock::now();
+        pid_t holder = holderOf(path).value_or(0);
+        if (now >= deadline) {
+            fs.close(fd);
+            // An expected condition, not this process's fault: reported once, by the caller.
+            return Error(kPosixErrorDomain, code, {{"description", heldMessage(path, holder)}});
+        }
+        // The holder writes its ID just after it takes the lock: give it a moment before
+        // saying that it is unknown.
+        if (!announced && (holder != 0 || now - started >= std::chrono::milliseconds(200))) {
+            announced = true;
+            if (wait.waiting) {
+                wait.waiting(holder, path);
+            } else {
+                logInfo("waiting for " +
+                        (holder ? "Tamber process " + std::to_string(holder)
+                                : std::string("another Tamber process")) +
+                        " to release the state directory " + path);
+            }
+        }
+        std::this_thread::sleep_for(
+            std::min<Clock::duration>(std::chrono::milliseconds(20), deadline - now));
     }
+    // Who holds it, for the others; a longer ID left by an earlier holder ends after the line.
+    std::string pid = std::to_string(::getpid()) + "\n";
+    if (fs.write(fd, pid.data(), pid.size()) != static_cast<ssize_t>(pid.size()))
+        logError("Cannot write the lock file " + lockPath + ": " + std::strerror(errno));
     return std::unique_ptr<TremorStoreDirectory>(new TremorStoreDirectory(path, fd));
+}
+
+std::optional<pid_t> TremorStoreDirectory::holderOf(const std::string& directory) {
+    FileSystem& fs = FileSystem::current();
+    int fd = fs.open(directory + "/" + kLockName, O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+    if (fd < 0)
+        return std::nullopt;
+    char text[32] = {};
+    ssize_t n = fs.read(fd, text, sizeof text - 1);
+    fs.close(fd);
+    pid_t pid = 0;
+    for (ssize_t i = 0; i < n && text[i] >= '0' && text[i] <= '9' && pid < 100000000; ++i)
+        pid = pid * 10 + (text[i] - '0');
+    if (pid <= 0)
+        return std::nullopt;
+    return pid;
+}
+
+std::string TremorStoreDirectory::heldMessage(const std::string& directory, pid_t holder) {
+    return "the state directory " + directory + " is held by " +
+           (holder ? "Tamber process " + std::to_string(holder)
+                   : std::string("another Tamber process"));
 }
 
 TremorStoreDirectory::~TremorStoreDirectory() {

@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "platform/tremors/TremorService.h"
+#include "support/Log.h"
 
 namespace tamber {
 
@@ -10,8 +11,10 @@ namespace {
 
 TremorStreamRef createStream(TremorStream::Options options) {
     auto service = TremorService::shared();
-    if (!service.ok())
+    if (!service.ok()) {
+        logError("The event journal could not start: " + service.error().description());
         return nullptr;
+    }
     auto stream = TremorStream::create(service.value(), std::move(options));
     if (!stream)
         return nullptr;

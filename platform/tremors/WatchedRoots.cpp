@@ -1,6 +1,7 @@
 #include "platform/tremors/WatchedRoots.h"
 
 #include <algorithm>
+#include <cerrno>
 
 namespace tamber {
 
@@ -44,7 +45,10 @@ Status WatchedRoots::load() {
         Row row;
         row.root = {fromSqlite(stmt->columnInt64(0)), stmt->columnText(1),
                     fromSqlite(stmt->columnInt64(2)), fromSqlite(stmt->columnInt64(3))};
-        row.watched = stmt->columnInt64(4) != 0;
+        int64_t state = stmt->columnInt64(4);
+        row.state = state == int64_t(State::Watched)     ? State::Watched
+                    : state == int64_t(State::Forgotten) ? State::Forgotten
+                                                         : State::Unwatched;
         rows_.push_back(std::move(row));
     }
     if (!r)
@@ -69,7 +73,7 @@ Status WatchedRoots::write(const Row& row) {
         .bind(2, row.root.path)
         .bind(3, toSqlite(row.root.sinceEventId))
         .bind(4, toSqlite(row.root.inode))
-        .bind(5, int64_t{row.watched})
+        .bind(5, static_cast<int64_t>(row.state))
         .run();
 }
 
@@ -84,7 +88,8 @@ Status WatchedRoots::add(const std::string& rawPath, uint64_t sinceEventId, uint
         uint64_t id = 1;
         for (const Row& row : rows_) id = std::max(id, row.root.id + 1);
         updated.root = {id, path, sinceEventId, inode};
-    } else if (existing->watched) {
+    } else if (existing->watched()) {
+        existing->live = true;
         if (inode == 0 || inode == existing->root.inode)
             return std::nullopt;
         updated = *existing;
@@ -94,8 +99,9 @@ Status WatchedRoots::add(const std::string& rawPath, uint64_t sinceEventId, uint
         updated = *existing;
         updated.root.sinceEventId = sinceEventId;
         updated.root.inode = inode;
-        updated.watched = true;
+        updated.state = State::Watched;
     }
+    updated.live = true;
     if (Status status = write(updated))
         return status;
     if (existing) {
@@ -108,7 +114,7 @@ Status WatchedRoots::add(const std::string& rawPath, uint64_t sinceEventId, uint
 
 Status WatchedRoots::setInode(const std::string& path, uint64_t inode) {
     Row* row = find(normalised(path));
-    if (!row || !row->watched)
+    if (!row || !row->watched())
         return Error::invalidParameter("root", path);
     Row updated = *row;
     updated.root.inode = inode;
@@ -120,10 +126,11 @@ Status WatchedRoots::setInode(const std::string& path, uint64_t inode) {
 
 Status WatchedRoots::remove(const std::string& path) {
     Row* row = find(normalised(path));
-    if (!row || !row->watched)
+    if (!row || !row->watched())
         return std::nullopt;
     Row updated = *row;
-    updated.watched = false;
+    updated.state = State::Unwatched;
+    updated.live = false;
     updated.root.inode = 0;
     if (Status status = write(updated))
         return status;
@@ -131,10 +138,70 @@ Status WatchedRoots::remove(const std::string& path) {
     return std::nullopt;
 }
 
+bool WatchedRoots::resume(const std::string& path) {
+    Row* row = find(normalised(path));
+    if (!row || !row->watched())
+        return false;
+    row->live = true;
+    return true;
+}
+
+void WatchedRoots::release(const std::string& path) {
+    if (Row* row = find(normalised(path)))
+        row->live = false;
+}
+
+Result<std::vector<std::string>> WatchedRoots::retire() {
+    std::vector<std::string> retired;
+    for (Row& row : rows_) {
+        if (!row.watched() || row.live || row.root.path == "/.docid")
+            continue;
+        // The inode stays: a later forget still finds the tree's index entries from it.
+        Row updated = row;
+        updated.state = State::Unwatched;
+        if (Status status = write(updated))
+            return *status;
+        row = std::move(updated);
+        retired.push_back(row.root.path);
+    }
+    return retired;
+}
+
+Result<WatchedRoots::Root> WatchedRoots::forget(const std::string& path) {
+    Row* row = find(normalised(path));
+    if (!row || row->state == State::Forgotten)
+        return Error(kPosixErrorDomain, ENOENT,
+                     {{"description", path + " is not a remembered tree of the event journal"}});
+    Row updated = *row;
+    updated.state = State::Forgotten;
+    updated.live = false;
+    updated.root.inode = 0;
+    if (Status status = write(updated))
+        return *status;
+    Root before = row->root;
+    *row = std::move(updated);
+    return before;
+}
+
 std::vector<WatchedRoots::Root> WatchedRoots::watched() const {
     std::vector<Root> result;
     for (const Row& row : rows_) {
-        if (row.watched)
+        if (row.watched())
+            result.push_back(row.root);
+    }
+    return result;
+}
+
+bool WatchedRoots::knows(const std::string& path) const {
+    std::string wanted = normalised(path);
+    return std::any_of(rows_.begin(), rows_.end(),
+                       [&](const Row& row) { return row.root.path == wanted; });
+}
+
+std::vector<WatchedRoots::Root> WatchedRoots::remembered() const {
+    std::vector<Root> result;
+    for (const Row& row : rows_) {
+        if (row.state != State::Forgotten)
             result.push_back(row.root);
     }
     return result;
@@ -143,7 +210,7 @@ std::vector<WatchedRoots::Root> WatchedRoots::watched() const {
 uint64_t WatchedRoots::idFor(std::string_view path) const {
     const Row* best = nullptr;
     for (const Row& row : rows_) {
-        if (row.watched && isAtOrBelow(path, row.root.path) &&
+        if (row.watched() && isAtOrBelow(path, row.root.path) &&
             (!best || row.root.path.size() > best->root.path.size())) {
             best = &row;
         }
@@ -172,7 +239,7 @@ std::vector<uint64_t> WatchedRoots::mayHoldEventsBelow(
 std::optional<uint64_t> WatchedRoots::watchedSince(const std::string& path) const {
     std::optional<uint64_t> since;
     for (const Row& row : rows_) {
-        if (row.watched && isAtOrBelow(path, row.root.path)) {
+        if (row.watched() && isAtOrBelow(path, row.root.path)) {
             since = std::min(since.value_or(row.root.sinceEventId), row.root.sinceEventId);
         }
     }
@@ -181,7 +248,7 @@ std::optional<uint64_t> WatchedRoots::watchedSince(const std::string& path) cons
 
 const std::string* WatchedRoots::pathOfRootInode(uint64_t inode) const {
     for (const Row& row : rows_) {
-        if (row.watched && row.root.inode == inode && inode != 0)
+        if (row.watched() && row.live && row.root.inode == inode && inode != 0)
             return &row.root.path;
     }
     return nullptr;
