@@ -118,12 +118,14 @@ protected:
                 base64Encode(PlistNode::array().toBinary().value())};
     }
     static void expectExpiredOrRefused(const json& answer, const std::string& what) {
-        EXPECT_EQ(answer["status"], 1) << what << ": " << answer;
         ASSERT_TRUE(answer.contains("error")) << what << ": " << answer;
-        // Refused as input before the provider sees it, or an anchor that makes the browser
-        // start over.
+        // Refused as input (a usage error) before the provider sees it, or an anchor that
+        // makes the browser start over.
         std::string message = answer["error"].value("message", "");
-        if (message.find("is not base64") == std::string::npos) {
+        if (message.find("is not base64") != std::string::npos) {
+            EXPECT_EQ(answer["status"], 2) << what << ": " << answer;
+        } else {
+            EXPECT_EQ(answer["status"], 1) << what << ": " << answer;
             EXPECT_EQ(answer["error"]["domain"], "HostPorterErrorDomain") << what << ": " << answer;
             EXPECT_EQ(answer["error"]["code"], -1002) << what << ": " << answer;
         }
@@ -313,7 +315,8 @@ TEST_F(HostileInputTest, MalformedIdentifiersAreRefusedAndNeverNameAnotherItem) 
         std::string shown = identifier.substr(0, 60);
         for (const char* verb : {"item", "path", "ls"}) {
             json answer = tamberJson({verb, identifier});
-            EXPECT_EQ(answer["status"], 1) << verb << " \"" << shown << "\": " << answer;
+            // No such item: a malformed identifier names nothing.
+            EXPECT_EQ(answer["status"], 3) << verb << " \"" << shown << "\": " << answer;
             EXPECT_TRUE(answer.contains("error")) << verb << " \"" << shown << "\": " << answer;
         }
     }

@@ -152,6 +152,8 @@ TEST(DocumentIndexTest, OlderDatabasesAreUpgradedInPlace) {
         EXPECT_EQ(store->uuid(), uuid) << "upgraded, not replaced";
         EXPECT_EQ(store->lastEventId(), 1u);
         EXPECT_EQ(store->inodeForDocumentId(doc), 2u);
+        // A reopened store answers paths only for the trees this process watches again.
+        ASSERT_TRUE(store->resumeRoot("/watched"));
         EXPECT_EQ(store->pathForInode(2), "/watched/a.txt");
         auto record = store->inode(2);
         ASSERT_TRUE(record);
