@@ -8,6 +8,7 @@
 #include "applibraries/SharedAppLibraryLookup.h"
 #include "applibraries/TBPAppLibraryManager.h"
 #include "host/HostPorterManager.h"
+#include "host/StagingCopies.h"
 #include "platform/FileContents.h"
 #include "platform/tremors/TremorService.h"
 #include "support/Log.h"
@@ -70,6 +71,7 @@ Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
         if (auto error = service.value()->watchTree(root.path()))
             logError("can't watch app library " + root.path() + "; " + error->description());
     }
+    StagingCopies::sweepStale();  // copies left by imports that were killed part-way
     porter_ = porter;
     return porter_;
 }

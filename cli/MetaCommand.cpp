@@ -4,7 +4,9 @@
 #include <ctime>
 #include <ostream>
 
+#include "applibraries/SharedAppLibraryLookup.h"
 #include "cli/JsonValues.h"
+#include "host/PublishedTrees.h"
 #include "platform/objects/Number.h"
 
 namespace tamber {
@@ -118,6 +120,11 @@ Status MetaCommand::applyChanges(const Url& url) {
 
 int MetaCommand::run(CliContext& context) {
     Url url = Url::fileURLWithPath(path_);
+    // The app libraries are published trees too, even when the provider is not started.
+    if (!AppLibraryLookup::current())
+        SharedAppLibraryLookup::install();
+    if (auto outside = PublishedTrees::check(url))
+        return context.fail(*outside, json_);
     auto exists = url.resourceValue(ResourceKeys::kFileID);
     if (!exists.ok()) {
         const Error& e = exists.error();
