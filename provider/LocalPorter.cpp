@@ -171,7 +171,7 @@ Result<HostPorterItemRef> LocalPorter::itemForIdentifier(
 
 Result<LocalPorter::LocalItemRef> LocalPorter::itemForURL(const Url& url) {
     if (auto outside = PublishedTrees::check(url)) {
-        logError("\"" + url.path() + "\" is " + PublishedTrees::kOutsideMessage);
+        logDebug([&] { return "\"" + url.path() + "\" is " + PublishedTrees::kOutsideMessage; });
         return *outside;
     }
     auto identifier = identifierForURLLogged(url);

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -8,6 +9,7 @@
 #include <fstream>
 #include <nlohmann/json.hpp>
 
+#include "host/StagingCopies.h"
 #include "platform/tremors/TremorService.h"
 #include "tests/common/AppLibraryTest.h"
 #include "tests/common/CliRunner.h"
@@ -33,6 +35,7 @@ protected:
         AppRegistry::setDefaultRegistry(nullptr);
         TremorService::resetForTesting();
         TremorService::configure(state.path());
+        StagingCopies::setLedgerDirectoryForTesting(state / "ledger");
         storage = dir.makeDir("Documents");
         inbox = dir.makeDir("Documents/Shelf");
         elsewhere = dir.makeDir("elsewhere");
@@ -46,6 +49,7 @@ protected:
                           dir.path() + "/container\nX-Tamber-Supports-Document-Browser=true\n");
     }
     void TearDown() override {
+        StagingCopies::setLedgerDirectoryForTesting("");
         TremorService::resetForTesting();
         if (previousDataDirs)
             setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
@@ -165,6 +169,32 @@ TEST_F(BoundaryCommandsTest, ALinkedTrashReceivesNothing) {
     EXPECT_EQ(error["message"], kOutside);
     EXPECT_TRUE(fs::exists(file));
     EXPECT_TRUE(elsewhereIsEmpty());
+}
+
+TEST_F(BoundaryCommandsTest, ALinkedTrashIsNeitherReadNorWrittenByThePurge) {
+    fs::create_directory_symlink(elsewhere, library + "/.Trash");
+    std::string undated = dir.writeFile("elsewhere/old.txt", "o");
+    EXPECT_EQ(tamberJson({"purge-trash", "--older-than", "1s"}), (json{{"removed", 0}}));
+    EXPECT_TRUE(fs::exists(undated));
+    // An undated item in a real trash would have been stamped with today's date.
+    EXPECT_EQ(::listxattr(undated.c_str(), nullptr, 0), 0);
+}
+
+TEST_F(BoundaryCommandsTest, AVerbSweepsTheStagingCopiesOfAKilledImport) {
+    pid_t child = ::fork();
+    if (child == 0)
+        ::_exit(0);
+    ASSERT_GT(child, 0);
+    ::waitpid(child, nullptr, 0);
+    std::string staged = dir.makeDir("Documents/Shelf/.tamber-import-" + std::to_string(child) +
+                                     "-0123456789abcdef");
+    dir.writeFile(
+        "Documents/Shelf/.tamber-import-" + std::to_string(child) + "-0123456789abcdef/half.txt",
+        "h");
+    StagingCopies::record(staged);
+    tamberJson({"item", inbox});
+    EXPECT_FALSE(fs::exists(staged));
+    EXPECT_TRUE(fs::is_empty(state / "ledger"));
 }
 
 TEST_F(BoundaryCommandsTest, PathAnswersTheContainersAndRefusesOutside) {

@@ -384,8 +384,8 @@ TEST_F(ItemTest, IdentifiersNeverNameAnythingOutsideThePublishedTrees) {
     for (const std::string& path : {forgotten, behind}) {
         ScopedLogCapture log;
         EXPECT_FALSE(urlOf(fid(path))) << path;
-        EXPECT_FALSE(TBFileObjectIdentifier::fileURLWithFileIdentifier(
-            std::stoull(fid(path).substr(4))))
+        EXPECT_FALSE(
+            TBFileObjectIdentifier::fileURLWithFileIdentifier(std::stoull(fid(path).substr(4))))
             << path;
     }
     // Nor is an identifier computed for them; the link itself is an item.
