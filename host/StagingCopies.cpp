@@ -61,9 +61,10 @@ std::string StagingCopies::ledgerDirectory() {
     return std::string(home && *home ? home : "") + "/.local/state/tamber/staging";
 }
 
-void StagingCopies::setLedgerDirectoryForTesting(std::string path) {
+std::string StagingCopies::setLedgerDirectoryForTesting(std::string path) {
     std::lock_guard lock(overrideMutex());
-    ledgerOverride() = std::move(path);
+    std::swap(ledgerOverride(), path);
+    return path;
 }
 
 std::string StagingCopies::makeName() {

@@ -17,8 +17,9 @@ public:
 
     // The ledger folder: $XDG_STATE_HOME/tamber/staging, or ~/.local/state/tamber/staging.
     static std::string ledgerDirectory();
-    // Tests point the ledger elsewhere; an empty path restores the default.
-    static void setLedgerDirectoryForTesting(std::string path);
+    // Tests point the ledger elsewhere; an empty path restores the default. Returns the
+    // previous setting.
+    static std::string setLedgerDirectoryForTesting(std::string path);
 
     // A fresh staging name carrying this process's id.
     static std::string makeName();

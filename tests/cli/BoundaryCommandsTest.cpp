@@ -35,7 +35,7 @@ protected:
         AppRegistry::setDefaultRegistry(nullptr);
         TremorService::resetForTesting();
         TremorService::configure(state.path());
-        StagingCopies::setLedgerDirectoryForTesting(state / "ledger");
+        previousLedger_ = StagingCopies::setLedgerDirectoryForTesting(state / "ledger");
         storage = dir.makeDir("Documents");
         inbox = dir.makeDir("Documents/Shelf");
         elsewhere = dir.makeDir("elsewhere");
@@ -49,7 +49,7 @@ protected:
                           dir.path() + "/container\nX-Tamber-Supports-Document-Browser=true\n");
     }
     void TearDown() override {
-        StagingCopies::setLedgerDirectoryForTesting("");
+        StagingCopies::setLedgerDirectoryForTesting(previousLedger_);
         TremorService::resetForTesting();
         if (previousDataDirs)
             setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
@@ -87,6 +87,7 @@ protected:
 
     TempDir state, systemData;
     std::optional<std::string> previousDataDirs;
+    std::string previousLedger_;
     std::string storage, inbox, elsewhere, library;
 };
 

@@ -64,10 +64,10 @@ protected:
             std::make_shared<RecordingHostPorterManager>(at(storage)));
         previousRoots_ = PublishedTrees::setAppLibraryRootsSource(
             [this] { return std::vector<Url>{at(library)}; });
-        StagingCopies::setLedgerDirectoryForTesting(dir / "ledger");
+        previousLedger_ = StagingCopies::setLedgerDirectoryForTesting(dir / "ledger");
     }
     void TearDown() override {
-        StagingCopies::setLedgerDirectoryForTesting("");
+        StagingCopies::setLedgerDirectoryForTesting(previousLedger_);
         PublishedTrees::setAppLibraryRootsSource(previousRoots_);
         HostPorterManager::installDefaultManager(previous_);
     }
@@ -82,6 +82,7 @@ protected:
 private:
     std::shared_ptr<HostPorterManager> previous_;
     PublishedTrees::RootsSource previousRoots_;
+    std::string previousLedger_;
 };
 
 TEST_F(PublishedTreesTest, InsideMeansAtOrBelowARootWithoutALinkOnTheWay) {
