@@ -1,5 +1,7 @@
 #include "enumeration/LocalFileEnumerator.h"
 #include "enumeration/LocalRootEnumerator.h"
+#include "host/PublishedTrees.h"
+#include "platform/FileSystem.h"
 #include "provider/LocalPorter.h"
 #include "support/LogSection.h"
 
@@ -19,6 +21,11 @@ Result<HostPorterEnumeratorRef> LocalPorter::enumeratorForContainerItemIdentifie
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok())
             return url.error();
+        // A link is an item, not a container: listing it would read what lies behind it.
+        if (auto opened = PublishedTrees::openFolder(url.value(), O_PATH); opened.ok())
+            FileSystem::current().close(opened.value());
+        else if (PublishedTrees::isOutsideError(opened.error()))
+            return opened.error();
         auto enumerator = LocalFileEnumerator::initWithContainer(identifier, {url.value()});
         enumerator->start();
         return HostPorterEnumeratorRef(enumerator);

@@ -102,7 +102,8 @@ TEST_F(BoundaryCommandsTest, NothingIsCreatedOrShownThroughALinkToOutside) {
     EXPECT_EQ(errorOf({"item", esc + "/NEW"})["message"], kOutside);
     EXPECT_EQ(errorOf({"id", esc + "/NEW"})["message"], kOutside);
     EXPECT_EQ(errorOf({"ls", esc + "/NEW"})["message"], kOutside);
-    // The link itself is an item of the inbox.
+    // The link itself is an item of the inbox, but not a container to list.
+    EXPECT_EQ(errorOf({"ls", esc})["message"], kOutside);
     json link = tamberJson({"item", esc});
     EXPECT_EQ(link["filename"], "esc");
     EXPECT_EQ(link["path"], esc);
