@@ -4,6 +4,8 @@
 #include <ctime>
 #include <ostream>
 
+#include "applibraries/LocalAppLibraryCache.h"
+#include "applibraries/LocalAppLibraryManager.h"
 #include "applibraries/SharedAppLibraryLookup.h"
 #include "cli/JsonValues.h"
 #include "host/PublishedTrees.h"
@@ -120,9 +122,13 @@ Status MetaCommand::applyChanges(const Url& url) {
 
 int MetaCommand::run(CliContext& context) {
     Url url = Url::fileURLWithPath(path_);
-    // The app libraries are published trees too, even when the provider is not started.
+    // The app libraries are published trees too, even when the provider is not started: take
+    // the libraries last found (the main cache) without asking the registry again.
     if (!AppLibraryLookup::current())
         SharedAppLibraryLookup::install();
+    auto mainCache = LocalAppLibraryCache::mainCache();
+    mainCache->queue().sync([&] { mainCache->load(); });
+    LocalAppLibraryManager::shared()->upgradeFromMainCache(nullptr, false);
     if (auto outside = PublishedTrees::check(url))
         return context.fail(*outside, json_);
     auto exists = url.resourceValue(ResourceKeys::kFileID);

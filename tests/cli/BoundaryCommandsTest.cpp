@@ -162,6 +162,10 @@ TEST_F(BoundaryCommandsTest, MetaRefusesPathsOutsideAndWritesNothing) {
 
     std::string inside = dir.writeFile("Documents/Shelf/in.txt", "i");
     EXPECT_EQ(tamberJson({"meta", inside, "--set-rank", "2"})["favoriteRank"], 2);
+    // An app library is published too.
+    tamberJson({"apps"});
+    std::string inLibrary = dir.writeFile("container/Documents/lib.txt", "l");
+    EXPECT_EQ(tamberJson({"meta", inLibrary, "--set-rank", "4"})["favoriteRank"], 4);
 }
 
 TEST_F(BoundaryCommandsTest, ALinkedTrashReceivesNothing) {
