@@ -496,8 +496,6 @@ void pt_trashUnderFolder(const Url& url, const Url& trashFolder, const UrlComple
 }
 
 Status pt_ensureTrashFolder(const Url& trashFolder) {
-    if (auto outside = PublishedTrees::check(trashFolder))
-        return outside;
     auto parent = PublishedTrees::openParent(trashFolder, O_PATH);
     if (!parent.ok())
         return parent.error();

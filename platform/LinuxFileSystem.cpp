@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <atomic>
 #include <cerrno>
 #include <cstddef>
 #include <cstdint>
@@ -94,16 +93,13 @@ bool isLinkAt(int dirfd, const std::string& name) {
     return ::fstatat(dirfd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISLNK(st.st_mode);
 }
 
-// Whether openat2 answered ENOSYS once: then the walk serves every later call.
-std::atomic<bool> openat2Missing{false};
-
 }  // namespace
 
 int LinuxFileSystem::openBeneath(int dirfd, const std::string& path, int flags, mode_t mode) {
     auto components = beneathComponents(path);
     if (!components)
         return -1;
-    if (resolution_ == BeneathResolution::Walk || openat2Missing.load())
+    if (resolution_ == BeneathResolution::Walk || openat2Missing_.load())
         return walkBeneath(dirfd, path, flags, mode);
     struct open_how how {};
     how.flags = static_cast<uint64_t>(flags | O_CLOEXEC);
@@ -112,16 +108,20 @@ int LinuxFileSystem::openBeneath(int dirfd, const std::string& path, int flags, 
     std::string relative = components->empty() ? std::string(".") : path;
     // EAGAIN: a rename elsewhere raced the lookup; the kernel asks to try again.
     for (int attempt = 0;; ++attempt) {
-        long fd = ::syscall(SYS_openat2, dirfd, relative.c_str(), &how, sizeof how);
+        long fd = openat2(dirfd, relative.c_str(), &how, sizeof how);
         if (fd >= 0)
             return static_cast<int>(fd);
         if (errno == ENOSYS) {
-            openat2Missing.store(true);
+            openat2Missing_.store(true);
             return walkBeneath(dirfd, path, flags, mode);
         }
         if (errno != EAGAIN || attempt == 16)
             return -1;
     }
+}
+
+long LinuxFileSystem::openat2(int dirfd, const char* path, void* how, size_t size) {
+    return ::syscall(SYS_openat2, dirfd, path, how, size);
 }
 
 int LinuxFileSystem::walkBeneath(int dirfd, const std::string& path, int flags, mode_t mode) {

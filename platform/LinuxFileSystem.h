@@ -1,5 +1,7 @@
 #pragma once
 
+#include <atomic>
+
 #include "platform/FileSystem.h"
 
 namespace tamber {
@@ -40,10 +42,16 @@ public:
     ssize_t readlinkat(int dirfd, const std::string& name, char* buffer, size_t size) override;
     int symlinkat(const std::string& target, int newdirfd, const std::string& name) override;
 
+protected:
+    // The openat2(2) system call with its `struct open_how`; tests play a kernel without it.
+    virtual long openat2(int dirfd, const char* path, void* how, size_t size);
+
 private:
     int walkBeneath(int dirfd, const std::string& path, int flags, mode_t mode);
 
     BeneathResolution resolution_;
+    // Set once openat2 answered ENOSYS: the walk serves every later call.
+    std::atomic<bool> openat2Missing_{false};
 };
 
 }  // namespace tamber

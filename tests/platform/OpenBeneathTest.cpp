@@ -111,6 +111,32 @@ INSTANTIATE_TEST_SUITE_P(Resolutions, OpenBeneathTest,
                              return info.param == Resolution::Openat2 ? "Openat2" : "Walk";
                          });
 
+// A kernel without openat2: the first call finds out and walks, later calls walk at once.
+TEST(OpenBeneathFallbackTest, AKernelWithoutOpenat2GetsTheWalk) {
+    struct OldKernel : LinuxFileSystem {
+        int asked = 0;
+        long openat2(int, const char*, void*, size_t) override {
+            ++asked;
+            errno = ENOSYS;
+            return -1;
+        }
+    } old;
+    testing::TempDir dir;
+    dir.writeFile("root/a/file.txt", "x");
+    fs::create_directory_symlink(dir / "root/a", dir / "root/link");
+    int root = ::open((dir / "root").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC);
+    ASSERT_GE(root, 0);
+    int fd = old.openBeneath(root, "a/file.txt", O_RDONLY, 0);
+    EXPECT_GE(fd, 0) << std::strerror(errno);
+    ::close(fd);
+    EXPECT_EQ(old.openBeneath(root, "link/file.txt", O_RDONLY, 0), -1);
+    EXPECT_EQ(errno, ELOOP);
+    EXPECT_EQ(old.openBeneath(root, "../root", O_PATH, 0), -1);
+    EXPECT_EQ(errno, EXDEV);
+    EXPECT_EQ(old.asked, 1);
+    ::close(root);
+}
+
 TEST(OpenBeneathFaultTest, InjectedFailuresAreCountedAndMatchedByPath) {
     testing::TempDir dir;
     dir.makeDir("root/kept");
