@@ -84,11 +84,10 @@ bool pt_isFolder(const Url& url) {
 
 Result<uint64_t> pt_directorySizeWithError(const Url& url) {
     FileSystem& fs = FileSystem::current();
-    if (auto outside = PublishedTrees::check(url))
-        return *outside;
-    int root = fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-    if (root < 0)
-        return Error::errorWithPOSIXCode(errno);
+    auto opened = PublishedTrees::openFolder(url, O_RDONLY);
+    if (!opened.ok())
+        return opened.error();
+    int root = opened.value();
 
     uint64_t total = 0;
     std::vector<int> pending{root};  // descriptors still to read; depth-first, bounded by depth
@@ -158,6 +157,7 @@ bool pt_withReadWriteAccess(const Url& url, const std::function<bool(int fd)>& b
     return ok;
 }
 
+// ---------------------------------------------------------------------------------------------
 // File operations
 
 namespace {

@@ -21,7 +21,8 @@ UrlRelationship pt_relationshipToItemAtURL(const Url& url, const Url& other);
 // A directory that is not a package.
 bool pt_isFolder(const Url& url);
 
-// The summed size of the regular files below a directory (symbolic links not followed).
+// The summed size of the regular files below a directory (symbolic links not followed). The
+// directory is opened inside the published trees only.
 Result<uint64_t> pt_directorySizeWithError(const Url& url);
 
 // Opens the item for attribute writes (read-only, never through a symbolic link, directories
