@@ -285,58 +285,54 @@ Result<Url> moveItem(const Url& url, const Url& folder, const std::optional<std:
     return folder.appendingPathComponent(*placed);
 }
 
-// Reserves a hidden staging name for a copy in progress: `make` creates the item under the name
-// it is given (failing with EEXIST when the name is taken).
-Result<std::string> reserveTemporaryName(const std::function<int(const std::string&)>& make) {
+// Reserves a hidden staging name in `folder` for a copy in progress: `make` creates the item
+// under the name it is given (failing with EEXIST when the name is taken). The name is recorded
+// in the staging ledger before the item exists, so that no kill leaves an unrecorded copy.
+Result<std::string> reserveTemporaryName(const Url& folder,
+                                         const std::function<int(const std::string&)>& make) {
     for (int attempt = 0; attempt < 100; ++attempt) {
         std::string name = StagingCopies::makeName();
+        std::string path = folder.appendingPathComponent(name).path();
+        StagingCopies::record(path);
         if (make(name) == 0)
             return name;
-        if (errno != EEXIST)
-            return lastError();
+        int error = errno;
+        StagingCopies::forget(path);
+        if (error != EEXIST)
+            return Error::posix(error);
     }
     return Error::posix(EEXIST);
 }
 
-// Makes the copy of the item under a staging name in `toDir` (recorded as `folder`'s child in
-// the staging ledger for as long as it exists); returns that name.
+// Makes the copy of the item under a staging name in `toDir` (the open `folder`), recorded in
+// the staging ledger until the caller forgets it; returns that name.
 Result<std::string> copyToTemporary(int fromDir, const std::string& from, const ItemType& type,
                                     int toDir, const Url& folder) {
     FileSystem& fs = FileSystem::current();
     Result<std::string> temporary = Error::posix(ENOTSUP);
     Status filled;
-    // Recorded before the copy is filled, so that a kill part-way leaves a record to sweep.
-    auto made = [&](const std::string& name) {
-        StagingCopies::record(folder.appendingPathComponent(name).path());
-    };
     if (S_ISREG(type.mode)) {
         int out = -1;
-        temporary = reserveTemporaryName([&](const std::string& name) {
+        temporary = reserveTemporaryName(folder, [&](const std::string& name) {
             out = fs.openat(toDir, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW,
                             copyMode(type.mode));
             return out < 0 ? -1 : 0;
         });
         ScopedFd closer(out);
-        if (temporary.ok()) {
-            made(*temporary);
+        if (temporary.ok())
             filled = copyFileInto(fromDir, from, out);
-        }
     } else if (S_ISDIR(type.mode)) {
-        temporary = reserveTemporaryName([&](const std::string& name) {
+        temporary = reserveTemporaryName(folder, [&](const std::string& name) {
             return fs.mkdirat(toDir, name, copyMode(type.mode) | S_IRWXU);
         });
-        if (temporary.ok()) {
-            made(*temporary);
+        if (temporary.ok())
             filled = copyFolderInto(fromDir, from, toDir, *temporary);
-        }
     } else if (S_ISLNK(type.mode)) {
         auto target = readLink(fromDir, from);
         if (!target.ok())
             return target.error();
         temporary = reserveTemporaryName(
-            [&](const std::string& name) { return fs.symlinkat(*target, toDir, name); });
-        if (temporary.ok())
-            made(*temporary);
+            folder, [&](const std::string& name) { return fs.symlinkat(*target, toDir, name); });
     }
     if (temporary.ok() && filled) {
         removeItem(toDir, *temporary);
