@@ -10,6 +10,7 @@
 #include "applibraries/TBPAppLibraryManager.h"
 #include "cli/JsonValues.h"
 #include "host/HostPorterManager.h"
+#include "host/StagingCopies.h"
 #include "platform/FileContents.h"
 #include "platform/tremors/TremorService.h"
 #include "provider/LocalPorterError.h"
@@ -104,6 +105,7 @@ Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
         if (auto error = service.value()->watchTree(root.path()))
             logError("can't watch app library " + root.path() + "; " + error->description());
     }
+    StagingCopies::sweepStale();  // copies left by imports that were killed part-way
     porter_ = porter;
     publishing_ = service.value();
     return porter_;

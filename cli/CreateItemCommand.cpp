@@ -12,8 +12,12 @@ CLI::App* CreateItemCommand::add(CLI::App& app) {
                                  "\"name 2\", \"name 3\", ...) and print the new item");
         sub->add_option("SRC", source_, "The file or folder to copy")->required();
     } else {
-        sub = app.add_subcommand("mkdir", "Create a folder and print it");
+        sub = app.add_subcommand("mkdir",
+                                 "Create a folder and print it (a taken name fails unless "
+                                 "--bounce)");
         sub->add_option("NAME", source_, "The new folder's name")->required();
+        sub->add_flag("--bounce", bounce_,
+                      "Use \"NAME 2\", \"NAME 3\", ... when the name is taken");
     }
     sub->add_option("PARENT", parent_,
                     "The folder to create it in: an identifier (fid=N, #bundle.id) or a path")
@@ -23,6 +27,12 @@ CLI::App* CreateItemCommand::add(CLI::App& app) {
 }
 
 int CreateItemCommand::run(CliContext& context) {
+    if (verb_ == Verb::Import && source_.empty()) {
+        return context.fail(
+            Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
+                  {{"parameter", "source"}, {"description", "the source path must not be empty"}}),
+            json_);
+    }
     auto porter = context.prepareProvider();
     if (!porter.ok())
         return context.fail(porter.error(), json_);
@@ -34,7 +44,8 @@ int CreateItemCommand::run(CliContext& context) {
             porter.value()->importDocumentAtURL(Url::fileURLWithPath(source_), parent.value(),
                                                 std::move(done));
         else
-            porter.value()->createDirectoryWithName(source_, parent.value(), std::move(done));
+            porter.value()->createDirectoryWithName(source_, parent.value(), bounce_,
+                                                    std::move(done));
     });
     return ItemAction::finish(context, item, json_);
 }

@@ -21,6 +21,7 @@ private:
     std::string source_;  // the file to import, or the new folder's name
     std::string parent_;
     bool json_ = false;
+    bool bounce_ = false;  // mkdir: a taken name becomes "name 2" instead of failing
 };
 
 }  // namespace tamber

@@ -3,6 +3,7 @@
 #include <ostream>
 
 #include "cli/JsonValues.h"
+#include "host/PublishedTrees.h"
 #include "items/TBFileObjectIdentifier.h"
 
 namespace tamber {
@@ -18,6 +19,8 @@ int IdCommand::run(CliContext& context) {
     if (auto porter = context.prepareProvider(); !porter.ok())
         return context.fail(porter.error(), json_);
     Url url = Url::fileURLWithPath(path_);
+    if (auto outside = PublishedTrees::check(url))
+        return context.fail(*outside, json_);
     auto identifier = TBFileObjectIdentifier::itemIdentifier(url);
     if (!identifier) {
         return context.fail(Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,

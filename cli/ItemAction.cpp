@@ -8,6 +8,7 @@
 #include "cli/ItemArgument.h"
 #include "cli/ItemJson.h"
 #include "cli/JsonValues.h"
+#include "host/PublishedTrees.h"
 #include "support/DispatchSemaphore.h"
 
 namespace tamber {
@@ -46,6 +47,8 @@ Result<HostPorterItemIdentifier> ItemAction::identifierFor(LocalPorter& porter,
     ItemArgument argument = ItemArgument::parse(text);
     if (argument.kind == ItemArgument::Kind::Identifier)
         return argument.identifier;
+    if (auto outside = PublishedTrees::check(argument.url))
+        return *outside;
     auto identifier = porter._persistentIdentifierForItemAt(argument.url);
     if (!identifier)
         return Error::porterErrorForNonExistentItemWithIdentifier(argument.url.path());

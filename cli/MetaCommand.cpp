@@ -4,8 +4,12 @@
 #include <ctime>
 #include <ostream>
 
+#include "applibraries/LocalAppLibraryCache.h"
+#include "applibraries/LocalAppLibraryManager.h"
+#include "applibraries/SharedAppLibraryLookup.h"
 #include "cli/JsonValues.h"
 #include "cli/TagLabels.h"
+#include "host/PublishedTrees.h"
 #include "platform/objects/Number.h"
 
 namespace tamber {
@@ -119,6 +123,15 @@ Status MetaCommand::applyChanges(const Url& url) {
 
 int MetaCommand::run(CliContext& context) {
     Url url = Url::fileURLWithPath(path_);
+    // The app libraries are published trees too, even when the provider is not started: take
+    // the libraries last found (the main cache) without asking the registry again.
+    if (!AppLibraryLookup::current())
+        SharedAppLibraryLookup::install();
+    auto mainCache = LocalAppLibraryCache::mainCache();
+    mainCache->queue().sync([&] { mainCache->load(); });
+    LocalAppLibraryManager::shared()->upgradeFromMainCache(nullptr, false);
+    if (auto outside = PublishedTrees::check(url))
+        return context.fail(*outside, json_);
     auto exists = url.resourceValue(ResourceKeys::kFileID);
     if (!exists.ok()) {
         const Error& e = exists.error();

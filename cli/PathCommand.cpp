@@ -2,26 +2,45 @@
 
 #include <ostream>
 
+#include "cli/ItemArgument.h"
 #include "cli/JsonValues.h"
+#include "host/HostPorterManager.h"
+#include "host/PublishedTrees.h"
 #include "items/TBFileObjectIdentifier.h"
 
 namespace tamber {
 
 CLI::App* PathCommand::add(CLI::App& app) {
     auto* sub = app.add_subcommand("path", "Print the path of the item an identifier names");
-    sub->add_option("ID", identifier_, "An identifier: fid=N, did=N or the root container")
+    sub->add_option("ID", identifier_,
+                    "An identifier (fid=N, did=N, #bundle.id), root, working-set, or a path")
         ->required();
     sub->add_flag("--json", json_, "Print {\"id\": ..., \"path\": ...}");
     return sub;
 }
 
 int PathCommand::run(CliContext& context) {
-    if (auto porter = context.prepareProvider(); !porter.ok())
+    auto porter = context.prepareProvider();
+    if (!porter.ok())
         return context.fail(porter.error(), json_);
-    auto url = TBFileObjectIdentifier::fileURLWithItemIdentifier(identifier_);
-    if (!url) {
-        return context.fail(Error::porterErrorForNonExistentItemWithIdentifier(identifier_), json_);
+    ItemArgument argument = ItemArgument::parse(identifier_);
+    std::optional<Url> url;
+    if (argument.kind == ItemArgument::Kind::Path) {
+        if (auto outside = PublishedTrees::check(argument.url))
+            return context.fail(*outside, json_);
+        // Only an item answers: something that exists and has an identifier.
+        if (porter.value()->persistentIdentifierForItemAtURL(argument.url))
+            url = argument.url;
+    } else if (argument.identifier == HostPorterWorkingSetContainerItemIdentifier ||
+               argument.identifier == HostPorterRootContainerItemIdentifier) {
+        // The working set gathers items from every tree; the storage is where it starts.
+        url = HostPorterManager::defaultManager()->documentStorageURL();
+    } else {
+        // Resolution answers nothing outside the published trees.
+        url = porter.value()->URLForItemWithPersistentIdentifier(argument.identifier);
     }
+    if (!url)
+        return context.fail(Error::porterErrorForNonExistentItemWithIdentifier(identifier_), json_);
     if (json_) {
         nlohmann::json result{{"id", identifier_}};
         setTextWithBytes(result, "path", "pathBytes", url->path());

@@ -5,11 +5,13 @@
 
 #include <cerrno>
 #include <cstdio>
-#include <random>
 #include <vector>
 
 #include "host/FileTree.h"
+#include "host/ItemNames.h"
+#include "host/PublishedTrees.h"
 #include "host/ScopedFd.h"
+#include "host/StagingCopies.h"
 #include "platform/FileSystem.h"
 #include "platform/TypeIdentifiers.h"
 #include "platform/objects/Number.h"
@@ -82,9 +84,10 @@ bool pt_isFolder(const Url& url) {
 
 Result<uint64_t> pt_directorySizeWithError(const Url& url) {
     FileSystem& fs = FileSystem::current();
-    int root = fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-    if (root < 0)
-        return Error::errorWithPOSIXCode(errno);
+    auto opened = PublishedTrees::openFolder(url, O_RDONLY);
+    if (!opened.ok())
+        return opened.error();
+    int root = opened.value();
 
     uint64_t total = 0;
     std::vector<int> pending{root};  // descriptors still to read; depth-first, bounded by depth
@@ -125,7 +128,26 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url) {
 
 bool pt_withReadWriteAccess(const Url& url, const std::function<bool(int fd)>& body) {
     FileSystem& fs = FileSystem::current();
-    int fd = fs.open(url.path(), O_RDONLY | O_NOFOLLOW);
+    auto root = PublishedTrees::rootOf(url);
+    if (!root) {
+        errno = EACCES;
+        return false;
+    }
+    int fd = -1;
+    if (root->path() == url.path()) {
+        fd = fs.open(url.path(), O_RDONLY);
+    } else {
+        auto parent = PublishedTrees::openParent(url, O_PATH);
+        if (!parent.ok()) {
+            const Error& error = parent.error();
+            errno = error.domain() == kPosixErrorDomain ? static_cast<int>(error.code()) : EACCES;
+            return false;
+        }
+        fd = fs.openat(parent.value().fd, parent.value().name, O_RDONLY | O_NOFOLLOW);
+        int saved = errno;
+        fs.close(parent.value().fd);
+        errno = saved;
+    }
     if (fd < 0)
         return false;
     bool ok = body(fd);
@@ -150,32 +172,20 @@ using filetree::removeItem;
 
 // Enough to be sure a folder is not endlessly full, far more than a person creates by hand.
 constexpr int kMaxBounces = 10000;
-constexpr std::string_view kImportPrefix = ".tamber-import-";
 
 Error lastError() {
     return Error::errorWithPOSIXCode(errno);
 }
 
-bool isAcceptableName(std::string_view name) {
-    return !name.empty() && name != "." && name != ".." &&
-           name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
+Error importError(const std::string& what) {
+    return Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
+                 {{"parameter", "source"}, {"description", what}});
 }
 
-// The folder holding the item and the item's name in it.
-struct Placement {
-    Url parent;
-    std::string name;
-};
-
-std::optional<Placement> placementOf(const Url& url) {
-    if (!url.isFileURL() || url.path() == "/")
-        return std::nullopt;
-    return Placement{url.deletingLastPathComponent(), url.lastPathComponent()};
-}
-
-// Folders named by the caller are opened following links: they are where the caller works.
-int openFolder(const Url& folder) {
-    return FileSystem::current().open(folder.path(), O_PATH | O_DIRECTORY);
+// A folder inside the published trees, opened beneath its root; every folder the operations
+// below write into, or take an item out of, is opened here or through openParent.
+Result<int> openFolder(const Url& folder) {
+    return PublishedTrees::openFolder(folder, O_PATH);
 }
 
 // The names a taken name bounces to: "a.txt", "a 2.txt", "a 3.txt", ... A number already in
@@ -244,62 +254,66 @@ int renameNoReplace(int fromDir, const std::string& from, int toDir, const std::
     return fs.renameat2(fromDir, from, toDir, to, 0);
 }
 
+// Both ends are opened (and so checked) before anything moves.
 Result<Url> moveItem(const Url& url, const Url& folder, const std::optional<std::string>& newName,
                      bool bounce) {
-    auto from = placementOf(url);
-    if (!from)
-        return Error::invalidParameter("url", url.absoluteString());
-    std::string name = newName.value_or(from->name);
-    if (!isAcceptableName(name))
-        return Error::invalidParameter("name", name);
-    if (!folder.isFileURL())
-        return Error::invalidParameter("folder", folder.absoluteString());
-
-    ScopedFd fromDir(openFolder(from->parent));
-    if (!fromDir.ok())
-        return lastError();
-    auto type = itemTypeAt(fromDir.get(), from->name);
+    if (newName) {
+        if (auto bad = checkItemName(*newName))
+            return *bad;
+    }
+    auto from = PublishedTrees::openParent(url, O_PATH);
+    if (!from.ok())
+        return from.error();
+    ScopedFd fromDir(from.value().fd);
+    const std::string& fromName = from.value().name;
+    std::string name = newName.value_or(fromName);
+    auto to = openFolder(folder);
+    if (!to.ok())
+        return to.error();
+    ScopedFd toDir(to.value());
+    auto type = itemTypeAt(fromDir.get(), fromName);
     if (!type)
         return lastError();
     if (folder.appendingPathComponent(name) == url)
         return url;  // already there
-    ScopedFd toDir(openFolder(folder));
-    if (!toDir.ok())
-        return lastError();
     auto placed = placeUnderFreeName(
         name, keepsExtension(name, type->mode), bounce, [&](const std::string& candidate) {
-            return renameNoReplace(fromDir.get(), from->name, toDir.get(), candidate);
+            return renameNoReplace(fromDir.get(), fromName, toDir.get(), candidate);
         });
     if (!placed.ok())
         return placed.error();
     return folder.appendingPathComponent(*placed);
 }
 
-// Reserves a hidden name for a copy in progress: `make` creates the item under the name it is
-// given (failing with EEXIST when the name is taken).
-Result<std::string> reserveTemporaryName(const std::function<int(const std::string&)>& make) {
-    static thread_local std::mt19937_64 random(std::random_device{}());
+// Reserves a hidden staging name in `folder` for a copy in progress: `make` creates the item
+// under the name it is given (failing with EEXIST when the name is taken). The name is recorded
+// in the staging ledger before the item exists, so that no kill leaves an unrecorded copy.
+Result<std::string> reserveTemporaryName(const Url& folder,
+                                         const std::function<int(const std::string&)>& make) {
     for (int attempt = 0; attempt < 100; ++attempt) {
-        char suffix[17];
-        std::snprintf(suffix, sizeof suffix, "%016llx", static_cast<unsigned long long>(random()));
-        std::string name = std::string(kImportPrefix) + suffix;
+        std::string name = StagingCopies::makeName();
+        std::string path = folder.appendingPathComponent(name).path();
+        StagingCopies::record(path);
         if (make(name) == 0)
             return name;
-        if (errno != EEXIST)
-            return lastError();
+        int error = errno;
+        StagingCopies::forget(path);
+        if (error != EEXIST)
+            return Error::posix(error);
     }
     return Error::posix(EEXIST);
 }
 
-// Makes the copy of the item under a temporary name in `toDir`; returns that name.
+// Makes the copy of the item under a staging name in `toDir` (the open `folder`), recorded in
+// the staging ledger until the caller forgets it; returns that name.
 Result<std::string> copyToTemporary(int fromDir, const std::string& from, const ItemType& type,
-                                    int toDir) {
+                                    int toDir, const Url& folder) {
     FileSystem& fs = FileSystem::current();
     Result<std::string> temporary = Error::posix(ENOTSUP);
     Status filled;
     if (S_ISREG(type.mode)) {
         int out = -1;
-        temporary = reserveTemporaryName([&](const std::string& name) {
+        temporary = reserveTemporaryName(folder, [&](const std::string& name) {
             out = fs.openat(toDir, name, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW,
                             copyMode(type.mode));
             return out < 0 ? -1 : 0;
@@ -308,7 +322,7 @@ Result<std::string> copyToTemporary(int fromDir, const std::string& from, const 
         if (temporary.ok())
             filled = copyFileInto(fromDir, from, out);
     } else if (S_ISDIR(type.mode)) {
-        temporary = reserveTemporaryName([&](const std::string& name) {
+        temporary = reserveTemporaryName(folder, [&](const std::string& name) {
             return fs.mkdirat(toDir, name, copyMode(type.mode) | S_IRWXU);
         });
         if (temporary.ok())
@@ -318,56 +332,105 @@ Result<std::string> copyToTemporary(int fromDir, const std::string& from, const 
         if (!target.ok())
             return target.error();
         temporary = reserveTemporaryName(
-            [&](const std::string& name) { return fs.symlinkat(*target, toDir, name); });
+            folder, [&](const std::string& name) { return fs.symlinkat(*target, toDir, name); });
     }
     if (temporary.ok() && filled) {
         removeItem(toDir, *temporary);
+        StagingCopies::forget(folder.appendingPathComponent(*temporary).path());
         return *filled;
     }
     return temporary;
 }
 
+struct DirIdentity {
+    uint64_t device = 0;
+    uint64_t inode = 0;
+    bool operator==(const DirIdentity&) const = default;
+};
+
+std::optional<DirIdentity> identityAt(int dirfd, const std::string& name) {
+    struct statx st {};
+    int flags = name.empty() ? AT_EMPTY_PATH : AT_SYMLINK_NOFOLLOW;
+    if (FileSystem::current().statx(dirfd, name, flags, STATX_INO, &st) != 0)
+        return std::nullopt;
+    return DirIdentity{(uint64_t(st.stx_dev_major) << 32) | st.stx_dev_minor, st.stx_ino};
+}
+
+// Whether the folder `source` is the open folder `dir` or one of its ancestors, by identity
+// along the real chain of ".." (so another path to the same folder is caught too).
+bool isFolderOrAncestor(const ItemType& source, int dir) {
+    FileSystem& fs = FileSystem::current();
+    DirIdentity wanted{source.device, source.inode};
+    int current = fs.openat(dir, ".", O_PATH | O_DIRECTORY);
+    bool found = false;
+    for (int depth = 0; current >= 0 && depth < 4096; ++depth) {
+        auto here = identityAt(current, "");
+        if (!here)
+            break;
+        if (*here == wanted) {
+            found = true;
+            break;
+        }
+        int up = fs.openat(current, "..", O_PATH | O_DIRECTORY);
+        fs.close(current);
+        current = up;
+        auto above = up >= 0 ? identityAt(up, "") : std::nullopt;
+        if (!above || *above == *here)
+            break;  // the top
+    }
+    if (current >= 0)
+        fs.close(current);
+    return found;
+}
+
 Result<Url> importItem(const Url& source, const Url& folder) {
-    auto from = placementOf(source);
-    if (!from)
-        return Error::invalidParameter("url", source.absoluteString());
-    if (!folder.isFileURL())
-        return Error::invalidParameter("folder", folder.absoluteString());
-    ScopedFd fromDir(openFolder(from->parent));
+    if (!source.isFileURL() || source.path().empty())
+        return importError("the source path must not be empty");
+    if (source.path() == "/")
+        return importError("can't import a folder into itself");
+    // The source may be any file the user names; the destination must be inside.
+    auto to = openFolder(folder);
+    if (!to.ok())
+        return to.error();
+    ScopedFd toDir(to.value());
+    ScopedFd fromDir(FileSystem::current().open(source.deletingLastPathComponent().path(),
+                                                O_PATH | O_DIRECTORY));
     if (!fromDir.ok())
         return lastError();
-    auto type = itemTypeAt(fromDir.get(), from->name);
+    std::string fromName = source.lastPathComponent();
+    auto type = itemTypeAt(fromDir.get(), fromName);
     if (!type)
         return lastError();
-    ScopedFd toDir(openFolder(folder));
-    if (!toDir.ok())
-        return lastError();
+    if (!S_ISREG(type->mode) && !S_ISDIR(type->mode) && !S_ISLNK(type->mode))
+        return importError("can only import a file, a folder or a symbolic link");
+    if (S_ISDIR(type->mode) && isFolderOrAncestor(*type, toDir.get()))
+        return importError("can't import a folder into itself");
 
-    auto temporary = copyToTemporary(fromDir.get(), from->name, *type, toDir.get());
+    auto temporary = copyToTemporary(fromDir.get(), fromName, *type, toDir.get(), folder);
     if (!temporary.ok())
         return temporary.error();
-    auto placed = placeUnderFreeName(from->name, keepsExtension(from->name, type->mode), true,
-                                     [&](const std::string& candidate) {
-                                         return renameNoReplace(toDir.get(), *temporary,
-                                                                toDir.get(), candidate);
-                                     });
-    if (!placed.ok()) {
+    std::string staged = folder.appendingPathComponent(*temporary).path();
+    auto placed = placeUnderFreeName(
+        fromName, keepsExtension(fromName, type->mode), true, [&](const std::string& candidate) {
+            return renameNoReplace(toDir.get(), *temporary, toDir.get(), candidate);
+        });
+    if (!placed.ok())
         removeItem(toDir.get(), *temporary);
+    StagingCopies::forget(staged);
+    if (!placed.ok())
         return placed.error();
-    }
     return folder.appendingPathComponent(*placed);
 }
 
-Result<Url> createFolder(const Url& folder, const std::string& name) {
-    if (!isAcceptableName(name))
-        return Error::invalidParameter("name", name);
-    if (!folder.isFileURL())
-        return Error::invalidParameter("folder", folder.absoluteString());
-    ScopedFd dir(openFolder(folder));
+Result<Url> createFolder(const Url& folder, const std::string& name, bool bounce) {
+    if (auto bad = checkItemName(name))
+        return *bad;
+    auto dir = openFolder(folder);
     if (!dir.ok())
-        return lastError();
-    auto placed = placeUnderFreeName(name, false, true, [&](const std::string& candidate) {
-        return FileSystem::current().mkdirat(dir.get(), candidate, 0777);
+        return dir.error();
+    ScopedFd dirFd(dir.value());
+    auto placed = placeUnderFreeName(name, false, bounce, [&](const std::string& candidate) {
+        return FileSystem::current().mkdirat(dirFd.get(), candidate, 0777);
     });
     if (!placed.ok())
         return placed.error();
@@ -375,13 +438,11 @@ Result<Url> createFolder(const Url& folder, const std::string& name) {
 }
 
 Status deleteItem(const Url& url) {
-    auto at = placementOf(url);
-    if (!at)
-        return Error::invalidParameter("url", url.absoluteString());
-    ScopedFd dir(openFolder(at->parent));
-    if (!dir.ok())
-        return lastError();
-    return removeItem(dir.get(), at->name);
+    auto at = PublishedTrees::openParent(url, O_PATH);
+    if (!at.ok())
+        return at.error();
+    ScopedFd dir(at.value().fd);
+    return removeItem(dir.get(), at.value().name);
 }
 
 void finish(Result<Url> result, const UrlCompletion& completion) {
@@ -399,9 +460,9 @@ void pt_importUnderFolder(const Url& source, const Url& folder, const UrlComplet
     finish(importItem(source, folder), completion);
 }
 
-void pt_createSubFolder(const Url& folder, const std::string& name,
+void pt_createSubFolder(const Url& folder, const std::string& name, bool bounce,
                         const UrlCompletion& completion) {
-    finish(createFolder(folder, name), completion);
+    finish(createFolder(folder, name, bounce), completion);
 }
 
 void pt_renameWithNewName(const Url& url, const std::string& name,
@@ -428,6 +489,27 @@ void pt_reparentUnderFolder(const Url& url, const Url& folder, bool allowBouncin
 
 void pt_trashUnderFolder(const Url& url, const Url& trashFolder, const UrlCompletion& completion) {
     finish(moveItem(url, trashFolder, std::nullopt, true), completion);
+}
+
+Status pt_ensureTrashFolder(const Url& trashFolder) {
+    auto parent = PublishedTrees::openParent(trashFolder, O_PATH);
+    if (!parent.ok())
+        return parent.error();
+    ScopedFd dir(parent.value().fd);
+    const std::string& name = parent.value().name;
+    if (FileSystem::current().mkdirat(dir.get(), name, 0777) == 0)
+        return std::nullopt;
+    if (errno != EEXIST)
+        return lastError();
+    auto type = itemTypeAt(dir.get(), name);
+    if (!type)
+        return lastError();
+    // A link named like the trash would carry trashed items out of the tree.
+    if (S_ISLNK(type->mode))
+        return PublishedTrees::outsideError(trashFolder);
+    if (!S_ISDIR(type->mode))
+        return Error::posix(ENOTDIR);
+    return std::nullopt;
 }
 
 void pt_deleteWithCompletionHandler(const Url& url, const ErrorCompletion& completion) {

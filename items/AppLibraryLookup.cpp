@@ -1,6 +1,9 @@
 #include "items/AppLibraryLookup.h"
 
 #include <atomic>
+#include <mutex>
+
+#include "host/PublishedTrees.h"
 
 namespace tamber {
 
@@ -19,6 +22,14 @@ std::shared_ptr<AppLibraryLookup> AppLibraryLookup::current() {
 
 std::shared_ptr<AppLibraryLookup> AppLibraryLookup::setCurrent(
     std::shared_ptr<AppLibraryLookup> lookup) {
+    // The libraries this lookup knows are the published trees besides the storage.
+    static std::once_flag hooked;
+    std::call_once(hooked, [] {
+        PublishedTrees::setAppLibraryRootsSource([] {
+            auto current = AppLibraryLookup::current();
+            return current ? current->rootURLsForAppLibraries() : std::vector<Url>{};
+        });
+    });
     return std::atomic_exchange(&slot(), std::move(lookup));
 }
 

@@ -8,6 +8,7 @@
 #include <string>
 
 #include "host/HostPorterManager.h"
+#include "host/PublishedTrees.h"
 #include "host/UrlOperations.h"
 #include "items/AppLibraryLookup.h"
 #include "items/TBPFileObjectIdentifier.h"
@@ -120,6 +121,13 @@ uint32_t TBFileObjectIdentifier::deviceID(const Url& url) {
 std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(const Url& url) {
     if (!url.isFileURL()) {
         logFormat(LogLevel::Error, "can't compute file object identifier if not a file URL", {});
+        return std::nullopt;
+    }
+    // Reached through a link below a root: not an item of ours (outside the trees is logged
+    // below).
+    if (PublishedTrees::rootOf(url) && PublishedTrees::check(url)) {
+        logFormat(LogLevel::Info, "can't compute file object identifier for \"%@\"; %@",
+                  {url.path(), std::string(PublishedTrees::kOutsideMessage)});
         return std::nullopt;
     }
     Url storage = HostPorterManager::defaultManager()->documentStorageURL();
@@ -239,7 +247,8 @@ std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(
         return std::nullopt;
     }
     uint32_t device = storageDeviceID();
-    if (device == 0) return std::nullopt;
+    if (device == 0)
+        return std::nullopt;
     uint64_t value = parseValue(components[1]);
     uint64_t fileId = value;
     if (host == "did") {
@@ -270,7 +279,8 @@ std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(
 
 std::optional<Url> TBFileObjectIdentifier::fileURLWithFileIdentifier(uint64_t fileID) {
     uint32_t device = storageDeviceID();
-    if (device == 0) return std::nullopt;
+    if (device == 0)
+        return std::nullopt;
     return _fileURLWithFileIdentifier(fileID, device);
 }
 
@@ -282,7 +292,15 @@ std::optional<Url> TBFileObjectIdentifier::_fileURLWithFileIdentifier(uint64_t f
                   {int64_t(fileID), ErrnoArg{errno}});
         return std::nullopt;
     }
-    return Url::fileURLWithPath(buffer);
+    Url url = Url::fileURLWithPath(buffer);
+    // The journal may remember trees no longer published, and a path that now runs through a
+    // link: neither names an item.
+    if (auto outside = PublishedTrees::check(url)) {
+        logFormat(LogLevel::Info, "file ID \"%lld\" resolves to \"%@\"; %@",
+                  {int64_t(fileID), url.path(), std::string(PublishedTrees::kOutsideMessage)});
+        return std::nullopt;
+    }
+    return url;
 }
 
 }  // namespace tamber

@@ -62,6 +62,8 @@ std::string_view FaultInjectingFileSystem::operationName(Operation op) {
             return "readlinkat";
         case Operation::Symlinkat:
             return "symlinkat";
+        case Operation::OpenBeneath:
+            return "openBeneath";
     }
     return "unknown";
 }
@@ -150,6 +152,13 @@ int FaultInjectingFileSystem::openat(int dirfd, const std::string& name, int fla
     if (shouldFail(Operation::Openat, {dirfd, name}))
         return -1;
     return inner_->openat(dirfd, name, flags, mode);
+}
+
+int FaultInjectingFileSystem::openBeneath(int dirfd, const std::string& path, int flags,
+                                          mode_t mode) {
+    if (shouldFail(Operation::OpenBeneath, {dirfd, path}))
+        return -1;
+    return inner_->openBeneath(dirfd, path, flags, mode);
 }
 
 int FaultInjectingFileSystem::close(int fd) {

@@ -40,8 +40,9 @@ public:
         CopyFileRange,
         Readlinkat,
         Symlinkat,
+        OpenBeneath,
     };
-    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::Symlinkat) + 1;
+    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::OpenBeneath) + 1;
     static std::string_view operationName(Operation op);
 
     explicit FaultInjectingFileSystem(std::shared_ptr<FileSystem> inner);
@@ -63,6 +64,7 @@ public:
     int open(const std::string& path, int flags, mode_t mode) override;
     int openat(int dirfd, const std::string& name, int flags, mode_t mode) override;
     int close(int fd) override;
+    int openBeneath(int dirfd, const std::string& path, int flags, mode_t mode) override;
     int statx(int dirfd, const std::string& path, int flags, unsigned int mask,
               struct statx* out) override;
     int faccessat(int dirfd, const std::string& path, int mode, int flags) override;

@@ -31,6 +31,13 @@ public:
     virtual int open(const std::string& path, int flags, mode_t mode = 0) = 0;
     virtual int openat(int dirfd, const std::string& name, int flags, mode_t mode = 0) = 0;
     virtual int close(int fd) = 0;
+    // Opens the relative `path` beneath the directory `dirfd` without following a symbolic link
+    // in any component, the last one included, and without leaving `dirfd` (no "..", no
+    // absolute path): openat2(2) with RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS, or, on a kernel
+    // without it, a component-by-component O_NOFOLLOW walk. A link component fails with ELOOP
+    // (with O_PATH | O_NOFOLLOW a final link is opened as the link itself), an escape with
+    // EXDEV. An empty path or "." opens `dirfd` itself again.
+    virtual int openBeneath(int dirfd, const std::string& path, int flags, mode_t mode = 0) = 0;
 
     // statx(2); `dirfd` AT_FDCWD for absolute paths.
     virtual int statx(int dirfd, const std::string& path, int flags, unsigned int mask,

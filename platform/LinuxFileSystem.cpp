@@ -1,5 +1,6 @@
 #include "platform/LinuxFileSystem.h"
 
+#include <linux/openat2.h>
 #include <stdio.h>
 #include <sys/syscall.h>
 #include <sys/xattr.h>
@@ -10,6 +11,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
+#include <optional>
 #include <string_view>
 
 namespace tamber {
@@ -60,7 +62,109 @@ bool readAllEntries(int fd, std::vector<FileSystem::DirectoryEntry>& out) {
     }
 }
 
+// The components of a relative path without empty and "." ones; nothing (errno EXDEV) for an
+// absolute path or one with "..", which could only lead out of or around the directory.
+std::optional<std::vector<std::string>> beneathComponents(const std::string& path) {
+    if (path.starts_with('/')) {
+        errno = EXDEV;
+        return std::nullopt;
+    }
+    std::vector<std::string> components;
+    size_t start = 0;
+    while (start <= path.size()) {
+        size_t slash = path.find('/', start);
+        if (slash == std::string::npos)
+            slash = path.size();
+        std::string component = path.substr(start, slash - start);
+        start = slash + 1;
+        if (component.empty() || component == ".")
+            continue;
+        if (component == "..") {
+            errno = EXDEV;
+            return std::nullopt;
+        }
+        components.push_back(std::move(component));
+    }
+    return components;
+}
+
+bool isLinkAt(int dirfd, const std::string& name) {
+    struct stat st {};
+    return ::fstatat(dirfd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISLNK(st.st_mode);
+}
+
 }  // namespace
+
+int LinuxFileSystem::openBeneath(int dirfd, const std::string& path, int flags, mode_t mode) {
+    auto components = beneathComponents(path);
+    if (!components)
+        return -1;
+    if (resolution_ == BeneathResolution::Walk || openat2Missing_.load())
+        return walkBeneath(dirfd, path, flags, mode);
+    struct open_how how {};
+    how.flags = static_cast<uint64_t>(flags | O_CLOEXEC);
+    how.mode = (flags & (O_CREAT | O_TMPFILE)) ? mode : 0;
+    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS;
+    std::string relative = components->empty() ? std::string(".") : path;
+    // EAGAIN: a rename elsewhere raced the lookup; the kernel asks to try again.
+    for (int attempt = 0;; ++attempt) {
+        long fd = openat2(dirfd, relative.c_str(), &how, sizeof how);
+        if (fd >= 0)
+            return static_cast<int>(fd);
+        if (errno == ENOSYS) {
+            openat2Missing_.store(true);
+            return walkBeneath(dirfd, path, flags, mode);
+        }
+        if (errno != EAGAIN || attempt == 16)
+            return -1;
+    }
+}
+
+long LinuxFileSystem::openat2(int dirfd, const char* path, void* how, size_t size) {
+    return ::syscall(SYS_openat2, dirfd, path, how, size);
+}
+
+int LinuxFileSystem::walkBeneath(int dirfd, const std::string& path, int flags, mode_t mode) {
+    auto components = beneathComponents(path);
+    if (!components)
+        return -1;
+    if (components->empty())
+        return ::openat(dirfd, ".", flags | O_CLOEXEC, mode);
+    int current = dirfd;
+    auto release = [&] {
+        if (current != dirfd) {
+            int saved = errno;
+            ::close(current);
+            errno = saved;
+        }
+    };
+    for (size_t i = 0; i + 1 < components->size(); ++i) {
+        const std::string& name = (*components)[i];
+        int next = ::openat(current, name.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+        if (next < 0) {
+            // O_NOFOLLOW | O_PATH opens a link as such, and O_DIRECTORY then refuses it.
+            if (errno == ENOTDIR && isLinkAt(current, name))
+                errno = ELOOP;
+            release();
+            return -1;
+        }
+        release();
+        current = next;
+    }
+    const std::string& last = components->back();
+    // A final link is opened as the link only when the caller asked for exactly that.
+    bool linkWanted = (flags & O_PATH) && (flags & O_NOFOLLOW);
+    if (!linkWanted && isLinkAt(current, last)) {
+        errno = ELOOP;
+        release();
+        return -1;
+    }
+    int fd = ::openat(current, last.c_str(), flags | O_NOFOLLOW | O_CLOEXEC, mode);
+    if (fd < 0 && errno == ENOTDIR && isLinkAt(current, last))
+        errno = ELOOP;
+    release();
+    return fd;
+}
 
 int LinuxFileSystem::open(const std::string& path, int flags, mode_t mode) {
     return ::open(path.c_str(), flags | O_CLOEXEC, mode);

@@ -1,6 +1,7 @@
 #include "provider/LocalPorter.h"
 
 #include "host/HostPorterManager.h"
+#include "host/PublishedTrees.h"
 #include "items/AppLibraryLookup.h"
 #include "items/LocalAppLibraryItem.h"
 #include "items/TBFileObjectIdentifier.h"
@@ -169,6 +170,10 @@ Result<HostPorterItemRef> LocalPorter::itemForIdentifier(
 }
 
 Result<LocalPorter::LocalItemRef> LocalPorter::itemForURL(const Url& url) {
+    if (auto outside = PublishedTrees::check(url)) {
+        logDebug([&] { return "\"" + url.path() + "\" is " + PublishedTrees::kOutsideMessage; });
+        return *outside;
+    }
     auto identifier = identifierForURLLogged(url);
     if (!identifier) {
         logError("identifier lookup failed for URL \"" + url.path() + "\"");

@@ -62,8 +62,12 @@ public:
     using ErrorCompletion = std::function<void(std::optional<Error> error)>;
     void importDocumentAtURL(const Url& source, const HostPorterItemIdentifier& parent,
                              ItemCompletion completion);
+    // A taken name bounces to "name 2", ... (as a file browser's new folder does); with
+    // `bounce` false it fails with EEXIST instead.
     void createDirectoryWithName(const std::string& name, const HostPorterItemIdentifier& parent,
                                  ItemCompletion completion);
+    void createDirectoryWithName(const std::string& name, const HostPorterItemIdentifier& parent,
+                                 bool bounce, ItemCompletion completion);
     void renameItemWithIdentifier(const HostPorterItemIdentifier& identifier,
                                   const std::string& name, ItemCompletion completion);
     void reparentItemWithIdentifier(const HostPorterItemIdentifier& identifier,

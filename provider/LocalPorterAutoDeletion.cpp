@@ -4,9 +4,11 @@
 #include "applibraries/LocalAppLibraryManager.h"
 #include "enumeration/FSDirectoryEnumerator.h"
 #include "host/HostPorterManager.h"
+#include "host/PublishedTrees.h"
 #include "items/ExtendedAttributes.h"
 #include "items/LocalAppLibraryItem.h"
 #include "items/UnarchiveLogged.h"
+#include "platform/FileSystem.h"
 #include "provider/LocalPorter.h"
 #include "provider/TrashLocations.h"
 #include "support/DispatchGroup.h"
@@ -22,8 +24,14 @@ namespace {
 std::vector<Url> trashFoldersToSweep() {
     std::vector<Url> folders;
     auto add = [&](const Url& folder) {
-        if (std::find(folders.begin(), folders.end(), folder) == folders.end())
-            folders.push_back(folder);
+        if (std::find(folders.begin(), folders.end(), folder) != folders.end())
+            return;
+        // Only a real folder reached without links: a linked .Trash is not read at all.
+        auto opened = PublishedTrees::openFolder(folder, O_PATH);
+        if (!opened.ok())
+            return;
+        FileSystem::current().close(opened.value());
+        folders.push_back(folder);
     };
     for (const auto& library : LocalAppLibraryManager::shared()->allItems()) {
         if (auto trash = trashFolderForURL(library->fileURL()))

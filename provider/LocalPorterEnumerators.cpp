@@ -2,6 +2,8 @@
 
 #include "enumeration/LocalFileEnumerator.h"
 #include "enumeration/LocalRootEnumerator.h"
+#include "host/PublishedTrees.h"
+#include "platform/FileSystem.h"
 #include "platform/objects/Number.h"
 #include "provider/LocalPorter.h"
 #include "support/Log.h"
@@ -23,6 +25,11 @@ Result<HostPorterEnumeratorRef> LocalPorter::enumeratorForContainerItemIdentifie
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok())
             return url.error();
+        // A link is an item, not a container: listing it would read what lies behind it.
+        if (auto opened = PublishedTrees::openFolder(url.value(), O_PATH); opened.ok())
+            FileSystem::current().close(opened.value());
+        else if (PublishedTrees::isOutsideError(opened.error()))
+            return opened.error();
         // A file has no children: listing one would answer with an empty page, which a caller
         // can't tell from an empty folder. What can't be read here is left to the listing,
         // which reports it.

@@ -61,13 +61,19 @@ void LocalPorter::importDocumentAtURL(const Url& source, const HostPorterItemIde
 void LocalPorter::createDirectoryWithName(const std::string& name,
                                           const HostPorterItemIdentifier& parent,
                                           ItemCompletion completion) {
+    createDirectoryWithName(name, parent, true, std::move(completion));
+}
+
+void LocalPorter::createDirectoryWithName(const std::string& name,
+                                          const HostPorterItemIdentifier& parent, bool bounce,
+                                          ItemCompletion completion) {
     withLogSection("create directory with name \"" + name + "\" in parent \"" + parent + "\"", [&] {
         if (isRootContainer(parent))
             return completion(nullptr, Error::errorFileWriteNoPermission());
         auto folder = urlForIdentifierLogged(parent);
         if (!folder.ok())
             return completion(nullptr, folder.error());
-        pt_createSubFolder(folder.value(), name,
+        pt_createSubFolder(folder.value(), name, bounce,
                            [this, completion](std::optional<Url> url, std::optional<Error> error) {
                                finishWithItem(*this, url, error, completion);
                            });

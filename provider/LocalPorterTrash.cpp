@@ -1,6 +1,6 @@
+#include "host/ItemNames.h"
 #include "host/UrlOperations.h"
 #include "items/ExtendedAttributes.h"
-#include "platform/FileContents.h"
 #include "platform/archive/KeyedArchiver.h"
 #include "platform/objects/Number.h"
 #include "platform/objects/String.h"
@@ -91,9 +91,11 @@ void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identi
             return completion(
                 nullptr, Error::invalidParameter("trashComponents", joinedComponents(*components)));
         }
-        Url trash = documents->appendingPathComponent(".Trash");
+        Url trash = documents->appendingPathComponent(kTrashFolderName);
         logDebug([&] { return "trash is located at \"" + trash.path() + "\""; });
-        if (auto error = FileContents::createDirectory(trash))
+        // Made beneath the library without following links; a linked .Trash is refused
+        // before anything moves.
+        if (auto error = pt_ensureTrashFolder(trash))
             return completion(nullptr, *error);
 
         Url original = *url;
@@ -126,7 +128,10 @@ void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& iden
             return completion(nullptr, item.error());
         if (!item.value()->isTrashed()) {
             logDebug("item is not in trash");
-            return completion(nullptr, Error::invalidParameter("itemIdentifier", identifier));
+            return completion(nullptr, Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
+                                             {{"parameter", "itemIdentifier"},
+                                              {"value", identifier},
+                                              {"description", "item is not in the trash"}}));
         }
 
         std::optional<Url> destination;

@@ -62,7 +62,7 @@ TEST_F(MetaCommandTest, SetValuesAreReadBackAndNoneClearsThem) {
 }
 
 TEST_F(MetaCommandTest, ErrorsAreJsonAndExitNonZero) {
-    CliRun missing = tamber({"--storage", storage, "meta", dir / "nope", "--json"});
+    CliRun missing = tamber({"--storage", storage, "meta", dir / "storage/nope", "--json"});
     EXPECT_NE(missing.status, 0);
     json e = json::parse(missing.out)["error"];
     EXPECT_EQ(e["domain"], "HostPlatformErrorDomain");
@@ -81,7 +81,7 @@ TEST_F(MetaCommandTest, ErrorsAreJsonAndExitNonZero) {
 
 TEST_F(MetaCommandTest, StorageIsCreatedAndMustBeAFolder) {
     std::string fresh = dir / "a/b/Documents";
-    CliRun r = tamber({"--storage", fresh, "meta", file});
+    CliRun r = tamber({"--storage", fresh, "meta", fresh});
     EXPECT_EQ(r.status, 0) << r.err;
     EXPECT_TRUE(std::filesystem::is_directory(fresh));
 

@@ -371,6 +371,30 @@ TEST_F(ItemTest, IdentifiersResolveBackOrAreRejected) {
     }
 }
 
+TEST_F(ItemTest, IdentifiersNeverNameAnythingOutsideThePublishedTrees) {
+    // The index still knows a tree that is no longer published, and a path through a link.
+    std::string forgotten = dir.writeFile("Unpublished/old.txt", "o");
+    std::string away = dir.makeDir("Away");
+    std::string behind = dir.writeFile("Away/behind.txt", "b");
+    std::filesystem::create_directory_symlink(away, storage + "/link");
+    std::string throughLink = storage + "/link/behind.txt";
+    strata->publish(forgotten);
+    strata->publish(throughLink);
+    strata->publish(storage + "/link");
+    for (const std::string& path : {forgotten, behind}) {
+        ScopedLogCapture log;
+        EXPECT_FALSE(urlOf(fid(path))) << path;
+        EXPECT_FALSE(
+            TBFileObjectIdentifier::fileURLWithFileIdentifier(std::stoull(fid(path).substr(4))))
+            << path;
+    }
+    // Nor is an identifier computed for them; the link itself is an item.
+    EXPECT_FALSE(idOf(forgotten));
+    EXPECT_FALSE(idOf(throughLink));
+    ASSERT_TRUE(idOf(storage + "/link"));
+    EXPECT_EQ(urlOf(*idOf(storage + "/link"))->path(), storage + "/link");
+}
+
 TEST_F(ItemTest, DocumentResolutionRetriesOnlyPassingFailures) {
     std::string file = dir.writeFile("Documents/doc.txt", "x");
     strata->publish(file);

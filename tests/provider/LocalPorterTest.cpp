@@ -9,6 +9,7 @@
 #include <fstream>
 #include <thread>
 
+#include "host/PublishedTrees.h"
 #include "platform/FaultInjectingFileSystem.h"
 #include "platform/FileContents.h"
 #include "platform/LinuxFileSystem.h"
@@ -106,6 +107,9 @@ TEST_F(LocalPorterTest, LookupsRunInTitledSectionsAndLogWhatTheyFound) {
     std::ofstream(file) << "x";
     strata->publish(file);
     Url url = Url::fileURLWithPath(file);
+    // The app libraries load (and log that) the first time their roots are asked for.
+    PublishedTrees::roots();
+    log->clear();
 
     auto identifier = porter->persistentIdentifierForItemAtURL(url);
     ASSERT_TRUE(identifier);

@@ -1,0 +1,144 @@
+#include "host/PublishedTrees.h"
+
+#include <fcntl.h>
+
+#include <cerrno>
+#include <memory>
+#include <mutex>
+
+#include "host/HostPorterManager.h"
+#include "platform/FileSystem.h"
+#include "support/Error.h"
+
+namespace tamber {
+
+namespace {
+
+std::mutex& sourceMutex() {
+    static std::mutex mutex;
+    return mutex;
+}
+
+PublishedTrees::RootsSource& rootsSource() {
+    static PublishedTrees::RootsSource source;
+    return source;
+}
+
+bool isAtOrBelow(const std::string& root, const std::string& path) {
+    if (path.size() < root.size() || path.compare(0, root.size(), root) != 0)
+        return false;
+    return path.size() == root.size() || root == "/" || path[root.size()] == '/';
+}
+
+// `path` relative to `root` ("" for the root itself); `path` is at or below `root`.
+std::string relativeTo(const std::string& root, const std::string& path) {
+    if (path.size() == root.size())
+        return {};
+    return path.substr(root == "/" ? 1 : root.size() + 1);
+}
+
+// A link or an escape on the way down is the boundary's refusal; anything else is what the
+// system said.
+Error openFailure(const Url& url, int error) {
+    if (error == ELOOP || error == EXDEV)
+        return PublishedTrees::outsideError(url);
+    return Error::posix(error);
+}
+
+}  // namespace
+
+PublishedTrees::RootsSource PublishedTrees::setAppLibraryRootsSource(RootsSource source) {
+    std::lock_guard lock(sourceMutex());
+    std::swap(rootsSource(), source);
+    return source;
+}
+
+std::vector<Url> PublishedTrees::roots() {
+    std::vector<Url> all{HostPorterManager::defaultManager()->documentStorageURL()};
+    RootsSource source;
+    {
+        std::lock_guard lock(sourceMutex());
+        source = rootsSource();
+    }
+    if (source) {
+        for (Url& root : source()) {
+            if (root.isFileURL())
+                all.push_back(std::move(root));
+        }
+    }
+    return all;
+}
+
+std::optional<Url> PublishedTrees::rootOf(const Url& url) {
+    if (!url.isFileURL())
+        return std::nullopt;
+    std::optional<Url> deepest;
+    for (Url& root : roots()) {
+        if (root.path().empty() || !isAtOrBelow(root.path(), url.path()))
+            continue;
+        if (!deepest || root.path().size() > deepest->path().size())
+            deepest = std::move(root);
+    }
+    return deepest;
+}
+
+Error PublishedTrees::outsideError(const Url& url) {
+    return Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,
+                 {{"description", kOutsideMessage}, {"path", url.path()}});
+}
+
+bool PublishedTrees::isOutsideError(const Error& error) {
+    auto it = error.userInfo().find("description");
+    return error.is(kHostPorterErrorDomain, kHostPorterNoSuchItem) &&
+           it != error.userInfo().end() && it->second == kOutsideMessage;
+}
+
+Result<int> PublishedTrees::openFolder(const Url& folder, int flags) {
+    auto root = rootOf(folder);
+    if (!root)
+        return outsideError(folder);
+    FileSystem& fs = FileSystem::current();
+    // The root is published as named, through a link if it is one.
+    int rootFd = fs.open(root->path(), O_PATH | O_DIRECTORY);
+    if (rootFd < 0)
+        return Error::posix(errno);
+    std::string relative = relativeTo(root->path(), folder.path());
+    int fd = relative.empty() ? fs.open(root->path(), flags | O_DIRECTORY)
+                              : fs.openBeneath(rootFd, relative, flags | O_DIRECTORY);
+    int saved = errno;
+    fs.close(rootFd);
+    if (fd < 0)
+        return openFailure(folder, saved);
+    return fd;
+}
+
+Result<PublishedTrees::Parent> PublishedTrees::openParent(const Url& url, int flags) {
+    auto root = rootOf(url);
+    if (!root)
+        return outsideError(url);
+    if (root->path() == url.path())
+        return Error::invalidParameter("url", url.path());
+    auto fd = openFolder(url.deletingLastPathComponent(), flags);
+    if (!fd.ok())
+        return isOutsideError(fd.error()) ? outsideError(url) : fd.error();
+    return Parent{fd.value(), url.lastPathComponent()};
+}
+
+Status PublishedTrees::check(const Url& url) {
+    auto root = rootOf(url);
+    if (!root)
+        return outsideError(url);
+    if (root->path() == url.path())
+        return std::nullopt;
+    auto parent = openParent(url, O_PATH);
+    if (!parent.ok()) {
+        // A missing folder on the way leaves nothing to escape through; only refusals count.
+        if (isOutsideError(parent.error()))
+            return parent.error();
+        return std::nullopt;
+    }
+    FileSystem::current().close(parent.value().fd);
+    return std::nullopt;
+}
+
+}  // namespace tamber

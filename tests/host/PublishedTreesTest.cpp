@@ -1,0 +1,301 @@
+#include "host/PublishedTrees.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+#include <memory>
+
+#include "host/RecordingHostPorterManager.h"
+#include "host/StagingCopies.h"
+#include "host/UrlOperations.h"
+#include "platform/FaultInjectingFileSystem.h"
+#include "platform/LinuxFileSystem.h"
+#include "tests/common/ScopedFileSystem.h"
+#include "tests/common/TempDir.h"
+
+namespace tamber {
+namespace {
+
+namespace fs = std::filesystem;
+using testing::TempDir;
+
+Url at(const std::string& path) {
+    return Url::fileURLWithPath(path);
+}
+
+struct Outcome {
+    std::optional<Url> url;
+    std::optional<Error> error;
+};
+
+template <class Operation>
+Outcome run(Operation operation) {
+    Outcome outcome;
+    operation([&](std::optional<Url> url, std::optional<Error> error) {
+        outcome.url = std::move(url);
+        outcome.error = std::move(error);
+    });
+    return outcome;
+}
+
+std::string descriptionOf(const std::optional<Error>& error) {
+    if (!error)
+        return "<no error>";
+    auto it = error->userInfo().find("description");
+    return it == error->userInfo().end() ? error->description() : it->second;
+}
+
+// A storage folder "storage", an app library "apps/lib/Documents", and "outside" beside them;
+// "storage/away" is a link to the outside.
+class PublishedTreesTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        storage = dir.makeDir("storage");
+        library = dir.makeDir("apps/lib/Documents");
+        outside = dir.makeDir("outside");
+        dir.makeDir("storage/Work");
+        fs::create_directory_symlink(outside, storage + "/away");
+        previous_ = HostPorterManager::installDefaultManager(
+            std::make_shared<RecordingHostPorterManager>(at(storage)));
+        previousRoots_ = PublishedTrees::setAppLibraryRootsSource(
+            [this] { return std::vector<Url>{at(library)}; });
+        previousLedger_ = StagingCopies::setLedgerDirectoryForTesting(dir / "ledger");
+    }
+    void TearDown() override {
+        StagingCopies::setLedgerDirectoryForTesting(previousLedger_);
+        PublishedTrees::setAppLibraryRootsSource(previousRoots_);
+        HostPorterManager::installDefaultManager(previous_);
+    }
+    static bool refused(const Status& status) {
+        return status && PublishedTrees::isOutsideError(*status);
+    }
+    static bool refused(const Outcome& outcome) { return refused(outcome.error); }
+
+    TempDir dir;
+    std::string storage, library, outside;
+
+private:
+    std::shared_ptr<HostPorterManager> previous_;
+    PublishedTrees::RootsSource previousRoots_;
+    std::string previousLedger_;
+};
+
+TEST_F(PublishedTreesTest, InsideMeansAtOrBelowARootWithoutALinkOnTheWay) {
+    EXPECT_FALSE(PublishedTrees::check(at(storage)));
+    EXPECT_FALSE(PublishedTrees::check(at(storage + "/Work/new.txt")));
+    EXPECT_FALSE(PublishedTrees::check(at(library + "/a/b")));
+    EXPECT_FALSE(PublishedTrees::check(at(storage + "/away"))) << "a link is an item";
+    EXPECT_EQ(PublishedTrees::rootOf(at(library + "/x"))->path(), library);
+
+    for (const std::string& path :
+         {outside + "/f", storage + "2", dir / "apps/lib", storage + "/away/f",
+          storage + "/away/sub/f", std::string("/")}) {
+        Status status = PublishedTrees::check(at(path));
+        ASSERT_TRUE(refused(status)) << path;
+        EXPECT_EQ(status->domain(), kHostPorterErrorDomain);
+        EXPECT_EQ(status->code(), kHostPorterNoSuchItem);
+        EXPECT_EQ(descriptionOf(status), "not inside the document storage or an app library");
+    }
+    // Without the library hook only the storage is published.
+    PublishedTrees::setAppLibraryRootsSource(nullptr);
+    EXPECT_TRUE(refused(PublishedTrees::check(at(library + "/a"))));
+}
+
+TEST_F(PublishedTreesTest, OperationsRefuseOutsideBeforeTouchingAnything) {
+    std::string file = dir.writeFile("storage/Work/a.txt", "a");
+    std::string source = dir.writeFile("elsewhere/b.txt", "b");
+
+    EXPECT_TRUE(refused(
+        run([&](auto done) { pt_createSubFolder(at(storage + "/away"), "N", false, done); })));
+    EXPECT_TRUE(refused(run(
+        [&](auto done) { pt_reparentUnderFolder(at(file), at(storage + "/away"), false, done); })));
+    EXPECT_TRUE(refused(
+        run([&](auto done) { pt_reparentUnderFolder(at(file), at(outside), false, done); })));
+    EXPECT_TRUE(refused(
+        run([&](auto done) { pt_importUnderFolder(at(source), at(storage + "/away"), done); })));
+    EXPECT_TRUE(refused(run([&](auto done) { pt_renameWithNewName(at(source), "c.txt", done); })));
+    EXPECT_TRUE(refused(run(
+        [&](auto done) { pt_trashUnderFolder(at(file), at(storage + "/away/.Trash"), done); })));
+    std::optional<Error> deleted;
+    pt_deleteWithCompletionHandler(at(outside + "/x"), [&](auto error) { deleted = error; });
+    EXPECT_TRUE(refused(deleted));
+
+    bool ran = false;
+    EXPECT_FALSE(pt_withReadWriteAccess(at(source), [&](int) { return ran = true; }));
+    EXPECT_EQ(errno, EACCES);
+    EXPECT_FALSE(pt_withReadWriteAccess(at(storage + "/away/x"), [&](int) { return ran = true; }));
+    EXPECT_FALSE(ran);
+    EXPECT_TRUE(pt_withReadWriteAccess(at(file), [&](int fd) { return fd >= 0; }));
+    EXPECT_TRUE(refused(pt_directorySizeWithError(at(outside)).error()));
+
+    EXPECT_TRUE(fs::exists(file));
+    EXPECT_TRUE(fs::exists(source));
+    EXPECT_TRUE(fs::is_empty(outside));
+}
+
+TEST_F(PublishedTreesTest, ALinkInsideIsMovedRenamedAndDeletedAsALink) {
+    dir.writeFile("outside/keep.txt", "k");
+    Outcome renamed =
+        run([&](auto done) { pt_renameWithNewName(at(storage + "/away"), "gone", done); });
+    ASSERT_TRUE(renamed.url) << descriptionOf(renamed.error);
+    Outcome moved = run([&](auto done) {
+        pt_reparentUnderFolder(at(storage + "/gone"), at(library), false, done);
+    });
+    ASSERT_TRUE(moved.url) << descriptionOf(moved.error);
+    EXPECT_TRUE(fs::is_symlink(library + "/gone"));
+    Outcome imported = run([&](auto done) {
+        pt_importUnderFolder(at(library + "/gone"), at(storage + "/Work"), done);
+    });
+    ASSERT_TRUE(imported.url) << descriptionOf(imported.error);
+    EXPECT_TRUE(fs::is_symlink(storage + "/Work/gone"));
+    std::optional<Error> deleted = Error::posix(EIO);
+    pt_deleteWithCompletionHandler(at(library + "/gone"), [&](auto error) { deleted = error; });
+    EXPECT_FALSE(deleted);
+    EXPECT_FALSE(fs::exists(fs::symlink_status(library + "/gone")));
+    EXPECT_TRUE(fs::exists(outside + "/keep.txt"));
+}
+
+// Swaps a folder for a link to the outside just before the operation opens it: after every
+// check a caller could have made.
+class SwappingFileSystem : public FaultInjectingFileSystem {
+public:
+    SwappingFileSystem(std::string folder, std::string target)
+        : FaultInjectingFileSystem(std::make_shared<LinuxFileSystem>()),
+          folder_(std::move(folder)),
+          target_(std::move(target)) {}
+    int openBeneath(int dirfd, const std::string& path, int flags, mode_t mode) override {
+        if (!swapped_) {
+            swapped_ = true;
+            fs::rename(folder_, folder_ + ".real");
+            fs::create_directory_symlink(target_, folder_);
+        }
+        return FaultInjectingFileSystem::openBeneath(dirfd, path, flags, mode);
+    }
+
+private:
+    std::string folder_, target_;
+    bool swapped_ = false;
+};
+
+TEST_F(PublishedTreesTest, AFolderSwappedForALinkAfterTheLookupIsRefused) {
+    std::string file = dir.writeFile("storage/a.txt", "a");
+    dir.makeDir("storage/Work/Sub");
+    ASSERT_FALSE(PublishedTrees::check(at(storage + "/Work/Sub")));
+    auto swapping = std::make_shared<SwappingFileSystem>(storage + "/Work", outside);
+    {
+        testing::ScopedFileSystem scoped(swapping);
+        Outcome moved = run([&](auto done) {
+            pt_reparentUnderFolder(at(file), at(storage + "/Work/Sub"), false, done);
+        });
+        EXPECT_TRUE(refused(moved)) << descriptionOf(moved.error);
+    }
+    EXPECT_TRUE(fs::exists(file));
+    EXPECT_TRUE(fs::is_empty(outside));
+}
+
+TEST_F(PublishedTreesTest, ALinkedTrashIsRefusedAndAMissingOneMade) {
+    EXPECT_FALSE(pt_ensureTrashFolder(at(library + "/.Trash")));
+    EXPECT_TRUE(fs::is_directory(library + "/.Trash"));
+    EXPECT_FALSE(pt_ensureTrashFolder(at(library + "/.Trash"))) << "an existing one is fine";
+    fs::create_directory_symlink(outside, storage + "/.Trash");
+    EXPECT_TRUE(refused(pt_ensureTrashFolder(at(storage + "/.Trash"))));
+    dir.writeFile("storage/Work/.Trash", "not a folder");
+    Status file = pt_ensureTrashFolder(at(storage + "/Work/.Trash"));
+    ASSERT_TRUE(file);
+    EXPECT_TRUE(file->is(kPosixErrorDomain, ENOTDIR));
+}
+
+TEST_F(PublishedTreesTest, CreateFailsOnATakenNameUnlessItBounces) {
+    std::string work = storage + "/Work";
+    ASSERT_TRUE(run([&](auto done) { pt_createSubFolder(at(work), "Drafts", false, done); }).url);
+    Outcome taken = run([&](auto done) { pt_createSubFolder(at(work), "Drafts", false, done); });
+    ASSERT_TRUE(taken.error);
+    EXPECT_TRUE(taken.error->is(kPosixErrorDomain, EEXIST));
+    Outcome bounced = run([&](auto done) { pt_createSubFolder(at(work), "Drafts", true, done); });
+    ASSERT_TRUE(bounced.url);
+    EXPECT_EQ(bounced.url->path(), work + "/Drafts 2");
+
+    for (const auto& [name, message] : std::vector<std::pair<std::string, std::string>>{
+             {"", "name must not be empty"},
+             {".", "name '.' is reserved"},
+             {"..", "name '..' is reserved"},
+             {"a/b", "name must not contain '/'"},
+             {".Trash", "name '.Trash' is reserved"}}) {
+        Outcome o = run([&](auto done) { pt_createSubFolder(at(work), name, true, done); });
+        ASSERT_TRUE(o.error) << name;
+        EXPECT_TRUE(o.error->is(kHostPorterErrorDomain, kHostPorterInvalidParameter)) << name;
+        EXPECT_EQ(descriptionOf(o.error), message);
+    }
+    EXPECT_FALSE(fs::exists(work + "/.Trash"));
+}
+
+TEST_F(PublishedTreesTest, ImportRefusesAFolderIntoItselfAndSpecialFiles) {
+    std::string work = storage + "/Work";
+    dir.makeDir("storage/Work/Sub");
+    for (const std::string& into : {work, work + "/Sub", storage + "/Work/./Sub"}) {
+        Outcome o = run([&](auto done) { pt_importUnderFolder(at(work), at(into), done); });
+        EXPECT_EQ(descriptionOf(o.error), "can't import a folder into itself") << into;
+    }
+    // The same folder under another path is still itself.
+    fs::create_directory_symlink(work, dir / "alias");
+    Outcome aliased = run(
+        [&](auto done) { pt_importUnderFolder(at(dir / "alias/Sub"), at(work + "/Sub"), done); });
+    EXPECT_EQ(descriptionOf(aliased.error), "can't import a folder into itself");
+
+    std::string fifo = dir / "pipe";
+    ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+    Outcome piped = run([&](auto done) { pt_importUnderFolder(at(fifo), at(work), done); });
+    EXPECT_EQ(descriptionOf(piped.error), "can only import a file, a folder or a symbolic link");
+    EXPECT_EQ(fs::directory_iterator(work + "/Sub"), fs::directory_iterator());
+}
+
+TEST_F(PublishedTreesTest, StaleStagingCopiesOfDeadProcessesAreSwept) {
+    std::string name = StagingCopies::makeName();
+    EXPECT_EQ(StagingCopies::pidOfName(name), ::getpid());
+    EXPECT_EQ(StagingCopies::pidOfName(".tamber-import-x"), 0);
+    EXPECT_EQ(StagingCopies::pidOfName("notes.txt"), 0);
+
+    // A process that is certainly gone: a child that has exited and been reaped.
+    pid_t child = ::fork();
+    if (child == 0)
+        ::_exit(0);
+    ASSERT_GT(child, 0);
+    ::waitpid(child, nullptr, 0);
+    std::string dead = ".tamber-import-" + std::to_string(child) + "-00000000000000aa";
+    std::string deadCopy = dir.makeDir("storage/Work/" + dead);
+    dir.writeFile("storage/Work/" + dead + "/part", "half");
+    StagingCopies::record(deadCopy);
+    std::string liveCopy = dir.writeFile("storage/Work/" + name, "mine");
+    StagingCopies::record(liveCopy);
+    // A forged record that names something outside is dropped, the thing left alone.
+    std::string forged = ".tamber-import-" + std::to_string(child) + "-00000000000000bb";
+    std::string outsideCopy = dir.writeFile("outside/" + forged, "x");
+    StagingCopies::record(outsideCopy);
+
+    EXPECT_EQ(StagingCopies::sweepStale(), 1u);
+    EXPECT_FALSE(fs::exists(deadCopy));
+    EXPECT_TRUE(fs::exists(liveCopy)) << "its process still runs";
+    EXPECT_TRUE(fs::exists(outsideCopy));
+    // The dead records are gone; the live one stays until its import forgets it.
+    EXPECT_EQ(std::distance(fs::directory_iterator(dir / "ledger"), fs::directory_iterator()), 1);
+    StagingCopies::forget(liveCopy);
+    fs::remove(liveCopy);
+    EXPECT_TRUE(fs::is_empty(dir / "ledger"));
+
+    // A finished import leaves neither a staging copy nor a record.
+    std::string source = dir.writeFile("elsewhere/c.txt", "c");
+    ASSERT_TRUE(
+        run([&](auto done) { pt_importUnderFolder(at(source), at(storage + "/Work"), done); }).url);
+    EXPECT_TRUE(fs::is_empty(dir / "ledger"));
+    for (const auto& entry : fs::directory_iterator(storage + "/Work"))
+        EXPECT_FALSE(entry.path().filename().string().starts_with(".tamber-import-"))
+            << entry.path();
+}
+
+}  // namespace
+}  // namespace tamber
