@@ -10,6 +10,7 @@
 #include "applibraries/TBPAppLibraryManager.h"
 #include "cli/JsonValues.h"
 #include "host/HostPorterManager.h"
+#include "host/PublishedTrees.h"
 #include "host/StagingCopies.h"
 #include "platform/FileContents.h"
 #include "platform/tremors/TremorService.h"
@@ -146,6 +147,9 @@ Error CliContext::internalError(const std::string& what) {
 int CliContext::exitStatusFor(const Error& error) {
     if (isUsageError(error))
         return kExitUsage;
+    // Something outside the published trees exists; it is refused, not missing.
+    if (PublishedTrees::isOutsideError(error))
+        return kExitFailure;
     const bool notFound =
         error.is(kHostPorterErrorDomain, kHostPorterNoSuchItem) ||
         error.is(kHostPlatformErrorDomain, kHostPlatformFileNoSuchFile) ||

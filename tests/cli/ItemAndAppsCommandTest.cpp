@@ -100,7 +100,7 @@ TEST_F(ItemAndAppsCommandTest, UnknownItemsAreErrors) {
     EXPECT_EQ(error["domain"], "LocalPorter.Error");
     EXPECT_EQ(error["code"], 0);
     // A file outside every published tree is refused as such.
-    json outside = tamberJson({"item", dir.writeFile("elsewhere.txt")}, 3)["error"];
+    json outside = tamberJson({"item", dir.writeFile("elsewhere.txt")}, 1)["error"];
     EXPECT_EQ(outside["domain"], "HostPorterErrorDomain");
     EXPECT_EQ(outside["code"], -1005);
     EXPECT_EQ(outside["message"], "not inside the document storage or an app library");
