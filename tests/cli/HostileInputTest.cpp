@@ -311,12 +311,16 @@ TEST_F(HostileInputTest, MalformedIdentifiersAreRefusedAndNeverNameAnotherItem) 
                                      " " + valid};
     for (const std::string& identifier : hostile) {
         std::string shown = identifier.substr(0, 60);
-        for (const char* verb : {"item", "path", "ls"}) {
-            json answer = tamberJson({verb, identifier});
-            EXPECT_EQ(answer["status"], 1) << verb << " \"" << shown << "\": " << answer;
-            EXPECT_TRUE(answer.contains("error")) << verb << " \"" << shown << "\": " << answer;
+        // Verbs that change things too: none may act on the item the identifier's prefix names.
+        for (std::vector<std::string> args : std::vector<std::vector<std::string>>{
+                 {"item"}, {"path"}, {"ls"}, {"rm"}, {"trash"}, {"rename", "renamed"}}) {
+            args.insert(args.begin() + 1, identifier);
+            json answer = tamberJson(args);
+            EXPECT_EQ(answer["status"], 1) << args[0] << " \"" << shown << "\": " << answer;
+            EXPECT_TRUE(answer.contains("error")) << args[0] << " \"" << shown << "\": " << answer;
         }
     }
+    EXPECT_TRUE(std::filesystem::exists(file));
     json item = tamberJson({"item", valid});
     EXPECT_EQ(item["status"], 0) << item;
     EXPECT_EQ(item["path"], file);
