@@ -54,8 +54,8 @@ void printEvents(TremorStreamRef, void* info, size_t count, const ObjectRef& pat
         if (flags[i] & (kTremorUserDropped | kTremorKernelDropped)) {
             // Lost history (an overflow, a tree that could not be watched, a replay from before
             // the oldest kept event): say so, since the lines above may not be complete.
-            *printer.err << "tamber: warning: events under " << (path ? path->value() : "?")
-                         << " were lost ("
+            *printer.err << "tamber: warning: events under "
+                         << (path ? escapedText(path->value()) : "?") << " were lost ("
                          << ((flags[i] & kTremorKernelDropped) ? "kernel" : "user")
                          << " side); a rescan of that tree is needed\n";
             printer.err->flush();

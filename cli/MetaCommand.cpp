@@ -148,7 +148,7 @@ int MetaCommand::run(CliContext& context) {
     ItemMetadata metadata = ItemMetadata::read(url);
     nlohmann::json j = toJson(metadata);
     if (json_) {
-        j["path"] = url.path();
+        setTextWithBytes(j, "path", "pathBytes", url.path());
         context.out() << jsonText(j) << "\n";
         return 0;
     }

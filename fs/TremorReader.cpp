@@ -148,7 +148,13 @@ void TremorReader::start() {
     }
     stream_ = stream;
     TremorStreamSetDispatchQueue(stream, streamQueue_);
-    TremorStreamStart(stream);
+    if (!TremorStreamStart(stream)) {
+        // A tree that can't be watched (gone, say) has no history to replay; a delegate that
+        // waits for its end must hear so rather than wait for ever.
+        logError("can't start tremor stream for " + description());
+        lostHistoryOwed_ = true;
+        streamQueue_->async([self = shared_from_this()] { self->reportLostHistory(); });
+    }
 }
 
 void TremorReader::stop() {

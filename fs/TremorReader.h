@@ -43,7 +43,8 @@ public:
     TremorReader& operator=(const TremorReader&) = delete;
 
     // Opens and starts the stream from `lastProcessedTremorID`. A stream that can't be made
-    // is fatal.
+    // is fatal; one that can't start, or an ID no journal hands out, is reported as lost
+    // history (readerMustRescan).
     void start();
     // Stops, invalidates and releases the stream; nothing when none is open. May be called
     // from a block on `streamQueue` (the usual way to stop from a delegate call is an async

@@ -13,6 +13,11 @@ namespace tamber {
 
 // The platform's event-stream calls, over the process's TremorService. Creation fails (null)
 // when the service cannot start.
+//
+// `sinceWhen` is an event ID, or TremorStream::kSinceNow (all bits set) for live events only:
+// no journal hands that ID out, so callers holding an ID from outside (an anchor, a page
+// token, a command line) must not pass it on as it is. A stream from an ID past the journal's
+// last event sends a lost-history event (0x02) and then the history-done event, nothing else.
 TremorStreamRef TremorStreamCreate(TremorStreamCallback callback,
                                    const TremorStreamContext* context,
                                    const std::vector<std::string>& pathsToWatch, uint64_t sinceWhen,

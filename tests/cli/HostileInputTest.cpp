@@ -313,13 +313,17 @@ TEST_F(HostileInputTest, MalformedIdentifiersAreRefusedAndNeverNameAnotherItem) 
                                      " " + valid};
     for (const std::string& identifier : hostile) {
         std::string shown = identifier.substr(0, 60);
-        for (const char* verb : {"item", "path", "ls"}) {
-            json answer = tamberJson({verb, identifier});
+        // Verbs that change things too: none may act on the item the identifier's prefix names.
+        for (std::vector<std::string> args : std::vector<std::vector<std::string>>{
+                 {"item"}, {"path"}, {"ls"}, {"rm"}, {"trash"}, {"rename", "renamed"}}) {
+            args.insert(args.begin() + 1, identifier);
+            json answer = tamberJson(args);
             // No such item: a malformed identifier names nothing.
-            EXPECT_EQ(answer["status"], 3) << verb << " \"" << shown << "\": " << answer;
-            EXPECT_TRUE(answer.contains("error")) << verb << " \"" << shown << "\": " << answer;
+            EXPECT_EQ(answer["status"], 3) << args[0] << " \"" << shown << "\": " << answer;
+            EXPECT_TRUE(answer.contains("error")) << args[0] << " \"" << shown << "\": " << answer;
         }
     }
+    EXPECT_TRUE(std::filesystem::exists(file));
     json item = tamberJson({"item", valid});
     EXPECT_EQ(item["status"], 0) << item;
     EXPECT_EQ(item["path"], file);
@@ -415,6 +419,11 @@ TEST_F(HostileInputTest, ItemsWithBadNamesAreRenamedMovedTrashedAndDeletedLikeAn
     // By identifier.
     std::string original = dir.writeFile("Documents/" + badName, "1");
     std::string id = idOf(original);
+    // A name longer than the file system takes is refused, and nothing changes.
+    json tooLong = tamberJson({"rename", id, std::string(256, 'N')});
+    EXPECT_EQ(tooLong["status"], 1) << tooLong;
+    EXPECT_TRUE(tooLong.contains("error")) << tooLong;
+    EXPECT_TRUE(fs::exists(original));
     json renamed = tamberJson({"rename", id, "other\xfe"});
     ASSERT_EQ(renamed["status"], 0) << renamed;
     EXPECT_TRUE(fs::exists(storage + "/other\xfe"));
@@ -428,6 +437,26 @@ TEST_F(HostileInputTest, ItemsWithBadNamesAreRenamedMovedTrashedAndDeletedLikeAn
     json removed = tamberJson({"rm", id});
     ASSERT_EQ(removed["status"], 0) << removed;
     EXPECT_EQ(removed["deleted"], id);
+
+    // A folder, by its file-ID identifier.
+    std::string badFolder = dir.makeDir("Documents/dir\xff");
+    dir.writeFile("Documents/dir\xff/inside", "i");
+    std::string folderID = idOf(badFolder);
+    ASSERT_EQ(folderID.rfind("fid=", 0), 0u) << folderID;
+    json listed = tamberJson({"ls", folderID});
+    ASSERT_EQ(listed["status"], 0) << listed;
+    EXPECT_EQ(listed["items"].size(), 1u) << listed;
+    json folderRenamed = tamberJson({"rename", folderID, "dir\xfe\t"});
+    ASSERT_EQ(folderRenamed["status"], 0) << folderRenamed;
+    EXPECT_TRUE(fs::exists(storage + "/dir\xfe\t/inside"));
+    json folderMoved = tamberJson({"mv", folderID, folder});
+    ASSERT_EQ(folderMoved["status"], 0) << folderMoved;
+    EXPECT_TRUE(fs::exists(folder + "/dir\xfe\t/inside"));
+    json folderTrashed = tamberJson({"trash", folderID});
+    ASSERT_EQ(folderTrashed["status"], 0) << folderTrashed;
+    EXPECT_FALSE(fs::exists(folder + "/dir\xfe\t"));
+    json folderRemoved = tamberJson({"rm", folderID});
+    ASSERT_EQ(folderRemoved["status"], 0) << folderRemoved;
 
     // By path.
     std::string second = dir.writeFile("Documents/" + badName, "2");

@@ -294,6 +294,21 @@ TEST_F(TremorTest, AReaderFromAnIDNeverHandedOutAsksForARescanAtOnce) {
     }
 }
 
+TEST_F(TremorTest, AReaderWhoseTreeCannotBeWatchedAsksForARescan) {
+    const Url gone = Url::fileURLWithPath("/nonexistent-tamber-tree/inside");
+    startReader(0, TremorReaderMode::pathBased, {gone});
+    ASSERT_TRUE(delegate->waitForReport("rescan"));
+    EXPECT_EQ(delegate->itemReports(), (Reports{"rescan"}));
+    auto verdict = std::async(std::launch::async, [&] {
+        return TremorReader::canResumeGatherPhase({gone}, 0).first.kind;
+    });
+    if (verdict.wait_for(std::chrono::seconds(30)) != std::future_status::ready) {
+        std::fprintf(stderr, "FAILED: canResumeGatherPhase over a gone tree never ended\n");
+        std::_Exit(1);
+    }
+    EXPECT_EQ(verdict.get(), Kind::cantReplayHistoricalTremors);
+}
+
 TEST_F(TremorTest, AReaderDestroyedWhileRunningSaysSoAndLaterBatchesFindNothing) {
     auto reader =
         TremorReader::make({storageURL()}, currentID(), TremorReaderMode::pathBased, true);
