@@ -95,7 +95,11 @@ protected:
         if (::setxattr(tree_.c_str(), "user.probe", "1", 1, 0) != 0 && errno == ENOTSUP)
             GTEST_SKIP() << "no user attributes on this file system";
     }
-    void TearDown() override { stop(); }
+    void TearDown() override {
+        stop();
+        scoped_.reset();  // only once the service's threads are gone
+    }
+    void useFileSystem(std::shared_ptr<FileSystem> fs) { scoped_.emplace(std::move(fs)); }
 
     // A service on state_, which resumes the trees it remembers and crawls them.
     void start() {
@@ -222,6 +226,7 @@ protected:
     testing::TempDir root_;
     std::string tree_;
     uint32_t device_ = 0;
+    std::optional<testing::ScopedFileSystem> scoped_;
     std::shared_ptr<TremorService> service_;
     std::shared_ptr<TremorStrataService> strata_;
 };
@@ -258,7 +263,7 @@ TEST_F(DocumentIdentityTest, RoundsOfSafeSavesWhileWatchedKeepEveryIdAndItsTags)
 // Two documents saved while stopped, each new file reported with the other's old inode number.
 TEST_F(DocumentIdentityTest, AnInodeNumberGivenToAnotherDocumentsNewFileIsThatFile) {
     auto renumbering = std::make_shared<RenumberingFileSystem>();
-    testing::ScopedFileSystem scoped(renumbering);
+    useFileSystem(renumbering);
     ASSERT_NO_FATAL_FAILURE(start());
     auto docs = makeDocuments(2);
     uint64_t since = service_->currentEventId();
@@ -353,7 +358,7 @@ TEST_F(DocumentIdentityTest, AKnownFileMovedOntoADocumentIsAMoveNotASave) {
 
 TEST_F(DocumentIdentityTest, AttributeEventsOfDocumentsUpdateTheCopyAndOthersCostNothing) {
     auto counting = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
-    testing::ScopedFileSystem scoped(counting);
+    useFileSystem(counting);
     ASSERT_NO_FATAL_FAILURE(start());
     auto docs = makeDocuments(1);
     const std::string& path = docs[0].path;
