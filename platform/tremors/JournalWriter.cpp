@@ -130,7 +130,7 @@ std::string JournalWriter::documentIdPath(uint32_t device, uint32_t docID, uint6
 }
 
 Result<std::vector<JournalEvent>> JournalWriter::apply(const std::vector<FileChange>& changes) {
-    return commit([&] {
+    return commit(Settle::ClaimByPath, [&] {
         for (const FileChange& change : changes) {
             switch (change.kind) {
                 case FileChange::Kind::Created:
@@ -160,16 +160,17 @@ Result<std::vector<JournalEvent>> JournalWriter::apply(const std::vector<FileCha
 Result<std::vector<JournalEvent>> JournalWriter::journalDropped(
     const std::vector<std::string>& paths, uint32_t flags) {
     for (const auto& path : paths) pending_.push_back({0, path, 0, flags});
-    return commit([] {});
+    return commit(Settle::Clear, [] {});
 }
 
-Result<std::vector<JournalEvent>> JournalWriter::commit(const std::function<void()>& work) {
+Result<std::vector<JournalEvent>> JournalWriter::commit(Settle settle,
+                                                        const std::function<void()>& work) {
     std::vector<JournalEvent> events;
     // One transaction for the journal rows and the index: a crash keeps both or neither.
     Status status = store_.transact([&]() -> Status {
         work();
         flushStaged();
-        settleVanished();
+        settleVanished(settle);
         events = std::move(pending_);
         if (events.empty())
             return std::nullopt;
@@ -349,7 +350,30 @@ void JournalWriter::refreshAttributes(uint32_t docID, const std::string& path, u
     }
 }
 
-void JournalWriter::settleVanished() {
+void JournalWriter::settleVanished(Settle settle) {
+    if (settle == Settle::ClaimByPath) {
+        // Events are applied after the fact: the file that took a document's place may be at its
+        // path already while its own event is still to come, in a later batch.
+        // That file's inode number may still be indexed for an older file, whose document then
+        // waits for its own path in turn: each path is tried once.
+        std::set<std::string> tried;
+        for (bool more = true; more;) {
+            more = false;
+            std::vector<std::string> waiting;
+            for (const auto& [path, record] : vanished_) {
+                if (!path.empty() && tried.insert(path).second)
+                    waiting.push_back(path);
+            }
+            for (const std::string& path : waiting) {
+                struct statx st {};
+                if (!statPath(path, st))
+                    continue;
+                more = true;
+                forgetReusedNumber(st);
+                claimDocumentId(path, st.stx_ino, kindOf(st.stx_mode));
+            }
+        }
+    }
     for (auto& [path, record] : vanished_) {
         logIfFailed(store_.clearDocumentId(record.docID), "Could not clear a document ID");
         pending_.push_back({0, documentIdPath(device_, record.docID, record.inode, 0), record.inode,
@@ -490,7 +514,8 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
         }
         fs.close(fd);
     }
-    return commit([&] { compareWithIndex(root, oldTop, onDisk, journal); });
+    // The crawl saw every file: a known file at a document's old path was moved there.
+    return commit(Settle::Clear, [&] { compareWithIndex(root, oldTop, onDisk, journal); });
 }
 
 void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,

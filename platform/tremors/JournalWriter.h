@@ -66,8 +66,11 @@ private:
     void touched(const FileChange& change, uint32_t flag);
     void compareWithIndex(const std::string& root, uint64_t oldTop,
                           std::map<uint64_t, Found>& onDisk, bool journal);
+    // What becomes of documents whose files vanished and were not claimed in the batch: cleared,
+    // or first given to the file at their path, if it has no ID of its own.
+    enum class Settle { Clear, ClaimByPath };
     // Runs `work`, then journals what it left pending, all in one transaction.
-    Result<std::vector<JournalEvent>> commit(const std::function<void()>& work);
+    Result<std::vector<JournalEvent>> commit(Settle settle, const std::function<void()>& work);
 
     // Index entries of the batch are written together: at its end, or before the index is read
     // in a way that staged entries could not answer.
@@ -93,7 +96,7 @@ private:
     // The document's metadata changed on its own inode: its copy becomes what the file holds.
     void refreshAttributes(uint32_t docID, const std::string& path, uint64_t inode);
     // Clears the document IDs of files that vanished for good and journals their deletion.
-    void settleVanished();
+    void settleVanished(Settle settle);
 
     TremorStore& store_;
     const uint32_t device_;
