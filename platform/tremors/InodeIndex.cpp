@@ -381,4 +381,26 @@ Status InodeIndex::replaceDocumentAttributes(uint32_t docID, const Attributes& a
     return txn->commit();
 }
 
+Result<std::vector<InodeRecord>> InodeIndex::subtree(uint64_t top,
+                                                     std::unordered_set<uint64_t> stops) {
+    std::vector<InodeRecord> found;
+    std::vector<uint64_t> stack{top};
+    stops.insert(top);
+    while (!stack.empty()) {
+        uint64_t dir = stack.back();
+        stack.pop_back();
+        auto entries = children(dir);
+        if (!entries)
+            return entries.error();
+        for (InodeRecord& child : entries.value()) {
+            if (!stops.insert(child.inode).second)
+                continue;  // a stop, or a cycle left by lost events
+            if (child.kind == InodeRecord::kDirectory)
+                stack.push_back(child.inode);
+            found.push_back(std::move(child));
+        }
+    }
+    return found;
+}
+
 }  // namespace tamber

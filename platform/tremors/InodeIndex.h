@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_set>
 #include <vector>
 
 #include "platform/objects/Data.h"
@@ -45,6 +46,8 @@ public:
     Result<std::optional<std::string>> path(
         uint64_t inode, const std::function<const std::string*(uint64_t)>& rootPath);
     Result<std::vector<InodeRecord>> children(uint64_t parent);
+    // Every entry below `top`, not below an inode of `stops` (nor those), each once.
+    Result<std::vector<InodeRecord>> subtree(uint64_t top, std::unordered_set<uint64_t> stops);
     Result<std::vector<InodeRecord>> childrenNamed(uint64_t parent, std::string_view name);
 
     Result<uint32_t> allocateDocumentId(uint64_t inode);

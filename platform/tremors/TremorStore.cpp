@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
-#include <unordered_set>
 
 #include "support/Log.h"
 
@@ -516,39 +515,18 @@ Result<TremorStore::Forgotten> TremorStore::forgetRoot(const std::string& rawPat
     if (!forgotten)
         return forgotten.error();
     Forgotten outcome;
-    uint64_t top = forgotten.value().inode;
-    std::vector<Root> others = roots_->remembered();
-    for (const Root& other : others) {
-        if (other.path != kDocumentIdRoot && WatchedRoots::isAtOrBelow(path, other.path))
-            return outcome;  // the tree is still another root's
-    }
+    uint64_t top = forgotten.value().top;
     if (top == 0)
-        return outcome;  // nothing says where its entries start
-    // The tops of remembered roots inside it end the walk: what is below them is theirs.
-    std::vector<uint64_t> stops;
-    for (const Root& other : others) {
-        if (other.inode != 0 && WatchedRoots::isAtOrBelow(other.path, path))
-            stops.push_back(other.inode);
-    }
+        return outcome;
+    auto tree = index_->subtree(top, std::move(forgotten.value().kept));
+    if (!tree)
+        return tree.error();
     std::vector<uint64_t> gone;
-    std::unordered_set<uint64_t> seen(stops.begin(), stops.end());
     std::vector<uint32_t> documents;
-    std::vector<uint64_t> stack{top};
-    while (!stack.empty()) {
-        uint64_t dir = stack.back();
-        stack.pop_back();
-        auto children = index_->children(dir);
-        if (!children)
-            return children.error();
-        for (const InodeRecord& child : children.value()) {
-            if (!seen.insert(child.inode).second)
-                continue;  // another root's, or a cycle left by lost events
-            gone.push_back(child.inode);
-            if (child.docID != 0)
-                documents.push_back(child.docID);
-            if (child.kind == InodeRecord::kDirectory)
-                stack.push_back(child.inode);
-        }
+    for (const InodeRecord& record : tree.value()) {
+        gone.push_back(record.inode);
+        if (record.docID != 0)
+            documents.push_back(record.docID);
     }
     outcome.entries = gone.size();
     gone.push_back(top);

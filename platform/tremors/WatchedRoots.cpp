@@ -167,7 +167,7 @@ Result<std::vector<std::string>> WatchedRoots::retire() {
     return retired;
 }
 
-Result<WatchedRoots::Root> WatchedRoots::forget(const std::string& path) {
+Result<WatchedRoots::Forgotten> WatchedRoots::forget(const std::string& path) {
     Row* row = find(normalised(path));
     if (!row || row->state == State::Forgotten)
         return Error(kPosixErrorDomain, ENOENT,
@@ -178,9 +178,17 @@ Result<WatchedRoots::Root> WatchedRoots::forget(const std::string& path) {
     updated.root.inode = 0;
     if (Status status = write(updated))
         return *status;
-    Root before = row->root;
+    Forgotten forgotten{row->root.inode, {}};
     *row = std::move(updated);
-    return before;
+    for (const Row& other : rows_) {
+        if (other.state == State::Forgotten || other.root.path == "/.docid")
+            continue;
+        if (isAtOrBelow(row->root.path, other.root.path))
+            return Forgotten{};  // the tree is still that root's
+        if (other.root.inode != 0 && isAtOrBelow(other.root.path, row->root.path))
+            forgotten.kept.insert(other.root.inode);
+    }
+    return forgotten;
 }
 
 std::vector<WatchedRoots::Root> WatchedRoots::watched() const {

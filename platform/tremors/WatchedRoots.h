@@ -4,6 +4,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_set>
 #include <vector>
 
 #include "platform/tremors/SqliteDatabase.h"
@@ -49,7 +50,13 @@ public:
     bool resume(const std::string& path);
     void release(const std::string& path);
     Result<std::vector<std::string>> retire();
-    Result<Root> forget(const std::string& path);
+    // Where the forgotten tree's index entries start (0: nowhere, or they are still another
+    // remembered root's) and the tops of remembered roots inside it, whose entries stay.
+    struct Forgotten {
+        uint64_t top = 0;
+        std::unordered_set<uint64_t> kept;
+    };
+    Result<Forgotten> forget(const std::string& path);
     std::vector<Root> watched() const;
     std::vector<Root> remembered() const;
     bool knows(const std::string& path) const;
