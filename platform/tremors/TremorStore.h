@@ -14,6 +14,7 @@
 #include "platform/tremors/JournalEvent.h"
 #include "platform/tremors/SqliteDatabase.h"
 #include "platform/tremors/TremorStoreDirectory.h"
+#include "platform/tremors/TremorStoreSchema.h"
 #include "platform/tremors/WatchedRoots.h"
 #include "support/Result.h"
 
@@ -38,9 +39,7 @@ public:
         std::string reason;  // why not, for the log
     };
 
-    // 2: the index keeps each entry's birth time, size and modification time.
-    // 3: and its change time, and a copy of each document's metadata attributes.
-    static constexpr int kSchemaVersion = 3;
+    static constexpr int kSchemaVersion = TremorStoreSchema::kVersion;
     static constexpr size_t kDefaultReplayChunk = 1000;
     static constexpr size_t kMaxPathComponents = InodeIndex::kMaxPathComponents;
     static constexpr const char* kDocumentIdRoot = "/.docid";
@@ -183,9 +182,6 @@ private:
     explicit TremorStore(std::unique_ptr<TremorStoreDirectory> dir) : dir_(std::move(dir)) {}
 
     Status load();
-    Status configure();
-    Status createSchema();
-    Status upgrade(int64_t from);
     Status readState();
     Status fetch(Cursor& cursor, size_t chunk, uint64_t upTo);
 
