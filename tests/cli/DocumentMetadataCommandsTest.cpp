@@ -105,7 +105,12 @@ TEST_F(DocumentMetadataCommandsTest, AnAttributeRemovedOnTheFileStaysRemovedAfte
         if (!running)
             endProcess();
         ASSERT_EQ(::removexattr(file.c_str(), kRankAttribute), 0);
-        if (!running) {
+        if (running) {
+            // The journal takes the removal in before the replacement: a removal that a save
+            // overtakes before it is read cannot be told from a value the save dropped.
+            if (auto service = TremorService::sharedIfRunning())
+                service->sync();
+        } else {
             // Seen by the next start: the same file, with another change time.
             id();
             endProcess();
