@@ -20,8 +20,8 @@
 #include "platform/tremors/TremorService.h"
 #include "support/Log.h"
 #include "support/StderrLogSink.h"
-#include "tests/common/AppLibraryTest.h"
 #include "tests/common/CliRunner.h"
+#include "tests/common/CommandLineTest.h"
 #include "tests/common/ScopedFileSystem.h"
 #include "tests/common/TempDir.h"
 
@@ -42,34 +42,13 @@ std::vector<std::string> linesOf(const std::string& text) {
 
 // What a script relies on: the exit status names the class of failure, and the failure is one
 // line on standard error (or one JSON object on standard output with --json).
-class ExitStatusTest : public testing::AppLibraryTest {
+class ExitStatusTest : public testing::CommandLineTest {
 protected:
     void SetUp() override {
-        AppLibraryTest::SetUp();
-        AppRegistry::setDefaultRegistry(nullptr);
-        if (const char* dirs = std::getenv("XDG_DATA_DIRS"))
-            previousDataDirs = dirs;
-        setenv("XDG_DATA_DIRS", systemData.path().c_str(), 1);
-        TremorService::resetForTesting();
-        TremorService::configure(state.path());
-        storage = dir.makeDir("Documents");
+        CommandLineTest::SetUp();
         file = dir.writeFile("Documents/a.txt", "a");
     }
-    void TearDown() override {
-        TremorService::resetForTesting();
-        if (previousDataDirs)
-            setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
-        else
-            unsetenv("XDG_DATA_DIRS");
-        AppLibraryTest::TearDown();
-    }
 
-    CliRun tamber(std::vector<std::string> args) {
-        if (auto service = TremorService::sharedIfRunning())
-            service->sync();
-        args.insert(args.begin(), {"--storage", storage});
-        return testing::runTamber(std::move(args));
-    }
     // Runs a verb that must fail with `status`: nothing on standard output, one line
     // "tamber: ..." on standard error that says what was wrong; returns that line.
     std::string failure(std::vector<std::string> args, int status) {
@@ -102,9 +81,7 @@ protected:
         return id.substr(0, id.find('\n'));
     }
 
-    TempDir state, systemData;
-    std::optional<std::string> previousDataDirs;
-    std::string storage, file;
+    std::string file;
 };
 
 bool mentions(const std::string& line, const std::string& what) {

@@ -17,8 +17,8 @@
 #include "fs/FSChangeToken.h"
 #include "platform/archive/PlistNode.h"
 #include "platform/tremors/TremorService.h"
-#include "tests/common/AppLibraryTest.h"
 #include "tests/common/CliRunner.h"
+#include "tests/common/CommandLineTest.h"
 #include "tests/common/TempDir.h"
 
 namespace tamber {
@@ -35,27 +35,8 @@ constexpr auto kDeadline = std::chrono::seconds(60);
 // Extreme and malformed values through every verb that reads them. Each run must end with an
 // answer or a clear error: a verb that hangs ends the test program with a failure instead of
 // blocking the suite, and a crash ends it by itself.
-class HostileInputTest : public testing::AppLibraryTest {
+class HostileInputTest : public testing::CommandLineTest {
 protected:
-    void SetUp() override {
-        AppLibraryTest::SetUp();
-        AppRegistry::setDefaultRegistry(nullptr);
-        if (const char* dirs = std::getenv("XDG_DATA_DIRS"))
-            previousDataDirs = dirs;
-        setenv("XDG_DATA_DIRS", systemData.path().c_str(), 1);
-        TremorService::resetForTesting();
-        TremorService::configure(state.path());
-        storage = dir.makeDir("Documents");
-    }
-    void TearDown() override {
-        TremorService::resetForTesting();
-        if (previousDataDirs)
-            setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
-        else
-            unsetenv("XDG_DATA_DIRS");
-        AppLibraryTest::TearDown();
-    }
-
     CliRun tamber(std::vector<std::string> args) {
         if (auto service = TremorService::sharedIfRunning())
             service->sync();
@@ -135,10 +116,6 @@ protected:
         EXPECT_EQ(answer["error"]["domain"], "HostPorterErrorDomain") << what << ": " << answer;
         EXPECT_EQ(answer["error"]["code"], -1002) << what << ": " << answer;
     }
-
-    testing::TempDir state, systemData;
-    std::optional<std::string> previousDataDirs;
-    std::string storage;
 };
 
 TEST_F(HostileInputTest, AnchorsWithAnyEventIDEndAtOnceAndIDsBeyondTheLastExpire) {
@@ -320,7 +297,8 @@ TEST_F(HostileInputTest, MalformedIdentifiersAreRefusedAndNeverNameAnotherItem) 
             json answer = tamberJson(args);
             // No such item (3), or, for text that is no identifier at all, a path outside
             // the published trees (1).
-            EXPECT_TRUE(answer["status"] == 3 || answer["status"] == 1) << args[0] << " \"" << shown << "\": " << answer;
+            EXPECT_TRUE(answer["status"] == 3 || answer["status"] == 1)
+                << args[0] << " \"" << shown << "\": " << answer;
             EXPECT_TRUE(answer.contains("error")) << args[0] << " \"" << shown << "\": " << answer;
         }
     }

@@ -5,8 +5,8 @@
 #include <set>
 
 #include "platform/tremors/TremorService.h"
-#include "tests/common/AppLibraryTest.h"
 #include "tests/common/CliRunner.h"
+#include "tests/common/CommandLineTest.h"
 #include "tests/common/TempDir.h"
 
 namespace tamber {
@@ -18,31 +18,8 @@ using testing::TempDir;
 
 // The ls, anchor and changes verbs over a fresh storage folder, the real journal and the real
 // (empty) application registry.
-class ListingCommandsTest : public testing::AppLibraryTest {
+class ListingCommandsTest : public testing::CommandLineTest {
 protected:
-    void SetUp() override {
-        AppLibraryTest::SetUp();
-        AppRegistry::setDefaultRegistry(nullptr);
-        if (const char* dirs = std::getenv("XDG_DATA_DIRS"))
-            previousDataDirs = dirs;
-        setenv("XDG_DATA_DIRS", systemData.path().c_str(), 1);
-        TremorService::resetForTesting();
-        TremorService::configure(state.path());
-        storage = dir.makeDir("Documents");
-    }
-    void TearDown() override {
-        TremorService::resetForTesting();
-        if (previousDataDirs)
-            setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
-        else
-            unsetenv("XDG_DATA_DIRS");
-        AppLibraryTest::TearDown();
-    }
-
-    CliRun tamber(std::vector<std::string> args) {
-        args.insert(args.begin(), {"--storage", storage});
-        return testing::runTamber(std::move(args));
-    }
     json tamberJson(std::vector<std::string> args, int expectedStatus = 0) {
         args.push_back("--json");
         CliRun run = tamber(std::move(args));
@@ -54,10 +31,6 @@ protected:
         for (const auto& item : items) ids.insert(item["identifier"].get<std::string>());
         return ids;
     }
-
-    TempDir state, systemData;
-    std::optional<std::string> previousDataDirs;
-    std::string storage;
 };
 
 TEST_F(ListingCommandsTest, PagesOf200ResumeFromTheirTokenAndAllListsEverythingOnce) {
