@@ -8,6 +8,7 @@
 
 #include "host/HostPorterManager.h"
 #include "host/RecordingHostPorterManager.h"
+#include "tests/common/TempStagingLedger.h"
 
 namespace tamber::testing {
 
@@ -27,5 +28,13 @@ public:
 private:
     std::shared_ptr<HostPorterManager> previous_;
 };
+
+// For a test program of file operations in TempDirs: the temporary folder is published, and
+// import staging copies are recorded in a ledger of the program's own.
+inline bool addTempFileOperationEnvironments() {
+    ::testing::AddGlobalTestEnvironment(new PublishedTempBase);
+    ::testing::AddGlobalTestEnvironment(new TempStagingLedger);
+    return true;
+}
 
 }  // namespace tamber::testing
