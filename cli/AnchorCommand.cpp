@@ -4,9 +4,9 @@
 #include <optional>
 #include <ostream>
 
-#include "cli/Base64.h"
 #include "cli/ContainerArgument.h"
-#include "cli/JsonValues.h"
+#include "runtime/Base64.h"
+#include "runtime/JsonValues.h"
 #include "support/DispatchSemaphore.h"
 
 namespace tamber {
@@ -16,17 +16,14 @@ CLI::App* AnchorCommand::add(CLI::App& app) {
     sub->add_option("ID", container_,
                     "A folder's identifier or path, or root, working-set, all-directories")
         ->required();
-    sub->add_flag("--json", json_, R"(Print {"anchor": A})");
+    addJsonFlag(sub, R"(Print {"anchor": A})");
     return sub;
 }
 
-int AnchorCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
-    auto container = ContainerArgument::resolve(*porter.value(), container_);
+int AnchorCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    auto container = ContainerArgument::resolve(provider, container_);
     if (!container.ok())
-        return context.fail(container.error(), json_);
+        return fail(context, container.error());
     auto enumerator = container.value().enumerator;
     std::optional<HostPorterSyncAnchor> anchor;
     DispatchSemaphore done;
@@ -38,11 +35,10 @@ int AnchorCommand::run(CliContext& context) {
     done.wait();
     enumerator->invalidate();
     if (!anchor) {
-        return context.fail(Error(kPosixErrorDomain, EIO,
-                                  {{"description",
-                                    "no sync anchor: the container's volume has "
-                                    "no event journal"}}),
-                            json_);
+        return fail(context, Error(kPosixErrorDomain, EIO,
+                                   {{"description",
+                                     "no sync anchor: the container's volume has "
+                                     "no event journal"}}));
     }
     if (json_)
         context.out() << jsonText(nlohmann::json{{"anchor", base64Encode(*anchor)}}) << "\n";

@@ -2,19 +2,19 @@
 
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber anchor ID`: the container's current sync anchor, alone on a line (base64).
-class AnchorCommand : public Command {
+class AnchorCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string container_;
-    bool json_ = false;
 };
 
 }  // namespace tamber

@@ -4,9 +4,8 @@
 #include <ostream>
 
 #include "applibraries/LocalAppLibraryManager.h"
-#include "cli/JsonValues.h"
 #include "items/LocalAppLibraryItem.h"
-#include "provider/LocalPorter.h"
+#include "runtime/JsonValues.h"
 
 namespace tamber {
 
@@ -14,17 +13,14 @@ CLI::App* AppsCommand::add(CLI::App& app) {
     auto* sub = app.add_subcommand("apps", "List the app libraries (installed apps' Documents)");
     sub->add_flag("--refresh", refresh_,
                   "Report whether reading the installed applications changed the list");
-    sub->add_flag("--json", json_,
-                  "Print {\"versionToken\": N, \"libraries\": [{\"identifier\", \"name\", "
-                  "\"bundleIdentifier\", \"root\"}]}");
+    addJsonFlag(sub,
+                "Print {\"versionToken\": N, \"libraries\": [{\"identifier\", \"name\", "
+                "\"bundleIdentifier\", \"root\"}]}");
     return sub;
 }
 
-int AppsCommand::run(CliContext& context) {
+int AppsCommand::runWith(CliContext& context, HostPorterExtension&) {
     // Preparing the provider already refreshes from the registry, as every verb does.
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
     auto manager = LocalAppLibraryManager::shared();
     auto items = manager->allItems();
     std::sort(items.begin(), items.end(), [](const auto& a, const auto& b) {

@@ -1,19 +1,19 @@
 #pragma once
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber apps [--refresh] [--json]`: the app libraries the provider publishes, and the version
 // token of the list they came from.
-class AppsCommand : public Command {
+class AppsCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     bool refresh_ = false;
-    bool json_ = false;
 };
 
 }  // namespace tamber

@@ -3,13 +3,13 @@
 #include <memory>
 #include <ostream>
 
-#include "cli/Base64.h"
-#include "cli/ChangeCollector.h"
 #include "cli/ContainerArgument.h"
 #include "cli/Interrupt.h"
-#include "cli/ItemJson.h"
-#include "cli/JsonValues.h"
 #include "cli/TextEscape.h"
+#include "runtime/Base64.h"
+#include "runtime/ChangeCollector.h"
+#include "runtime/HostJson.h"
+#include "runtime/JsonValues.h"
 
 namespace tamber {
 
@@ -20,60 +20,39 @@ CLI::App* ChangesCommand::add(CLI::App& app) {
         ->required();
     sub->add_option("--anchor", anchor_, "The sync anchor (base64, from anchor or changes)")
         ->required();
-    sub->add_flag(
-        "--json", json_,
-        R"(Print {"updated": [...], "deleted": [...], "changes": [in order], "anchor": A, )"
-        R"("moreComing": b})");
+    addJsonFlag(sub,
+                R"(Print {"updated": [...], "deleted": [...], "changes": [in order], "anchor": A, )"
+                R"("moreComing": b})");
     return sub;
 }
 
-int ChangesCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
+int ChangesCommand::runWith(CliContext& context, HostPorterExtension& provider) {
     auto anchor = base64Decode(anchor_);
     if (!anchor)
-        return context.fail(CliContext::usageError("--anchor is not base64: " + anchor_), json_);
-    auto container = ContainerArgument::resolve(*porter.value(), container_);
+        return fail(context, CliContext::usageError("--anchor is not base64: " + anchor_));
+    auto container = ContainerArgument::resolve(provider, container_);
     if (!container.ok())
-        return context.fail(container.error(), json_);
+        return fail(context, container.error());
     auto enumerator = container.value().enumerator;
 
     auto collector = std::make_shared<ChangeCollector>();
     catchInterrupts();
     enumerator->enumerateChangesForObserver(collector, *anchor);
     // A batch ends once the history is replayed; only an interrupt cuts it short.
-    bool finished = false;
-    while (!(finished = collector->wait(0.2)) && !interrupted()) {
+    std::optional<ChangeCollector::Batch> batch;
+    while (!(batch = collector->waitFor(0.2)) && !interrupted()) {
     }
     enumerator->invalidate();
-    if (!finished)
-        return context.fail(CliContext::usageError("interrupted"), json_);
-    if (collector->error)
-        return context.fail(*collector->error, json_);
+    if (!batch)
+        return fail(context, CliContext::usageError("interrupted"));
+    if (batch->error)
+        return fail(context, *batch->error);
 
-    std::string next = collector->anchor ? base64Encode(*collector->anchor) : "";
     if (json_) {
-        nlohmann::json updated = nlohmann::json::array();
-        nlohmann::json changes = nlohmann::json::array();
-        for (const auto& change : collector->changes) {
-            auto local = std::dynamic_pointer_cast<const LocalItem>(change.item);
-            if (local) {
-                updated.push_back(itemJson(*local));
-                changes.push_back({{"updated", itemJson(*local)}});
-            } else if (!change.item) {
-                changes.push_back({{"deleted", change.deletedItem}});
-            }
-        }
-        nlohmann::json result{{"updated", std::move(updated)},
-                              {"deleted", collector->deleted},
-                              {"changes", std::move(changes)},
-                              {"anchor", next},
-                              {"moreComing", collector->moreComing}};
-        context.out() << jsonText(result) << "\n";
+        context.out() << jsonText(HostJson::changeBatch(*batch)) << "\n";
         return 0;
     }
-    for (const auto& change : collector->changes) {
+    for (const auto& change : batch->changes) {
         if (change.item) {
             context.out() << "updated\t" << escapedText(change.item->itemIdentifier()) << "\t"
                           << escapedText(change.item->filename()) << "\n";
@@ -81,7 +60,8 @@ int ChangesCommand::run(CliContext& context) {
             context.out() << "deleted\t" << escapedText(change.deletedItem) << "\n";
         }
     }
-    context.out() << "anchor: " << next << (collector->moreComing ? " (more coming)" : "") << "\n";
+    std::string next = batch->anchor ? base64Encode(*batch->anchor) : "";
+    context.out() << "anchor: " << next << (batch->moreComing ? " (more coming)" : "") << "\n";
     return 0;
 }
 

@@ -2,21 +2,21 @@
 
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber changes ID --anchor A [--json]`: one batch of the changes since a sync anchor, with
 // the anchor to continue from.
-class ChangesCommand : public Command {
+class ChangesCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string container_;
     std::string anchor_;
-    bool json_ = false;
 };
 
 }  // namespace tamber

@@ -8,13 +8,14 @@
 
 #include "applibraries/SharedAppLibraryLookup.h"
 #include "applibraries/TBPAppLibraryManager.h"
-#include "cli/JsonValues.h"
 #include "host/HostPorterManager.h"
 #include "host/PublishedTrees.h"
 #include "host/StagingCopies.h"
 #include "platform/FileContents.h"
 #include "platform/tremors/TremorService.h"
 #include "provider/LocalPorterError.h"
+#include "runtime/HostJson.h"
+#include "runtime/JsonValues.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -165,9 +166,7 @@ std::string CliContext::errorMessage(const Error& error) {
 }
 
 nlohmann::json CliContext::errorJson(const Error& error) {
-    return {
-        {"error",
-         {{"domain", error.domain()}, {"code", error.code()}, {"message", errorMessage(error)}}}};
+    return HostJson::error(error);
 }
 
 std::string CliContext::failureLine(const Error& error) const {

@@ -1,14 +1,15 @@
 #include "cli/ContainerArgument.h"
 
-#include "cli/ItemAction.h"
+#include "cli/ItemArgument.h"
 
 namespace tamber {
 
-Result<ContainerArgument> ContainerArgument::resolve(LocalPorter& porter, const std::string& text) {
-    auto identifier = ItemAction::identifierFor(porter, text);
+Result<ContainerArgument> ContainerArgument::resolve(HostPorterExtension& provider,
+                                                     const std::string& text) {
+    auto identifier = ItemArgument::resolve(provider, text);
     if (!identifier.ok())
         return identifier.error();
-    auto enumerator = porter.enumeratorForContainerItemIdentifier(identifier.value());
+    auto enumerator = provider.enumeratorForContainerItemIdentifier(identifier.value());
     if (!enumerator.ok())
         return enumerator.error();
     return ContainerArgument{identifier.value(), enumerator.value()};

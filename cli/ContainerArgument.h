@@ -2,8 +2,9 @@
 
 #include <string>
 
-#include "cli/CliContext.h"
 #include "host/HostPorterEnumerator.h"
+#include "host/HostPorterExtension.h"
+#include "support/Result.h"
 
 namespace tamber {
 
@@ -13,7 +14,8 @@ struct ContainerArgument {
     HostPorterItemIdentifier identifier;
     HostPorterEnumeratorRef enumerator;
 
-    static Result<ContainerArgument> resolve(LocalPorter& porter, const std::string& text);
+    static Result<ContainerArgument> resolve(HostPorterExtension& provider,
+                                             const std::string& text);
 };
 
 }  // namespace tamber

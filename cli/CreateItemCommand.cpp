@@ -1,6 +1,7 @@
 #include "cli/CreateItemCommand.h"
 
-#include "cli/ItemAction.h"
+#include "cli/ItemArgument.h"
+#include "runtime/ProviderCalls.h"
 
 namespace tamber {
 
@@ -22,32 +23,30 @@ CLI::App* CreateItemCommand::add(CLI::App& app) {
     sub->add_option("PARENT", parent_,
                     "The folder to create it in: an identifier (fid=N, #bundle.id) or a path")
         ->required();
-    sub->add_flag("--json", json_, "Print the item as `tamber item --json` does");
+    addJsonFlag(sub, "Print the item as `tamber item --json` does");
     return sub;
 }
 
-int CreateItemCommand::run(CliContext& context) {
-    if (verb_ == Verb::Import && source_.empty()) {
-        return context.fail(
-            Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
-                  {{"parameter", "source"}, {"description", "the source path must not be empty"}}),
-            json_);
-    }
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
-    auto parent = ItemAction::identifierFor(*porter.value(), parent_);
+Status CreateItemCommand::checkArguments() {
+    if (verb_ == Verb::Import && source_.empty())
+        return Error(
+            kHostPorterErrorDomain, kHostPorterInvalidParameter,
+            {{"parameter", "source"}, {"description", "the source path must not be empty"}});
+    return std::nullopt;
+}
+
+int CreateItemCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    auto parent = ItemArgument::resolve(provider, parent_);
     if (!parent.ok())
-        return context.fail(parent.error(), json_);
-    auto item = ItemAction::waitForItem([&](LocalPorter::ItemCompletion done) {
-        if (verb_ == Verb::Import)
-            porter.value()->importDocumentAtURL(Url::fileURLWithPath(source_), parent.value(),
-                                                std::move(done));
-        else
-            porter.value()->createDirectoryWithName(source_, parent.value(), bounce_,
-                                                    std::move(done));
-    });
-    return ItemAction::finish(context, item, json_);
+        return fail(context, parent.error());
+    return finish(context, ProviderCalls::waitForItem([&](auto done) {
+                      if (verb_ == Verb::Import)
+                          provider.importDocumentAtURL(Url::fileURLWithPath(source_),
+                                                       parent.value(), std::move(done));
+                      else
+                          provider.createDirectoryWithName(source_, parent.value(), bounce_,
+                                                           std::move(done));
+                  }));
 }
 
 }  // namespace tamber

@@ -6,8 +6,8 @@
 #include <ostream>
 
 #include "cli/Interrupt.h"
-#include "cli/JsonValues.h"
 #include "cli/TextEscape.h"
+#include "runtime/JsonValues.h"
 
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/objects/Array.h"

@@ -2,32 +2,28 @@
 
 #include <ostream>
 
-#include "cli/JsonValues.h"
 #include "host/PublishedTrees.h"
-#include "items/TBFileObjectIdentifier.h"
+#include "runtime/JsonValues.h"
 
 namespace tamber {
 
 CLI::App* IdCommand::add(CLI::App& app) {
     auto* sub = app.add_subcommand("id", "Print the persistent identifier of a file or folder");
     sub->add_option("PATH", path_, "A file or folder inside the published folders")->required();
-    sub->add_flag("--json", json_, "Print {\"id\": ..., \"path\": ...}");
+    addJsonFlag(sub, "Print {\"id\": ..., \"path\": ...}");
     return sub;
 }
 
-int IdCommand::run(CliContext& context) {
-    if (auto porter = context.prepareProvider(); !porter.ok())
-        return context.fail(porter.error(), json_);
+int IdCommand::runWith(CliContext& context, HostPorterExtension& provider) {
     Url url = Url::fileURLWithPath(path_);
     if (auto outside = PublishedTrees::check(url))
-        return context.fail(*outside, json_);
-    auto identifier = TBFileObjectIdentifier::itemIdentifier(url);
+        return fail(context, *outside);
+    auto identifier = provider.persistentIdentifierForItemAtURL(url);
     if (!identifier) {
-        return context.fail(Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,
-                                  {{"description", "no identifier for " + url.path() +
-                                                       " (missing, or outside the published "
-                                                       "folders)"}}),
-                            json_);
+        return fail(context, Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,
+                                   {{"description", "no identifier for " + url.path() +
+                                                        " (missing, or outside the published "
+                                                        "folders)"}}));
     }
     if (json_) {
         nlohmann::json result{{"id", *identifier}};

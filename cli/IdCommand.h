@@ -2,19 +2,19 @@
 
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber id PATH`: prints the persistent identifier of the item at PATH.
-class IdCommand : public Command {
+class IdCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string path_;
-    bool json_ = false;
 };
 
 }  // namespace tamber

@@ -2,6 +2,8 @@
 
 #include <string_view>
 
+#include "host/PublishedTrees.h"
+
 namespace tamber {
 
 namespace {
@@ -29,6 +31,19 @@ ItemArgument ItemArgument::parse(const std::string& text) {
         argument.url = Url::fileURLWithPath(text);
     }
     return argument;
+}
+
+Result<HostPorterItemIdentifier> ItemArgument::resolve(HostPorterExtension& provider,
+                                                       const std::string& text) {
+    ItemArgument argument = parse(text);
+    if (argument.kind == Kind::Identifier)
+        return argument.identifier;
+    if (auto outside = PublishedTrees::check(argument.url))
+        return *outside;
+    auto identifier = provider.persistentIdentifierForItemAtURL(argument.url);
+    if (!identifier)
+        return Error::porterErrorForNonExistentItemWithIdentifier(argument.url.path());
+    return *identifier;
 }
 
 }  // namespace tamber

@@ -2,6 +2,7 @@
 
 #include <string>
 
+#include "host/HostPorterExtension.h"
 #include "host/HostPorterItemIdentifier.h"
 #include "platform/Url.h"
 
@@ -16,6 +17,11 @@ struct ItemArgument {
     Url url;                              // Kind::Path
 
     static ItemArgument parse(const std::string& text);
+    // The identifier `text` names: identifiers and container words as they are, a path through
+    // the provider. A path outside the published trees is refused; one the provider does not
+    // know is no such item.
+    static Result<HostPorterItemIdentifier> resolve(HostPorterExtension& provider,
+                                                    const std::string& text);
 };
 
 }  // namespace tamber

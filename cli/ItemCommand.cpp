@@ -3,9 +3,6 @@
 #include <ostream>
 
 #include "cli/ItemArgument.h"
-#include "cli/ItemJson.h"
-#include "cli/JsonValues.h"
-#include "provider/LocalPorter.h"
 
 namespace tamber {
 
@@ -15,25 +12,16 @@ CLI::App* ItemCommand::add(CLI::App& app) {
                     "An identifier (fid=N, did=N, #bundle.id, root), or a path inside the "
                     "published folders")
         ->required();
-    sub->add_flag("--json", json_, "Print the record as JSON");
+    addJsonFlag(sub, "Print the record as JSON");
     return sub;
 }
 
-int ItemCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
+int ItemCommand::runWith(CliContext& context, HostPorterExtension& provider) {
     ItemArgument argument = ItemArgument::parse(item_);
     auto item = argument.kind == ItemArgument::Kind::Path
-                    ? porter.value()->itemForURL(argument.url)
-                    : porter.value()->itemForIdentifierLogged(argument.identifier);
-    if (!item.ok())
-        return context.fail(item.error(), json_);
-    if (json_)
-        context.out() << jsonText(itemJson(*item.value())) << "\n";
-    else
-        printItemText(context.out(), *item.value());
-    return 0;
+                    ? provider.itemAtURL(argument.url)
+                    : provider.itemForIdentifier(argument.identifier);
+    return finish(context, item);
 }
 
 }  // namespace tamber

@@ -2,19 +2,19 @@
 
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber item ID|PATH [--json]`: prints the item record the provider hands to the host.
-class ItemCommand : public Command {
+class ItemCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string item_;
-    bool json_ = false;
 };
 
 }  // namespace tamber

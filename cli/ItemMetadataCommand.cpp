@@ -2,11 +2,12 @@
 
 #include <charconv>
 
-#include "cli/ItemAction.h"
+#include "cli/ItemArgument.h"
 #include "cli/TagLabels.h"
 #include "platform/Tag.h"
 #include "platform/objects/Date.h"
 #include "platform/objects/Number.h"
+#include "runtime/ProviderCalls.h"
 
 namespace tamber {
 
@@ -29,48 +30,44 @@ CLI::App* ItemMetadataCommand::add(CLI::App& app) {
             sub->add_flag("--clear", clear_, "Clear the last-used date instead");
             break;
     }
-    sub->add_flag("--json", json_, "Print the item as `tamber item --json` does");
+    addJsonFlag(sub, "Print the item as `tamber item --json` does");
     return sub;
 }
 
-int ItemMetadataCommand::run(CliContext& context) {
-    std::shared_ptr<const Number> rank;
-    if (verb_ == Verb::Rank && rank_ != "none") {
-        int64_t value = 0;
-        auto [end, ec] = std::from_chars(rank_.data(), rank_.data() + rank_.size(), value);
-        if (ec != std::errc() || end != rank_.data() + rank_.size())
-            return context.fail(
-                CliContext::usageError("RANK takes an integer or \"none\", not \"" + rank_ + "\""),
-                json_);
-        rank = Number::fromInt64(value);
-    }
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
-    auto& provider = *porter.value();
-    auto item = ItemAction::identifierFor(provider, item_);
-    if (!item.ok())
-        return context.fail(item.error(), json_);
+Status ItemMetadataCommand::checkArguments() {
+    if (verb_ != Verb::Rank || rank_ == "none")
+        return std::nullopt;
+    int64_t value = 0;
+    auto [end, ec] = std::from_chars(rank_.data(), rank_.data() + rank_.size(), value);
+    if (ec != std::errc() || end != rank_.data() + rank_.size())
+        return CliContext::usageError("RANK takes an integer or \"none\", not \"" + rank_ + "\"");
+    rankValue_ = Number::fromInt64(value);
+    return std::nullopt;
+}
 
-    auto result = ItemAction::waitForItem([&](LocalPorter::ItemCompletion done) {
-        switch (verb_) {
-            case Verb::Tag: {
-                std::optional<Bytes> data;
-                if (auto labels = TagLabels::cleaned(tags_); !labels.empty()) {
-                    std::vector<std::shared_ptr<const Tag>> tags;
-                    for (const auto& label : labels) tags.push_back(Tag::make(label));
-                    data = GetTagsDataForTags(tags);
-                }
-                return provider.setTagData(data, item.value(), std::move(done));
-            }
-            case Verb::Rank:
-                return provider.setFavoriteRank(rank, item.value(), std::move(done));
-            case Verb::Touch:
-                return provider.setLastUsedDate(clear_ ? nullptr : Date::now(), item.value(),
-                                                std::move(done));
-        }
-    });
-    return ItemAction::finish(context, result, json_);
+int ItemMetadataCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    auto item = ItemArgument::resolve(provider, item_);
+    if (!item.ok())
+        return fail(context, item.error());
+    return finish(context, ProviderCalls::waitForItem([&](auto done) {
+                      switch (verb_) {
+                          case Verb::Tag: {
+                              std::optional<Bytes> data;
+                              if (auto labels = TagLabels::cleaned(tags_); !labels.empty()) {
+                                  std::vector<std::shared_ptr<const Tag>> tags;
+                                  for (const auto& label : labels) tags.push_back(Tag::make(label));
+                                  data = GetTagsDataForTags(tags);
+                              }
+                              return provider.setTagData(data, item.value(), std::move(done));
+                          }
+                          case Verb::Rank:
+                              return provider.setFavoriteRank(rankValue_, item.value(),
+                                                              std::move(done));
+                          case Verb::Touch:
+                              return provider.setLastUsedDate(clear_ ? nullptr : Date::now(),
+                                                              item.value(), std::move(done));
+                      }
+                  }));
 }
 
 }  // namespace tamber

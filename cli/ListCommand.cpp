@@ -3,12 +3,12 @@
 #include <memory>
 #include <ostream>
 
-#include "cli/Base64.h"
 #include "cli/ContainerArgument.h"
-#include "cli/ItemJson.h"
-#include "cli/JsonValues.h"
-#include "cli/PageCollector.h"
 #include "cli/TextEscape.h"
+#include "runtime/Base64.h"
+#include "runtime/HostJson.h"
+#include "runtime/JsonValues.h"
+#include "runtime/PageCollector.h"
 
 namespace tamber {
 
@@ -19,50 +19,46 @@ CLI::App* ListCommand::add(CLI::App& app) {
         ->required();
     sub->add_option("--page", page_, "Continue from this page token (base64, from a previous ls)");
     sub->add_flag("--all", all_, "List every page, not just one");
-    sub->add_flag("--json", json_, R"(Print {"items": [...], "nextPage": TOKEN or null})");
+    addJsonFlag(sub, R"(Print {"items": [...], "nextPage": TOKEN or null})");
     return sub;
 }
 
-int ListCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
+int ListCommand::runWith(CliContext& context, HostPorterExtension& provider) {
     HostPorterPage page = HostPorterInitialPageSortedByName();
     if (!page_.empty()) {
         auto decoded = base64Decode(page_);
         if (!decoded)
-            return context.fail(CliContext::usageError("--page is not base64: " + page_), json_);
+            return fail(context, CliContext::usageError("--page is not base64: " + page_));
         page = *decoded;
     }
-    auto container = ContainerArgument::resolve(*porter.value(), container_);
+    auto container = ContainerArgument::resolve(provider, container_);
     if (!container.ok())
-        return context.fail(container.error(), json_);
+        return fail(context, container.error());
     auto enumerator = container.value().enumerator;
 
-    nlohmann::json items = nlohmann::json::array();
+    std::vector<HostPorterItemRef> items;
     std::optional<HostPorterPage> next;
     size_t pages = 0;
     for (;;) {
         auto collector = std::make_shared<PageCollector>();
         enumerator->enumerateItemsForObserver(collector, page);
-        collector->wait();
-        if (collector->error) {
+        PageCollector::Page listed = collector->wait();
+        if (listed.error) {
             enumerator->invalidate();
-            return context.fail(*collector->error, json_);
+            return fail(context, *listed.error);
         }
-        for (const auto& item : collector->items) {
-            auto local = std::dynamic_pointer_cast<const LocalItem>(item);
-            if (!local)
+        for (auto& item : listed.items) {
+            if (!item)
                 continue;
             if (json_) {
-                items.push_back(itemJson(*local));
+                items.push_back(std::move(item));
             } else {
-                context.out() << escapedText(local->itemIdentifier()) << "\t"
-                              << escapedText(local->filename()) << "\t" << local->typeIdentifier()
+                context.out() << escapedText(item->itemIdentifier()) << "\t"
+                              << escapedText(item->filename()) << "\t" << item->typeIdentifier()
                               << "\n";
             }
         }
-        next = collector->nextPage;
+        next = listed.nextPage;
         ++pages;
         if (!all_ || !next)
             break;
@@ -71,13 +67,10 @@ int ListCommand::run(CliContext& context) {
         page = *next;
     }
     enumerator->invalidate();
-    if (json_) {
-        nlohmann::json result{{"items", std::move(items)},
-                              {"nextPage", next ? nlohmann::json(base64Encode(*next)) : nullptr}};
-        context.out() << jsonText(result) << "\n";
-    } else if (next) {
+    if (json_)
+        context.out() << jsonText(HostJson::page(items, next)) << "\n";
+    else if (next)
         context.out() << "next page: " << base64Encode(*next) << "\n";
-    }
     return 0;
 }
 

@@ -7,10 +7,10 @@
 #include "applibraries/LocalAppLibraryCache.h"
 #include "applibraries/LocalAppLibraryManager.h"
 #include "applibraries/SharedAppLibraryLookup.h"
-#include "cli/JsonValues.h"
 #include "cli/TagLabels.h"
 #include "host/PublishedTrees.h"
 #include "platform/objects/Number.h"
+#include "runtime/JsonValues.h"
 
 namespace tamber {
 

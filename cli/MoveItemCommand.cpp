@@ -1,6 +1,7 @@
 #include "cli/MoveItemCommand.h"
 
-#include "cli/ItemAction.h"
+#include "cli/ItemArgument.h"
+#include "runtime/ProviderCalls.h"
 
 namespace tamber {
 
@@ -17,33 +18,26 @@ CLI::App* MoveItemCommand::add(CLI::App& app) {
             ->required();
         sub->add_option("--name", name_, "Also give the item this name");
     }
-    sub->add_flag("--json", json_, "Print the item as `tamber item --json` does");
+    addJsonFlag(sub, "Print the item as `tamber item --json` does");
     return sub;
 }
 
-int MoveItemCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
-    auto& provider = *porter.value();
-    auto item = ItemAction::identifierFor(provider, item_);
+int MoveItemCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    auto item = ItemArgument::resolve(provider, item_);
     if (!item.ok())
-        return context.fail(item.error(), json_);
+        return fail(context, item.error());
     if (verb_ == Verb::Rename) {
-        return ItemAction::finish(context, ItemAction::waitForItem([&](auto done) {
-                                      provider.renameItemWithIdentifier(item.value(), target_,
-                                                                        std::move(done));
-                                  }),
-                                  json_);
+        return finish(context, ProviderCalls::waitForItem([&](auto done) {
+                          provider.renameItemWithIdentifier(item.value(), target_, std::move(done));
+                      }));
     }
-    auto parent = ItemAction::identifierFor(provider, target_);
+    auto parent = ItemArgument::resolve(provider, target_);
     if (!parent.ok())
-        return context.fail(parent.error(), json_);
-    return ItemAction::finish(context, ItemAction::waitForItem([&](auto done) {
-                                  provider.reparentItemWithIdentifier(item.value(), parent.value(),
-                                                                      name_, std::move(done));
-                              }),
-                              json_);
+        return fail(context, parent.error());
+    return finish(context, ProviderCalls::waitForItem([&](auto done) {
+                      provider.reparentItemWithIdentifier(item.value(), parent.value(), name_,
+                                                          std::move(done));
+                  }));
 }
 
 }  // namespace tamber

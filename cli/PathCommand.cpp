@@ -3,10 +3,9 @@
 #include <ostream>
 
 #include "cli/ItemArgument.h"
-#include "cli/JsonValues.h"
 #include "host/HostPorterManager.h"
 #include "host/PublishedTrees.h"
-#include "items/TBFileObjectIdentifier.h"
+#include "runtime/JsonValues.h"
 
 namespace tamber {
 
@@ -15,21 +14,18 @@ CLI::App* PathCommand::add(CLI::App& app) {
     sub->add_option("ID", identifier_,
                     "An identifier (fid=N, did=N, #bundle.id), root, working-set, or a path")
         ->required();
-    sub->add_flag("--json", json_, "Print {\"id\": ..., \"path\": ...}");
+    addJsonFlag(sub, "Print {\"id\": ..., \"path\": ...}");
     return sub;
 }
 
-int PathCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
+int PathCommand::runWith(CliContext& context, HostPorterExtension& provider) {
     ItemArgument argument = ItemArgument::parse(identifier_);
     std::optional<Url> url;
     if (argument.kind == ItemArgument::Kind::Path) {
         if (auto outside = PublishedTrees::check(argument.url))
-            return context.fail(*outside, json_);
+            return fail(context, *outside);
         // Only an item answers: something that exists and has an identifier.
-        if (porter.value()->persistentIdentifierForItemAtURL(argument.url))
+        if (provider.persistentIdentifierForItemAtURL(argument.url))
             url = argument.url;
     } else if (argument.identifier == HostPorterWorkingSetContainerItemIdentifier ||
                argument.identifier == HostPorterRootContainerItemIdentifier) {
@@ -37,10 +33,10 @@ int PathCommand::run(CliContext& context) {
         url = HostPorterManager::defaultManager()->documentStorageURL();
     } else {
         // Resolution answers nothing outside the published trees.
-        url = porter.value()->URLForItemWithPersistentIdentifier(argument.identifier);
+        url = provider.URLForItemWithPersistentIdentifier(argument.identifier);
     }
     if (!url)
-        return context.fail(Error::porterErrorForNonExistentItemWithIdentifier(identifier_), json_);
+        return fail(context, Error::porterErrorForNonExistentItemWithIdentifier(identifier_));
     if (json_) {
         nlohmann::json result{{"id", identifier_}};
         setTextWithBytes(result, "path", "pathBytes", url->path());

@@ -2,19 +2,19 @@
 
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber path ID`: prints the path of the item an identifier names.
-class PathCommand : public Command {
+class PathCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string identifier_;
-    bool json_ = false;
 };
 
 }  // namespace tamber

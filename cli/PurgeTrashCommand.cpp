@@ -1,58 +1,13 @@
 #include "cli/PurgeTrashCommand.h"
 
-#include <fcntl.h>
-
-#include <algorithm>
 #include <charconv>
 #include <ostream>
-#include <vector>
 
-#include "applibraries/LocalAppLibraryManager.h"
-#include "cli/ItemAction.h"
-#include "cli/JsonValues.h"
-#include "items/LocalAppLibraryItem.h"
-#include "platform/FileSystem.h"
 #include "platform/objects/Date.h"
-#include "provider/TrashLocations.h"
+#include "runtime/JsonValues.h"
+#include "runtime/ProviderCalls.h"
 
 namespace tamber {
-
-namespace {
-
-// The folders the sweep looks at: each library's trash and the storage's.
-std::vector<Url> trashFolders(const Url& storage) {
-    std::vector<Url> folders;
-    auto add = [&](const Url& folder) {
-        if (std::find(folders.begin(), folders.end(), folder) == folders.end())
-            folders.push_back(folder);
-    };
-    for (const auto& library : LocalAppLibraryManager::shared()->allItems()) {
-        if (auto trash = trashFolderForURL(library->fileURL()))
-            add(*trash);
-    }
-    add(storage.appendingPathComponent(".Trash"));
-    return folders;
-}
-
-// Trashed items are the visible entries at the top of the trash folders; a folder that is
-// missing or unreadable holds none.
-size_t countTrashedItems(const std::vector<Url>& folders) {
-    FileSystem& fs = FileSystem::current();
-    size_t count = 0;
-    for (const auto& folder : folders) {
-        int fd = fs.open(folder.path(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-        if (fd < 0)
-            continue;
-        std::vector<FileSystem::DirectoryEntry> entries;
-        if (fs.readDirectory(fd, entries))
-            count += std::count_if(entries.begin(), entries.end(),
-                                   [](const auto& entry) { return entry.name.front() != '.'; });
-        fs.close(fd);
-    }
-    return count;
-}
-
-}  // namespace
 
 std::optional<double> PurgeTrashCommand::parseDuration(const std::string& text) {
     if (text.size() < 2)
@@ -89,28 +44,25 @@ CLI::App* PurgeTrashCommand::add(CLI::App& app) {
                     "How long an item must have been trashed: N followed by s, m, h or d "
                     "(30d, 12h, 90m, 45s)")
         ->required();
-    sub->add_flag("--json", json_, "Print {\"removed\": N}");
+    addJsonFlag(sub, "Print {\"removed\": N}");
     return sub;
 }
 
-int PurgeTrashCommand::run(CliContext& context) {
+Status PurgeTrashCommand::checkArguments() {
     auto seconds = parseDuration(olderThan_);
     if (!seconds)
-        return context.fail(CliContext::usageError("--older-than takes a duration such as 30d, "
-                                                   "12h, 90m or 45s, not \"" +
-                                                   olderThan_ + "\""),
-                            json_);
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
-    auto folders = trashFolders(context.storageURL());
-    size_t before = countTrashedItems(folders);
-    auto reference = Date::make(Date::now()->timeIntervalSince1970() - *seconds);
-    ItemAction::waitFor([&](std::function<void()> done) {
-        porter.value()->_removeTrashedItemsOlderThanDate(reference, std::move(done));
-    });
-    size_t after = countTrashedItems(folders);
-    size_t removed = before > after ? before - after : 0;
+        return CliContext::usageError(
+            "--older-than takes a duration such as 30d, 12h, 90m or "
+            "45s, not \"" +
+            olderThan_ + "\"");
+    seconds_ = *seconds;
+    return std::nullopt;
+}
+
+int PurgeTrashCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    auto reference = Date::make(Date::now()->timeIntervalSince1970() - seconds_);
+    size_t removed = ProviderCalls::waitForCount(
+        [&](auto done) { provider.removeTrashedItemsOlderThanDate(reference, std::move(done)); });
     if (json_)
         context.out() << jsonText(nlohmann::json{{"removed", removed}}) << "\n";
     else

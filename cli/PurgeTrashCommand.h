@@ -3,23 +3,25 @@
 #include <optional>
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber purge-trash --older-than DURATION`: deletes for good what has been in the trash
 // folders for longer than DURATION (30d, 12h, 90m, 45s) and prints how many items went.
-class PurgeTrashCommand : public Command {
+class PurgeTrashCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
     // Seconds in a duration such as "30d", "12h", "90m" or "45s"; nothing when malformed.
     static std::optional<double> parseDuration(const std::string& text);
 
 private:
+    Status checkArguments() override;
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string olderThan_;
-    bool json_ = false;
+    double seconds_ = 0;  // olderThan_, once checked
 };
 
 }  // namespace tamber

@@ -2,30 +2,27 @@
 
 #include <ostream>
 
-#include "cli/ItemAction.h"
-#include "cli/JsonValues.h"
+#include "cli/ItemArgument.h"
+#include "runtime/JsonValues.h"
+#include "runtime/ProviderCalls.h"
 
 namespace tamber {
 
 CLI::App* RemoveItemCommand::add(CLI::App& app) {
     auto* sub = app.add_subcommand("rm", "Delete an item for good (not into the trash)");
     sub->add_option("ID", item_, "The item: an identifier or a path")->required();
-    sub->add_flag("--json", json_, "Print {\"deleted\": ID}");
+    addJsonFlag(sub, "Print {\"deleted\": ID}");
     return sub;
 }
 
-int RemoveItemCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
-    auto& provider = *porter.value();
-    auto item = ItemAction::identifierFor(provider, item_);
+int RemoveItemCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    auto item = ItemArgument::resolve(provider, item_);
     if (!item.ok())
-        return context.fail(item.error(), json_);
-    Status status = ItemAction::waitForStatus(
+        return fail(context, item.error());
+    Status status = ProviderCalls::waitForStatus(
         [&](auto done) { provider.deleteItemWithIdentifier(item.value(), std::move(done)); });
     if (status)
-        return context.fail(*status, json_);
+        return fail(context, *status);
     if (json_)
         context.out() << jsonText(nlohmann::json{{"deleted", item.value()}}) << "\n";
     else

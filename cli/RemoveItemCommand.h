@@ -2,20 +2,20 @@
 
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber rm ID`: deletes an item (a folder with everything in it) for good. There is no item
 // left to print: it prints the identifier that is gone.
-class RemoveItemCommand : public Command {
+class RemoveItemCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string item_;
-    bool json_ = false;
 };
 
 }  // namespace tamber

@@ -1,6 +1,6 @@
 #include "cli/TextEscape.h"
 
-#include "cli/JsonValues.h"
+#include "runtime/JsonValues.h"
 
 namespace tamber {
 

@@ -2,8 +2,9 @@
 
 #include <ostream>
 
-#include "cli/ItemAction.h"
+#include "cli/ItemArgument.h"
 #include "platform/FileContents.h"
+#include "runtime/ProviderCalls.h"
 
 namespace tamber {
 
@@ -13,45 +14,41 @@ CLI::App* ThumbnailCommand::add(CLI::App& app) {
     sub->add_option("ID", item_, "The app library: #bundle.id or its Documents folder's path")
         ->required();
     sub->add_option("-o,--output", output_, "The PNG file to write")->required();
-    sub->add_flag("--json", json_, "Print the item as `tamber item --json` does");
+    addJsonFlag(sub, "Print the item as `tamber item --json` does");
     return sub;
 }
 
-int ThumbnailCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
-    auto& provider = *porter.value();
-    auto identifier = ItemAction::identifierFor(provider, item_);
+int ThumbnailCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    auto identifier = ItemArgument::resolve(provider, item_);
     if (!identifier.ok())
-        return context.fail(identifier.error(), json_);
+        return fail(context, identifier.error());
     // An unknown identifier fails as `tamber item` would, before any thumbnail is asked for.
-    auto item = provider.itemForIdentifierLogged(identifier.value());
+    auto item = provider.itemForIdentifier(identifier.value());
     if (!item.ok())
-        return context.fail(item.error(), json_);
+        return fail(context, item.error());
 
     std::optional<Bytes> png;
-    Status status = ItemAction::waitForStatus([&](LocalPorter::ErrorCompletion done) {
+    Status status = ProviderCalls::waitForStatus([&](auto done) {
         provider.fetchThumbnailsForItemIdentifiers(
             {identifier.value()}, {},
-            LocalPorter::PerThumbnailCompletion(
+            HostPorterExtension::PerThumbnailCompletion(
                 [&](const HostPorterItemIdentifier&, std::optional<Bytes> data,
                     std::optional<Error>) { png = std::move(data); }),
             std::move(done));
     });
     if (status)
-        return context.fail(*status, json_);
+        return fail(context, *status);
     if (!png)
-        return context.fail(
+        return fail(
+            context,
             Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
                   {{"description", identifier.value() + " has no thumbnail (only app libraries "
-                                                        "whose app has an icon have one)"}}),
-            json_);
+                                                        "whose app has an icon have one)"}}));
     if (auto error = FileContents::writeAtomically(Url::fileURLWithPath(output_), *png))
-        return context.fail(*error, json_);
+        return fail(context, *error);
     if (!json_)
         context.err() << "wrote " << png->size() << " bytes to " << output_ << "\n";
-    return ItemAction::printItem(context, *item.value(), json_);
+    return printItem(context, *item.value());
 }
 
 }  // namespace tamber

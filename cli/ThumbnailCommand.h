@@ -2,21 +2,21 @@
 
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber thumbnail ID -o FILE.png`: writes the thumbnail the file browser would show (app
 // libraries only: their app's icon) and prints the item.
-class ThumbnailCommand : public Command {
+class ThumbnailCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string item_;
     std::string output_;
-    bool json_ = false;
 };
 
 }  // namespace tamber

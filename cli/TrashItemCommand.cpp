@@ -1,6 +1,7 @@
 #include "cli/TrashItemCommand.h"
 
-#include "cli/ItemAction.h"
+#include "cli/ItemArgument.h"
+#include "runtime/ProviderCalls.h"
 
 namespace tamber {
 
@@ -14,37 +15,29 @@ CLI::App* TrashItemCommand::add(CLI::App& app) {
         sub->add_option("--to", to_, "The folder to put it into: an identifier or a path");
     }
     sub->add_option("ID", item_, "The item: an identifier or a path")->required();
-    sub->add_flag("--json", json_, "Print the item as `tamber item --json` does");
+    addJsonFlag(sub, "Print the item as `tamber item --json` does");
     return sub;
 }
 
-int TrashItemCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
-    auto& provider = *porter.value();
-    auto item = ItemAction::identifierFor(provider, item_);
+int TrashItemCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    auto item = ItemArgument::resolve(provider, item_);
     if (!item.ok())
-        return context.fail(item.error(), json_);
+        return fail(context, item.error());
     if (verb_ == Verb::Trash) {
-        return ItemAction::finish(context, ItemAction::waitForItem([&](auto done) {
-                                      provider.trashItemWithIdentifier(item.value(),
-                                                                       std::move(done));
-                                  }),
-                                  json_);
+        return finish(context, ProviderCalls::waitForItem([&](auto done) {
+                          provider.trashItemWithIdentifier(item.value(), std::move(done));
+                      }));
     }
     std::optional<HostPorterItemIdentifier> parent;
     if (to_) {
-        auto resolved = ItemAction::identifierFor(provider, *to_);
+        auto resolved = ItemArgument::resolve(provider, *to_);
         if (!resolved.ok())
-            return context.fail(resolved.error(), json_);
+            return fail(context, resolved.error());
         parent = resolved.value();
     }
-    return ItemAction::finish(context, ItemAction::waitForItem([&](auto done) {
-                                  provider.untrashItemWithIdentifier(item.value(), parent,
-                                                                     std::move(done));
-                              }),
-                              json_);
+    return finish(context, ProviderCalls::waitForItem([&](auto done) {
+                      provider.untrashItemWithIdentifier(item.value(), parent, std::move(done));
+                  }));
 }
 
 }  // namespace tamber

@@ -3,25 +3,25 @@
 #include <optional>
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber trash ID` moves an item into its library's trash; `tamber untrash ID [--to PARENT]`
 // puts it back where it came from, or into PARENT. Both print the item where it now is.
-class TrashItemCommand : public Command {
+class TrashItemCommand : public ProviderCommand {
 public:
     enum class Verb { Trash, Untrash };
     explicit TrashItemCommand(Verb verb) : verb_(verb) {}
 
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     Verb verb_;
     std::string item_;
     std::optional<std::string> to_;
-    bool json_ = false;
 };
 
 }  // namespace tamber

@@ -7,8 +7,8 @@
 
 #include "cli/ContainerArgument.h"
 #include "cli/Interrupt.h"
-#include "cli/JsonValues.h"
 #include "platform/objects/Date.h"
+#include "runtime/JsonValues.h"
 
 namespace tamber {
 
@@ -18,14 +18,11 @@ CLI::App* WatchCommand::add(CLI::App& app) {
     sub->add_option("ID", container_,
                     "A folder's identifier or path, or root (default), working-set, "
                     "all-directories");
-    sub->add_flag("--json", json_, R"(One {"container": ID, "date": ISO-8601} a line)");
+    addJsonFlag(sub, R"(One {"container": ID, "date": ISO-8601} a line)");
     return sub;
 }
 
-int WatchCommand::run(CliContext& context) {
-    auto porter = context.prepareProvider();
-    if (!porter.ok())
-        return context.fail(porter.error(), json_);
+int WatchCommand::runWith(CliContext& context, HostPorterExtension& provider) {
     std::mutex outMutex;
     // Installed before the enumerator exists, so that no signal of its start is missed.
     context.setSignalHandler([&](const HostPorterItemIdentifier& container) {
@@ -37,10 +34,10 @@ int WatchCommand::run(CliContext& context) {
             context.out() << date << "\t" << container;
         context.out() << std::endl;
     });
-    auto container = ContainerArgument::resolve(*porter.value(), container_);
+    auto container = ContainerArgument::resolve(provider, container_);
     if (!container.ok()) {
         context.setSignalHandler({});
-        return context.fail(container.error(), json_);
+        return fail(context, container.error());
     }
     catchInterrupts();
     while (!interrupted()) std::this_thread::sleep_for(std::chrono::milliseconds(100));

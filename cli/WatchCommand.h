@@ -2,20 +2,20 @@
 
 #include <string>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 
 namespace tamber {
 
 // `tamber watch [ID] [--json]`: prints every signal the provider sends for a container's
 // enumerator until interrupted.
-class WatchCommand : public Command {
+class WatchCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
 
 private:
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
+
     std::string container_ = "root";
-    bool json_ = false;
 };
 
 }  // namespace tamber

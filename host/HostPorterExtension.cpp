@@ -2,6 +2,12 @@
 
 namespace tamber {
 
+Error HostPorterExtension::unsupportedOperationError(const std::string& operation) {
+    return Error(kHostPorterErrorDomain, kHostPorterFeatureUnsupported,
+                 {{"description", operation + " is not supported by this provider"},
+                  {"operation", operation}});
+}
+
 Result<HostPorterItemRef> HostPorterExtension::itemForIdentifier(
     const HostPorterItemIdentifier& identifier) {
     return Error::porterErrorForNonExistentItemWithIdentifier(identifier);
@@ -15,6 +21,10 @@ std::optional<Url> HostPorterExtension::URLForItemWithPersistentIdentifier(
 std::optional<HostPorterItemIdentifier> HostPorterExtension::persistentIdentifierForItemAtURL(
     const Url&) {
     return std::nullopt;
+}
+
+Result<HostPorterItemRef> HostPorterExtension::itemAtURL(const Url& url) {
+    return Error::porterErrorForNonExistentItemWithIdentifier(url.path());
 }
 
 Result<HostPorterEnumeratorRef> HostPorterExtension::enumeratorForContainerItemIdentifier(
@@ -35,5 +45,95 @@ void HostPorterExtension::startProvidingItemAtURL(
 void HostPorterExtension::itemChangedAtURL(const Url&) {}
 
 void HostPorterExtension::stopProvidingItemAtURL(const Url&) {}
+
+void HostPorterExtension::importDocumentAtURL(const Url&, const HostPorterItemIdentifier&,
+                                              ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("import"));
+}
+
+void HostPorterExtension::createDirectoryWithName(const std::string& name,
+                                                  const HostPorterItemIdentifier& parent,
+                                                  ItemCompletion completion) {
+    createDirectoryWithName(name, parent, true, std::move(completion));
+}
+
+void HostPorterExtension::createDirectoryWithName(const std::string&,
+                                                  const HostPorterItemIdentifier&, bool,
+                                                  ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("create directory"));
+}
+
+void HostPorterExtension::renameItemWithIdentifier(const HostPorterItemIdentifier&,
+                                                   const std::string&, ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("rename"));
+}
+
+void HostPorterExtension::reparentItemWithIdentifier(const HostPorterItemIdentifier&,
+                                                     const HostPorterItemIdentifier&,
+                                                     const std::optional<std::string>&,
+                                                     ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("move"));
+}
+
+void HostPorterExtension::deleteItemWithIdentifier(const HostPorterItemIdentifier&,
+                                                   ErrorCompletion completion) {
+    completion(unsupportedOperationError("delete"));
+}
+
+void HostPorterExtension::trashItemWithIdentifier(const HostPorterItemIdentifier&,
+                                                  ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("trash"));
+}
+
+void HostPorterExtension::untrashItemWithIdentifier(const HostPorterItemIdentifier&,
+                                                    const std::optional<HostPorterItemIdentifier>&,
+                                                    ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("untrash"));
+}
+
+void HostPorterExtension::removeTrashedItemsOlderThanDate(
+    std::shared_ptr<const Date>, std::function<void(size_t removed)> completion) {
+    // Nothing is published, so nothing is trashed.
+    completion(0);
+}
+
+void HostPorterExtension::setLastUsedDate(std::shared_ptr<const Date>,
+                                          const HostPorterItemIdentifier&,
+                                          ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("set last used date"));
+}
+
+void HostPorterExtension::setTagData(const std::optional<Bytes>&, const HostPorterItemIdentifier&,
+                                     ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("set tag data"));
+}
+
+void HostPorterExtension::setFavoriteRank(std::shared_ptr<const Number>,
+                                          const HostPorterItemIdentifier&,
+                                          ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("set favorite rank"));
+}
+
+void HostPorterExtension::fetchThumbnailsForItemIdentifiers(
+    const std::vector<HostPorterItemIdentifier>&, ThumbnailSize, PerThumbnailCompletion,
+    ErrorCompletion completion) {
+    completion(unsupportedOperationError("fetch thumbnails"));
+}
+
+void HostPorterExtension::fetchThumbnailsForItemIdentifiers(
+    const std::vector<HostPorterItemIdentifier>&, ThumbnailSize, PerThumbnailCompletionWithType,
+    ErrorCompletion completion) {
+    completion(unsupportedOperationError("fetch thumbnails"));
+}
+
+void HostPorterExtension::defaultApplicationContainerForBundleIdentifier(
+    const std::string&, ItemCompletion completion) {
+    completion(nullptr, unsupportedOperationError("default application container"));
+}
+
+void HostPorterExtension::refreshInstalledAppsWithCompletionHandler(
+    std::function<void()> completion) {
+    completion();
+}
 
 }  // namespace tamber

@@ -169,6 +169,13 @@ Result<HostPorterItemRef> LocalPorter::itemForIdentifier(
     return HostPorterItemRef(item.value());
 }
 
+Result<HostPorterItemRef> LocalPorter::itemAtURL(const Url& url) {
+    auto item = itemForURL(url);
+    if (!item.ok())
+        return item.error();
+    return HostPorterItemRef(item.value());
+}
+
 Result<LocalPorter::LocalItemRef> LocalPorter::itemForURL(const Url& url) {
     if (auto outside = PublishedTrees::check(url)) {
         logDebug([&] { return "\"" + url.path() + "\" is " + PublishedTrees::kOutsideMessage; });

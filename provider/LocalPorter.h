@@ -56,70 +56,66 @@ public:
     Result<HostPorterEnumeratorRef> enumeratorForContainerItemIdentifier(
         const HostPorterItemIdentifier& identifier) override;
 
+    // The item at a path: the item-for-URL lookup below, for hosts.
+    Result<HostPorterItemRef> itemAtURL(const Url& url) override;
+
     // Item operations. Every completion is called exactly once, on whatever thread the file
-    // operation finishes.
-    using ItemCompletion = std::function<void(LocalItemRef item, std::optional<Error> error)>;
-    using ErrorCompletion = std::function<void(std::optional<Error> error)>;
+    // operation finishes; the item is always a LocalItem.
     void importDocumentAtURL(const Url& source, const HostPorterItemIdentifier& parent,
-                             ItemCompletion completion);
-    // A taken name bounces to "name 2", ... (as a file browser's new folder does); with
-    // `bounce` false it fails with EEXIST instead.
+                             ItemCompletion completion) override;
     void createDirectoryWithName(const std::string& name, const HostPorterItemIdentifier& parent,
-                                 ItemCompletion completion);
+                                 ItemCompletion completion) override;
     void createDirectoryWithName(const std::string& name, const HostPorterItemIdentifier& parent,
-                                 bool bounce, ItemCompletion completion);
+                                 bool bounce, ItemCompletion completion) override;
     void renameItemWithIdentifier(const HostPorterItemIdentifier& identifier,
-                                  const std::string& name, ItemCompletion completion);
+                                  const std::string& name, ItemCompletion completion) override;
     void reparentItemWithIdentifier(const HostPorterItemIdentifier& identifier,
                                     const HostPorterItemIdentifier& parent,
                                     const std::optional<std::string>& newName,
-                                    ItemCompletion completion);
+                                    ItemCompletion completion) override;
     void deleteItemWithIdentifier(const HostPorterItemIdentifier& identifier,
-                                  ErrorCompletion completion);
+                                  ErrorCompletion completion) override;
 
     // Trash and put-back.
     void trashItemWithIdentifier(const HostPorterItemIdentifier& identifier,
-                                 ItemCompletion completion);
+                                 ItemCompletion completion) override;
     void untrashItemWithIdentifier(const HostPorterItemIdentifier& identifier,
                                    const std::optional<HostPorterItemIdentifier>& parent,
-                                   ItemCompletion completion);
+                                   ItemCompletion completion) override;
     // Removes what was trashed before `referenceDate`, stamps what has no trash date; the
     // completion runs on "tamber.auto-delete.notifier" once every deletion has finished.
     void _removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> referenceDate,
                                           std::function<void()> completion);
+    // The same sweep for hosts, reporting how many deletions succeeded.
+    void removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> referenceDate,
+                                         std::function<void(size_t removed)> completion) override;
 
     // Metadata.
     void setLastUsedDate(std::shared_ptr<const Date> date,
-                         const HostPorterItemIdentifier& identifier, ItemCompletion completion);
+                         const HostPorterItemIdentifier& identifier,
+                         ItemCompletion completion) override;
     void setTagData(const std::optional<Bytes>& tagData, const HostPorterItemIdentifier& identifier,
-                    ItemCompletion completion);
+                    ItemCompletion completion) override;
     void setFavoriteRank(std::shared_ptr<const Number> rank,
-                         const HostPorterItemIdentifier& identifier, ItemCompletion completion);
+                         const HostPorterItemIdentifier& identifier,
+                         ItemCompletion completion) override;
 
     // Thumbnails: only app libraries have one, their app's icon as PNG.
-    struct ThumbnailSize {
-        double width = 0;
-        double height = 0;
-    };
-    using PerThumbnailCompletion =
-        std::function<void(const HostPorterItemIdentifier& identifier, std::optional<Bytes> png,
-                           std::optional<Error> error)>;
-    using PerThumbnailCompletionWithType =
-        std::function<void(const HostPorterItemIdentifier& identifier, std::optional<Bytes> png,
-                           const std::string& typeIdentifier, std::optional<Error> error)>;
     void fetchThumbnailsForItemIdentifiers(const std::vector<HostPorterItemIdentifier>& identifiers,
                                            ThumbnailSize requestedSize,
                                            PerThumbnailCompletion perThumbnailCompletion,
-                                           ErrorCompletion completion);
+                                           ErrorCompletion completion) override;
     void fetchThumbnailsForItemIdentifiers(const std::vector<HostPorterItemIdentifier>& identifiers,
                                            ThumbnailSize requestedSize,
                                            PerThumbnailCompletionWithType perThumbnailCompletion,
-                                           ErrorCompletion completion);
+                                           ErrorCompletion completion) override;
     std::optional<Bytes> bestIconData(const AppRecord& record);
 
-    // The app library item of one app.
+    // The app library item of one app; the public name forwards to the underscored one.
     void _defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
                                                          ItemCompletion completion);
+    void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
+                                                        ItemCompletion completion) override;
 
     // Refreshes the app libraries from the registry, upgrades the shared manager from the main
     // cache, calls the waiting handlers and signals the containers that changed. Runs on the
@@ -132,6 +128,7 @@ public:
     // Coalesced through the pacer; `completion` is called after the next refresh (and again
     // after every later one).
     void _refreshInstalledAppsWithCompletionHandler(std::function<void()> completion);
+    void refreshInstalledAppsWithCompletionHandler(std::function<void()> completion) override;
 
 private:
     Result<Url> urlForIdentifier(const HostPorterItemIdentifier& identifier);
@@ -139,6 +136,8 @@ private:
     Result<LocalItemRef> itemForIdentifierUnlogged(const HostPorterItemIdentifier& identifier);
     LocalItemRef temporaryLocalFolderItem();
     void installPacerHandler();
+    void sweepTrash(std::shared_ptr<const Date> referenceDate,
+                    std::function<void(size_t removed)> completion);
 
     std::vector<std::function<void()>> appRefreshCompletionHandlers_;
     std::shared_ptr<DispatchQueue> appRefreshQueue_;

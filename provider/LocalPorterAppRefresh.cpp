@@ -47,4 +47,8 @@ void LocalPorter::_refreshInstalledAppsWithCompletionHandler(std::function<void(
     });
 }
 
+void LocalPorter::refreshInstalledAppsWithCompletionHandler(std::function<void()> completion) {
+    _refreshInstalledAppsWithCompletionHandler(std::move(completion));
+}
+
 }  // namespace tamber

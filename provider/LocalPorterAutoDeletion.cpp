@@ -1,4 +1,5 @@
 #include <algorithm>
+#include <atomic>
 #include <limits>
 
 #include "applibraries/LocalAppLibraryManager.h"
@@ -50,10 +51,26 @@ void restamp(const Url& url) {
 
 void LocalPorter::_removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> referenceDate,
                                                    std::function<void()> completion) {
+    sweepTrash(std::move(referenceDate), [completion = std::move(completion)](size_t) {
+        if (completion)
+            completion();
+    });
+}
+
+void LocalPorter::removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> referenceDate,
+                                                  std::function<void(size_t removed)> completion) {
+    sweepTrash(std::move(referenceDate), std::move(completion));
+}
+
+void LocalPorter::sweepTrash(std::shared_ptr<const Date> referenceDate,
+                             std::function<void(size_t removed)> completion) {
     std::string title = "remove trashed items older than " +
                         (referenceDate ? referenceDate->description() : std::string("nil"));
     withLogSection(title, [&] {
         auto group = std::make_shared<DispatchGroup>();
+        // Deletions finish on their own threads; the group's notification reads the count
+        // after the last of them.
+        auto removed = std::make_shared<std::atomic<size_t>>(0);
 
         FSDirectoryEnumerator walk;
         walk.urls = trashFoldersToSweep();
@@ -92,15 +109,18 @@ void LocalPorter::_removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> r
                        " was trashed before reference date, let's remove it";
             });
             group->enter();
-            deleteItemWithIdentifier(*identifier,
-                                     [group](std::optional<Error>) { group->leave(); });
+            deleteItemWithIdentifier(*identifier, [group, removed](std::optional<Error> error) {
+                if (!error)
+                    ++*removed;
+                group->leave();
+            });
         });
 
         logDebug("wait until all deletions are complete");
         group->notify(DispatchQueue::makeSerial("tamber.auto-delete.notifier"),
-                      [completion = std::move(completion)] {
+                      [removed, completion = std::move(completion)] {
                           if (completion)
-                              completion();
+                              completion(removed->load());
                       });
     });
 }

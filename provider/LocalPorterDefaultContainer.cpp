@@ -25,4 +25,9 @@ void LocalPorter::_defaultApplicationContainerForBundleIdentifier(
     });
 }
 
+void LocalPorter::defaultApplicationContainerForBundleIdentifier(
+    const std::string& bundleIdentifier, ItemCompletion completion) {
+    _defaultApplicationContainerForBundleIdentifier(bundleIdentifier, std::move(completion));
+}
+
 }  // namespace tamber

@@ -13,7 +13,7 @@
 #include <stdexcept>
 
 #include "cli/CommandLine.h"
-#include "cli/JsonValues.h"
+#include "runtime/JsonValues.h"
 #include "items/ItemMetadata.h"
 #include "platform/FaultInjectingFileSystem.h"
 #include "platform/LinuxFileSystem.h"

@@ -11,8 +11,8 @@
 #include <sstream>
 #include <thread>
 
-#include "cli/Base64.h"
-#include "cli/JsonValues.h"
+#include "runtime/Base64.h"
+#include "runtime/JsonValues.h"
 #include "cli/TextEscape.h"
 #include "fs/FSChangeToken.h"
 #include "platform/archive/PlistNode.h"

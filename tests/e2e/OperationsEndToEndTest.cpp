@@ -16,9 +16,9 @@ protected:
         std::pair<LocalItemRef, std::optional<Error>> result;
         DispatchSemaphore done;
         int calls = 0;
-        operation([&](LocalItemRef item, std::optional<Error> error) {
+        operation([&](HostPorterItemRef item, std::optional<Error> error) {
             ++calls;
-            result = {item, error};
+            result = {std::dynamic_pointer_cast<const LocalItem>(item), error};
             done.signal();
         });
         EXPECT_TRUE(done.wait(10));

@@ -1,5 +1,8 @@
 #include <gtest/gtest.h>
 
+#include <string>
+#include <vector>
+
 #include "host/HostExtensionMain.h"
 #include "host/HostPorterManager.h"
 #include "tests/common/ScopedLogCapture.h"
@@ -39,6 +42,90 @@ TEST(HostExtensionMainTest, HandsThePrincipalInstanceToTheRuntimeOrFailsWith70) 
     EXPECT_TRUE(std::dynamic_pointer_cast<CountingExtension>(received));
     HostRegisterPrincipalClass(nullptr);
     HostRegisterRuntime(nullptr);
+}
+
+// A host binds to the base interface alone: every operation a provider leaves out must still
+// answer, once, with the unsupported error, so that a waiting host never hangs on it.
+TEST(HostPorterExtensionTest, OperationsAProviderLeavesOutCompleteOnceAsUnsupported) {
+    HostPorterExtension provider;
+    std::vector<std::string> answered;  // one entry per completion call
+    auto item = [&](const std::string& operation) {
+        return [&answered, operation](HostPorterItemRef received, std::optional<Error> error) {
+            EXPECT_FALSE(received) << operation;
+            ASSERT_TRUE(error) << operation;
+            EXPECT_TRUE(error->is(kHostPorterErrorDomain, kHostPorterFeatureUnsupported))
+                << operation;
+            EXPECT_NE(error->reason().find("not supported"), std::string::npos) << operation;
+            answered.push_back(operation);
+        };
+    };
+    auto status = [&](const std::string& operation) {
+        return [&answered, operation](std::optional<Error> error) {
+            ASSERT_TRUE(error) << operation;
+            EXPECT_TRUE(error->is(kHostPorterErrorDomain, kHostPorterFeatureUnsupported))
+                << operation;
+            answered.push_back(operation);
+        };
+    };
+    const Url url = Url::fileURLWithPath("/tmp/x");
+    provider.importDocumentAtURL(url, "fid=2", item("import"));
+    provider.createDirectoryWithName("a", "fid=2", item("mkdir"));
+    provider.createDirectoryWithName("a", "fid=2", false, item("mkdir strict"));
+    provider.renameItemWithIdentifier("did=3", "b", item("rename"));
+    provider.reparentItemWithIdentifier("did=3", "fid=2", std::nullopt, item("move"));
+    provider.deleteItemWithIdentifier("did=3", status("delete"));
+    provider.trashItemWithIdentifier("did=3", item("trash"));
+    provider.untrashItemWithIdentifier("did=3", std::nullopt, item("untrash"));
+    provider.setLastUsedDate(nullptr, "did=3", item("last used"));
+    provider.setTagData(std::nullopt, "did=3", item("tags"));
+    provider.setFavoriteRank(nullptr, "did=3", item("rank"));
+    provider.defaultApplicationContainerForBundleIdentifier("com.example", item("container"));
+    int perThumbnail = 0;
+    provider.fetchThumbnailsForItemIdentifiers(
+        {"#com.example"}, {},
+        HostPorterExtension::PerThumbnailCompletion([&](const HostPorterItemIdentifier&,
+                                                        std::optional<Bytes>,
+                                                        std::optional<Error>) { ++perThumbnail; }),
+        status("thumbnails"));
+    EXPECT_EQ(perThumbnail, 0);
+    EXPECT_EQ(answered, (std::vector<std::string>{"import", "mkdir", "mkdir strict", "rename",
+                                                  "move", "delete", "trash", "untrash", "last used",
+                                                  "tags", "rank", "container", "thumbnails"}));
+
+    int removedCalls = 0, refreshCalls = 0;
+    provider.removeTrashedItemsOlderThanDate(Date::now(), [&](size_t removed) {
+        ++removedCalls;
+        EXPECT_EQ(removed, 0u);
+    });
+    provider.refreshInstalledAppsWithCompletionHandler([&] { ++refreshCalls; });
+    EXPECT_EQ(removedCalls, 1);
+    EXPECT_EQ(refreshCalls, 1);
+    EXPECT_FALSE(provider.itemAtURL(url).ok());
+    EXPECT_FALSE(provider.persistentIdentifierForItemAtURL(url));
+}
+
+// The plain create-folder call is the bouncing one: a provider that implements only the call
+// with the flag serves both.
+TEST(HostPorterExtensionTest, CreatingAFolderWithoutTheFlagBounces) {
+    struct Recording : HostPorterExtension {
+        std::vector<bool> bounces;
+        void createDirectoryWithName(const std::string&, const HostPorterItemIdentifier&,
+                                     bool bounce, ItemCompletion completion) override {
+            bounces.push_back(bounce);
+            completion(nullptr, Error::posix(EEXIST));
+        }
+        using HostPorterExtension::createDirectoryWithName;
+    } provider;
+    int calls = 0;
+    HostPorterExtension& host = provider;
+    host.createDirectoryWithName("a", "fid=2", [&](HostPorterItemRef, std::optional<Error> error) {
+        ++calls;
+        EXPECT_TRUE(error && error->is(kPosixErrorDomain, EEXIST));
+    });
+    host.createDirectoryWithName("a", "fid=2", false,
+                                 [&](HostPorterItemRef, std::optional<Error>) { ++calls; });
+    EXPECT_EQ(calls, 2);
+    EXPECT_EQ(provider.bounces, (std::vector<bool>{true, false}));
 }
 
 }  // namespace

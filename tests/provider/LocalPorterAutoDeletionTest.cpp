@@ -61,6 +61,40 @@ TEST_F(AutoDeletionTest, RemovesOnlyWhatWasTrashedStrictlyBeforeTheReferenceDate
     EXPECT_EQ(sectionsTitled("remove trashed items older than " + reference->description()), 1u);
 }
 
+// Hosts learn from the sweep itself what it deleted: only the items that went, counted once
+// every deletion has finished, never the kept or restamped ones.
+TEST_F(AutoDeletionTest, TheHostFacingSweepReportsWhatItDeleted) {
+    auto reference = Date::make(1'700'000'000);
+    std::string older = trashed(libraryTrash() + "/older.txt", Date::make(1'000));
+    std::string folder = makeFolder(storage + "/.Trash/old folder");
+    writeFile(folder + "/inside.txt");
+    ASSERT_FALSE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(folder), Date::make(2'000)));
+    std::string kept = trashed(storage + "/.Trash/kept.txt", reference);
+    std::string undated = trashed(libraryTrash() + "/undated.txt", nullptr);
+
+    auto sweepCounting = [&] {
+        auto calls = std::make_shared<std::atomic<int>>(0);
+        auto counted = std::make_shared<std::promise<std::pair<size_t, bool>>>();
+        HostPorterExtension& host = *porter;
+        host.removeTrashedItemsOlderThanDate(reference, [=](size_t removed) {
+            if (++*calls == 1)
+                counted->set_value({removed, std::filesystem::exists(older)});
+        });
+        auto future = counted->get_future();
+        EXPECT_EQ(future.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+        auto result = future.get();
+        EXPECT_EQ(calls->load(), 1);
+        return result;
+    };
+    auto [removed, olderStillThere] = sweepCounting();
+    EXPECT_EQ(removed, 2u) << "the old file and the old folder, as one item with its contents";
+    EXPECT_FALSE(olderStillThere) << "counted before its deletion finished";
+    EXPECT_FALSE(std::filesystem::exists(folder));
+    EXPECT_TRUE(std::filesystem::exists(kept));
+    EXPECT_TRUE(std::filesystem::exists(undated));
+    EXPECT_EQ(sweepCounting().first, 0u) << "nothing older is left";
+}
+
 TEST_F(AutoDeletionTest, ItemsWithoutAReadableDateAreRestampedAndGoLater) {
     std::string undated = trashed(libraryTrash() + "/undated.txt", nullptr);
     std::string broken = trashed(storage + "/.Trash/broken.txt", nullptr);

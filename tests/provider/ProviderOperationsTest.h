@@ -23,9 +23,10 @@ struct ItemOutcome {
     std::optional<Error> error;
 
     LocalPorter::ItemCompletion handler() {
-        return [this](LocalItemRef received, std::optional<Error> failure) {
+        return [this](HostPorterItemRef received, std::optional<Error> failure) {
             ++calls;
-            item = std::move(received);
+            // The provider answers with its own records; anything else reads as no item.
+            item = std::dynamic_pointer_cast<const LocalItem>(received);
             error = std::move(failure);
         };
     }

@@ -1,4 +1,4 @@
-#include "cli/Base64.h"
+#include "runtime/Base64.h"
 
 #include <glib.h>
 

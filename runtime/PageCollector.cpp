@@ -1,4 +1,4 @@
-#include "cli/PageCollector.h"
+#include "runtime/PageCollector.h"
 
 #include "support/Log.h"
 
@@ -6,34 +6,27 @@ namespace tamber {
 
 void PageCollector::didEnumerateItems(const std::vector<HostPorterItemRef>& page) {
     std::lock_guard lock(mutex_);
-    items.insert(items.end(), page.begin(), page.end());
+    items_.insert(items_.end(), page.begin(), page.end());
 }
 
 void PageCollector::finishEnumeratingUpToPage(const std::optional<HostPorterPage>& next) {
-    {
-        std::lock_guard lock(mutex_);
-        nextPage = next;
-    }
-    finish();
+    finish(next, std::nullopt);
 }
 
 void PageCollector::finishEnumeratingWithError(const Error& failure) {
-    {
-        std::lock_guard lock(mutex_);
-        error = failure;
-    }
-    finish();
+    finish(std::nullopt, failure);
 }
 
-void PageCollector::finish() {
-    std::lock_guard lock(mutex_);
-    // A second finish would be the provider's bug; the first answer stands.
-    if (done_) {
-        logError("a listing page was finished twice");
-        return;
+void PageCollector::finish(std::optional<HostPorterPage> nextPage, std::optional<Error> error) {
+    Page page;
+    {
+        std::lock_guard lock(mutex_);
+        page.items = items_;
     }
-    done_ = true;
-    finished_.signal();
+    page.nextPage = std::move(nextPage);
+    page.error = std::move(error);
+    if (!finished_->finish(std::move(page)))
+        logError("a listing page was finished twice");
 }
 
 }  // namespace tamber

@@ -1,9 +1,9 @@
-#include "cli/JsonValues.h"
+#include "runtime/JsonValues.h"
 
 #include <cmath>
 #include <string>
 
-#include "cli/Base64.h"
+#include "runtime/Base64.h"
 
 namespace tamber {
 

@@ -1,0 +1,38 @@
+#include "cli/ProviderCommand.h"
+
+#include <ostream>
+
+#include "cli/ItemText.h"
+#include "runtime/HostJson.h"
+#include "runtime/JsonValues.h"
+
+namespace tamber {
+
+int ProviderCommand::run(CliContext& context) {
+    if (auto refused = checkArguments())
+        return fail(context, *refused);
+    auto provider = context.prepareProvider();
+    if (!provider.ok())
+        return fail(context, provider.error());
+    return runWith(context, *provider.value());
+}
+
+void ProviderCommand::addJsonFlag(CLI::App* verb, const std::string& help) {
+    verb->add_flag("--json", json_, help);
+}
+
+int ProviderCommand::printItem(CliContext& context, const HostPorterItem& item) const {
+    if (json_)
+        context.out() << jsonText(HostJson::item(item)) << "\n";
+    else
+        printItemText(context.out(), item);
+    return 0;
+}
+
+int ProviderCommand::finish(CliContext& context, const Result<HostPorterItemRef>& item) const {
+    if (!item.ok())
+        return fail(context, item.error());
+    return printItem(context, *item.value());
+}
+
+}  // namespace tamber

@@ -1,0 +1,76 @@
+#include "runtime/HostJson.h"
+
+#include "items/LocalItem.h"
+#include "platform/Tag.h"
+#include "runtime/Base64.h"
+#include "runtime/JsonValues.h"
+
+namespace tamber {
+
+namespace {
+
+nlohmann::json tagsJson(const HostPorterItem& item) {
+    nlohmann::json labels = nlohmann::json::array();
+    if (auto data = item.tagData()) {
+        if (auto tags = GetTagsFromTagsData(*data))
+            for (const auto& tag : *tags) labels.push_back(validUtf8(tag->label()));
+    }
+    return labels;
+}
+
+}  // namespace
+
+nlohmann::json HostJson::item(const HostPorterItem& item) {
+    nlohmann::json json{{"identifier", validUtf8(item.itemIdentifier())},
+                        {"parentIdentifier", validUtf8(item.parentItemIdentifier())},
+                        {"typeIdentifier", item.typeIdentifier()},
+                        {"documentSize", numberJson(item.documentSize())},
+                        {"creationDate", dateJson(item.creationDate())},
+                        {"contentModificationDate", dateJson(item.contentModificationDate())},
+                        {"childItemCount", numberJson(item.childItemCount())},
+                        {"capabilities", item.capabilities()},
+                        {"tags", tagsJson(item)},
+                        {"favoriteRank", numberJson(item.favoriteRank())},
+                        {"lastUsedDate", dateJson(item.lastUsedDate())},
+                        {"trashed", item.isTrashed()}};
+    // Names are bytes: one that is not UTF-8 is shown with U+FFFD and given exactly beside it.
+    setTextWithBytes(json, "filename", "filenameBytes", item.filename());
+    if (const auto* local = dynamic_cast<const LocalItem*>(&item))
+        setTextWithBytes(json, "path", "pathBytes", local->fileURL().path());
+    return json;
+}
+
+nlohmann::json HostJson::page(const std::vector<HostPorterItemRef>& items,
+                              const std::optional<HostPorterPage>& nextPage) {
+    nlohmann::json list = nlohmann::json::array();
+    for (const auto& entry : items)
+        if (entry)
+            list.push_back(item(*entry));
+    return {{"items", std::move(list)},
+            {"nextPage", nextPage ? nlohmann::json(base64Encode(*nextPage)) : nullptr}};
+}
+
+nlohmann::json HostJson::changeBatch(const ChangeCollector::Batch& batch) {
+    nlohmann::json updated = nlohmann::json::array();
+    nlohmann::json changes = nlohmann::json::array();
+    for (const auto& change : batch.changes) {
+        if (change.item) {
+            updated.push_back(item(*change.item));
+            changes.push_back({{"updated", item(*change.item)}});
+        } else {
+            changes.push_back({{"deleted", change.deletedItem}});
+        }
+    }
+    return {{"updated", std::move(updated)},
+            {"deleted", batch.deleted},
+            {"changes", std::move(changes)},
+            {"anchor", batch.anchor ? base64Encode(*batch.anchor) : std::string()},
+            {"moreComing", batch.moreComing}};
+}
+
+nlohmann::json HostJson::error(const Error& error) {
+    return {{"error",
+             {{"domain", error.domain()}, {"code", error.code()}, {"message", error.reason()}}}};
+}
+
+}  // namespace tamber

@@ -1,0 +1,33 @@
+#pragma once
+
+#include <optional>
+#include <vector>
+
+#include <nlohmann/json.hpp>
+
+#include "host/HostPorterItem.h"
+#include "host/HostPorterPage.h"
+#include "runtime/ChangeCollector.h"
+#include "support/Error.h"
+
+namespace tamber {
+
+// The JSON a host prints or sends for what the provider answers. Every host encodes through
+// these, so that the command line and the server agree byte for byte.
+class HostJson {
+public:
+    // An item record: identifiers, name, type, sizes, dates, capabilities, tags, rank, trash
+    // state, and the path when the item is a file of the published trees. A name or path that is
+    // not UTF-8 shows U+FFFD, with its exact bytes in base64 beside it.
+    static nlohmann::json item(const HostPorterItem& item);
+    // A listing: {"items": [...], "nextPage": base64 token or null}.
+    static nlohmann::json page(const std::vector<HostPorterItemRef>& items,
+                               const std::optional<HostPorterPage>& nextPage);
+    // A finished change batch: {"updated": [...], "deleted": [...], "changes": [in order],
+    // "anchor": base64 or "", "moreComing": bool}.
+    static nlohmann::json changeBatch(const ChangeCollector::Batch& batch);
+    // {"error": {"domain", "code", "message"}}.
+    static nlohmann::json error(const Error& error);
+};
+
+}  // namespace tamber
