@@ -7,6 +7,7 @@
 #include <charconv>
 #include <cstdio>
 
+#include "host/ItemIdentifier.h"
 #include "host/UrlOperations.h"
 #include "items/AppLibraryLookup.h"
 #include "items/ItemMetadata.h"
@@ -84,16 +85,10 @@ Bytes versionFromDate(const Date& date) {
 }
 
 std::optional<uint64_t> documentIDOf(const HostPorterItemIdentifier& identifier) {
-    constexpr std::string_view kPrefix = "did=";
-    if (!identifier.starts_with(kPrefix))
+    auto parsed = ItemIdentifier::parse(identifier);
+    if (parsed.kind() != ItemIdentifier::Kind::Document)
         return std::nullopt;
-    uint64_t value = 0;
-    const char* begin = identifier.data() + kPrefix.size();
-    const char* end = identifier.data() + identifier.size();
-    auto [ptr, ec] = std::from_chars(begin, end, value);
-    if (ec != std::errc() || ptr != end || begin == end)
-        return std::nullopt;
-    return value;
+    return parsed.number();
 }
 
 HostPorterItemCapabilities capabilitiesFor(const Url& url, const HostPorterItemIdentifier& id) {
@@ -105,7 +100,7 @@ HostPorterItemCapabilities capabilitiesFor(const Url& url, const HostPorterItemI
     if (writable && writable->boolValue()) {
         capabilities |= C::kWriting;
         // App libraries are the apps' own: they can be written into, never moved or removed.
-        if (!id.starts_with('#'))
+        if (!ItemIdentifier::parse(id).isAppLibrary())
             capabilities |= C::kReparenting | C::kRenaming | C::kTrashing | C::kDeleting;
     }
     return capabilities;
@@ -262,7 +257,7 @@ std::optional<LocalItem::Fields> LocalItem::buildFields(const Url& url,
     // The folders into which other apps drop files are the system's, not the user's.
     if (f.filename == "Inbox" && isFolderType(f.typeIdentifier) &&
         (f.parentItemIdentifier == HostPorterRootContainerItemIdentifier ||
-         f.parentItemIdentifier.starts_with('#'))) {
+         ItemIdentifier::parse(f.parentItemIdentifier).isAppLibrary())) {
         logDebug("can't create an item for the \"Inbox\" directory");
         return std::nullopt;
     }

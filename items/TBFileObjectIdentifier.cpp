@@ -8,6 +8,7 @@
 #include <string>
 
 #include "host/HostPorterManager.h"
+#include "host/ItemIdentifier.h"
 #include "host/PublishedTrees.h"
 #include "host/UrlOperations.h"
 #include "items/AppLibraryLookup.h"
@@ -75,13 +76,6 @@ IdRead readIdResource(const Url& url, ResourceKey key, const char* kind, uint64_
     }
     value = number->uint64Value();
     return IdRead::Value;
-}
-
-uint64_t parseValue(const std::string& text) {
-    uint64_t value = 0;
-    // Trailing text ("1x", "1\n2") makes it no number: it must not name the item of its prefix.
-    auto [ptr, ec] = std::from_chars(text.data(), text.data() + text.size(), value);
-    return ec == std::errc() && ptr == text.data() + text.size() ? value : 0;
 }
 
 // The device of the document storage folder; 0 after logging why it has none.
@@ -249,7 +243,9 @@ std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(
     uint32_t device = storageDeviceID();
     if (device == 0)
         return std::nullopt;
-    uint64_t value = parseValue(components[1]);
+    // Trailing text ("1x", "1\n2") makes it no number (0): it must not name the item of its
+    // prefix.
+    uint64_t value = ItemIdentifier::parse(identifier).number();
     uint64_t fileId = value;
     if (host == "did") {
         // Document IDs are 32-bit; a larger number names no document.
