@@ -7,8 +7,8 @@
 #include <functional>
 #include <vector>
 
-#include "host/ScopedFd.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 
 namespace tamber::filetree {
 

@@ -14,6 +14,7 @@
 #include "items/ResourceValueGetter.h"
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "platform/TypeIdentifiers.h"
 #include "platform/objects/String.h"
 #include "support/Error.h"
@@ -128,12 +129,11 @@ struct StatusFields {
 // link count is read from the folder itself here. Nothing when it can't be read.
 std::shared_ptr<const Number> countEntries(const Url& url) {
     FileSystem& fs = FileSystem::current();
-    int fd = fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC, 0);
-    if (fd < 0)
+    ScopedFd fd(fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC, 0));
+    if (!fd.ok())
         return nullptr;
     std::vector<FileSystem::DirectoryEntry> entries;
-    bool read = fs.readDirectory(fd, entries);
-    fs.close(fd);
+    bool read = fs.readDirectory(fd.get(), entries);
     if (!read)
         return nullptr;
     // A 16-bit count, as the host's is; a larger folder says the most it can.

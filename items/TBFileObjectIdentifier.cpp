@@ -14,6 +14,7 @@
 #include "items/AppLibraryLookup.h"
 #include "items/TBPFileObjectIdentifier.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "platform/objects/Number.h"
 #include "platform/strata/AttributeList.h"
 #include "platform/strata/StrataService.h"
@@ -26,27 +27,9 @@ namespace {
 constexpr int kEventOnlyFlags = O_PATH | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
 
 // The descriptor of an open-for-events item, closed on every path out.
-class EventOnlyDescriptor {
-public:
-    explicit EventOnlyDescriptor(const std::string& path)
-        : fd_(FileSystem::current().open(path, kEventOnlyFlags)) {}
-    ~EventOnlyDescriptor() { close(); }
-    EventOnlyDescriptor(const EventOnlyDescriptor&) = delete;
-    EventOnlyDescriptor& operator=(const EventOnlyDescriptor&) = delete;
-    int get() const { return fd_; }
-    bool ok() const { return fd_ >= 0; }
-    void close() {
-        if (fd_ < 0)
-            return;
-        int saved = errno;
-        FileSystem::current().close(fd_);
-        fd_ = -1;
-        errno = saved;
-    }
-
-private:
-    int fd_;
-};
+ScopedFd openEventOnly(const std::string& path) {
+    return ScopedFd(FileSystem::current().open(path, kEventOnlyFlags));
+}
 
 std::string pathOrUnknown(const Url& url) {
     return url.path().empty() ? std::string("<Unknown File>") : url.path();
@@ -96,7 +79,7 @@ bool isRetriedErrno(int error) {
 }  // namespace
 
 uint32_t TBFileObjectIdentifier::deviceIDWithError(const Url& url, Error* error) {
-    EventOnlyDescriptor fd(url.path());
+    ScopedFd fd = openEventOnly(url.path());
     CommonAttributes attributes;
     if (!fd.ok() || GetAttributeList(fd.get(), attributes) != 0) {
         int saved = errno;
@@ -174,7 +157,7 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     auto packageNumber = objectCast<Number>(package.value());
     bool isPackage = packageNumber && packageNumber->boolValue();
 
-    EventOnlyDescriptor fd(url.path());
+    ScopedFd fd = openEventOnly(url.path());
     if (!fd.ok()) {
         logFormat(LogLevel::Error, "can't open file at \"%@\"; %{errno}d",
                   {url.path(), ErrnoArg{errno}});
@@ -189,7 +172,7 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     uint32_t type = attributes.mode & 0xF000;
     bool isDocument = type == 0x8000 || (type == 0x4000 && isPackage);
     if (!isDocument) {
-        fd.close();
+        fd.reset();
         if (auto error = url.setResourceValue(Number::fromUInt64(attributes.fileId),
                                               ResourceKeys::kFileID)) {
             logFormat(LogLevel::Info,
@@ -206,7 +189,7 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
         logFormat(LogLevel::Error, "can't get permanent storage for \"%@\"", {url.path()});
         return std::nullopt;
     }
-    fd.close();
+    fd.reset();
     if (auto error =
             url.setResourceValue(Number::fromUInt64(documentId), ResourceKeys::kDocumentID)) {
         logFormat(LogLevel::Info, "can't cache value %@ for key HostURLDocumentIdentifierKey; %@",

@@ -9,6 +9,7 @@
 #include <utility>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "platform/UrlPath.h"
 #include "platform/strata/DocumentAttributes.h"
 #include "platform/tremors/TremorFlags.h"
@@ -492,14 +493,14 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
     while (!stack.empty()) {
         auto [dir, at] = std::move(stack.back());
         stack.pop_back();
-        int fd = fs.open(at, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-        if (fd < 0)
+        ScopedFd fd(fs.open(at, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        if (!fd.ok())
             continue;  // vanished or unreadable: what it held counts as gone
         entries.clear();
-        bool listed = fs.readDirectory(fd, entries);
+        bool listed = fs.readDirectory(fd.get(), entries);
         for (const auto& entry : listed ? entries : std::vector<FileSystem::DirectoryEntry>{}) {
             struct statx st {};
-            if (fs.statx(fd, entry.name, AT_SYMLINK_NOFOLLOW, kStampMask, &st) != 0)
+            if (fs.statx(fd.get(), entry.name, AT_SYMLINK_NOFOLLOW, kStampMask, &st) != 0)
                 continue;
             InodeRecord record = recordOf(st, dir, entry.name);
             std::string path = at + "/" + entry.name;
@@ -507,7 +508,6 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
                 stack.emplace_back(record.inode, path);
             onDisk[record.inode] = {std::move(record), std::move(path)};
         }
-        fs.close(fd);
     }
     // The crawl saw every file: a known file at a document's old path was moved there.
     return commit(Settle::Clear, [&] { compareWithIndex(root, oldTop, onDisk, journal); });
