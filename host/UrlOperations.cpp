@@ -87,15 +87,18 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url) {
     auto opened = PublishedTrees::openFolder(url, O_RDONLY);
     if (!opened.ok())
         return opened.error();
-    int root = opened.value();
 
     uint64_t total = 0;
-    std::vector<int> pending{root};  // descriptors still to read; depth-first, bounded by depth
+    // Descriptors still to read; depth-first, bounded by depth. Those left after a failure
+    // close with the vector.
+    std::vector<ScopedFd> pending;
+    pending.emplace_back(opened.value());
     std::vector<FileSystem::DirectoryEntry> entries;
     std::optional<Error> failure;
     while (!pending.empty()) {
-        int dir = pending.back();
+        ScopedFd held = std::move(pending.back());
         pending.pop_back();
+        int dir = held.get();
         entries.clear();
         if (!failure && !fs.readDirectory(dir, entries))
             failure = Error::errorWithPOSIXCode(errno);
@@ -112,14 +115,13 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url) {
             } else if (S_ISDIR(st.stx_mode)) {
                 int child = fs.openat(dir, entry.name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
                 if (child >= 0) {
-                    pending.push_back(child);
+                    pending.emplace_back(child);
                 } else if (errno != ENOENT) {
                     failure = Error::errorWithPOSIXCode(errno);
                     break;
                 }
             }
         }
-        fs.close(dir);
     }
     if (failure)
         return *failure;
