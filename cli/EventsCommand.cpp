@@ -187,8 +187,8 @@ int EventsCommand::run(CliContext& context) {
     TremorStreamRef stream =
         docid_ ? TremorStreamCreateRelativeToDevice(
                      printEvents, &streamContext,
-                     TBFileObjectIdentifier::deviceID(context.storageURL()), {"/.docid"}, *since,
-                     0.1, flags)
+                     TBFileObjectIdentifier::deviceID(context.storageURL()),
+                     {kTremorDocumentIdRoot}, *since, 0.1, flags)
                : TremorStreamCreate(printEvents, &streamContext, paths, *since, 0.1, flags);
     if (!stream) {
         return context.fail(

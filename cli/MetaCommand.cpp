@@ -83,7 +83,8 @@ nlohmann::json MetaCommand::toJson(const ItemMetadata& m) {
             {"putBack", m.putBack ? nlohmann::json(m.putBack->value()) : nlohmann::json(nullptr)}};
 }
 
-Status MetaCommand::applyChanges(const Url& url) {
+Result<LocalPorter::MetadataChanges> MetaCommand::parseChanges() const {
+    LocalPorter::MetadataChanges changes;
     if (setRank_) {
         std::shared_ptr<const Number> rank;
         if (*setRank_ != "none") {
@@ -95,8 +96,7 @@ Status MetaCommand::applyChanges(const Url& url) {
                                               s + "\"");
             rank = Number::fromInt64(value);
         }
-        if (auto error = ItemMetadata::writeFavoriteRank(url, rank))
-            return error;
+        changes.favoriteRank = rank;
     }
     if (setLastUsed_) {
         std::shared_ptr<const Date> date;
@@ -110,15 +110,12 @@ Status MetaCommand::applyChanges(const Url& url) {
                     *setLastUsed_ + "\"");
             date = Date::make(*seconds);
         }
-        if (auto error = ItemMetadata::writeLastUsedDate(url, date))
-            return error;
+        changes.lastUsedDate = date;
     }
-    if (setTags_) {
-        Bytes tagData = ItemMetadata::tagDataForLabels(TagLabels::cleaned(splitLabels(*setTags_)));
-        if (auto error = ItemMetadata::writeTagData(url, tagData))
-            return error;
-    }
-    return std::nullopt;
+    if (setTags_)
+        changes.tagData =
+            ItemMetadata::tagDataForLabels(TagLabels::cleaned(splitLabels(*setTags_)));
+    return changes;
 }
 
 int MetaCommand::run(CliContext& context) {
@@ -142,10 +139,14 @@ int MetaCommand::run(CliContext& context) {
     // A document saved while nothing watched gets its metadata back when the journal starts;
     // without one (held by another process, say) the attributes are still read and written.
     context.prepareJournal();
-    if (auto error = applyChanges(url))
+    // Every value is checked before the first write, so that a bad one changes nothing.
+    auto changes = parseChanges();
+    if (!changes.ok())
+        return context.fail(changes.error(), json_);
+    if (auto error = LocalPorter::changeMetadataAtURL(url, changes.value()))
         return context.fail(*error, json_);
 
-    ItemMetadata metadata = ItemMetadata::read(url);
+    ItemMetadata metadata = LocalPorter::metadataAtURL(url);
     nlohmann::json j = toJson(metadata);
     if (json_) {
         setTextWithBytes(j, "path", "pathBytes", url.path());

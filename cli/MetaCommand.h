@@ -7,6 +7,7 @@
 
 #include "cli/Command.h"
 #include "items/ItemMetadata.h"
+#include "provider/LocalPorter.h"
 
 namespace tamber {
 
@@ -21,7 +22,8 @@ public:
     static nlohmann::json toJson(const ItemMetadata& metadata);
 
 private:
-    Status applyChanges(const Url& url);
+    // The changes the --set-* options ask for, or a usage error for a bad value.
+    Result<LocalPorter::MetadataChanges> parseChanges() const;
 
     std::string path_;
     bool json_ = false;

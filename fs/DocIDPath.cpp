@@ -5,9 +5,16 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "platform/tremors/TremorFlags.h"
+
 namespace tamber {
 
 namespace {
+
+// The root's name without its leading slash, followed by the slash that ends it.
+std::string rootNameWithSlash() {
+    return std::string(kTremorDocumentIdRoot + 1) + "/";
+}
 
 bool readNumber(const char*& cursor, int64_t& value) {
     errno = 0;
@@ -35,7 +42,7 @@ std::optional<DocIDPath> DocIDPath::parse(const std::string& path) {
     const char* cursor = path.c_str();
     const char* end = cursor + path.size();
     while (cursor < end && *cursor == '/') ++cursor;
-    if (!readLiteral(cursor, end, ".docid/"))
+    if (!readLiteral(cursor, end, rootNameWithSlash().c_str()))
         return std::nullopt;
     if (cursor < end && std::isdigit(static_cast<unsigned char>(*cursor))) {
         int64_t device = 0;  // not used: the stream already chose the device
@@ -50,6 +57,10 @@ std::optional<DocIDPath> DocIDPath::parse(const std::string& path) {
     if (cursor != end)
         return std::nullopt;
     return parsed;
+}
+
+bool DocIDPath::mentionsDocumentIds(const std::string& path) {
+    return path.find(rootNameWithSlash()) != std::string::npos;
 }
 
 }  // namespace tamber

@@ -17,6 +17,9 @@ struct DocIDPath {
     // Numbers are read as strtoll reads them (no digits reads 0); only a conversion error,
     // a missing piece or trailing text fails.
     static std::optional<DocIDPath> parse(const std::string& path);
+    // Whether `path` has the document-ID root's name followed by "/" anywhere: such an event
+    // is taken for a document-ID event, and one that does not parse is reported as such.
+    static bool mentionsDocumentIds(const std::string& path);
 };
 
 }  // namespace tamber

@@ -5,6 +5,7 @@
 
 #include "applibraries/LocalAppLibraryManager.h"
 #include "fs/ChangePageResumes.h"
+#include "host/ItemIdentifier.h"
 #include "host/UrlOperations.h"
 #include "items/LocalAppLibraryItem.h"
 #include "support/Log.h"
@@ -159,7 +160,8 @@ void FSChangesEnumerator::readerDidDelete(TremorReader& reader,
                                           const std::optional<Url>& url) {
     if (!accepts(reader))
         return;
-    bool isLibrary = identifier.find('#') != std::string::npos;
+    auto parsed = ItemIdentifier::parse(identifier);
+    bool isLibrary = parsed.isAppLibrary();
     if (container_ == HostPorterWorkingSetContainerItemIdentifier) {
         if (isLibrary) {
             logDebug(
@@ -167,7 +169,7 @@ void FSChangesEnumerator::readerDidDelete(TremorReader& reader,
             return;
         }
     } else if (container_ == HostPorterAllDirectoriesContainerItemIdentifier) {
-        if (identifier.find("fid=") == std::string::npos) {
+        if (parsed.kind() != ItemIdentifier::Kind::File) {
             logDebug(
                 [&] { return "ignore update of " + identifier + "; item is not a directory"; });
             return;

@@ -37,8 +37,6 @@ constexpr double kLatencySeconds = 0.5;
 // Paths as objects, one event per file, and a {"path", "fileID"} dictionary per event.
 constexpr uint32_t kCreateFlags =
     kTremorCreateUseObjects | kTremorCreateFileEvents | kTremorCreateUseExtendedData;
-constexpr const char* kDocIDRoot = "/.docid";
-constexpr const char* kDocIDMarker = ".docid/";
 
 // Streams hold a number, not the reader: a batch that was already queued when its reader
 // stopped or was destroyed looks the number up, finds nothing and is dropped.
@@ -132,9 +130,9 @@ void TremorReader::start() {
     if (mode_ == TremorReaderMode::docIDBased) {
         Url storage = HostPorterManager::defaultManager()->documentStorageURL();
         uint32_t device = TBFileObjectIdentifier::deviceID(storage);
-        stream =
-            TremorStreamCreateRelativeToDevice(&TremorReader::streamCallback, &context, device,
-                                               {kDocIDRoot}, since, kLatencySeconds, kCreateFlags);
+        stream = TremorStreamCreateRelativeToDevice(&TremorReader::streamCallback, &context, device,
+                                                    {kTremorDocumentIdRoot}, since, kLatencySeconds,
+                                                    kCreateFlags);
     } else {
         std::vector<std::string> paths;
         paths.reserve(urls_.size());
@@ -185,7 +183,7 @@ void TremorReader::reportLostHistory() {
         lostHistoryOwed_ = false;
     }
     // The batch a stream sends when it cannot replay what was asked for.
-    std::string path = urls_.empty() ? std::string(kDocIDRoot) : urls_.front().path();
+    std::string path = urls_.empty() ? std::string(kTremorDocumentIdRoot) : urls_.front().path();
     std::map<std::string, ObjectRef> entry{{"path", String::make(path)}};
     ObjectRef paths = Array::make({Dictionary::make(std::move(entry))});
     const uint32_t flags = kTremorUserDropped | kTremorMustScanSubdirs;
@@ -312,7 +310,7 @@ void TremorReader::classifyEvent(const std::string& path, std::optional<uint64_t
             logDebug("done processing history");
         if (auto target = delegate())
             target->readerDidProcessHistory(*this);
-    } else if (path.find(kDocIDMarker) != std::string::npos) {
+    } else if (DocIDPath::mentionsDocumentIds(path)) {
         processDocIDEvent(path, eventID);
     } else {
         processPathEvent(path, fileID, flags, eventID);

@@ -7,8 +7,8 @@
 #include <functional>
 #include <vector>
 
-#include "host/ScopedFd.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 
 namespace tamber::filetree {
 
@@ -42,30 +42,22 @@ Status removeItem(int dirfd, const std::string& name) {
     }
 
     struct Frame {
-        int fd;
+        ScopedFd fd;
         std::string name;  // in the folder below it on the stack (or `dirfd`)
         std::vector<FileSystem::DirectoryEntry> entries;
         size_t next = 0;
     };
+    // The folders open on the way down; whatever is left closes when the walk returns.
     std::vector<Frame> stack;
-    auto closeAll = [&] {
-        int saved = errno;
-        for (Frame& frame : stack) fs.close(frame.fd);
-        errno = saved;
-    };
     // Opens a folder and reads it; false with errno set when either fails.
     auto enter = [&](int parent, const std::string& child) {
-        int fd = fs.openat(parent, child, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-        if (fd < 0)
+        ScopedFd fd(fs.openat(parent, child, O_RDONLY | O_DIRECTORY | O_NOFOLLOW));
+        if (!fd.ok())
             return false;
         std::vector<FileSystem::DirectoryEntry> entries;
-        if (!fs.readDirectory(fd, entries)) {
-            int saved = errno;
-            fs.close(fd);
-            errno = saved;
+        if (!fs.readDirectory(fd.get(), entries))
             return false;
-        }
-        stack.push_back({fd, child, std::move(entries)});
+        stack.push_back({std::move(fd), child, std::move(entries)});
         return true;
     };
 
@@ -75,18 +67,16 @@ Status removeItem(int dirfd, const std::string& name) {
         Frame& top = stack.back();
         if (top.next == top.entries.size()) {
             std::string done = std::move(top.name);
-            fs.close(top.fd);
             stack.pop_back();
-            int parent = stack.empty() ? dirfd : stack.back().fd;
+            int parent = stack.empty() ? dirfd : stack.back().fd.get();
             if (fs.unlinkat(parent, done, AT_REMOVEDIR) != 0 && errno != ENOENT) {
                 Error error = lastError();
-                closeAll();
                 return error;
             }
             continue;
         }
         const FileSystem::DirectoryEntry& entry = top.entries[top.next++];
-        int parent = top.fd;
+        int parent = top.fd.get();
         bool isDirectory = entry.type == DT_DIR;
         if (entry.type == DT_UNKNOWN) {
             auto entryType = itemTypeAt(parent, entry.name);
@@ -98,12 +88,10 @@ Status removeItem(int dirfd, const std::string& name) {
         // Not a folder, or no longer one (replaced by a link or a file since it was listed).
         if (isDirectory && errno != ENOTDIR && errno != ELOOP && errno != ENOENT) {
             Error error = lastError();
-            closeAll();
             return error;
         }
         if (fs.unlinkat(parent, child, 0) != 0 && errno != ENOENT) {
             Error error = lastError();
-            closeAll();
             return error;
         }
     }
@@ -201,40 +189,26 @@ static Status copyLink(int fromDir, const std::string& from, int toDir, const st
 Status copyFolderInto(int fromDir, const std::string& from, int toDir, const std::string& to) {
     FileSystem& fs = FileSystem::current();
     struct Frame {
-        int from;
-        int to;
+        ScopedFd from;
+        ScopedFd to;
         std::vector<FileSystem::DirectoryEntry> entries;
         size_t next = 0;
     };
+    // The folders open on both sides; whatever is left closes when the walk returns.
     std::vector<Frame> stack;
-    auto closeAll = [&] {
-        int saved = errno;
-        for (Frame& frame : stack) {
-            fs.close(frame.from);
-            fs.close(frame.to);
-        }
-        stack.clear();
-        errno = saved;
-    };
     // Opens both sides of one folder (making the copy unless `create` is null); false with
     // errno set.
     auto enter = [&](int parentFrom, const std::string& name, int parentTo,
                      const std::string& copyName, std::optional<mode_t> create) {
         if (create && fs.mkdirat(parentTo, copyName, copyMode(*create) | S_IRWXU) != 0)
             return false;
-        int in = fs.openat(parentFrom, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
-        int out = in < 0 ? -1 : fs.openat(parentTo, copyName, O_PATH | O_DIRECTORY | O_NOFOLLOW);
+        ScopedFd in(fs.openat(parentFrom, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW));
+        ScopedFd out(!in.ok() ? -1
+                              : fs.openat(parentTo, copyName, O_PATH | O_DIRECTORY | O_NOFOLLOW));
         std::vector<FileSystem::DirectoryEntry> entries;
-        if (out < 0 || !fs.readDirectory(in, entries)) {
-            int saved = errno;
-            if (in >= 0)
-                fs.close(in);
-            if (out >= 0)
-                fs.close(out);
-            errno = saved;
+        if (!out.ok() || !fs.readDirectory(in.get(), entries))
             return false;
-        }
-        stack.push_back({in, out, std::move(entries)});
+        stack.push_back({std::move(in), std::move(out), std::move(entries)});
         return true;
     };
 
@@ -244,14 +218,12 @@ Status copyFolderInto(int fromDir, const std::string& from, int toDir, const std
     while (!stack.empty()) {
         Frame& top = stack.back();
         if (top.next == top.entries.size()) {
-            fs.close(top.from);
-            fs.close(top.to);
             stack.pop_back();
             continue;
         }
         std::string name = top.entries[top.next++].name;
-        int in = top.from;
-        int out = top.to;
+        int in = top.from.get();
+        int out = top.to.get();
         auto type = itemTypeAt(in, name);
         Status failure;
         if (!type) {
@@ -269,7 +241,6 @@ Status copyFolderInto(int fromDir, const std::string& from, int toDir, const std
             failure = copyLink(in, name, out, name);
         }
         if (failure) {
-            closeAll();
             return failure;
         }
     }

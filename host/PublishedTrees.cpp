@@ -8,6 +8,7 @@
 
 #include "host/HostPorterManager.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "support/Error.h"
 
 namespace tamber {
@@ -99,16 +100,14 @@ Result<int> PublishedTrees::openFolder(const Url& folder, int flags) {
         return outsideError(folder);
     FileSystem& fs = FileSystem::current();
     // The root is published as named, through a link if it is one.
-    int rootFd = fs.open(root->path(), O_PATH | O_DIRECTORY);
-    if (rootFd < 0)
+    ScopedFd rootFd(fs.open(root->path(), O_PATH | O_DIRECTORY));
+    if (!rootFd.ok())
         return Error::posix(errno);
     std::string relative = relativeTo(root->path(), folder.path());
     int fd = relative.empty() ? fs.open(root->path(), flags | O_DIRECTORY)
-                              : fs.openBeneath(rootFd, relative, flags | O_DIRECTORY);
-    int saved = errno;
-    fs.close(rootFd);
+                              : fs.openBeneath(rootFd.get(), relative, flags | O_DIRECTORY);
     if (fd < 0)
-        return openFailure(folder, saved);
+        return openFailure(folder, errno);
     return fd;
 }
 
@@ -137,7 +136,7 @@ Status PublishedTrees::check(const Url& url) {
             return parent.error();
         return std::nullopt;
     }
-    FileSystem::current().close(parent.value().fd);
+    ScopedFd opened(parent.value().fd);  // only its opening mattered
     return std::nullopt;
 }
 

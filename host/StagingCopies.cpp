@@ -13,9 +13,9 @@
 
 #include "host/FileTree.h"
 #include "host/PublishedTrees.h"
-#include "host/ScopedFd.h"
 #include "platform/FileContents.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "support/Log.h"
 
 namespace tamber {

@@ -10,9 +10,9 @@
 #include "host/FileTree.h"
 #include "host/ItemNames.h"
 #include "host/PublishedTrees.h"
-#include "host/ScopedFd.h"
 #include "host/StagingCopies.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "platform/TypeIdentifiers.h"
 #include "platform/objects/Number.h"
 
@@ -87,15 +87,18 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url) {
     auto opened = PublishedTrees::openFolder(url, O_RDONLY);
     if (!opened.ok())
         return opened.error();
-    int root = opened.value();
 
     uint64_t total = 0;
-    std::vector<int> pending{root};  // descriptors still to read; depth-first, bounded by depth
+    // Descriptors still to read; depth-first, bounded by depth. Those left after a failure
+    // close with the vector.
+    std::vector<ScopedFd> pending;
+    pending.emplace_back(opened.value());
     std::vector<FileSystem::DirectoryEntry> entries;
     std::optional<Error> failure;
     while (!pending.empty()) {
-        int dir = pending.back();
+        ScopedFd held = std::move(pending.back());
         pending.pop_back();
+        int dir = held.get();
         entries.clear();
         if (!failure && !fs.readDirectory(dir, entries))
             failure = Error::errorWithPOSIXCode(errno);
@@ -112,14 +115,13 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url) {
             } else if (S_ISDIR(st.stx_mode)) {
                 int child = fs.openat(dir, entry.name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW);
                 if (child >= 0) {
-                    pending.push_back(child);
+                    pending.emplace_back(child);
                 } else if (errno != ENOENT) {
                     failure = Error::errorWithPOSIXCode(errno);
                     break;
                 }
             }
         }
-        fs.close(dir);
     }
     if (failure)
         return *failure;
@@ -133,9 +135,9 @@ bool pt_withReadWriteAccess(const Url& url, const std::function<bool(int fd)>& b
         errno = EACCES;
         return false;
     }
-    int fd = -1;
+    ScopedFd fd;
     if (root->path() == url.path()) {
-        fd = fs.open(url.path(), O_RDONLY);
+        fd.reset(fs.open(url.path(), O_RDONLY));
     } else {
         auto parent = PublishedTrees::openParent(url, O_PATH);
         if (!parent.ok()) {
@@ -143,18 +145,13 @@ bool pt_withReadWriteAccess(const Url& url, const std::function<bool(int fd)>& b
             errno = error.domain() == kPosixErrorDomain ? static_cast<int>(error.code()) : EACCES;
             return false;
         }
-        fd = fs.openat(parent.value().fd, parent.value().name, O_RDONLY | O_NOFOLLOW);
-        int saved = errno;
-        fs.close(parent.value().fd);
-        errno = saved;
+        ScopedFd folder(parent.value().fd);
+        fd.reset(fs.openat(folder.get(), parent.value().name, O_RDONLY | O_NOFOLLOW));
     }
-    if (fd < 0)
+    if (!fd.ok())
         return false;
-    bool ok = body(fd);
-    int saved = errno;
-    fs.close(fd);
-    errno = saved;
-    return ok;
+    // The body's errno outlives the close.
+    return body(fd.get());
 }
 
 // ---------------------------------------------------------------------------------------------
@@ -361,25 +358,21 @@ std::optional<DirIdentity> identityAt(int dirfd, const std::string& name) {
 bool isFolderOrAncestor(const ItemType& source, int dir) {
     FileSystem& fs = FileSystem::current();
     DirIdentity wanted{source.device, source.inode};
-    int current = fs.openat(dir, ".", O_PATH | O_DIRECTORY);
+    ScopedFd current(fs.openat(dir, ".", O_PATH | O_DIRECTORY));
     bool found = false;
-    for (int depth = 0; current >= 0 && depth < 4096; ++depth) {
-        auto here = identityAt(current, "");
+    for (int depth = 0; current.ok() && depth < 4096; ++depth) {
+        auto here = identityAt(current.get(), "");
         if (!here)
             break;
         if (*here == wanted) {
             found = true;
             break;
         }
-        int up = fs.openat(current, "..", O_PATH | O_DIRECTORY);
-        fs.close(current);
-        current = up;
-        auto above = up >= 0 ? identityAt(up, "") : std::nullopt;
+        current.reset(fs.openat(current.get(), "..", O_PATH | O_DIRECTORY));
+        auto above = current.ok() ? identityAt(current.get(), "") : std::nullopt;
         if (!above || *above == *here)
             break;  // the top
     }
-    if (current >= 0)
-        fs.close(current);
     return found;
 }
 

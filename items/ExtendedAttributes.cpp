@@ -1,11 +1,8 @@
 #include "items/ExtendedAttributes.h"
 
 #include <cerrno>
-#include <memory>
 
-#include "host/UrlOperations.h"
 #include "platform/FileSystem.h"
-#include "platform/strata/StrataService.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -14,13 +11,6 @@ namespace {
 
 LogLevel levelUnless(int quietCode, const Error& error) {
     return error.code() == quietCode ? LogLevel::Debug : LogLevel::Error;
-}
-
-// The document's copy of its metadata follows what Tamber writes at once, so that a save right
-// after does not lose it while the attribute event waits in the journal.
-void noteWritten(int fd, const std::optional<Bytes>& data, const std::string& name) {
-    if (auto strata = StrataService::current())
-        strata->metadataAttributeWritten(fd, name, data);
 }
 
 }  // namespace
@@ -52,7 +42,6 @@ Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::str
     FileSystem& fs = FileSystem::current();
     if (!data) {
         if (fs.fremovexattr(fd, name) == 0 || errno == ENODATA) {
-            noteWritten(fd, data, name);
             return std::nullopt;
         }
         Error error = Error::errorWithPOSIXCode(errno);
@@ -61,22 +50,10 @@ Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::str
         return error;
     }
     if (fs.fsetxattr(fd, name, data->data(), data->size(), 0) == 0) {
-        noteWritten(fd, data, name);
         return std::nullopt;
     }
     Error error = Error::errorWithPOSIXCode(errno);
     logAt(levelUnless(EACCES, error), "can't set xattr \"" + name + "\"; " + error.description());
-    return error;
-}
-
-Status WriteXattrAtURL(const Url& url, const std::optional<Bytes>& data, const std::string& name) {
-    bool ok = pt_withReadWriteAccess(
-        url, [&](int fd) { return !SetOrRemoveXattr(fd, data, name).has_value(); });
-    if (ok)
-        return std::nullopt;
-    Error error = Error::errorWithPOSIXCode(errno);
-    logError("can't set xattr " + name + " on " + url.absoluteString() + "; " +
-             error.description());
     return error;
 }
 

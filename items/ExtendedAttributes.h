@@ -14,13 +14,10 @@ namespace tamber {
 // other failure logs at error level. Failures are never returned as errors.
 std::optional<Bytes> ReadXattrData(const std::string& name, const Url& url);
 
-// Sets the attribute on an open descriptor, or removes it when `data` is nothing. Removing an
+// Sets the attribute on an open descriptor, or removes it when `data` is nothing. Only the
+// metadata writer (ItemMetadata) calls this, so that the journal hears of every write. Removing an
 // attribute that is not there succeeds. A refusal (EACCES) logs at debug level, anything else at
 // error level; the error is returned.
 Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::string& name);
-
-// Sets or removes an attribute of the item at `url` through the read-write access operation.
-// A failure is logged at error level ("can't set xattr NAME on URL; ERROR") and returned.
-Status WriteXattrAtURL(const Url& url, const std::optional<Bytes>& data, const std::string& name);
 
 }  // namespace tamber

@@ -3,6 +3,7 @@
 #include <cerrno>
 #include <set>
 
+#include "host/UrlOperations.h"
 #include "items/ExtendedAttributes.h"
 #include "items/LocalItem.h"
 #include "items/UnarchiveLogged.h"
@@ -11,6 +12,7 @@
 #include "platform/archive/KeyedArchiver.h"
 #include "platform/archive/KeyedUnarchiver.h"
 #include "platform/objects/Array.h"
+#include "platform/strata/StrataService.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -61,7 +63,14 @@ Status writeObject(const Url& url, const std::string& name, const ObjectRef& obj
         logError("can't archive value for xattr " + name + "; " + data.error().description());
         return data.error();
     }
-    return WriteXattrAtURL(url, data.value(), name);
+    return ItemMetadata::writeAttributeData(url, name, data.value());
+}
+
+// The document's copy of its metadata follows what Tamber writes at once, so that a save right
+// after does not lose it while the attribute event waits in the journal.
+void noteWritten(int fd, const std::optional<Bytes>& data, const std::string& name) {
+    if (auto strata = StrataService::current())
+        strata->metadataAttributeWritten(fd, name, data);
 }
 
 // The names of the attributes present, or nothing when the listing failed (then every
@@ -170,6 +179,25 @@ Status ItemMetadata::writeFavoriteRank(const Url& url, const std::shared_ptr<con
 
 Status ItemMetadata::writeTrashDate(const Url& url, const std::shared_ptr<const Date>& date) {
     return writeObject(url, LocalItem::xattrTrashDateName(), date);
+}
+
+Status ItemMetadata::writeAttributeData(const Url& url, const std::string& name,
+                                        const std::optional<Bytes>& data) {
+    Status written;
+    bool ok = pt_withReadWriteAccess(url, [&](int fd) {
+        written = SetOrRemoveXattr(fd, data, name);
+        if (written)
+            return false;
+        noteWritten(fd, data, name);
+        return true;
+    });
+    if (ok)
+        return std::nullopt;
+    // The attribute call's own error when it was the one that failed, else the access's.
+    Error error = written.value_or(Error::errorWithPOSIXCode(errno));
+    logError("can't set xattr " + name + " on " + url.absoluteString() + "; " +
+             error.description());
+    return error;
 }
 
 Status ItemMetadata::writePutBack(const Url& url, const std::shared_ptr<const String>& path) {

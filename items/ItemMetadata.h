@@ -36,13 +36,21 @@ struct ItemMetadata {
     static std::shared_ptr<const Date> readTrashDate(const Url& url);
     static std::shared_ptr<const String> readPutBack(const Url& url);
 
-    // Writers. Nothing removes the attribute, except for tags: absent or undecodable tag data
-    // is written as an empty list, and the tags attribute is never removed.
+    // The one writer of the five attributes: every change to them, from any host or provider
+    // operation, goes through these, so that the journal's copy of the document's metadata
+    // hears of each write that happened. A null value removes the attribute (removing one
+    // that is not there succeeds), except for tags: absent or undecodable tag data is written
+    // as an empty list, so that clearing the tags is a change too and the attribute stays. A
+    // failure is logged ("can't set xattr NAME on URL; ERROR") and returned.
     static Status writeLastUsedDate(const Url& url, const std::shared_ptr<const Date>& date);
     static Status writeTagData(const Url& url, const std::optional<Bytes>& tagData);
     static Status writeFavoriteRank(const Url& url, const std::shared_ptr<const Number>& rank);
     static Status writeTrashDate(const Url& url, const std::shared_ptr<const Date>& date);
     static Status writePutBack(const Url& url, const std::shared_ptr<const String>& path);
+    // Sets `name` to bytes already archived, or removes it for nothing; the writers above end
+    // here. Opens the item through its read-write access, beneath its published tree.
+    static Status writeAttributeData(const Url& url, const std::string& name,
+                                     const std::optional<Bytes>& data);
 
     // Tag data for labels, each a tag without colour.
     static Bytes tagDataForLabels(const std::vector<std::string>& labels);

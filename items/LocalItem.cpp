@@ -7,12 +7,14 @@
 #include <charconv>
 #include <cstdio>
 
+#include "host/ItemIdentifier.h"
 #include "host/UrlOperations.h"
 #include "items/AppLibraryLookup.h"
 #include "items/ItemMetadata.h"
 #include "items/ResourceValueGetter.h"
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "platform/TypeIdentifiers.h"
 #include "platform/objects/String.h"
 #include "support/Error.h"
@@ -84,16 +86,10 @@ Bytes versionFromDate(const Date& date) {
 }
 
 std::optional<uint64_t> documentIDOf(const HostPorterItemIdentifier& identifier) {
-    constexpr std::string_view kPrefix = "did=";
-    if (!identifier.starts_with(kPrefix))
+    auto parsed = ItemIdentifier::parse(identifier);
+    if (parsed.kind() != ItemIdentifier::Kind::Document)
         return std::nullopt;
-    uint64_t value = 0;
-    const char* begin = identifier.data() + kPrefix.size();
-    const char* end = identifier.data() + identifier.size();
-    auto [ptr, ec] = std::from_chars(begin, end, value);
-    if (ec != std::errc() || ptr != end || begin == end)
-        return std::nullopt;
-    return value;
+    return parsed.number();
 }
 
 HostPorterItemCapabilities capabilitiesFor(const Url& url, const HostPorterItemIdentifier& id) {
@@ -105,7 +101,7 @@ HostPorterItemCapabilities capabilitiesFor(const Url& url, const HostPorterItemI
     if (writable && writable->boolValue()) {
         capabilities |= C::kWriting;
         // App libraries are the apps' own: they can be written into, never moved or removed.
-        if (!id.starts_with('#'))
+        if (!ItemIdentifier::parse(id).isAppLibrary())
             capabilities |= C::kReparenting | C::kRenaming | C::kTrashing | C::kDeleting;
     }
     return capabilities;
@@ -133,12 +129,11 @@ struct StatusFields {
 // link count is read from the folder itself here. Nothing when it can't be read.
 std::shared_ptr<const Number> countEntries(const Url& url) {
     FileSystem& fs = FileSystem::current();
-    int fd = fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC, 0);
-    if (fd < 0)
+    ScopedFd fd(fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC, 0));
+    if (!fd.ok())
         return nullptr;
     std::vector<FileSystem::DirectoryEntry> entries;
-    bool read = fs.readDirectory(fd, entries);
-    fs.close(fd);
+    bool read = fs.readDirectory(fd.get(), entries);
     if (!read)
         return nullptr;
     // A 16-bit count, as the host's is; a larger folder says the most it can.
@@ -262,7 +257,7 @@ std::optional<LocalItem::Fields> LocalItem::buildFields(const Url& url,
     // The folders into which other apps drop files are the system's, not the user's.
     if (f.filename == "Inbox" && isFolderType(f.typeIdentifier) &&
         (f.parentItemIdentifier == HostPorterRootContainerItemIdentifier ||
-         f.parentItemIdentifier.starts_with('#'))) {
+         ItemIdentifier::parse(f.parentItemIdentifier).isAppLibrary())) {
         logDebug("can't create an item for the \"Inbox\" directory");
         return std::nullopt;
     }

@@ -8,11 +8,13 @@
 #include <string>
 
 #include "host/HostPorterManager.h"
+#include "host/ItemIdentifier.h"
 #include "host/PublishedTrees.h"
 #include "host/UrlOperations.h"
 #include "items/AppLibraryLookup.h"
 #include "items/TBPFileObjectIdentifier.h"
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "platform/objects/Number.h"
 #include "platform/strata/AttributeList.h"
 #include "platform/strata/StrataService.h"
@@ -25,27 +27,9 @@ namespace {
 constexpr int kEventOnlyFlags = O_PATH | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
 
 // The descriptor of an open-for-events item, closed on every path out.
-class EventOnlyDescriptor {
-public:
-    explicit EventOnlyDescriptor(const std::string& path)
-        : fd_(FileSystem::current().open(path, kEventOnlyFlags)) {}
-    ~EventOnlyDescriptor() { close(); }
-    EventOnlyDescriptor(const EventOnlyDescriptor&) = delete;
-    EventOnlyDescriptor& operator=(const EventOnlyDescriptor&) = delete;
-    int get() const { return fd_; }
-    bool ok() const { return fd_ >= 0; }
-    void close() {
-        if (fd_ < 0)
-            return;
-        int saved = errno;
-        FileSystem::current().close(fd_);
-        fd_ = -1;
-        errno = saved;
-    }
-
-private:
-    int fd_;
-};
+ScopedFd openEventOnly(const std::string& path) {
+    return ScopedFd(FileSystem::current().open(path, kEventOnlyFlags));
+}
 
 std::string pathOrUnknown(const Url& url) {
     return url.path().empty() ? std::string("<Unknown File>") : url.path();
@@ -77,13 +61,6 @@ IdRead readIdResource(const Url& url, ResourceKey key, const char* kind, uint64_
     return IdRead::Value;
 }
 
-uint64_t parseValue(const std::string& text) {
-    uint64_t value = 0;
-    // Trailing text ("1x", "1\n2") makes it no number: it must not name the item of its prefix.
-    auto [ptr, ec] = std::from_chars(text.data(), text.data() + text.size(), value);
-    return ec == std::errc() && ptr == text.data() + text.size() ? value : 0;
-}
-
 // The device of the document storage folder; 0 after logging why it has none.
 uint32_t storageDeviceID() {
     Url storage = HostPorterManager::defaultManager()->documentStorageURL();
@@ -102,7 +79,7 @@ bool isRetriedErrno(int error) {
 }  // namespace
 
 uint32_t TBFileObjectIdentifier::deviceIDWithError(const Url& url, Error* error) {
-    EventOnlyDescriptor fd(url.path());
+    ScopedFd fd = openEventOnly(url.path());
     CommonAttributes attributes;
     if (!fd.ok() || GetAttributeList(fd.get(), attributes) != 0) {
         int saved = errno;
@@ -180,7 +157,7 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     auto packageNumber = objectCast<Number>(package.value());
     bool isPackage = packageNumber && packageNumber->boolValue();
 
-    EventOnlyDescriptor fd(url.path());
+    ScopedFd fd = openEventOnly(url.path());
     if (!fd.ok()) {
         logFormat(LogLevel::Error, "can't open file at \"%@\"; %{errno}d",
                   {url.path(), ErrnoArg{errno}});
@@ -195,7 +172,7 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     uint32_t type = attributes.mode & 0xF000;
     bool isDocument = type == 0x8000 || (type == 0x4000 && isPackage);
     if (!isDocument) {
-        fd.close();
+        fd.reset();
         if (auto error = url.setResourceValue(Number::fromUInt64(attributes.fileId),
                                               ResourceKeys::kFileID)) {
             logFormat(LogLevel::Info,
@@ -212,7 +189,7 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
         logFormat(LogLevel::Error, "can't get permanent storage for \"%@\"", {url.path()});
         return std::nullopt;
     }
-    fd.close();
+    fd.reset();
     if (auto error =
             url.setResourceValue(Number::fromUInt64(documentId), ResourceKeys::kDocumentID)) {
         logFormat(LogLevel::Info, "can't cache value %@ for key HostURLDocumentIdentifierKey; %@",
@@ -249,7 +226,9 @@ std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(
     uint32_t device = storageDeviceID();
     if (device == 0)
         return std::nullopt;
-    uint64_t value = parseValue(components[1]);
+    // Trailing text ("1x", "1\n2") makes it no number (0): it must not name the item of its
+    // prefix.
+    uint64_t value = ItemIdentifier::parse(identifier).number();
     uint64_t fileId = value;
     if (host == "did") {
         // Document IDs are 32-bit; a larger number names no document.

@@ -9,6 +9,7 @@
 #include <string>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 
 namespace tamber {
 
@@ -17,18 +18,6 @@ namespace {
 constexpr size_t kReadChunk = 64 * 1024;
 // Names already taken by another writer are retried with a fresh suffix this many times.
 constexpr int kTemporaryNameAttempts = 16;
-
-// Restores errno after cleanup calls that may change it.
-class ErrnoKeeper {
-public:
-    ErrnoKeeper() : saved_(errno) {}
-    ~ErrnoKeeper() { errno = saved_; }
-    ErrnoKeeper(const ErrnoKeeper&) = delete;
-    ErrnoKeeper& operator=(const ErrnoKeeper&) = delete;
-
-private:
-    int saved_;
-};
 
 bool isDirectory(const std::string& path) {
     struct statx st {};
@@ -90,8 +79,8 @@ bool writeAll(int fd, const Bytes& bytes) {
 
 Result<Bytes> FileContents::read(const Url& url) {
     FileSystem& fs = FileSystem::current();
-    int fd = fs.open(url.path(), O_RDONLY);
-    if (fd < 0) {
+    ScopedFd fd(fs.open(url.path(), O_RDONLY));
+    if (!fd.ok()) {
         if (errno == ENOENT)
             return Error::fileNoSuchFile(url.path());
         return Error::errorWithPOSIXCode(errno);
@@ -100,21 +89,19 @@ Result<Bytes> FileContents::read(const Url& url) {
     for (;;) {
         size_t used = bytes.size();
         bytes.resize(used + kReadChunk);
-        ssize_t n = fs.read(fd, bytes.data() + used, kReadChunk);
+        ssize_t n = fs.read(fd.get(), bytes.data() + used, kReadChunk);
         if (n < 0) {
             if (errno == EINTR) {
                 bytes.resize(used);
                 continue;
             }
             Error error = Error::errorWithPOSIXCode(errno);
-            fs.close(fd);
             return error;
         }
         bytes.resize(used + static_cast<size_t>(n));
         if (n == 0)
             break;
     }
-    fs.close(fd);
     return bytes;
 }
 
@@ -133,23 +120,23 @@ Status FileContents::writeAtomically(const Url& url, const Bytes& bytes) {
     prefix += "." + url.lastPathComponent() + ".";
 
     std::string temporary;
-    int fd = -1;
-    for (int attempt = 0; attempt < kTemporaryNameAttempts && fd < 0; ++attempt) {
+    ScopedFd fd;
+    for (int attempt = 0; attempt < kTemporaryNameAttempts && !fd.ok(); ++attempt) {
         temporary = prefix + temporarySuffix();
-        fd = fs.open(temporary, O_WRONLY | O_CREAT | O_EXCL, 0666);
-        if (fd < 0 && errno != EEXIST)
+        fd.reset(fs.open(temporary, O_WRONLY | O_CREAT | O_EXCL, 0666));
+        if (!fd.ok() && errno != EEXIST)
             return Error::errorWithPOSIXCode(errno);
     }
-    if (fd < 0)
+    if (!fd.ok())
         return Error::errorWithPOSIXCode(errno);
 
-    bool ok = writeAll(fd, bytes) && fs.fsync(fd) == 0;
-    if (!ok) {
-        ErrnoKeeper keep;
-        fs.close(fd);
-    } else if (fs.close(fd) != 0) {
+    // A write error may show only when the file is closed: that close is checked too. On the
+    // failing path the descriptor is closed keeping the first error.
+    bool ok = writeAll(fd.get(), bytes) && fs.fsync(fd.get()) == 0;
+    if (!ok)
+        fd.reset();
+    else if (fd.close() != 0)
         ok = false;
-    }
     if (ok && fs.renameat2(AT_FDCWD, temporary, AT_FDCWD, url.path(), 0) == 0)
         return std::nullopt;
 

@@ -128,6 +128,11 @@ std::optional<std::string> percentDecode(std::string_view text) {
     return out;
 }
 
+bool isEntryName(std::string_view name) {
+    return !name.empty() && name != "." && name != ".." &&
+           name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
+}
+
 std::string_view lastComponent(std::string_view path) {
     if (path.empty() || path == "/")
         return path;

@@ -29,6 +29,11 @@ std::string_view lastComponent(std::string_view path);
 std::string_view deletingLastComponent(std::string_view path);
 std::vector<std::string> components(std::string_view path);
 
+// Whether `name` is a name a directory entry can have, one component: not empty, not "." or
+// "..", and without '/' or NUL. Names that come from outside (events, the index, attributes,
+// callers) are checked with this before they are joined to a path.
+bool isEntryName(std::string_view name);
+
 // The extension of a name, without the dot; empty for "name", ".hidden" and "name.".
 std::string_view extension(std::string_view name);
 

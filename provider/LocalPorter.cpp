@@ -1,6 +1,7 @@
 #include "provider/LocalPorter.h"
 
 #include "host/HostPorterManager.h"
+#include "host/ItemIdentifier.h"
 #include "host/PublishedTrees.h"
 #include "items/AppLibraryLookup.h"
 #include "items/LocalAppLibraryItem.h"
@@ -26,7 +27,7 @@ constexpr double kAppRefreshMinimumInterval = 0.5;
 const char* const kTemporaryLocalFolderName = ".TemporaryLocalFolder";
 
 bool isAppLibraryIdentifier(const HostPorterItemIdentifier& identifier) {
-    return !identifier.empty() && identifier.front() == '#';
+    return ItemIdentifier::parse(identifier).isAppLibrary();
 }
 
 }  // namespace

@@ -7,6 +7,7 @@
 
 #include "host/HostPorterEnumerator.h"
 #include "host/HostPorterExtension.h"
+#include "items/ItemMetadata.h"
 #include "items/LocalItem.h"
 #include "platform/apps/AppRecord.h"
 #include "support/DispatchQueue.h"
@@ -129,6 +130,21 @@ public:
     // after every later one).
     void _refreshInstalledAppsWithCompletionHandler(std::function<void()> completion);
     void refreshInstalledAppsWithCompletionHandler(std::function<void()> completion) override;
+
+    // Metadata by path, for hosts that name an item by its path rather than its identifier
+    // (the command line's meta verb). Works without the journal or the app refresh: the item
+    // only has to lie in a published tree.
+    struct MetadataChanges {
+        // Each one present is written; a null rank or date removes that attribute.
+        std::optional<std::shared_ptr<const Number>> favoriteRank;
+        std::optional<std::shared_ptr<const Date>> lastUsedDate;
+        std::optional<Bytes> tagData;
+    };
+    // Writes the favourite rank, then the last-used date, then the tags, and stops at the
+    // first failure, which is returned (the writes before it stay).
+    static Status changeMetadataAtURL(const Url& url, const MetadataChanges& changes);
+    // The five attributes as they are now.
+    static ItemMetadata metadataAtURL(const Url& url);
 
 private:
     Result<Url> urlForIdentifier(const HostPorterItemIdentifier& identifier);

@@ -7,6 +7,7 @@
 #include "host/HostPorterManager.h"
 #include "host/PublishedTrees.h"
 #include "items/ExtendedAttributes.h"
+#include "items/ItemMetadata.h"
 #include "items/LocalAppLibraryItem.h"
 #include "items/UnarchiveLogged.h"
 #include "platform/FileSystem.h"
@@ -44,7 +45,7 @@ std::vector<Url> trashFoldersToSweep() {
 
 // Items whose date is gone or unreadable age from now on instead of never.
 void restamp(const Url& url) {
-    (void)writeTrashDate(url, Date::now());
+    (void)ItemMetadata::writeTrashDate(url, Date::now());
 }
 
 }  // namespace

@@ -1,3 +1,4 @@
+#include "host/ItemIdentifier.h"
 #include "host/UrlOperations.h"
 #include "provider/LocalPorter.h"
 #include "support/Error.h"
@@ -17,10 +18,9 @@ bool isRootContainer(const HostPorterItemIdentifier& identifier) {
 // libraries, which belong to their apps) are never renamed, moved or removed, whatever a caller
 // asks: their records don't offer it, and the files below them would go too.
 bool isFixedContainer(const HostPorterItemIdentifier& identifier) {
-    return isRootContainer(identifier) ||
-           identifier == HostPorterWorkingSetContainerItemIdentifier ||
-           identifier == HostPorterAllDirectoriesContainerItemIdentifier ||
-           (!identifier.empty() && identifier.front() == '#');
+    auto kind = ItemIdentifier::parse(identifier).kind();
+    return isRootContainer(identifier) || kind == ItemIdentifier::Kind::WorkingSet ||
+           kind == ItemIdentifier::Kind::AllDirectories || kind == ItemIdentifier::Kind::AppLibrary;
 }
 
 // Turns the outcome of a host file operation into the completion of an item operation.

@@ -1,12 +1,5 @@
-#include <cerrno>
-
-#include "host/UrlOperations.h"
-#include "items/ExtendedAttributes.h"
+#include "host/ItemIdentifier.h"
 #include "items/ItemMetadata.h"
-#include "platform/Tag.h"
-#include "platform/archive/KeyedArchiver.h"
-#include "platform/objects/Array.h"
-#include "platform/objects/String.h"
 #include "provider/LocalPorter.h"
 #include "support/Error.h"
 #include "support/Log.h"
@@ -16,32 +9,6 @@ namespace tamber {
 
 namespace {
 
-// Sets (or, for nothing, removes) one attribute through the item's read-write access. A
-// failure is logged with the attribute's name and handed back: a caller that asked for a
-// change must learn that it did not happen.
-Status writeAttribute(const Url& url, const ObjectRef& value, const std::string& name) {
-    std::optional<Bytes> data;
-    if (value) {
-        auto archived = KeyedArchiver::archivedDataWithRootObject(value);
-        if (!archived.ok()) {
-            logError("can't archive value for xattr " + name + "; " +
-                     archived.error().description());
-            return archived.error();
-        }
-        data = std::move(archived.value());
-    }
-    Status written;
-    if (!pt_withReadWriteAccess(url, [&](int fd) {
-            written = SetOrRemoveXattr(fd, data, name);
-            return !written;
-        })) {
-        Error error = written.value_or(Error::errorWithPOSIXCode(errno));
-        logError("can't set xattr " + name + "; " + error.description());
-        return error;
-    }
-    return std::nullopt;
-}
-
 // The error a metadata update answers with when its write failed: says what could not be
 // changed on which item, keeps the cause's domain and code.
 Error updateFailed(const Error& cause, const std::string& what,
@@ -50,18 +17,6 @@ Error updateFailed(const Error& cause, const std::string& what,
     info["description"] = "can't " + what + " of " + identifier + ": " + cause.reason();
     info["itemIdentifier"] = identifier;
     return Error(cause.domain(), cause.code(), std::move(info));
-}
-
-// The labels of tag data, in order; nothing readable gives none. Colours are not kept.
-std::vector<ObjectRef> labelsOf(const std::optional<Bytes>& tagData) {
-    std::vector<ObjectRef> labels;
-    if (!tagData)
-        return labels;
-    if (auto tags = GetTagsFromTagsData(*tagData)) {
-        labels.reserve(tags->size());
-        for (const auto& tag : *tags) labels.push_back(String::make(tag->label()));
-    }
-    return labels;
 }
 
 void completeWithItem(LocalPorter& porter, const Url& url,
@@ -82,7 +37,7 @@ void LocalPorter::setLastUsedDate(std::shared_ptr<const Date> date,
              : "clearing last used date for item \"" + identifier;
     withLogSection(title, [&] {
         // Libraries and other "#" items are the apps', not the user's documents.
-        if (identifier.find('#') != std::string::npos) {
+        if (ItemIdentifier::parse(identifier).isAppLibrary()) {
             Error refused = Error::invalidParameter("itemIdentifier", identifier);
             std::map<std::string, std::string> info = refused.userInfo();
             info["description"] = "an app library has no last-used date: " + identifier;
@@ -108,9 +63,8 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
             return completion(nullptr,
                               Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         }
-        // Never removed: no tags is an empty list, so that clearing them is a change too.
-        if (auto error = writeAttribute(url.value(), Array::make(labelsOf(tagData)),
-                                        LocalItem::xattrTagDataName()))
+        // Logged by the writer; no tags is written as an empty list, never a removal.
+        if (auto error = ItemMetadata::writeTagData(url.value(), tagData))
             return completion(nullptr, updateFailed(*error, "set the tags", identifier));
         completeWithItem(*this, url.value(), completion);
     });
@@ -119,21 +73,38 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
 void LocalPorter::setFavoriteRank(std::shared_ptr<const Number> rank,
                                   const HostPorterItemIdentifier& identifier,
                                   ItemCompletion completion) {
-    withLogSection(
-        "set favorite rank \"" + (rank ? rank->description() : std::string("nil")) +
-            "\" to item \"" + identifier,
-        [&] {
-            auto url = urlForIdentifierLogged(identifier);
-            if (!url.ok()) {
-                logError("can't find URL for item; " + url.error().description());
-                return completion(nullptr,
-                                  Error::porterErrorForNonExistentItemWithIdentifier(identifier));
-            }
-            if (auto error = writeAttribute(url.value(), rank, LocalItem::xattrFavoriteRankName()))
-                return completion(nullptr,
-                                  updateFailed(*error, "set the favourite rank", identifier));
-            completeWithItem(*this, url.value(), completion);
-        });
+    withLogSection("set favorite rank \"" + (rank ? rank->description() : std::string("nil")) +
+                       "\" to item \"" + identifier,
+                   [&] {
+                       auto url = urlForIdentifierLogged(identifier);
+                       if (!url.ok()) {
+                           logError("can't find URL for item; " + url.error().description());
+                           return completion(
+                               nullptr,
+                               Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+                       }
+                       if (auto error = ItemMetadata::writeFavoriteRank(url.value(), rank))
+                           return completion(
+                               nullptr, updateFailed(*error, "set the favourite rank", identifier));
+                       completeWithItem(*this, url.value(), completion);
+                   });
+}
+
+Status LocalPorter::changeMetadataAtURL(const Url& url, const MetadataChanges& changes) {
+    if (changes.favoriteRank)
+        if (auto error = ItemMetadata::writeFavoriteRank(url, *changes.favoriteRank))
+            return error;
+    if (changes.lastUsedDate)
+        if (auto error = ItemMetadata::writeLastUsedDate(url, *changes.lastUsedDate))
+            return error;
+    if (changes.tagData)
+        if (auto error = ItemMetadata::writeTagData(url, *changes.tagData))
+            return error;
+    return std::nullopt;
+}
+
+ItemMetadata LocalPorter::metadataAtURL(const Url& url) {
+    return ItemMetadata::read(url);
 }
 
 }  // namespace tamber

@@ -2,6 +2,7 @@
 #include <mutex>
 #include <new>
 
+#include "host/ItemIdentifier.h"
 #include "platform/apps/AppRecord.h"
 #include "platform/apps/AppRegistry.h"
 #include "platform/device/DeviceAnswer.h"
@@ -119,9 +120,10 @@ std::string identifierList(const std::vector<HostPorterItemIdentifier>& identifi
 // The PNG of one item's thumbnail, or nothing; every step that fails writes one line.
 std::optional<Bytes> thumbnailFor(LocalPorter& porter, const HostPorterItemIdentifier& identifier) {
     // Files and folders are shown with the browser's own icons.
-    if (identifier.empty() || identifier.front() != '#')
+    auto parsed = ItemIdentifier::parse(identifier);
+    if (!parsed.isAppLibrary())
         return std::nullopt;
-    std::string bundleIdentifier = identifier.substr(1);
+    const std::string& bundleIdentifier = parsed.bundleIdentifier();
     auto record = std::dynamic_pointer_cast<const AppRecord>(
         AppRegistry::defaultRegistry()->recordForBundleIdentifier(bundleIdentifier));
     if (!record) {

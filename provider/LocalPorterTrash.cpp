@@ -1,7 +1,7 @@
+#include "host/ItemIdentifier.h"
 #include "host/ItemNames.h"
 #include "host/UrlOperations.h"
-#include "items/ExtendedAttributes.h"
-#include "platform/archive/KeyedArchiver.h"
+#include "items/ItemMetadata.h"
 #include "platform/objects/Number.h"
 #include "platform/objects/String.h"
 #include "provider/LocalPorter.h"
@@ -40,22 +40,11 @@ void setPutBackString(const Url& trashedURL, const Url& originalURL) {
                  ", basePath: " + library->root.path());
         return;
     }
-    auto data = KeyedArchiver::archivedDataWithRootObject(String::make(*relative));
-    if (!data.ok()) {
-        logError("can't archive value for xattr " + LocalItem::xattrTrashPutBackName() + "; " +
-                 data.error().description());
-        return;
-    }
     logDebug(
         [&] { return "setting putback '" + *relative + "' on " + trashedURL.absoluteString(); });
-    bool written = pt_withReadWriteAccess(trashedURL, [&](int fd) {
-        return !SetOrRemoveXattr(fd, data.value(), LocalItem::xattrTrashPutBackName());
-    });
-    if (!written) {
-        Error error = Error::errorWithPOSIXCode(errno);
+    if (auto error = ItemMetadata::writePutBack(trashedURL, String::make(*relative)))
         logError("couldn't set putback xattr (" + *relative + ") on " +
-                 trashedURL.absoluteString() + "; " + error.description());
-    }
+                 trashedURL.absoluteString() + "; " + error->description());
 }
 
 bool isReachableFolder(const Url& url) {
@@ -76,7 +65,8 @@ void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identi
             return completion(nullptr,
                               Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         // Trashing a library or the storage itself would move it into its own trash.
-        if (identifier == HostPorterRootContainerItemIdentifier || identifier.starts_with('#'))
+        auto kind = ItemIdentifier::parse(identifier).kind();
+        if (kind == ItemIdentifier::Kind::RootContainer || kind == ItemIdentifier::Kind::AppLibrary)
             return completion(nullptr, Error::errorFileWriteNoPermission());
 
         auto components = componentsThroughFirstDocuments(*url);
@@ -105,7 +95,7 @@ void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identi
                 if (error || !trashed)
                     return completion(nullptr, error.value_or(Error::posix(EIO)));
                 // The move stands whatever happens to the attributes.
-                (void)writeTrashDate(*trashed, Date::now());
+                (void)ItemMetadata::writeTrashDate(*trashed, Date::now());
                 setPutBackString(*trashed, original);
                 auto item = itemForURL(*trashed);
                 if (!item.ok())
@@ -186,7 +176,7 @@ void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& iden
                     return completion(nullptr, error.value_or(Error::posix(EIO)));
                 // Only the date goes; the next trashing rewrites the put-back path anyway.
                 logDebug("removing trash date xattr");
-                (void)writeTrashDate(*restored, nullptr);
+                (void)ItemMetadata::writeTrashDate(*restored, nullptr);
                 auto restoredItem = itemForURL(*restored);
                 if (!restoredItem.ok())
                     return completion(nullptr, restoredItem.error());

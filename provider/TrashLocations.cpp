@@ -3,11 +3,9 @@
 #include "applibraries/LocalAppLibraryManager.h"
 #include "host/HostPorterManager.h"
 #include "host/UrlOperations.h"
-#include "items/ExtendedAttributes.h"
+#include "items/ItemMetadata.h"
 #include "items/LocalItem.h"
-#include "platform/archive/KeyedArchiver.h"
-#include "platform/archive/KeyedUnarchiver.h"
-#include "platform/objects/String.h"
+#include "platform/UrlPath.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -37,8 +35,7 @@ std::optional<Url> urlFromPathComponents(const std::vector<std::string>& compone
     for (size_t i = 1; i < components.size(); ++i) {
         const std::string& component = components[i];
         // A component that would change the path's shape once joined is not one.
-        if (component.empty() || component == "." || component == ".." ||
-            component.find('/') != std::string::npos || component.find('\0') != std::string::npos)
+        if (!UrlPath::isEntryName(component))
             return std::nullopt;
         path += "/" + component;
     }
@@ -84,37 +81,13 @@ std::optional<std::string> pathRelativeToBase(const Url& url, const Url& base) {
     return relative;
 }
 
-Status writeTrashDate(const Url& url, const std::shared_ptr<const Date>& date) {
-    const std::string& name = LocalItem::xattrTrashDateName();
-    std::optional<Bytes> data;
-    if (date) {
-        logDebug([&] { return "setting trash date on " + url.absoluteString(); });
-        auto archived = KeyedArchiver::archivedDataWithRootObject(date);
-        if (!archived.ok()) {
-            logError("can't archive value for xattr " + name + "; " +
-                     archived.error().description());
-            return archived.error();
-        }
-        data = std::move(archived.value());
-    }
-    if (pt_withReadWriteAccess(url, [&](int fd) { return !SetOrRemoveXattr(fd, data, name); }))
-        return std::nullopt;
-    Error error = Error::errorWithPOSIXCode(errno);
-    logError(std::string(date ? "can't set xattr " : "can't remove xattr ") + name + " on " +
-             url.absoluteString() + "; " + error.description());
-    return error;
-}
-
 std::optional<Url> resolvePutBackURL(const Url& url) {
-    auto data = ReadXattrData(LocalItem::xattrTrashPutBackName(), url);
-    if (!data) {
+    auto putBack = ItemMetadata::readPutBack(url);
+    if (!putBack) {
         logDebug([&] { return "couldn't find putback xattr for " + url.absoluteString(); });
         return std::nullopt;
     }
-    auto putBack = KeyedUnarchiver::unarchivedObjectOfClass<String>(*data);
-    if (!putBack.ok() || !putBack.value())
-        return std::nullopt;
-    const std::string& relative = putBack.value()->value();
+    const std::string& relative = putBack->value();
 
     auto library = documentLibraryContaining(url);
     if (!library) {

@@ -38,10 +38,6 @@ std::optional<DocumentLibrary> documentLibraryContaining(const Url& url);
 // ancestor of it.
 std::optional<std::string> pathRelativeToBase(const Url& url, const Url& base);
 
-// Stamps `date` as the item's trash date, or removes it for a null date; a failure is logged
-// and returned.
-Status writeTrashDate(const Url& url, const std::shared_ptr<const Date>& date);
-
 // Where the trashed item at `url` goes back to: its put-back path resolved against the library
 // that holds it. Nothing without a put-back attribute, outside every library, or when the path
 // would lead out of the library.

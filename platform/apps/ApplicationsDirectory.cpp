@@ -9,6 +9,7 @@
 #include <optional>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -52,15 +53,15 @@ std::optional<std::string> bundleIdentifierOf(const std::string& prefix, const s
 void walk(const std::string& dir, const std::string& prefix, size_t depth,
           std::vector<ApplicationsDirectory::DesktopFile>& out) {
     FileSystem& fs = FileSystem::current();
-    int fd = fs.open(dir, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd < 0) {
+    ScopedFd fd(fs.open(dir, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!fd.ok()) {
         logUnreadable(dir, errno);
         return;
     }
     std::vector<FileSystem::DirectoryEntry> entries;
-    bool ok = fs.readDirectory(fd, entries);
+    bool ok = fs.readDirectory(fd.get(), entries);
     int error = errno;
-    fs.close(fd);
+    fd.reset();  // not held open while the sub-folders are walked
     if (!ok) {
         logUnreadable(dir, error);
         return;

@@ -11,6 +11,7 @@
 #include <optional>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "platform/apps/AppRecord.h"
 #include "platform/objects/Dictionary.h"
 #include "platform/objects/Number.h"
@@ -175,8 +176,8 @@ DesktopEntryReader::Entry DesktopEntryReader::readFile(const std::string& path,
                                                        const std::string& bundleIdentifier) {
     FileSystem& fs = FileSystem::current();
     // Non-blocking, in case the file was replaced by a FIFO since it was listed.
-    int fd = fs.open(path, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
-    if (fd < 0) {
+    ScopedFd fd(fs.open(path, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+    if (!fd.ok()) {
         if (errno == ENOENT)
             return {Outcome::Skipped, nullptr};
         return unloadable(path, std::strerror(errno));
@@ -185,7 +186,7 @@ DesktopEntryReader::Entry DesktopEntryReader::readFile(const std::string& path,
     char buffer[16384];
     int error = 0;
     while (contents.size() <= kMaxEntrySize) {
-        ssize_t n = fs.read(fd, buffer, sizeof buffer);
+        ssize_t n = fs.read(fd.get(), buffer, sizeof buffer);
         if (n < 0 && errno == EINTR)
             continue;
         if (n < 0)
@@ -194,7 +195,6 @@ DesktopEntryReader::Entry DesktopEntryReader::readFile(const std::string& path,
             break;
         contents.append(buffer, static_cast<size_t>(n));
     }
-    fs.close(fd);
     if (error)
         return unloadable(path, std::strerror(error));
     if (contents.size() > kMaxEntrySize)

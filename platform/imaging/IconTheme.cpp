@@ -5,6 +5,7 @@
 #include <string_view>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 
 namespace tamber {
 
@@ -73,11 +74,11 @@ std::optional<std::string> IconTheme::pathForIcon(const std::string& iconName, u
     uint32_t bestSize = 0;
     std::vector<FileSystem::DirectoryEntry> entries;
     for (const std::string& folder : hicolorFolders()) {
-        int fd = fs.open(folder, O_RDONLY | O_DIRECTORY);
-        if (fd < 0)
+        ScopedFd fd(fs.open(folder, O_RDONLY | O_DIRECTORY));
+        if (!fd.ok())
             continue;  // a data folder without icons is the common case
         entries.clear();
-        bool listed = fs.readDirectory(fd, entries);
+        bool listed = fs.readDirectory(fd.get(), entries);
         for (const auto& entry : listed ? entries : std::vector<FileSystem::DirectoryEntry>{}) {
             auto size = folderSize(entry.name);
             if (!size)
@@ -90,12 +91,11 @@ std::optional<std::string> IconTheme::pathForIcon(const std::string& iconName, u
             std::string relative = entry.name + "/apps/" + name + ".png";
             struct statx st {};
             // Themes link icons to each other; a link to a file is as good as the file.
-            if (fs.statx(fd, relative, 0, STATX_TYPE, &st) != 0 || !S_ISREG(st.stx_mode))
+            if (fs.statx(fd.get(), relative, 0, STATX_TYPE, &st) != 0 || !S_ISREG(st.stx_mode))
                 continue;
             best = folder + "/" + relative;
             bestSize = *size;
         }
-        fs.close(fd);
     }
     return best;
 }

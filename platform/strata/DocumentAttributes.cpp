@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -102,20 +103,20 @@ std::optional<DocumentAttributes::Values> DocumentAttributes::restore(const std:
                                                                       const Values& saved) {
     FileSystem& fs = FileSystem::current();
     // Non-blocking: should the path have become a FIFO meanwhile, opening it must not hang.
-    int fd = fs.open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
-    if (fd < 0)
+    ScopedFd fd(fs.open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    if (!fd.ok())
         return std::nullopt;
     std::optional<Values> result;
     struct statx st {};
-    if (fs.statx(fd, "", AT_EMPTY_PATH, STATX_INO | STATX_TYPE, &st) == 0 && st.stx_ino == inode &&
-        S_ISREG(st.stx_mode)) {
+    if (fs.statx(fd.get(), "", AT_EMPTY_PATH, STATX_INO | STATX_TYPE, &st) == 0 &&
+        st.stx_ino == inode && S_ISREG(st.stx_mode)) {
         result = read(path);
     }
     if (result) {
         for (const auto& [name, value] : saved) {
             if (result->contains(name) || !isKept(name))
                 continue;
-            if (fs.fsetxattr(fd, name, value.data(), value.size(), XATTR_CREATE) == 0) {
+            if (fs.fsetxattr(fd.get(), name, value.data(), value.size(), XATTR_CREATE) == 0) {
                 result->emplace(name, value);
             } else if (errno == EEXIST) {
                 // Set meanwhile by someone else: theirs is newer.
@@ -128,7 +129,6 @@ std::optional<DocumentAttributes::Values> DocumentAttributes::restore(const std:
             }
         }
     }
-    fs.close(fd);
     return result;
 }
 

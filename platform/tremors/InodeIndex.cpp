@@ -4,6 +4,8 @@
 #include <limits>
 #include <unordered_set>
 
+#include "platform/UrlPath.h"
+
 namespace tamber {
 
 namespace {
@@ -94,11 +96,6 @@ const char* InodeIndex::upgradeFrom(int64_t version) {
     }
 }
 
-bool InodeIndex::isEntryName(std::string_view name) {
-    return !name.empty() && name != "." && name != ".." &&
-           name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
-}
-
 Status InodeIndex::load() {
     auto next = db_.queryInt64("SELECT next_document_id FROM meta WHERE id = 1");
     if (!next)
@@ -118,7 +115,7 @@ Status InodeIndex::load() {
 
 Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
     for (const InodeRecord& record : records) {
-        if (!isEntryName(record.name) || record.inode == 0) {
+        if (!UrlPath::isEntryName(record.name) || record.inode == 0) {
             return Error::invalidParameter("name", record.name);
         }
     }
@@ -212,7 +209,7 @@ Result<std::optional<std::string>> InodeIndex::path(
         if (!row.value())
             break;
         std::string name = stmt->columnText(1);
-        if (!isEntryName(name))
+        if (!UrlPath::isEntryName(name))
             break;  // never let the index name a path outside its root
         names.push_back(std::move(name));
         current = fromSqlite(stmt->columnInt64(0));

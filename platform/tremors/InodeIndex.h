@@ -62,9 +62,6 @@ public:
                                 const std::optional<Bytes>& value);
     Status replaceDocumentAttributes(uint32_t docID, const Attributes& attributes);
 
-    // A name readdir could return: not empty, ".", ".." or containing '/' or NUL.
-    static bool isEntryName(std::string_view name);
-
 private:
     static Result<std::vector<InodeRecord>> readAll(SqliteDatabase::Statement& stmt);
     // The first row of `sql` with `key` bound to its one parameter, read by `read`; nothing

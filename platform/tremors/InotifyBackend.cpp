@@ -7,6 +7,7 @@
 #include <cerrno>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -231,8 +232,8 @@ int InotifyBackend::watchDirectories(const std::string& top, bool reportContents
 int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& subdirectories,
                              bool reportContents, std::vector<FileChange>& out) {
     FileSystem& fs = FileSystem::current();
-    int fd = fs.open(path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW, 0);
-    if (fd < 0) {
+    ScopedFd fd(fs.open(path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW, 0));
+    if (!fd.ok()) {
         int error = errno;
         if (vanished(error))
             vanished_.push_back(path);
@@ -244,11 +245,10 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
     // listed below, even if the path is renamed or replaced in between. The trailing "/."
     // passes through the descriptor's link, so IN_DONT_FOLLOW does not stop at it.
     std::string target =
-        watchThroughDescriptors_ ? "/proc/self/fd/" + std::to_string(fd) + "/." : path;
+        watchThroughDescriptors_ ? "/proc/self/fd/" + std::to_string(fd.get()) + "/." : path;
     int wd = api_->addWatch(inotifyFd_, target, kWatchMask);
     if (wd < 0) {
         int error = errno;
-        fs.close(fd);
         if (vanished(error))
             vanished_.push_back(path);
         else
@@ -257,15 +257,13 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
     }
     if (translator_.addWatch(wd, path)) {
         // Watched before: what is inside was listed then or reported since.
-        fs.close(fd);
         return 0;
     }
     logDebug([&] { return "Watching " + path; });
 
     std::vector<FileSystem::DirectoryEntry> entries;
-    if (!fs.readDirectory(fd, entries)) {
+    if (!fs.readDirectory(fd.get(), entries)) {
         int error = errno;
-        fs.close(fd);
         reportUnwatched(path, error, out);
         return error;
     }
@@ -273,8 +271,9 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
         bool isDirectory = entry.type == DT_DIR;
         if (entry.type == DT_UNKNOWN) {
             struct statx st {};
-            isDirectory = fs.statx(fd, entry.name, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &st) == 0 &&
-                          S_ISDIR(st.stx_mode);
+            isDirectory =
+                fs.statx(fd.get(), entry.name, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &st) == 0 &&
+                S_ISDIR(st.stx_mode);
         }
         std::string child = join(path, entry.name);
         if (reportContents)
@@ -282,7 +281,6 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
         if (isDirectory)
             subdirectories.push_back(std::move(child));
     }
-    fs.close(fd);
     return 0;
 }
 

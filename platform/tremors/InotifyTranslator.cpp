@@ -7,6 +7,8 @@
 #include <cstring>
 #include <iterator>
 
+#include "platform/UrlPath.h"
+
 namespace tamber {
 
 namespace {
@@ -37,10 +39,6 @@ std::optional<std::string> parentOf(const std::string& path) {
     if (slash == std::string::npos || path == "/")
         return std::nullopt;
     return slash == 0 ? std::string("/") : path.substr(0, slash);
-}
-
-bool isChildName(std::string_view name) {
-    return !name.empty() && name != "." && name != ".." && name.find('/') == std::string_view::npos;
 }
 
 FileChange change(Kind kind, std::string path, bool isDirectory, int error = 0) {
@@ -183,7 +181,7 @@ bool InotifyTranslator::handle(const Record& record, std::vector<FileChange>& wo
 
     constexpr uint32_t kChildEvents = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO;
     if (record.mask & kChildEvents) {
-        if (!isChildName(record.name))
+        if (!UrlPath::isEntryName(record.name))
             return false;
         std::string path = join(dir, record.name);
         if (record.mask & IN_CREATE) {
@@ -215,7 +213,7 @@ bool InotifyTranslator::handle(const Record& record, std::vector<FileChange>& wo
     }
 
     // Changes to an entry, or to the watched directory itself when there is no name.
-    if (!record.name.empty() && !isChildName(record.name))
+    if (!record.name.empty() && !UrlPath::isEntryName(record.name))
         return false;
     std::string path = record.name.empty() ? dir : join(dir, record.name);
     bool isSelf = record.name.empty();

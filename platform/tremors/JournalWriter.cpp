@@ -9,6 +9,8 @@
 #include <utility>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
+#include "platform/UrlPath.h"
 #include "platform/strata/DocumentAttributes.h"
 #include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/WatchedRoots.h"
@@ -78,16 +80,6 @@ bool sameFile(const InodeRecord& indexed, const InodeRecord& found) {
 bool changedWhileAway(const InodeRecord& indexed, const InodeRecord& found) {
     return indexed.stamped && indexed.kind != InodeRecord::kDirectory &&
            (indexed.size != found.size || indexed.mtime != found.mtime);
-}
-
-std::string parentOf(const std::string& path) {
-    size_t slash = path.rfind('/');
-    return slash == 0 || slash == std::string::npos ? "/" : path.substr(0, slash);
-}
-
-std::string nameOf(const std::string& path) {
-    size_t slash = path.rfind('/');
-    return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
 void logIfFailed(const Status& status, std::string_view what) {
@@ -205,7 +197,7 @@ void JournalWriter::flushStaged() {
     std::vector<InodeRecord> records;
     records.reserve(staged_.size());
     for (auto& [inode, record] : staged_) {
-        if (InodeIndex::isEntryName(record.name))  // one odd name must not cost the batch
+        if (UrlPath::isEntryName(record.name))  // one odd name must not cost the batch
             records.push_back(std::move(record));
     }
     staged_.clear();
@@ -388,12 +380,13 @@ void JournalWriter::created(const FileChange& change) {
     uint32_t kind = change.isDirectory ? kTremorItemIsDir : kTremorItemIsFile;
     struct statx st {};
     struct statx parent {};
-    if (!statPath(change.path, st) || !statPath(parentOf(change.path), parent)) {
+    if (!statPath(change.path, st) ||
+        !statPath(std::string(UrlPath::deletingLastComponent(change.path)), parent)) {
         // Gone already; its removal follows in this batch or the next.
         pending_.push_back({0, change.path, 0, kTremorItemCreated | kind});
         return;
     }
-    std::string name = nameOf(change.path);
+    std::string name = std::string(UrlPath::lastComponent(change.path));
     for (const InodeRecord& existing : entriesAt(parent.stx_ino, name)) {
         if (!isIndexedFile(existing, st))
             forgetSubtree(existing, change.path);
@@ -424,12 +417,13 @@ void JournalWriter::renamed(const FileChange& change) {
     struct statx parent {};
     uint32_t kind = change.isDirectory ? kTremorItemIsDir : kTremorItemIsFile;
     uint64_t inode = from ? from->inode : 0;
-    bool present = statPath(change.path, st) && statPath(parentOf(change.path), parent);
+    bool present = statPath(change.path, st) &&
+                   statPath(std::string(UrlPath::deletingLastComponent(change.path)), parent);
     if (present)
         inode = st.stx_ino;
     std::vector<InodeRecord> existing;
     if (present) {
-        existing = entriesAt(parent.stx_ino, nameOf(change.path));
+        existing = entriesAt(parent.stx_ino, std::string(UrlPath::lastComponent(change.path)));
     } else if (auto at = recordAt(change.path)) {
         existing.push_back(std::move(*at));
     }
@@ -439,7 +433,8 @@ void JournalWriter::renamed(const FileChange& change) {
     }
     if (present) {
         forgetReusedNumber(st);
-        InodeRecord record = recordOf(st, parent.stx_ino, nameOf(change.path));
+        InodeRecord record =
+            recordOf(st, parent.stx_ino, std::string(UrlPath::lastComponent(change.path)));
         kind = kindFlag(record.kind);
         stage(std::move(record));
     }
@@ -460,7 +455,8 @@ void JournalWriter::touched(const FileChange& change, uint32_t flag) {
         // The index keeps up, so that a restart does not report the change again. Another file
         // that took the inode number is left to its own creation event.
         auto indexed = stagedOrIndexed(inode);
-        if (indexed && indexed->name == nameOf(change.path) && isIndexedFile(*indexed, st)) {
+        if (indexed && indexed->name == std::string(UrlPath::lastComponent(change.path)) &&
+            isIndexedFile(*indexed, st)) {
             InodeRecord now = recordOf(st, indexed->parent, indexed->name);
             if (differs(*indexed, now))
                 stage(std::move(now));
@@ -497,14 +493,14 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
     while (!stack.empty()) {
         auto [dir, at] = std::move(stack.back());
         stack.pop_back();
-        int fd = fs.open(at, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-        if (fd < 0)
+        ScopedFd fd(fs.open(at, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        if (!fd.ok())
             continue;  // vanished or unreadable: what it held counts as gone
         entries.clear();
-        bool listed = fs.readDirectory(fd, entries);
+        bool listed = fs.readDirectory(fd.get(), entries);
         for (const auto& entry : listed ? entries : std::vector<FileSystem::DirectoryEntry>{}) {
             struct statx st {};
-            if (fs.statx(fd, entry.name, AT_SYMLINK_NOFOLLOW, kStampMask, &st) != 0)
+            if (fs.statx(fd.get(), entry.name, AT_SYMLINK_NOFOLLOW, kStampMask, &st) != 0)
                 continue;
             InodeRecord record = recordOf(st, dir, entry.name);
             std::string path = at + "/" + entry.name;
@@ -512,7 +508,6 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
                 stack.emplace_back(record.inode, path);
             onDisk[record.inode] = {std::move(record), std::move(path)};
         }
-        fs.close(fd);
     }
     // The crawl saw every file: a known file at a document's old path was moved there.
     return commit(Settle::Clear, [&] { compareWithIndex(root, oldTop, onDisk, journal); });

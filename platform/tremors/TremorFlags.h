@@ -21,6 +21,10 @@ inline constexpr uint32_t kTremorItemIsFile = 0x10000;
 inline constexpr uint32_t kTremorItemIsDir = 0x20000;
 inline constexpr uint32_t kTremorItemIsSymlink = 0x40000;
 
+// The root a stream is given to receive document-ID events
+// ("/.docid/<device>/changed/<id>/src=<old>,dst=<new>") instead of path events.
+inline constexpr const char* kTremorDocumentIdRoot = "/.docid";
+
 // Stream creation flags.
 inline constexpr uint32_t kTremorCreateUseObjects = 0x01;
 inline constexpr uint32_t kTremorCreateFileEvents = 0x10;

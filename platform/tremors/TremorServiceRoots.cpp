@@ -8,6 +8,7 @@
 #include <utility>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "platform/Url.h"
 #include "platform/strata/StrataService.h"
 #include "platform/tremors/TremorFlags.h"
@@ -35,11 +36,11 @@ bool isVolumeDirectoryName(const std::string& name) {
 
 Status TremorService::openExistingStores() {
     FileSystem& fs = FileSystem::current();
-    int fd = fs.open(stateDir_, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    ScopedFd fd(fs.open(stateDir_, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     std::vector<FileSystem::DirectoryEntry> entries;
-    if (fd >= 0) {
-        fs.readDirectory(fd, entries);
-        fs.close(fd);
+    if (fd.ok()) {
+        fs.readDirectory(fd.get(), entries);
+        fd.reset();
     }
     // Always in the same order, so that two processes waiting for each other's stores cannot
     // each hold one the other wants.

@@ -13,6 +13,7 @@
 #include "platform/tremors/InodeRecord.h"
 #include "platform/tremors/JournalEvent.h"
 #include "platform/tremors/SqliteDatabase.h"
+#include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/TremorStoreDirectory.h"
 #include "platform/tremors/TremorStoreSchema.h"
 #include "platform/tremors/WatchedRoots.h"
@@ -42,7 +43,7 @@ public:
     static constexpr int kSchemaVersion = TremorStoreSchema::kVersion;
     static constexpr size_t kDefaultReplayChunk = 1000;
     static constexpr size_t kMaxPathComponents = InodeIndex::kMaxPathComponents;
-    static constexpr const char* kDocumentIdRoot = "/.docid";
+    static constexpr const char* kDocumentIdRoot = kTremorDocumentIdRoot;
 
     // Opens <stateDir>/<fsid as 16 hex digits>/journal.sqlite, creating it when missing, and
     // upgrades a database of an older schema in place. A database that cannot be used (not a

@@ -14,6 +14,7 @@
 #include <thread>
 
 #include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -62,8 +63,8 @@ Result<std::unique_ptr<TremorStoreDirectory>> TremorStoreDirectory::acquire(
     }
 
     std::string lockPath = path + "/" + kLockName;
-    int fd = fs.open(lockPath, O_RDWR | O_CREAT | O_CLOEXEC, 0600);
-    if (fd < 0) {
+    ScopedFd fd(fs.open(lockPath, O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+    if (!fd.ok()) {
         int code = errno;
         return failure(code, "Cannot open the lock file " + lockPath + ": " + std::strerror(code));
     }
@@ -73,18 +74,16 @@ Result<std::unique_ptr<TremorStoreDirectory>> TremorStoreDirectory::acquire(
         started + std::chrono::duration_cast<Clock::duration>(
                       std::chrono::duration<double>(wait.seconds > 0 ? wait.seconds : 0));
     bool announced = false;
-    while (::flock(fd, LOCK_EX | LOCK_NB) != 0) {
+    while (::flock(fd.get(), LOCK_EX | LOCK_NB) != 0) {
         int code = errno;
         if (code == EINTR)
             continue;
         if (code != EWOULDBLOCK) {
-            fs.close(fd);
             return failure(code, "Cannot lock " + lockPath + ": " + std::strerror(code));
         }
         auto now = Clock::now();
         pid_t holder = holderOf(path).value_or(0);
         if (now >= deadline) {
-            fs.close(fd);
             // An expected condition, not this process's fault: reported once, by the caller.
             return Error(kPosixErrorDomain, code, {{"description", heldMessage(path, holder)}});
         }
@@ -106,19 +105,18 @@ Result<std::unique_ptr<TremorStoreDirectory>> TremorStoreDirectory::acquire(
     }
     // Who holds it, for the others; a longer ID left by an earlier holder ends after the line.
     std::string pid = std::to_string(::getpid()) + "\n";
-    if (fs.write(fd, pid.data(), pid.size()) != static_cast<ssize_t>(pid.size()))
+    if (fs.write(fd.get(), pid.data(), pid.size()) != static_cast<ssize_t>(pid.size()))
         logError("Cannot write the lock file " + lockPath + ": " + std::strerror(errno));
-    return std::unique_ptr<TremorStoreDirectory>(new TremorStoreDirectory(path, fd));
+    return std::unique_ptr<TremorStoreDirectory>(new TremorStoreDirectory(path, fd.release()));
 }
 
 std::optional<pid_t> TremorStoreDirectory::holderOf(const std::string& directory) {
     FileSystem& fs = FileSystem::current();
-    int fd = fs.open(directory + "/" + kLockName, O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
-    if (fd < 0)
+    ScopedFd fd(fs.open(directory + "/" + kLockName, O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
+    if (!fd.ok())
         return std::nullopt;
     char text[32] = {};
-    ssize_t n = fs.read(fd, text, sizeof text - 1);
-    fs.close(fd);
+    ssize_t n = fs.read(fd.get(), text, sizeof text - 1);
     pid_t pid = 0;
     for (ssize_t i = 0; i < n && text[i] >= '0' && text[i] <= '9' && pid < 100000000; ++i)
         pid = pid * 10 + (text[i] - '0');

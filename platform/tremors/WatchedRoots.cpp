@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/tremors/TremorFlags.h"
+
 namespace tamber {
 
 namespace {
@@ -154,7 +156,7 @@ void WatchedRoots::release(const std::string& path) {
 Result<std::vector<std::string>> WatchedRoots::retire() {
     std::vector<std::string> retired;
     for (Row& row : rows_) {
-        if (!row.watched() || row.live || row.root.path == "/.docid")
+        if (!row.watched() || row.live || row.root.path == kTremorDocumentIdRoot)
             continue;
         // The inode stays: a later forget still finds the tree's index entries from it.
         Row updated = row;
@@ -181,7 +183,7 @@ Result<WatchedRoots::Forgotten> WatchedRoots::forget(const std::string& path) {
     Forgotten forgotten{row->root.inode, {}};
     *row = std::move(updated);
     for (const Row& other : rows_) {
-        if (other.state == State::Forgotten || other.root.path == "/.docid")
+        if (other.state == State::Forgotten || other.root.path == kTremorDocumentIdRoot)
             continue;
         if (isAtOrBelow(row->root.path, other.root.path))
             return Forgotten{};  // the tree is still that root's

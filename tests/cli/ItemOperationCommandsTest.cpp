@@ -5,6 +5,7 @@
 #include <fstream>
 #include <nlohmann/json.hpp>
 
+#include "items/ItemMetadata.h"
 #include "platform/imaging/IconBitmap.h"
 #include "platform/imaging/ImageEncoder.h"
 #include "platform/tremors/TremorService.h"
@@ -165,8 +166,9 @@ TEST_F(ItemOperationCommandsTest, TrashUntrashAndPurgeByAge) {
     tamberJson({"trash", old});
     tamberJson({"trash", fresh});
     // Trashed forty days ago.
-    ASSERT_FALSE(writeTrashDate(Url::fileURLWithPath(library + "/.Trash/old.txt"),
-                                Date::make(Date::now()->timeIntervalSince1970() - 40 * 86400)));
+    ASSERT_FALSE(ItemMetadata::writeTrashDate(
+        Url::fileURLWithPath(library + "/.Trash/old.txt"),
+        Date::make(Date::now()->timeIntervalSince1970() - 40 * 86400)));
 
     EXPECT_EQ(tamberJson({"purge-trash", "--older-than", "30d"}), (json{{"removed", 1}}));
     EXPECT_FALSE(std::filesystem::exists(library + "/.Trash/old.txt"));

@@ -79,6 +79,18 @@ TEST_F(MetaCommandTest, ErrorsAreJsonAndExitNonZero) {
     EXPECT_TRUE(metaJson()["favoriteRank"].is_null());
 }
 
+// One bad value among good ones refuses the whole call: the values before it in the
+// command line are not written either.
+TEST_F(MetaCommandTest, ABadValueLeavesTheOthersUnwritten) {
+    CliRun mixed = tamber({"--storage", storage, "meta", file, "--json", "--set-rank", "4",
+                           "--set-tags", "Work", "--set-last-used", "tomorrow"});
+    EXPECT_EQ(mixed.status, 2) << mixed.out << mixed.err;
+    json after = metaJson();
+    EXPECT_TRUE(after["favoriteRank"].is_null()) << after.dump();
+    EXPECT_TRUE(after["lastUsedDate"].is_null()) << after.dump();
+    EXPECT_EQ(after["tags"], json::array());
+}
+
 TEST_F(MetaCommandTest, StorageIsCreatedAndMustBeAFolder) {
     std::string fresh = dir / "a/b/Documents";
     CliRun r = tamber({"--storage", fresh, "meta", fresh});

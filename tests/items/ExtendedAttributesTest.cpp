@@ -43,7 +43,7 @@ protected:
     void store(const std::string& name, const ObjectRef& object) {
         auto data = KeyedArchiver::archivedDataWithRootObject(object);
         ASSERT_TRUE(data.ok());
-        ASSERT_FALSE(WriteXattrAtURL(file, data.value(), name).has_value());
+        ASSERT_FALSE(ItemMetadata::writeAttributeData(file, name, data.value()).has_value());
     }
 
     testing::TempDir dir;
@@ -57,13 +57,13 @@ TEST_F(ExtendedAttributesTest, RoundTripAndMissingAttributesAreSilent) {
     ScopedLogCapture log;
     EXPECT_FALSE(ReadXattrData(kName, file).has_value());
     Bytes value{0, 1, 2, 0xff, 0};
-    ASSERT_FALSE(WriteXattrAtURL(file, value, kName).has_value());
+    ASSERT_FALSE(ItemMetadata::writeAttributeData(file, kName, value).has_value());
     EXPECT_EQ(ReadXattrData(kName, file), value);
     char raw[16];  // stored in the user namespace under the same name
     EXPECT_EQ(::getxattr(file.path().c_str(), ("user." + kName).c_str(), raw, sizeof raw), 5);
-    ASSERT_FALSE(WriteXattrAtURL(file, std::nullopt, kName).has_value());
+    ASSERT_FALSE(ItemMetadata::writeAttributeData(file, kName, std::nullopt).has_value());
     EXPECT_FALSE(ReadXattrData(kName, file).has_value());
-    EXPECT_FALSE(WriteXattrAtURL(file, std::nullopt, kName).has_value());
+    EXPECT_FALSE(ItemMetadata::writeAttributeData(file, kName, std::nullopt).has_value());
     EXPECT_TRUE(log->lines().empty());
 }
 
@@ -139,8 +139,8 @@ TEST_F(ExtendedAttributesTest, ValuesOfTheWrongClassOrGarbageReadAsAbsent) {
     store(LocalItem::xattrLastUsedDateName(), String::make("yesterday"));
     store(LocalItem::xattrFavoriteRankName(), Date::make(1));
     store(LocalItem::xattrTagDataName(), Array::make({Number::fromInt64(1)}));
-    ASSERT_FALSE(WriteXattrAtURL(file, Bytes{'b', 'p', 'l', 'i', 's', 't'},
-                                 LocalItem::xattrTrashPutBackName()));
+    ASSERT_FALSE(ItemMetadata::writeAttributeData(file, LocalItem::xattrTrashPutBackName(),
+                                                  Bytes{'b', 'p', 'l', 'i', 's', 't'}));
     ItemMetadata m = ItemMetadata::read(file);
     EXPECT_FALSE(m.lastUsedDate || m.favoriteRank || m.putBack);
     EXPECT_FALSE(m.tagLabels.has_value() || m.tagData.has_value());
@@ -179,15 +179,16 @@ TEST_F(ExtendedAttributesTest, TheDocumentIdServiceHearsOfEveryWriteThatHappened
     ASSERT_EQ(::stat(file.path().c_str(), &st), 0);
     const std::string& tags = LocalItem::xattrTagDataName();
     Bytes value{1, 2, 3};
-    EXPECT_FALSE(WriteXattrAtURL(file, value, tags));
-    EXPECT_FALSE(WriteXattrAtURL(file, std::nullopt, tags));
-    EXPECT_FALSE(WriteXattrAtURL(file, std::nullopt, tags));  // not there: still a removal
+    EXPECT_FALSE(ItemMetadata::writeAttributeData(file, tags, value));
+    EXPECT_FALSE(ItemMetadata::writeAttributeData(file, tags, std::nullopt));
+    EXPECT_FALSE(
+        ItemMetadata::writeAttributeData(file, tags, std::nullopt));  // not there: still a removal
     {
         ScopedLogCapture quiet;
         fs->inject(Op::Fsetxattr, ENOSPC);
-        EXPECT_TRUE(WriteXattrAtURL(file, value, tags));
+        EXPECT_TRUE(ItemMetadata::writeAttributeData(file, tags, value));
         fs->inject(Op::Fremovexattr, EACCES);
-        EXPECT_TRUE(WriteXattrAtURL(file, std::nullopt, tags));
+        EXPECT_TRUE(ItemMetadata::writeAttributeData(file, tags, std::nullopt));
     }
     StrataService::setCurrent(previous);
     using Write = RecordingStrataService::Write;

@@ -1,4 +1,5 @@
 #include "platform/Url.h"
+#include "platform/UrlPath.h"
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -75,6 +76,20 @@ TEST(UrlPathTest, ComponentsAndExtensions) {
     EXPECT_EQ(Url::fileURLWithPath("/").deletingLastPathComponent().path(), "/");
     EXPECT_EQ(url.appendingPathComponent("c/d/").path(), "/Users/me/Deck.lumen/c/d");
     EXPECT_EQ(url.appendingPathComponent("../e").path(), "/Users/me/e");
+}
+
+// The one check every name from outside passes before it is joined to a path: a name that
+// would climb, stay put or split in two once joined is refused.
+TEST(UrlPathTest, EntryNamesAreOneComponent) {
+    for (const std::string& bad :
+         {std::string(""), std::string("."), std::string(".."), std::string("a/b"),
+          std::string("/"), std::string("a/"), std::string("../x"), std::string("a\0b", 3),
+          std::string("\0", 1)})
+        EXPECT_FALSE(UrlPath::isEntryName(bad)) << bad;
+    for (const std::string& good :
+         {std::string("..."), std::string(".hidden"), std::string("a b"), std::string("..a"),
+          std::string("\\"), std::string("\xff\xfe"), std::string(255, 'n')})
+        EXPECT_TRUE(UrlPath::isEntryName(good)) << good;
 }
 
 }  // namespace

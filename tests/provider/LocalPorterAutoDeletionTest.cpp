@@ -100,8 +100,8 @@ TEST_F(AutoDeletionTest, ItemsWithoutAReadableDateAreRestampedAndGoLater) {
     std::string broken = trashed(storage + "/.Trash/broken.txt", nullptr);
     auto notADate = KeyedArchiver::archivedDataWithRootObject(String::make("yesterday"));
     ASSERT_TRUE(notADate.ok());
-    ASSERT_FALSE(WriteXattrAtURL(Url::fileURLWithPath(broken), notADate.value(),
-                                 LocalItem::xattrTrashDateName()));
+    ASSERT_FALSE(ItemMetadata::writeAttributeData(
+        Url::fileURLWithPath(broken), LocalItem::xattrTrashDateName(), notADate.value()));
 
     double before = Date::now()->timeIntervalSince1970();
     sweep(Date::make(before + 3600));

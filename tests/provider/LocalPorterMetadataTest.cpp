@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include "items/ExtendedAttributes.h"
 #include "items/ItemMetadata.h"
@@ -158,12 +159,85 @@ TEST_F(MetadataTest, FailedWritesAreLoggedAndFailTheUpdate) {
         log->countStartingWith("[ERROR] can't set xattr " + LocalItem::xattrLastUsedDateName() +
                                " on " + url.absoluteString() + "; "),
         1u);
-    EXPECT_EQ(
-        log->countStartingWith("[ERROR] can't set xattr " + LocalItem::xattrTagDataName() + "; "),
-        1u);
-    EXPECT_EQ(log->countStartingWith("[ERROR] can't set xattr " +
-                                     LocalItem::xattrFavoriteRankName() + "; "),
+    EXPECT_EQ(log->countStartingWith("[ERROR] can't set xattr " + LocalItem::xattrTagDataName() +
+                                     " on " + url.absoluteString() + "; "),
               1u);
+    EXPECT_EQ(
+        log->countStartingWith("[ERROR] can't set xattr " + LocalItem::xattrFavoriteRankName() +
+                               " on " + url.absoluteString() + "; "),
+        1u);
+}
+
+// The document-ID service as far as the journal's copy of metadata is concerned: which
+// attributes of which file it was told were written.
+class WriteRecordingStrata : public FakeStrataService {
+public:
+    void metadataAttributeWritten(int fd, const std::string& name,
+                                  const std::optional<std::vector<uint8_t>>& value) override {
+        struct stat st {};
+        ASSERT_EQ(::fstat(fd, &st), 0);
+        writes.push_back({st.st_ino, name, value.has_value()});
+    }
+    struct Write {
+        uint64_t inode;
+        std::string name;
+        bool set;  // false: removed
+        friend bool operator==(const Write&, const Write&) = default;
+    };
+    std::vector<Write> writes;
+};
+
+class MetadataJournalTest : public ProviderOperationsTest {
+protected:
+    MetadataJournalTest() { strata = recorder; }
+    std::shared_ptr<WriteRecordingStrata> recorder = std::make_shared<WriteRecordingStrata>();
+};
+
+// Every path the provider writes metadata by (the three setters, trash and put-back, the
+// by-path changes) ends in the one writer, so the journal's copy misses none of them: a write
+// it did not hear of is lost at the next safe save.
+TEST_F(MetadataJournalTest, EveryProviderMetadataWriteIsToldToTheJournal) {
+    std::string file = writeFile(library + "/sub/a.txt");
+    HostPorterItemIdentifier identifier = identifierOf(file);
+    struct stat st {};
+    ASSERT_EQ(::stat(file.c_str(), &st), 0);
+    using Write = WriteRecordingStrata::Write;
+    const uint64_t inode = st.st_ino;
+
+    ItemOutcome tags, rank, date;
+    porter->setTagData(GetTagsDataForTags({Tag::make("Work")}), identifier, tags.handler());
+    porter->setFavoriteRank(Number::fromInt64(3), identifier, rank.handler());
+    porter->setLastUsedDate(Date::make(50), identifier, date.handler());
+    ASSERT_TRUE(tags.item && rank.item && date.item);
+    LocalPorter::MetadataChanges changes;
+    changes.favoriteRank = std::shared_ptr<const Number>();
+    changes.tagData = Bytes();
+    ASSERT_FALSE(LocalPorter::changeMetadataAtURL(Url::fileURLWithPath(file), changes));
+    EXPECT_EQ(recorder->writes,
+              (std::vector<Write>{{inode, LocalItem::xattrTagDataName(), true},
+                                  {inode, LocalItem::xattrFavoriteRankName(), true},
+                                  {inode, LocalItem::xattrLastUsedDateName(), true},
+                                  {inode, LocalItem::xattrFavoriteRankName(), false},
+                                  {inode, LocalItem::xattrTagDataName(), true}}));
+    auto after = LocalPorter::metadataAtURL(Url::fileURLWithPath(file));
+    EXPECT_FALSE(after.favoriteRank);
+    ASSERT_TRUE(after.tagLabels);
+    EXPECT_TRUE(after.tagLabels->empty());
+    ASSERT_TRUE(after.lastUsedDate);
+    EXPECT_EQ(after.lastUsedDate->timeIntervalSince1970(), 50);
+
+    recorder->writes.clear();
+    ItemOutcome trashed;
+    porter->trashItemWithIdentifier(identifier, trashed.handler());
+    ASSERT_TRUE(trashed.item) << trashed.error->description();
+    strata->publish(trashed.item->fileURL().path());
+    ItemOutcome back;
+    porter->untrashItemWithIdentifier(identifier, std::nullopt, back.handler());
+    ASSERT_TRUE(back.item) << back.error->description();
+    EXPECT_EQ(recorder->writes,
+              (std::vector<Write>{{inode, LocalItem::xattrTrashDateName(), true},
+                                  {inode, LocalItem::xattrTrashPutBackName(), true},
+                                  {inode, LocalItem::xattrTrashDateName(), false}}));
 }
 
 }  // namespace
