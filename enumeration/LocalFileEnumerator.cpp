@@ -251,7 +251,6 @@ void LocalFileEnumerator::enumerateChangesForObserver(
                 // In the set before it starts: a quick finish on the reader's queue removes
                 // it, and must find it there.
                 std::lock_guard lock(mutex_);
-                currentToken_ = token;
                 enumerators_.insert(enumerator);
             }
             enumerator->start();

@@ -69,7 +69,6 @@ private:
     FSChangesNotifierRef notifier_;
     mutable std::mutex mutex_;  // guards the three below: change enumerations end on their queues
     std::set<FSChangesEnumeratorRef> enumerators_;
-    FSChangeToken currentToken_;
     bool notifierStarted_ = false;  // guarded by mutex_
 };
 

@@ -64,11 +64,6 @@ bool LocalRootEnumerator::isRunning() const {
     return isRunning_;
 }
 
-void LocalRootEnumerator::setIsRunning(bool running) {
-    std::lock_guard lock(mutex_);
-    isRunning_ = running;
-}
-
 void LocalRootEnumerator::start() {
     // On the queue, so that a start never interleaves with a replacement of the enumerator.
     enumQueue_->sync([&] {

@@ -38,8 +38,6 @@ public:
     LocalFileEnumeratorRef localFileEnumerator() const;
     void setLocalFileEnumerator(LocalFileEnumeratorRef enumerator);
     bool isRunning() const;
-    void setIsRunning(bool running);
-    const std::shared_ptr<DispatchQueue>& enumQueue() const { return enumQueue_; }
     const std::shared_ptr<LocalAppLibraryManager>& appLibraryManager() const {
         return appLibraryManager_;
     }

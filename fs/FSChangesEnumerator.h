@@ -33,18 +33,6 @@ public:
     void start();
     void stop();
 
-    uint64_t numberOfChanges() const { return numberOfChanges_; }
-    void setNumberOfChanges(uint64_t value) { numberOfChanges_ = value; }
-    const HostPorterItemIdentifier& container() const { return container_; }
-    const std::shared_ptr<HostPorterChangeObserver>& observer() const { return observer_; }
-    bool shouldProcessedTremorsDocIDBased() const { return shouldProcessedTremorsDocIDBased_; }
-    void setShouldProcessedTremorsDocIDBased(bool value) {
-        shouldProcessedTremorsDocIDBased_ = value;
-    }
-    uint64_t sinceTremorID() const { return sinceTremorID_; }
-    uint64_t maxTremorID() const { return maxTremorID_; }
-    void setMaxTremorID(uint64_t value) { maxTremorID_ = value; }
-
     void readerDidChange(TremorReader& reader, const LocalItemRef& item,
                          const std::optional<Url>& url) override;
     void readerDidDelete(TremorReader& reader, const HostPorterItemIdentifier& identifier,

@@ -64,8 +64,6 @@ public:
     uint64_t lastEventId() const;
     // The oldest ID still kept (or the next one, when everything was trimmed).
     uint64_t oldestEventId() const;
-    // Commits made by this store's connection; one append is one commit.
-    uint64_t commitCount() const;
 
     // Runs `work` as one transaction: the appends and index changes it makes from this thread are
     // all written, or (when it or the commit fails) none is, and no ID it used is handed out
