@@ -187,6 +187,8 @@ private:
     std::unique_ptr<SqliteDatabase> db_;
     std::unique_ptr<WatchedRoots> roots_;  // uses db_
     std::unique_ptr<InodeIndex> index_;    // uses db_
+    // Guards the database and the two event-ID counters below (taken again by calls made with
+    // it held); uuid_ is set when the store is opened, before it is shared.
     mutable std::recursive_mutex mutex_;
     std::string uuid_;
     uint64_t nextEventId_ = 1;
