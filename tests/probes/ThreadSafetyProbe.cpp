@@ -38,7 +38,9 @@ public:
     }
 
 #ifdef TAMBER_PROBE_VIOLATION
-    int racy() { return value_; }
+    int racy() {
+        return value_;
+    }
 #endif
 
 private:
