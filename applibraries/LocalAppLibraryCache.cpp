@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <cstdlib>
 #include <limits>
-#include <mutex>
 #include <string_view>
 
 #include "items/UnarchiveLogged.h"
@@ -13,6 +12,7 @@
 #include "platform/objects/Dictionary.h"
 #include "platform/objects/Number.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -42,9 +42,9 @@ std::string_view fileName(LocalAppLibraryCacheSource source) {
 }
 
 struct SharedCaches {
-    std::mutex mutex;
-    std::shared_ptr<LocalAppLibraryCache> main;
-    std::shared_ptr<LocalAppLibraryCache> workingSet;
+    Mutex mutex;
+    std::shared_ptr<LocalAppLibraryCache> main GUARDED_BY(mutex);
+    std::shared_ptr<LocalAppLibraryCache> workingSet GUARDED_BY(mutex);
 };
 
 SharedCaches& sharedCaches() {
@@ -58,7 +58,7 @@ SharedCaches& sharedCaches() {
 std::shared_ptr<LocalAppLibraryCache> LocalAppLibraryCache::forSource(
     LocalAppLibraryCacheSource source) {
     SharedCaches& caches = sharedCaches();
-    std::lock_guard lock(caches.mutex);
+    MutexLock lock(caches.mutex);
     auto& slot = source == LocalAppLibraryCacheSource::main ? caches.main : caches.workingSet;
     if (!slot) {
         Url url = applicationSupportURL().appendingPathComponent("Tamber").appendingPathComponent(
@@ -78,7 +78,7 @@ std::shared_ptr<LocalAppLibraryCache> LocalAppLibraryCache::workingSetCache() {
 
 void LocalAppLibraryCache::resetSharedForTesting() {
     SharedCaches& caches = sharedCaches();
-    std::lock_guard lock(caches.mutex);
+    MutexLock lock(caches.mutex);
     caches.main.reset();
     caches.workingSet.reset();
 }

@@ -1,4 +1,5 @@
 #include "enumeration/DirectoryListingCache.h"
+#include "support/MutexLock.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -102,7 +103,7 @@ bool DirectoryListingCache::oldEnoughToKeep(const Stamp& stamp) {
 
 DirectoryListingCache::Listing DirectoryListingCache::find(const FileSystem* fs,
                                                            const Stamp& stamp) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     for (auto it = kept_.begin(); it != kept_.end(); ++it) {
         if (it->fileSystem != fs || it->stamp.inode != stamp.inode ||
             it->stamp.deviceMajor != stamp.deviceMajor ||
@@ -124,7 +125,7 @@ void DirectoryListingCache::keep(const std::shared_ptr<FileSystem>& fs, const St
                                  Listing listing) {
     if (maxListings_ == 0 || listing->all.size() > maxEntries_)
         return;
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     // Another thread may have read the same directory meanwhile.
     for (auto it = kept_.begin(); it != kept_.end(); ++it) {
         if (it->fileSystem == fs.get() && it->stamp.inode == stamp.inode &&
@@ -144,13 +145,13 @@ void DirectoryListingCache::keep(const std::shared_ptr<FileSystem>& fs, const St
 }
 
 void DirectoryListingCache::clear() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     kept_.clear();
     keptEntries_ = 0;
 }
 
 size_t DirectoryListingCache::listingCount() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return kept_.size();
 }
 

@@ -4,11 +4,11 @@
 #include <cstdint>
 #include <list>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "platform/FileSystem.h"
+#include "support/Mutex.h"
 #include "support/Result.h"
 
 namespace tamber {
@@ -78,9 +78,9 @@ private:
 
     const size_t maxListings_;
     const size_t maxEntries_;
-    mutable std::mutex mutex_;
-    std::list<Kept> kept_;  // most recently used first
-    size_t keptEntries_ = 0;
+    mutable Mutex mutex_;
+    std::list<Kept> kept_ GUARDED_BY(mutex_);  // most recently used first
+    size_t keptEntries_ GUARDED_BY(mutex_) = 0;
 };
 
 }  // namespace tamber

@@ -4,7 +4,6 @@
 
 #include <cerrno>
 #include <list>
-#include <mutex>
 #include <optional>
 #include <string>
 
@@ -13,6 +12,7 @@
 #include "platform/FileSystem.h"
 #include "platform/TypeIdentifiers.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -171,14 +171,14 @@ public:
     }
 
     void keep(Cursor cursor) {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         cursors_.push_front(std::move(cursor));
         if (cursors_.size() > kMaxCursors)
             cursors_.pop_back();
     }
 
     std::optional<Cursor> take(const std::string& key, uint64_t counter) {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         for (auto it = cursors_.begin(); it != cursors_.end(); ++it) {
             if (it->key == key && it->counter == counter) {
                 Cursor cursor = std::move(*it);
@@ -191,8 +191,8 @@ public:
 
 private:
     static constexpr size_t kMaxCursors = 8;
-    std::mutex mutex_;
-    std::list<Cursor> cursors_;
+    Mutex mutex_;
+    std::list<Cursor> cursors_ GUARDED_BY(mutex_);
 };
 
 bool sameEntries(const DirectoryListingCache::Entries& a, const DirectoryListingCache::Entries& b) {

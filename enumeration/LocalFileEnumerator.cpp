@@ -5,6 +5,7 @@
 #include "items/LocalItem.h"
 #include "support/Log.h"
 #include "support/LogSection.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -79,7 +80,7 @@ bool LocalFileEnumerator::shouldUpdateFileIDInStrata() const {
 }
 
 size_t LocalFileEnumerator::runningEnumeratorCount() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return enumerators_.size();
 }
 
@@ -250,8 +251,7 @@ void LocalFileEnumerator::enumerateChangesForObserver(
             {
                 // In the set before it starts: a quick finish on the reader's queue removes
                 // it, and must find it there.
-                std::lock_guard lock(mutex_);
-                currentToken_ = token;
+                MutexLock lock(mutex_);
                 enumerators_.insert(enumerator);
             }
             enumerator->start();
@@ -269,12 +269,12 @@ void LocalFileEnumerator::currentSyncAnchorWithCompletionHandler(
 }
 
 void LocalFileEnumerator::removeEnumerator(const FSChangesEnumeratorRef& enumerator) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     enumerators_.erase(enumerator);
 }
 
 void LocalFileEnumerator::start() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!notifier_ || notifierStarted_)
         return;
     notifierStarted_ = true;
@@ -282,7 +282,7 @@ void LocalFileEnumerator::start() {
 }
 
 void LocalFileEnumerator::stop() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!notifier_ || !notifierStarted_)
         return;
     notifierStarted_ = false;
@@ -293,7 +293,7 @@ void LocalFileEnumerator::invalidate() {
     stop();
     std::set<FSChangesEnumeratorRef> running;
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         // Dropping them also breaks the loop each forms with its observer context, which
         // holds this enumerator until the change enumeration finishes.
         running.swap(enumerators_);

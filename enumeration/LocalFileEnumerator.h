@@ -1,7 +1,6 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 #include <set>
 #include <vector>
 
@@ -10,6 +9,7 @@
 #include "fs/FSChangesNotifier.h"
 #include "host/HostPorterEnumerator.h"
 #include "platform/Url.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -67,10 +67,10 @@ private:
     Url enumeratedItemURL_;
     std::vector<Url> urls_;
     FSChangesNotifierRef notifier_;
-    mutable std::mutex mutex_;  // guards the three below: change enumerations end on their queues
-    std::set<FSChangesEnumeratorRef> enumerators_;
-    FSChangeToken currentToken_;
-    bool notifierStarted_ = false;  // guarded by mutex_
+    // Change enumerations start and end on their own queues.
+    mutable Mutex mutex_;
+    std::set<FSChangesEnumeratorRef> enumerators_ GUARDED_BY(mutex_);
+    bool notifierStarted_ GUARDED_BY(mutex_) = false;
 };
 
 using LocalFileEnumeratorRef = std::shared_ptr<LocalFileEnumerator>;

@@ -5,6 +5,7 @@
 #include "items/LocalAppLibraryItem.h"
 #include "support/Log.h"
 #include "support/LogSection.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -50,23 +51,18 @@ std::vector<Url> LocalRootEnumerator::monitoredURLs() const {
 }
 
 LocalFileEnumeratorRef LocalRootEnumerator::localFileEnumerator() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return localFileEnumerator_;
 }
 
 void LocalRootEnumerator::setLocalFileEnumerator(LocalFileEnumeratorRef enumerator) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     localFileEnumerator_ = std::move(enumerator);
 }
 
 bool LocalRootEnumerator::isRunning() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return isRunning_;
-}
-
-void LocalRootEnumerator::setIsRunning(bool running) {
-    std::lock_guard lock(mutex_);
-    isRunning_ = running;
 }
 
 void LocalRootEnumerator::start() {
@@ -74,7 +70,7 @@ void LocalRootEnumerator::start() {
     enumQueue_->sync([&] {
         LocalFileEnumeratorRef enumerator;
         {
-            std::lock_guard lock(mutex_);
+            MutexLock lock(mutex_);
             if (isRunning_)
                 return;
             isRunning_ = true;
@@ -88,7 +84,7 @@ void LocalRootEnumerator::stop() {
     enumQueue_->sync([&] {
         LocalFileEnumeratorRef enumerator;
         {
-            std::lock_guard lock(mutex_);
+            MutexLock lock(mutex_);
             if (!isRunning_)
                 return;
             isRunning_ = false;

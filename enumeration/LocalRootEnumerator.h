@@ -1,11 +1,11 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 
 #include "applibraries/LocalAppLibraryManager.h"
 #include "enumeration/LocalFileEnumerator.h"
 #include "host/HostPorterEnumerator.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -38,8 +38,6 @@ public:
     LocalFileEnumeratorRef localFileEnumerator() const;
     void setLocalFileEnumerator(LocalFileEnumeratorRef enumerator);
     bool isRunning() const;
-    void setIsRunning(bool running);
-    const std::shared_ptr<DispatchQueue>& enumQueue() const { return enumQueue_; }
     const std::shared_ptr<LocalAppLibraryManager>& appLibraryManager() const {
         return appLibraryManager_;
     }
@@ -59,9 +57,9 @@ private:
 
     HostPorterItemIdentifier container_;
     std::shared_ptr<LocalAppLibraryManager> appLibraryManager_;
-    mutable std::mutex mutex_;  // guards the two below
-    LocalFileEnumeratorRef localFileEnumerator_;
-    bool isRunning_ = false;
+    mutable Mutex mutex_;
+    LocalFileEnumeratorRef localFileEnumerator_ GUARDED_BY(mutex_);
+    bool isRunning_ GUARDED_BY(mutex_) = false;
     std::shared_ptr<DispatchQueue> enumQueue_;
 };
 

@@ -1,4 +1,5 @@
 #include "fs/ChangePageResumes.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -17,14 +18,14 @@ std::string ChangePageResumes::keyFor(const FSChangeToken& token,
 }
 
 void ChangePageResumes::keep(std::string key, Point point) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     points_.emplace_front(std::move(key), point);
     if (points_.size() > kMaxPoints)
         points_.pop_back();
 }
 
 std::optional<ChangePageResumes::Point> ChangePageResumes::take(const std::string& key) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     for (auto it = points_.begin(); it != points_.end(); ++it) {
         if (it->first == key) {
             Point point = it->second;

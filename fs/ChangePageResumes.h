@@ -2,7 +2,6 @@
 
 #include <cstdint>
 #include <list>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -10,6 +9,7 @@
 #include "fs/FSChangeToken.h"
 #include "fs/TremorReader.h"
 #include "host/HostPorterItemIdentifier.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -38,8 +38,8 @@ public:
 
 private:
     static constexpr size_t kMaxPoints = 16;
-    std::mutex mutex_;
-    std::list<std::pair<std::string, Point>> points_;  // newest first
+    Mutex mutex_;
+    std::list<std::pair<std::string, Point>> points_ GUARDED_BY(mutex_);  // newest first
 };
 
 }  // namespace tamber

@@ -9,6 +9,7 @@
 #include "host/UrlOperations.h"
 #include "items/LocalAppLibraryItem.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -19,7 +20,7 @@ std::shared_ptr<FSChangesEnumerator> FSChangesEnumerator::make(
         fatalError("require at least one URL to init a change enumerator");
     auto enumerator = std::make_shared<FSChangesEnumerator>(
         Private{}, std::move(token), std::move(container), std::move(urls), std::move(observer));
-    enumerator->reader_->setDelegate(enumerator);
+    enumerator->currentReader()->setDelegate(enumerator);
     return enumerator;
 }
 
@@ -62,7 +63,7 @@ void FSChangesEnumerator::stop() {
 }
 
 TremorReaderRef FSChangesEnumerator::currentReader() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return reader_;
 }
 
@@ -75,7 +76,7 @@ void FSChangesEnumerator::stopAsync(TremorReader& reader) {
 
 bool FSChangesEnumerator::accepts(const TremorReader& reader) const {
     reader.streamQueue()->assertCurrent();
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     // A stopped pass may still finish the batch it was in; that is not news any more.
     return !finished_ && &reader == reader_.get();
 }
@@ -86,7 +87,7 @@ bool FSChangesEnumerator::pageIsFull() const {
 }
 
 FSChangesEnumerator::Passage FSChangesEnumerator::pass() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     Passage passage;
     if (finished_)
         return passage;
@@ -180,7 +181,7 @@ void FSChangesEnumerator::readerDidDelete(TremorReader& reader,
             // The folder that vanished may have been an app's library root, which the root
             // container shows as the library itself.
             {
-                std::lock_guard lock(mutex_);
+                MutexLock lock(mutex_);
                 ++deferredChecks_;
             }
             reader.streamQueue()->async(
@@ -193,7 +194,7 @@ void FSChangesEnumerator::readerDidDelete(TremorReader& reader,
 
 void FSChangesEnumerator::reportLibraryRootDeletion(const Url& url) {
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         if (finished_ || pageIsFull())
             return;
     }
@@ -207,7 +208,7 @@ void FSChangesEnumerator::readerDidProcessHistory(TremorReader& reader) {
     if (!accepts(reader))
         return;
     stopAsync(reader);
-    std::unique_lock lock(mutex_);
+    MutexLock lock(mutex_);
     maxTremorID_ = std::max(maxTremorID_, reader.lastProcessedTremorID());
     if (shouldProcessedTremorsDocIDBased_) {
         logDebug("processed all Tremors path based, carry on with the docID based");
@@ -221,7 +222,7 @@ void FSChangesEnumerator::readerDidProcessHistory(TremorReader& reader) {
         // a library root's deletion was counted.
         reader.streamQueue()->async([self = shared_from_this(), next] {
             {
-                std::lock_guard lock(self->mutex_);
+                MutexLock lock(self->mutex_);
                 if (self->finished_)
                     return;  // one of those checks filled the page
             }
@@ -243,7 +244,7 @@ void FSChangesEnumerator::readerMustRescan(TremorReader& reader) {
         return;
     stopAsync(reader);
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         finished_ = true;
     }
     logDebug("fetching changes did finish after reset");

@@ -2,13 +2,13 @@
 
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <vector>
 
 #include "fs/FSChangeToken.h"
 #include "fs/TremorReader.h"
 #include "host/HostPorterChangeObserver.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -33,18 +33,6 @@ public:
     void start();
     void stop();
 
-    uint64_t numberOfChanges() const { return numberOfChanges_; }
-    void setNumberOfChanges(uint64_t value) { numberOfChanges_ = value; }
-    const HostPorterItemIdentifier& container() const { return container_; }
-    const std::shared_ptr<HostPorterChangeObserver>& observer() const { return observer_; }
-    bool shouldProcessedTremorsDocIDBased() const { return shouldProcessedTremorsDocIDBased_; }
-    void setShouldProcessedTremorsDocIDBased(bool value) {
-        shouldProcessedTremorsDocIDBased_ = value;
-    }
-    uint64_t sinceTremorID() const { return sinceTremorID_; }
-    uint64_t maxTremorID() const { return maxTremorID_; }
-    void setMaxTremorID(uint64_t value) { maxTremorID_ = value; }
-
     void readerDidChange(TremorReader& reader, const LocalItemRef& item,
                          const std::optional<Url>& url) override;
     void readerDidDelete(TremorReader& reader, const HostPorterItemIdentifier& identifier,
@@ -64,7 +52,7 @@ private:
     Passage pass();
     void forwardUpdate(const LocalItemRef& item, const std::optional<Url>& url);
     void forwardDeletion(const HostPorterItemIdentifier& identifier);
-    bool pageIsFull() const;  // under mutex_
+    bool pageIsFull() const REQUIRES(mutex_);
     // Whether a report comes from the reader of the current pass of an unfinished request.
     bool accepts(const TremorReader& reader) const;
     void reportLibraryRootDeletion(const Url& url);
@@ -73,20 +61,22 @@ private:
 
     // The counters and the token are changed on the current reader's queue; the lock keeps a
     // late task of an earlier pass and the owner's stop() from racing with it.
-    mutable std::mutex mutex_;
-    bool finished_ = false;  // no report is forwarded after the request finished
+    mutable Mutex mutex_;
+    // No report is forwarded after the request finished.
+    bool finished_ GUARDED_BY(mutex_) = false;
     // Checks of vanished folders queued for later on the reader's queue: their changes come
     // after other events', so a page they touch has no single event to resume from.
-    uint64_t deferredChecks_ = 0;
-    FSChangeToken currentToken_;
-    uint64_t numberOfChanges_ = 0;
-    HostPorterItemIdentifier container_;
-    std::vector<Url> urls_;
-    TremorReaderRef reader_;
-    std::shared_ptr<HostPorterChangeObserver> observer_;
-    bool shouldProcessedTremorsDocIDBased_ = true;
-    uint64_t sinceTremorID_;
-    uint64_t maxTremorID_;
+    uint64_t deferredChecks_ GUARDED_BY(mutex_) = 0;
+    FSChangeToken currentToken_ GUARDED_BY(mutex_);
+    uint64_t numberOfChanges_ GUARDED_BY(mutex_) = 0;
+    // Set once at construction, read-only afterwards.
+    const HostPorterItemIdentifier container_;
+    const std::vector<Url> urls_;
+    const std::shared_ptr<HostPorterChangeObserver> observer_;
+    const uint64_t sinceTremorID_;
+    TremorReaderRef reader_ GUARDED_BY(mutex_);
+    bool shouldProcessedTremorsDocIDBased_ GUARDED_BY(mutex_) = true;
+    uint64_t maxTremorID_ GUARDED_BY(mutex_);
 };
 
 using FSChangesEnumeratorRef = std::shared_ptr<FSChangesEnumerator>;

@@ -1,17 +1,16 @@
 #include "host/HostExtensionMain.h"
 
-#include <mutex>
-
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
 namespace {
 
 struct Registry {
-    std::mutex mutex;
-    HostPrincipalClassFactory factory;
-    HostRuntimeMain runtime;
+    Mutex mutex;
+    HostPrincipalClassFactory factory GUARDED_BY(mutex);
+    HostRuntimeMain runtime GUARDED_BY(mutex);
 };
 
 Registry& registry() {
@@ -22,22 +21,25 @@ Registry& registry() {
 }  // namespace
 
 void HostRegisterPrincipalClass(HostPrincipalClassFactory factory) {
-    std::lock_guard lock(registry().mutex);
-    registry().factory = std::move(factory);
+    Registry& r = registry();
+    MutexLock lock(r.mutex);
+    r.factory = std::move(factory);
 }
 
 void HostRegisterRuntime(HostRuntimeMain runtime) {
-    std::lock_guard lock(registry().mutex);
-    registry().runtime = std::move(runtime);
+    Registry& r = registry();
+    MutexLock lock(r.mutex);
+    r.runtime = std::move(runtime);
 }
 
 int HostExtensionMain(int argc, char** argv) {
     HostPrincipalClassFactory factory;
     HostRuntimeMain runtime;
     {
-        std::lock_guard lock(registry().mutex);
-        factory = registry().factory;
-        runtime = registry().runtime;
+        Registry& r = registry();
+        MutexLock lock(r.mutex);
+        factory = r.factory;
+        runtime = r.runtime;
     }
     if (!factory || !runtime) {
         logError("no extension principal class or host runtime registered");

@@ -1,4 +1,5 @@
 #include "host/RecordingHostPorterManager.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -6,7 +7,7 @@ RecordingHostPorterManager::RecordingHostPorterManager(Url documentStorage)
     : storage_(std::move(documentStorage)) {}
 
 Url RecordingHostPorterManager::documentStorageURL() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return storage_;
 }
 
@@ -14,7 +15,7 @@ void RecordingHostPorterManager::signalEnumeratorForContainerItemIdentifier(
     const HostPorterItemIdentifier& container, Completion completion) {
     std::optional<Error> error;
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         signals_.push_back(container);
         error = signalError_;
     }
@@ -25,7 +26,7 @@ void RecordingHostPorterManager::signalEnumeratorForContainerItemIdentifier(
 void RecordingHostPorterManager::deleteSearchableItemsWithDomainIdentifiers(
     const std::vector<std::string>& domainIdentifiers, Completion completion) {
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         deletions_.push_back(domainIdentifiers);
     }
     if (completion)
@@ -33,27 +34,27 @@ void RecordingHostPorterManager::deleteSearchableItemsWithDomainIdentifiers(
 }
 
 std::vector<HostPorterItemIdentifier> RecordingHostPorterManager::signals() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return signals_;
 }
 
 std::vector<std::vector<std::string>> RecordingHostPorterManager::deletions() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return deletions_;
 }
 
 void RecordingHostPorterManager::setStorageURL(Url url) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     storage_ = std::move(url);
 }
 
 void RecordingHostPorterManager::setSignalError(std::optional<Error> error) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     signalError_ = std::move(error);
 }
 
 void RecordingHostPorterManager::clear() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     signals_.clear();
     deletions_.clear();
 }

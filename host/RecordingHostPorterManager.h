@@ -1,9 +1,9 @@
 #pragma once
 
-#include <mutex>
 #include <vector>
 
 #include "host/HostPorterManager.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -26,11 +26,11 @@ public:
     void clear();
 
 private:
-    mutable std::mutex mutex_;
-    Url storage_;
-    std::vector<HostPorterItemIdentifier> signals_;
-    std::vector<std::vector<std::string>> deletions_;
-    std::optional<Error> signalError_;
+    mutable Mutex mutex_;
+    Url storage_ GUARDED_BY(mutex_);
+    std::vector<HostPorterItemIdentifier> signals_ GUARDED_BY(mutex_);
+    std::vector<std::vector<std::string>> deletions_ GUARDED_BY(mutex_);
+    std::optional<Error> signalError_ GUARDED_BY(mutex_);
 };
 
 }  // namespace tamber

@@ -24,8 +24,6 @@ public:
     [[noreturn]] static std::shared_ptr<const LocalAppLibraryItem> make(
         const Url& url, const LocalItemOptions& options = {});
 
-    bool pt_isContainer() const override { return true; }
-
 protected:
     explicit LocalAppLibraryItem(Fields fields) : LocalItem(std::move(fields)) {}
     const char* className() const override { return "LocalAppLibraryItem"; }

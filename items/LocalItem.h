@@ -75,23 +75,12 @@ public:
     // "<LocalItem:0x... did=5 name:"a" parent:root type:public.data trashed favorite:3>"
     std::string description() const override;
 
-    const HostPorterItemIdentifier& itemIdentifierAsString() const {
-        return fields_.itemIdentifier;
-    }
-    const HostPorterItemIdentifier& parentItemIdentifierAsString() const {
-        return fields_.parentItemIdentifier;
-    }
     std::optional<uint64_t> fileID() const { return fields_.fileID; }
     std::optional<uint64_t> docID() const { return fields_.docID; }
     const Url& fileURL() const { return fields_.fileURL; }
-    const std::optional<std::string>& pt_beaconDomainIdentifier() const {
-        return fields_.beaconDomainIdentifier;
-    }
     const std::optional<std::string>& pt_appContainerBundleIdentifier() const {
         return fields_.appContainerBundleIdentifier;
     }
-    bool pt_isUbiquitous() const { return false; }
-    virtual bool pt_isContainer() const { return false; }
     bool isFolder() const;
     bool isPackage() const;
 

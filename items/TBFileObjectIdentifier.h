@@ -9,8 +9,10 @@
 
 namespace tamber {
 
-// Identifiers of file URLs and back. Nothing here throws: every failure is one log line and an
-// empty result.
+// The URL side of identifiers: maps a file URL to its identifier (resolving the file or document
+// ID on disk) and an identifier back to a file URL (through the journal's inode index and
+// document-ID service). Not to be confused with TBPFileObjectIdentifier, which only formats the
+// strings. Nothing here throws: every failure is one log line and an empty result.
 class TBFileObjectIdentifier {
 public:
     // The 32-bit device number of the volume holding the item; 0 (and a POSIX error when asked

@@ -9,8 +9,10 @@
 
 namespace tamber {
 
-// Builds the three identifier forms: "fid=N" (a folder or anything that is neither a regular
-// file nor a package), "did=N" (a document) and "#bundle" (an app's document library).
+// The string side of identifiers: formats the three forms, "fid=N" (a folder or anything that is
+// neither a regular file nor a package), "did=N" (a document) and "#bundle" (an app's document
+// library), from numbers or a library root already known. It reads no file; mapping URLs to
+// identifiers and back is TBFileObjectIdentifier's job.
 class TBPFileObjectIdentifier {
 public:
     static HostPorterItemIdentifier fromFileID(uint64_t fileID);

@@ -1,4 +1,5 @@
 #include "platform/FaultInjectingFileSystem.h"
+#include "support/MutexLock.h"
 
 #include <unistd.h>
 
@@ -75,17 +76,17 @@ void FaultInjectingFileSystem::inject(Operation op, int errnoValue, int times,
                                       std::string pathSubstring) {
     if (times == 0)
         return;
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     injections_.push_back({op, errnoValue, times, std::move(pathSubstring)});
 }
 
 void FaultInjectingFileSystem::clearInjections() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     injections_.clear();
 }
 
 size_t FaultInjectingFileSystem::pendingInjections() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     size_t pending = 0;
     for (const Injection& injection : injections_) {
         pending += injection.remaining < 0 ? 1 : static_cast<size_t>(injection.remaining);
@@ -119,7 +120,7 @@ std::string FaultInjectingFileSystem::describe(const Subject& subject) {
 
 bool FaultInjectingFileSystem::shouldFail(Operation op, const Subject& subject) {
     calls_[static_cast<size_t>(op)].fetch_add(1);
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     std::string path;
     bool described = false;
     for (auto it = injections_.begin(); it != injections_.end(); ++it) {

@@ -4,12 +4,12 @@
 #include <atomic>
 #include <cstddef>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "platform/FileSystem.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -107,8 +107,8 @@ private:
 
     std::shared_ptr<FileSystem> inner_;
     std::array<std::atomic<size_t>, kOperationCount> calls_{};
-    mutable std::mutex mutex_;
-    std::vector<Injection> injections_;
+    mutable Mutex mutex_;
+    std::vector<Injection> injections_ GUARDED_BY(mutex_);
 };
 
 }  // namespace tamber

@@ -26,7 +26,6 @@ public:
     static std::shared_ptr<LocalPorter> create();
 
     const std::shared_ptr<DispatchQueue>& appRefreshQueue() const { return appRefreshQueue_; }
-    Pacer& appRefreshPacer() const { return *appRefreshPacer_; }
 
     // Host-facing.
     Result<HostPorterItemRef> itemForIdentifier(

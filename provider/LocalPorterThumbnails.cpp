@@ -1,5 +1,4 @@
 #include <cstdio>
-#include <mutex>
 #include <new>
 
 #include "host/ItemIdentifier.h"
@@ -12,6 +11,7 @@
 #include "provider/LocalPorter.h"
 #include "support/Log.h"
 #include "support/LogSection.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -32,8 +32,8 @@ struct DeviceTraits {
 
 // The two device answers, asked for once and kept for the life of the process.
 struct DeviceTraitsCache {
-    std::mutex mutex;
-    std::optional<DeviceTraits> traits;
+    Mutex mutex;
+    std::optional<DeviceTraits> traits GUARDED_BY(mutex);
 };
 
 DeviceTraitsCache& deviceTraitsCache() {
@@ -43,7 +43,7 @@ DeviceTraitsCache& deviceTraitsCache() {
 
 DeviceTraits deviceTraits() {
     auto& cache = deviceTraitsCache();
-    std::lock_guard lock(cache.mutex);
+    MutexLock lock(cache.mutex);
     if (!cache.traits) {
         DeviceTraits traits;
         auto deviceClass =
@@ -59,8 +59,8 @@ DeviceTraits deviceTraits() {
 }
 
 struct IconVariantSourceSlot {
-    std::mutex mutex;
-    IconVariantSource source;
+    Mutex mutex;
+    IconVariantSource source GUARDED_BY(mutex);
 };
 
 IconVariantSourceSlot& iconVariantSourceSlot() {
@@ -72,7 +72,7 @@ std::optional<Bytes> iconDataForVariant(const AppRecord& record, int variant) {
     IconVariantSource source;
     {
         auto& slot = iconVariantSourceSlot();
-        std::lock_guard lock(slot.mutex);
+        MutexLock lock(slot.mutex);
         source = slot.source;
     }
     return source ? source(record, variant) : record.iconDataForVariant(variant);
@@ -167,13 +167,13 @@ std::optional<Bytes> thumbnailFor(LocalPorter& porter, const HostPorterItemIdent
 
 void ResetThumbnailDeviceTraitsForTesting() {
     auto& cache = deviceTraitsCache();
-    std::lock_guard lock(cache.mutex);
+    MutexLock lock(cache.mutex);
     cache.traits.reset();
 }
 
 void SetIconVariantSourceForTesting(IconVariantSource source) {
     auto& slot = iconVariantSourceSlot();
-    std::lock_guard lock(slot.mutex);
+    MutexLock lock(slot.mutex);
     slot.source = std::move(source);
 }
 

@@ -1,10 +1,10 @@
 #pragma once
 
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "support/LogSink.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -28,8 +28,8 @@ public:
     void clear();
 
 private:
-    mutable std::mutex mutex_;
-    std::vector<Line> lines_;
+    mutable Mutex mutex_;
+    std::vector<Line> lines_ GUARDED_BY(mutex_);
 };
 
 }  // namespace tamber

@@ -3,31 +3,32 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
-#include <mutex>
 #include <utility>
 #include <vector>
 
 #include "support/BlockingScope.h"
 #include "support/DispatchTimer.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
 struct DispatchGroup::State {
-    std::mutex mutex;
+    Mutex mutex;
     std::condition_variable emptied;
-    uint64_t count = 0;
-    std::vector<std::pair<std::shared_ptr<DispatchQueue>, std::function<void()>>> notifications;
+    uint64_t count GUARDED_BY(mutex) = 0;
+    std::vector<std::pair<std::shared_ptr<DispatchQueue>, std::function<void()>>> notifications
+        GUARDED_BY(mutex);
 
     void enter() {
-        std::lock_guard lock(mutex);
+        MutexLock lock(mutex);
         ++count;
     }
 
     void leave() {
         decltype(notifications) due;
         {
-            std::lock_guard lock(mutex);
+            MutexLock lock(mutex);
             if (count == 0)
                 fatalError("DispatchGroup::leave without a matching enter");
             if (--count > 0)
@@ -66,7 +67,7 @@ void DispatchGroup::async(const std::shared_ptr<DispatchQueue>& queue,
 void DispatchGroup::notify(const std::shared_ptr<DispatchQueue>& queue,
                            std::function<void()> block) {
     {
-        std::lock_guard lock(state_->mutex);
+        MutexLock lock(state_->mutex);
         if (state_->count > 0) {
             state_->notifications.emplace_back(queue, std::move(block));
             return;
@@ -76,20 +77,26 @@ void DispatchGroup::notify(const std::shared_ptr<DispatchQueue>& queue,
 }
 
 void DispatchGroup::wait() {
-    std::unique_lock lock(state_->mutex);
+    MutexLock lock(state_->mutex);
     if (state_->count == 0)
         return;
     BlockingScope waiting;
-    state_->emptied.wait(lock, [&] { return state_->count == 0; });
+    state_->emptied.wait(lock.native(), [&] {
+        state_->mutex.assertHeld();
+        return state_->count == 0;
+    });
 }
 
 bool DispatchGroup::wait(double timeoutSeconds) {
     auto deadline = DispatchTimer::deadlineAfter(timeoutSeconds);
-    std::unique_lock lock(state_->mutex);
+    MutexLock lock(state_->mutex);
     if (state_->count == 0)
         return true;
     BlockingScope waiting;
-    return state_->emptied.wait_until(lock, deadline, [&] { return state_->count == 0; });
+    return state_->emptied.wait_until(lock.native(), deadline, [&] {
+        state_->mutex.assertHeld();
+        return state_->count == 0;
+    });
 }
 
 }  // namespace tamber

@@ -6,6 +6,7 @@
 #include "support/BlockingScope.h"
 #include "support/DispatchTimer.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -15,26 +16,32 @@ DispatchSemaphore::DispatchSemaphore(int64_t value) : value_(value) {
 }
 
 void DispatchSemaphore::signal() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     ++value_;
     available_.notify_one();
 }
 
 void DispatchSemaphore::wait() {
-    std::unique_lock lock(mutex_);
+    MutexLock lock(mutex_);
     if (value_ == 0) {
         BlockingScope waiting;
-        available_.wait(lock, [&] { return value_ > 0; });
+        available_.wait(lock.native(), [&] {
+            mutex_.assertHeld();
+            return value_ > 0;
+        });
     }
     --value_;
 }
 
 bool DispatchSemaphore::wait(double timeoutSeconds) {
     auto deadline = DispatchTimer::deadlineAfter(timeoutSeconds);
-    std::unique_lock lock(mutex_);
+    MutexLock lock(mutex_);
     if (value_ == 0) {
         BlockingScope waiting;
-        if (!available_.wait_until(lock, deadline, [&] { return value_ > 0; }))
+        if (!available_.wait_until(lock.native(), deadline, [&] {
+                mutex_.assertHeld();
+                return value_ > 0;
+            }))
             return false;
     }
     --value_;

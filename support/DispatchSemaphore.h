@@ -2,7 +2,8 @@
 
 #include <condition_variable>
 #include <cstdint>
-#include <mutex>
+
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -20,9 +21,9 @@ public:
     bool wait(double timeoutSeconds);
 
 private:
-    std::mutex mutex_;
+    Mutex mutex_;
     std::condition_variable available_;
-    int64_t value_;
+    int64_t value_ GUARDED_BY(mutex_);
 };
 
 }  // namespace tamber

@@ -20,7 +20,6 @@ inline constexpr int64_t kHostPlatformFileWriteNoPermission = 513;
 // Codes of the host framework domain.
 inline constexpr int64_t kHostPorterNoSuchItem = -1005;
 inline constexpr int64_t kHostPorterSyncAnchorExpired = -1002;
-inline constexpr int64_t kHostPorterPageExpired = -1002;
 inline constexpr int64_t kHostPorterInvalidParameter = -1009;
 
 // An error value: a domain, a code and optional user info. Copyable and cheap.

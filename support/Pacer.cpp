@@ -1,9 +1,9 @@
 #include "support/Pacer.h"
+#include "support/MutexLock.h"
 
 #include <algorithm>
 #include <chrono>
 #include <condition_variable>
-#include <mutex>
 #include <optional>
 #include <thread>
 
@@ -22,19 +22,20 @@ struct Pacer::State : std::enable_shared_from_this<State> {
     const std::shared_ptr<DispatchQueue> queue;
     const Clock::duration interval;
 
-    std::mutex mutex;
+    Mutex mutex;
     std::condition_variable runEnded;
-    std::shared_ptr<const std::function<void()>> handler;
-    bool pending = false;    // a signal not yet served by a run that started after it
-    bool scheduled = false;  // a run is waiting for its time
-    bool running = false;
-    bool cancelled = false;
-    Clock::time_point firstPendingAt;
-    std::optional<Clock::time_point> lastRunStart;
-    std::thread::id runner;
+    std::shared_ptr<const std::function<void()>> handler GUARDED_BY(mutex);
+    // A signal not yet served by a run that started after it.
+    bool pending GUARDED_BY(mutex) = false;
+    bool scheduled GUARDED_BY(mutex) = false;  // a run is waiting for its time
+    bool running GUARDED_BY(mutex) = false;
+    bool cancelled GUARDED_BY(mutex) = false;
+    Clock::time_point firstPendingAt GUARDED_BY(mutex);
+    std::optional<Clock::time_point> lastRunStart GUARDED_BY(mutex);
+    std::thread::id runner GUARDED_BY(mutex);
 
-    // With the lock held and a signal pending: the run's earliest allowed time.
-    Clock::time_point nextRunTime() const {
+    // With a signal pending: the run's earliest allowed time.
+    Clock::time_point nextRunTime() const REQUIRES(mutex) {
         auto at = firstPendingAt + interval;
         if (lastRunStart)
             at = std::max(at, *lastRunStart + interval);
@@ -53,7 +54,7 @@ struct Pacer::State : std::enable_shared_from_this<State> {
     void fire() {
         std::shared_ptr<const std::function<void()>> h;
         {
-            std::lock_guard lock(mutex);
+            MutexLock lock(mutex);
             scheduled = false;
             if (cancelled || !pending)
                 return;
@@ -74,7 +75,7 @@ struct Pacer::State : std::enable_shared_from_this<State> {
     void endRun() {
         std::optional<Clock::time_point> again;
         {
-            std::lock_guard lock(mutex);
+            MutexLock lock(mutex);
             running = false;
             runner = {};
             runEnded.notify_all();
@@ -98,11 +99,14 @@ Pacer::Pacer(std::string name, std::shared_ptr<DispatchQueue> queue,
 }
 
 Pacer::~Pacer() {
-    std::unique_lock lock(state_->mutex);
+    MutexLock lock(state_->mutex);
     state_->cancelled = true;
     if (state_->running && state_->runner != std::this_thread::get_id()) {
         BlockingScope waiting;
-        state_->runEnded.wait(lock, [&] { return !state_->running; });
+        state_->runEnded.wait(lock.native(), [&] {
+            state_->mutex.assertHeld();
+            return !state_->running;
+        });
     }
 }
 
@@ -118,14 +122,14 @@ std::string Pacer::description() const {
 
 void Pacer::setEventHandler(std::function<void()> handler) {
     auto shared = std::make_shared<const std::function<void()>>(std::move(handler));
-    std::lock_guard lock(state_->mutex);
+    MutexLock lock(state_->mutex);
     state_->handler = std::move(shared);
 }
 
 void Pacer::signal() {
     State::Clock::time_point at;
     {
-        std::lock_guard lock(state_->mutex);
+        MutexLock lock(state_->mutex);
         if (state_->pending || state_->cancelled)
             return;
         state_->pending = true;

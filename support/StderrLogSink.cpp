@@ -1,4 +1,5 @@
 #include "support/StderrLogSink.h"
+#include "support/MutexLock.h"
 
 #include <unistd.h>
 
@@ -12,7 +13,7 @@ void StderrLogSink::write(LogLevel level, std::string_view line) {
     std::string text;
     text.reserve(line.size() + 8);
     text.append("tamber: ").append(line).push_back('\n');
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     // One write call per line so that lines from several processes do not interleave.
     size_t done = 0;
     while (done < text.size()) {

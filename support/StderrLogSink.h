@@ -1,8 +1,7 @@
 #pragma once
 
-#include <mutex>
-
 #include "support/LogSink.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -16,7 +15,8 @@ public:
 
 private:
     const LogLevel minimum_;
-    std::mutex mutex_;
+    // Keeps the lines of different threads whole; it guards no member.
+    Mutex mutex_;
 };
 
 }  // namespace tamber

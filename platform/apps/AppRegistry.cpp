@@ -1,16 +1,15 @@
 #include "platform/apps/AppRegistry.h"
 
-#include <mutex>
-
 #include "platform/apps/DesktopEntryRegistry.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
 namespace {
 
 struct DefaultRegistry {
-    std::mutex mutex;
-    std::shared_ptr<AppRegistry> registry;  // created on first use
+    Mutex mutex;
+    std::shared_ptr<AppRegistry> registry GUARDED_BY(mutex);  // created on first use
 };
 
 DefaultRegistry& defaultState() {
@@ -22,7 +21,7 @@ DefaultRegistry& defaultState() {
 
 std::shared_ptr<AppRegistry> AppRegistry::defaultRegistry() {
     auto& state = defaultState();
-    std::lock_guard lock(state.mutex);
+    MutexLock lock(state.mutex);
     if (!state.registry)
         state.registry = std::make_shared<DesktopEntryRegistry>();
     return state.registry;
@@ -31,7 +30,7 @@ std::shared_ptr<AppRegistry> AppRegistry::defaultRegistry() {
 std::shared_ptr<AppRegistry> AppRegistry::setDefaultRegistry(
     std::shared_ptr<AppRegistry> registry) {
     auto& state = defaultState();
-    std::lock_guard lock(state.mutex);
+    MutexLock lock(state.mutex);
     auto previous = state.registry ? state.registry : std::make_shared<DesktopEntryRegistry>();
     state.registry = registry ? std::move(registry) : std::make_shared<DesktopEntryRegistry>();
     return previous;

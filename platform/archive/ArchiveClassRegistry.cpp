@@ -12,6 +12,7 @@
 namespace tamber {
 
 struct ArchiveClassRegistry::State {
+    // Guards classes: registration writes, look-ups share it.
     mutable std::shared_mutex mutex;
     std::map<std::string, ArchiveClass, std::less<>> classes;
 };

@@ -4,10 +4,10 @@
 #include <cmath>
 #include <cstdlib>
 #include <map>
-#include <mutex>
 
 #include "platform/FileContents.h"
 #include "platform/objects/Number.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -20,8 +20,8 @@ constexpr int kSmbiosTablet = 30;
 constexpr float kLargestScale = 16.0f;
 
 struct Overrides {
-    std::mutex mutex;
-    std::map<std::string, ObjectRef, std::less<>> values;
+    Mutex mutex;
+    std::map<std::string, ObjectRef, std::less<>> values GUARDED_BY(mutex);
 };
 
 Overrides& overrides() {
@@ -103,7 +103,7 @@ float ScreenScaleFromEnvironment() {
 ObjectRef CopyDeviceAnswer(std::string_view key) {
     {
         Overrides& o = overrides();
-        std::lock_guard lock(o.mutex);
+        MutexLock lock(o.mutex);
         if (auto it = o.values.find(key); it != o.values.end())
             return it->second;
     }
@@ -117,13 +117,13 @@ ObjectRef CopyDeviceAnswer(std::string_view key) {
 
 void SetDeviceAnswerOverride(std::string key, ObjectRef value) {
     Overrides& o = overrides();
-    std::lock_guard lock(o.mutex);
+    MutexLock lock(o.mutex);
     o.values[std::move(key)] = std::move(value);
 }
 
 void ClearDeviceAnswerOverrides() {
     Overrides& o = overrides();
-    std::lock_guard lock(o.mutex);
+    MutexLock lock(o.mutex);
     o.values.clear();
 }
 

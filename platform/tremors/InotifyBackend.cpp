@@ -9,6 +9,7 @@
 #include "platform/FileSystem.h"
 #include "platform/ScopedFd.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -79,7 +80,7 @@ Status InotifyBackend::watchTree(const std::string& root, std::vector<FileChange
     std::string top = root;
     while (top.size() > 1 && top.back() == '/') top.pop_back();
 
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     int error = watchDirectories(top, false, discovered);
     if (error == 0)
         return std::nullopt;
@@ -102,7 +103,7 @@ bool InotifyBackend::wait(int timeoutMs) {
 }
 
 void InotifyBackend::consume(std::vector<FileChange>& out) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     size_t bytes = 0;
     for (size_t i = 0; i < kReadsPerConsume; ++i) {
         if (!readOnce(out, bytes)) {
@@ -114,7 +115,7 @@ void InotifyBackend::consume(std::vector<FileChange>& out) {
 }
 
 void InotifyBackend::drain(std::vector<FileChange>& out) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     // Events queued after this point may come along too; those before it all do.
     int queued = api_->queuedBytes(inotifyFd_);
     size_t bytes = 0;
@@ -137,7 +138,7 @@ void InotifyBackend::requestStop() {
 }
 
 size_t InotifyBackend::watchCount() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return translator_.watchCount();
 }
 

@@ -5,13 +5,13 @@
 #include <atomic>
 #include <cstddef>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "platform/tremors/FileChange.h"
 #include "platform/tremors/InotifyApi.h"
 #include "platform/tremors/InotifyTranslator.h"
+#include "support/Mutex.h"
 #include "support/Result.h"
 
 namespace tamber {
@@ -75,25 +75,28 @@ public:
 
 private:
     // Reads and handles one buffer; false when nothing more was queued.
-    bool readOnce(std::vector<FileChange>& out, size_t& bytesRead);
+    bool readOnce(std::vector<FileChange>& out, size_t& bytesRead) REQUIRES(mutex_);
     // Hands out what the translator still holds; `queueEmpty` when the last read found nothing.
-    void finishReading(std::vector<FileChange>& out, bool queueEmpty);
+    void finishReading(std::vector<FileChange>& out, bool queueEmpty) REQUIRES(mutex_);
     // Removes the kernel watches of directories that left the trees.
-    void dropOrphanedWatches();
+    void dropOrphanedWatches() REQUIRES(mutex_);
     // Passes translated changes on, watching and listing the directories that appeared.
-    void handle(std::vector<FileChange>& changes, std::vector<FileChange>& out);
+    void handle(std::vector<FileChange>& changes, std::vector<FileChange>& out) REQUIRES(mutex_);
     // Watches `top` and the directories below it. With `reportContents`, every entry found in
     // a directory that was not watched yet is reported as Created. Returns the errno value that
     // kept `top` from being watched, 0 when it is watched.
-    int watchDirectories(const std::string& top, bool reportContents, std::vector<FileChange>& out);
+    int watchDirectories(const std::string& top, bool reportContents, std::vector<FileChange>& out)
+        REQUIRES(mutex_);
     // Opens the directory, watches it through that descriptor and lists it. Returns the errno
     // value on failure.
     int watchOne(const std::string& path, std::vector<std::string>& subdirectories,
-                 bool reportContents, std::vector<FileChange>& out);
-    void reportUnwatched(const std::string& path, int error, std::vector<FileChange>& out);
+                 bool reportContents, std::vector<FileChange>& out) REQUIRES(mutex_);
+    void reportUnwatched(const std::string& path, int error, std::vector<FileChange>& out)
+        REQUIRES(mutex_);
     // Lists again, at their new place, directories that vanished before they could be watched
     // because `from` (or a directory above them) was renamed to `to`.
-    void rewatchMoved(const std::string& from, const std::string& to, std::vector<FileChange>& out);
+    void rewatchMoved(const std::string& from, const std::string& to, std::vector<FileChange>& out)
+        REQUIRES(mutex_);
 
     const std::shared_ptr<InotifyApi> api_;
     const int inotifyFd_;
@@ -104,12 +107,12 @@ private:
     // consume() left events queued on purpose; wait() must not block.
     std::atomic<bool> readingCutShort_{false};
 
-    mutable std::mutex mutex_;
-    InotifyTranslator translator_;
-    std::vector<char> buffer_;
+    mutable Mutex mutex_;
+    InotifyTranslator translator_ GUARDED_BY(mutex_);
+    std::vector<char> buffer_ GUARDED_BY(mutex_);
     // Directories that appeared but were gone when they were to be watched; a rename read
     // later may say where they went. Forgotten once the queue is empty.
-    std::vector<std::string> vanished_;
+    std::vector<std::string> vanished_ GUARDED_BY(mutex_);
 };
 
 }  // namespace tamber

@@ -87,18 +87,6 @@ void InotifyTranslator::renameWatches(const std::string& from, const std::string
     }
 }
 
-const std::string* InotifyTranslator::pathOf(int wd) const {
-    auto it = paths_.find(wd);
-    return it == paths_.end() ? nullptr : &it->second;
-}
-
-std::optional<int> InotifyTranslator::watchAt(const std::string& path) const {
-    auto it = watches_.find(path);
-    if (it == watches_.end())
-        return std::nullopt;
-    return it->second;
-}
-
 bool InotifyTranslator::translate(const char* buffer, size_t length, std::vector<FileChange>& out) {
     std::vector<FileChange> work = std::move(held_);
     held_.clear();

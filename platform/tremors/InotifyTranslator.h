@@ -29,9 +29,6 @@ public:
     // The watched directory `from` and every watch below it now live under `to`.
     void renameWatches(const std::string& from, const std::string& to);
 
-    // The directory a watch stands for, or null.
-    const std::string* pathOf(int wd) const;
-    std::optional<int> watchAt(const std::string& path) const;
     size_t watchCount() const { return paths_.size(); }
 
     // Parses `length` bytes of inotify_event records and appends their changes to `out`, in the

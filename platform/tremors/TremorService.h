@@ -153,12 +153,14 @@ private:
     std::atomic<bool> indexReady_{false};
     std::atomic<bool> stopped_{false};
 
+    // Guards volumes_ and roots_.
     mutable std::mutex volumesMutex_;
     std::vector<std::unique_ptr<Volume>> volumes_;
     std::vector<std::pair<std::string, Volume*>> roots_;  // watched roots and their volume
 
     // Held while changes go from the backend to the queue, so a barrier lands after them.
     std::mutex readMutex_;
+    // Guards queue_ down to journaling_.
     std::mutex queueMutex_;
     std::condition_variable queueChanged_;
     std::deque<Item> queue_;
@@ -171,6 +173,7 @@ private:
 
     // Serialises every use of the writers and the stores' index.
     std::recursive_mutex writeMutex_;
+    // Guards listeners_ and nextListener_.
     std::mutex listenersMutex_;
     std::map<uint64_t, Listener> listeners_;
     uint64_t nextListener_ = 1;

@@ -128,11 +128,6 @@ uint64_t TremorStore::oldestEventId() const {
     return oldestEventId_;
 }
 
-uint64_t TremorStore::commitCount() const {
-    std::lock_guard lock(mutex_);
-    return db_->commitCount();
-}
-
 Status TremorStore::transact(const std::function<Status()>& work) {
     std::lock_guard lock(mutex_);
     const uint64_t nextEventId = nextEventId_;

@@ -65,8 +65,6 @@ public:
     uint64_t lastEventId() const;
     // The oldest ID still kept (or the next one, when everything was trimmed).
     uint64_t oldestEventId() const;
-    // Commits made by this store's connection; one append is one commit.
-    uint64_t commitCount() const;
 
     // Runs `work` as one transaction: the appends and index changes it makes from this thread are
     // all written, or (when it or the commit fails) none is, and no ID it used is handed out
@@ -190,6 +188,8 @@ private:
     std::unique_ptr<SqliteDatabase> db_;
     std::unique_ptr<WatchedRoots> roots_;  // uses db_
     std::unique_ptr<InodeIndex> index_;    // uses db_
+    // Guards the database and the two event-ID counters below (taken again by calls made with
+    // it held); uuid_ is set when the store is opened, before it is shared.
     mutable std::recursive_mutex mutex_;
     std::string uuid_;
     uint64_t nextEventId_ = 1;

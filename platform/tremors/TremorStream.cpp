@@ -13,6 +13,7 @@
 #include "platform/tremors/TremorService.h"
 #include "platform/tremors/WatchedRoots.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -35,14 +36,14 @@ TremorStream::~TremorStream() {
 }
 
 void TremorStream::setDispatchQueue(std::shared_ptr<DispatchQueue> queue) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     queue_ = std::move(queue);
 }
 
 bool TremorStream::start() {
     bool first;
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         if (running_ || invalidated_ || !queue_)
             return false;
         first = !everStarted_;
@@ -77,8 +78,9 @@ bool TremorStream::start() {
     std::shared_ptr<DispatchQueue> queue;
     uint64_t since;
     uint64_t run;
+    bool replaying;
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         if (first) {
             everStarted_ = true;
             historyOwed_ = options_.since != kSinceNow;
@@ -90,12 +92,13 @@ bool TremorStream::start() {
         listener_ = token;
         ceiling_ = ceiling;
         replaying_ = historyOwed_ || since < ceiling;
+        replaying = replaying_;
         queue = queue_;
         // Live events heard before the ceiling was read are in the history already.
         std::erase_if(live_, [&](const JournalEvent& e) { return e.id <= ceiling; });
     }
     auto self = shared_from_this();
-    if (replaying_)
+    if (replaying)
         queue->async([self, since, ceiling, run] { self->replay(since, ceiling, run); });
     return true;
 }
@@ -111,7 +114,7 @@ bool TremorStream::matches(const JournalEvent& event) const {
 void TremorStream::onAppended(uint32_t device, const std::vector<JournalEvent>& events) {
     if (device != device_)
         return;
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!running_)
         return;
     for (const auto& event : events) {
@@ -153,12 +156,12 @@ void TremorStream::replay(uint64_t since, uint64_t ceiling, uint64_t run) {
         return;
     bool owed;
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         owed = historyOwed_;
     }
     if (owed && !deliver({{ceiling, options_.paths.front(), 0, kTremorHistoryDone}}, run))
         return;
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (run != run_)
         return;
     replaying_ = false;
@@ -181,7 +184,7 @@ void TremorStream::scheduleFlush() {
 void TremorStream::flush(uint64_t run) {
     std::vector<JournalEvent> events;
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         if (run != run_)
             return;
         flushScheduled_ = false;
@@ -195,7 +198,7 @@ void TremorStream::flush(uint64_t run) {
 
 bool TremorStream::deliver(const std::vector<JournalEvent>& events, uint64_t run) {
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         if (!running_ || run != run_)
             return false;
         if (events.empty())
@@ -232,7 +235,7 @@ bool TremorStream::deliver(const std::vector<JournalEvent>& events, uint64_t run
 void TremorStream::stop() {
     uint64_t token = 0;
     {
-        std::lock_guard lock(mutex_);
+        MutexLock lock(mutex_);
         running_ = false;
         ++run_;
         replaying_ = false;
@@ -247,7 +250,7 @@ void TremorStream::stop() {
 
 void TremorStream::invalidate() {
     stop();
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     invalidated_ = true;
     queue_.reset();
 }

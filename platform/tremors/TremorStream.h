@@ -3,7 +3,6 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -11,6 +10,7 @@
 #include "platform/objects/Object.h"
 #include "platform/tremors/JournalEvent.h"
 #include "support/DispatchQueue.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -70,7 +70,7 @@ private:
     bool matches(const JournalEvent& event) const;
     void onAppended(uint32_t device, const std::vector<JournalEvent>& events);
     void replay(uint64_t since, uint64_t ceiling, uint64_t run);
-    void scheduleFlush();
+    void scheduleFlush() REQUIRES(mutex_);
     void flush(uint64_t run);
     // Calls the client unless the run is over; false when it is.
     bool deliver(const std::vector<JournalEvent>& events, uint64_t run);
@@ -79,22 +79,27 @@ private:
     Options options_;
     std::shared_ptr<TremorStream> handle_;
 
-    std::mutex mutex_;
-    std::shared_ptr<DispatchQueue> queue_;
+    // Set by the first start before the listener is added, read-only afterwards.
     uint32_t device_ = 0;
-    bool everStarted_ = false;
-    bool running_ = false;
-    bool invalidated_ = false;
-    bool replaying_ = false;
-    bool historyOwed_ = false;  // the history-done event is still to be sent
-    bool flushScheduled_ = false;
+
+    Mutex mutex_;
+    std::shared_ptr<DispatchQueue> queue_ GUARDED_BY(mutex_);
+    bool everStarted_ GUARDED_BY(mutex_) = false;
+    bool running_ GUARDED_BY(mutex_) = false;
+    bool invalidated_ GUARDED_BY(mutex_) = false;
+    bool replaying_ GUARDED_BY(mutex_) = false;
+    // The history-done event is still to be sent.
+    bool historyOwed_ GUARDED_BY(mutex_) = false;
+    bool flushScheduled_ GUARDED_BY(mutex_) = false;
     // Each start and stop begins a new run; work queued by an earlier run then does nothing.
-    uint64_t run_ = 0;
-    uint64_t ceiling_ = 0;   // replayed up to here; live events start after it
-    uint64_t position_ = 0;  // every event up to here was delivered or passed over
-    uint64_t listener_ = 0;
-    std::vector<JournalEvent> live_;
-    DispatchQueue::Clock::time_point lastDelivery_{};
+    uint64_t run_ GUARDED_BY(mutex_) = 0;
+    // Replayed up to here; live events start after it.
+    uint64_t ceiling_ GUARDED_BY(mutex_) = 0;
+    // Every event up to here was delivered or passed over.
+    uint64_t position_ GUARDED_BY(mutex_) = 0;
+    uint64_t listener_ GUARDED_BY(mutex_) = 0;
+    std::vector<JournalEvent> live_ GUARDED_BY(mutex_);
+    DispatchQueue::Clock::time_point lastDelivery_ GUARDED_BY(mutex_){};
 };
 
 }  // namespace tamber

@@ -117,7 +117,11 @@ TEST(DispatchQueueTest, BlockWaitingOnSemaphoreDoesNotStallOtherQueues) {
 TEST(DispatchQueueTest, GlobalBlocksWaitingOnLaterGlobalBlocksDoNotExhaustIt) {
     auto global = DispatchQueue::global();
     const int width = int(global->width());
-    for (auto [plain, waiters] : {std::pair{false, 3 * width}, std::pair{true, width + 2}}) {
+    for (auto round : {std::pair{false, 3 * width}, std::pair{true, width + 2}}) {
+        // Named variables, not a structured binding: the lambdas capture them, which clang
+        // before 16 refuses for bindings.
+        const bool plain = round.first;
+        const int waiters = round.second;
         DispatchSemaphore gate, allDone;
         std::mutex mutex;
         std::condition_variable changed;
