@@ -17,6 +17,7 @@
 #include "platform/objects/String.h"
 #include "support/Error.h"
 #include "support/Log.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -168,8 +169,8 @@ StatusFields readStatus(const Url& url, const std::string& type) {
 }
 
 std::shared_ptr<LocalItem::PutBackResolver>& putBackResolverSlot() {
-    static std::shared_ptr<LocalItem::PutBackResolver> resolver;
-    return resolver;
+    static ProcessWide<std::shared_ptr<LocalItem::PutBackResolver>> resolver;
+    return *resolver;
 }
 
 }  // namespace

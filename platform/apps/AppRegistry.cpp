@@ -3,6 +3,7 @@
 #include <mutex>
 
 #include "platform/apps/DesktopEntryRegistry.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -14,8 +15,8 @@ struct DefaultRegistry {
 };
 
 DefaultRegistry& defaultState() {
-    static DefaultRegistry state;
-    return state;
+    static ProcessWide<DefaultRegistry> state;
+    return *state;
 }
 
 }  // namespace
