@@ -27,7 +27,8 @@ public:
     void schedule(Clock::time_point deadline, std::function<void()> fire);
 
     // Drops the entries not due yet (releasing what they captured) and joins the thread; a
-    // later schedule starts it again. Called when the runtime that scheduled them goes away.
+    // later schedule starts it again. Called when the runtime that scheduled them goes away,
+    // from a host's thread: never from a firing entry, whose thread it would wait for.
     void shutdown();
 
     // Now plus `seconds`, rounded up so nothing happens early; not positive means now, and

@@ -39,7 +39,8 @@ public:
 
     // Waits until every task submitted so far, and every task those submit, has run, then
     // joins every worker. The pool can be used again afterwards. Callers stop what keeps
-    // submitting work (streams, timers) first; a task that never ends keeps this waiting.
+    // submitting work (streams, timers) first; a task that never ends keeps this waiting, and
+    // so would a call from a task (it waits for itself): call it from a host's own thread.
     void shutdown();
 
     // Live worker threads, busy or idle.
