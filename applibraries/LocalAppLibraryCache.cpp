@@ -13,6 +13,7 @@
 #include "platform/objects/Number.h"
 #include "support/Log.h"
 #include "support/MutexLock.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -48,8 +49,8 @@ struct SharedCaches {
 };
 
 SharedCaches& sharedCaches() {
-    // Never destroyed: blocks on the caches' queues may run while the process exits.
-    static auto* caches = new SharedCaches;
+    // Blocks on the caches' queues may run while the process exits.
+    static ProcessWide<SharedCaches> caches;
     return *caches;
 }
 

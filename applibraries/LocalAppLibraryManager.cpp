@@ -15,6 +15,7 @@
 #include "support/DispatchSemaphore.h"
 #include "support/Log.h"
 #include "support/LogSection.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -28,8 +29,8 @@ struct SharedManager {
 };
 
 SharedManager& sharedManager() {
-    // Never destroyed: lookups may still arrive while the process exits.
-    static auto* shared = new SharedManager;
+    // Lookups may still arrive while the process exits.
+    static ProcessWide<SharedManager> shared;
     return *shared;
 }
 
@@ -107,8 +108,8 @@ void LocalAppLibraryManager::resetSharedForTesting() {
 }
 
 DispatchQueue& LocalAppLibraryManager::backgroundQueue() {
-    // Never destroyed: a refresh may still run while the process exits.
-    static auto* queue = new std::shared_ptr<DispatchQueue>(
+    // A refresh may still run while the process exits.
+    static ProcessWide<std::shared_ptr<DispatchQueue>> queue(
         DispatchQueue::makeSerial("tamber.app-library.background"));
     return **queue;
 }

@@ -6,13 +6,7 @@
 #include <ostream>
 #include <utility>
 
-#include "applibraries/SharedAppLibraryLookup.h"
-#include "applibraries/TBPAppLibraryManager.h"
-#include "host/HostPorterManager.h"
 #include "host/PublishedTrees.h"
-#include "host/StagingCopies.h"
-#include "platform/FileContents.h"
-#include "platform/tremors/TremorService.h"
 #include "provider/LocalPorterError.h"
 #include "runtime/HostJson.h"
 #include "runtime/JsonValues.h"
@@ -29,93 +23,81 @@ CliContext::~CliContext() {
         std::lock_guard lock(waitNotice_->mutex);
         waitNotice_->err = nullptr;
     }
-    if (publishing_)
-        publishing_->retireUnwatched();
+    if (runtime_)
+        runtime_->shutdown();
+}
+
+Status CliContext::prepareStorage() {
+    if (runtime_)
+        return runtime_->prepareStorage();
+    ProviderRuntimeOptions options;
+    // The process stops the journal once, when it exits; tests run verb after verb in one
+    // process as separate runs of the same program.
+    options.journal = ProviderRuntimeOptions::Journal::ProcessWide;
+    options.storagePath = storagePath;
+    options.lockWaitSeconds = waitSeconds;
+    std::weak_ptr<WaitNotice> weakNotice = waitNotice_;
+    options.onLockWait = [weakNotice](pid_t holder, const std::string& directory) {
+        auto notice = weakNotice.lock();
+        if (!notice)
+            return;
+        std::lock_guard lock(notice->mutex);
+        // Once a run: each volume's journal may make it wait.
+        if (!notice->err || std::exchange(notice->told, true))
+            return;
+        *notice->err << "tamber: waiting for "
+                     << (holder ? "Tamber process " + std::to_string(holder)
+                                : std::string("another Tamber process"))
+                     << " to release the state directory " << directory << "\n";
+        notice->err->flush();
+    };
+    runtime_ = std::make_unique<ProviderRuntime>(std::move(options));
+    return runtime_->prepareStorage();
 }
 
 namespace {
 
-std::string defaultStoragePath() {
-    const char* home = std::getenv("HOME");
-    return std::string(home && *home ? home : "/") + "/Documents";
+const Url& noStorage() {
+    static const Url none;
+    return none;
+}
+
+const LocalPorter::AppRefreshOutcome& noRefresh() {
+    static const LocalPorter::AppRefreshOutcome none;
+    return none;
 }
 
 }  // namespace
 
-Status CliContext::prepareStorage() {
-    std::string path = storagePath.empty() ? defaultStoragePath() : storagePath;
-    storage_ = Url::fileURLWithPath(path);
-    if (auto failure = FileContents::createDirectory(storage_)) {
-        const Error& error = *failure;
-        logError("can't create document storage folder " + storage_.path() + "; " +
-                 error.description());
-        return Error(error.domain(), error.code(),
-                     {{"description", "can't use document storage folder " + storage_.path() +
-                                          ": " + std::strerror(static_cast<int>(error.code()))}});
-    }
-    std::weak_ptr<SignalSlot> weakSlot = signals_;
-    HostPorterManager::installDefaultManager(std::make_shared<StorageHostPorterManager>(
-        storage_, [weakSlot](const HostPorterItemIdentifier& container) {
-            auto slot = weakSlot.lock();
-            if (!slot)
-                return;
-            std::lock_guard lock(slot->mutex);
-            if (slot->handler)
-                slot->handler(container);
-        }));
-    return std::nullopt;
+const Url& CliContext::storageURL() const {
+    return runtime_ ? runtime_->storageURL() : noStorage();
+}
+
+const LocalPorter::AppRefreshOutcome& CliContext::appRefreshOutcome() const {
+    return runtime_ ? runtime_->appRefreshOutcome() : noRefresh();
 }
 
 Result<std::shared_ptr<TremorService>> CliContext::startJournal() {
-    std::weak_ptr<WaitNotice> weakNotice = waitNotice_;
-    TremorService::setLockWait(
-        {waitSeconds, [weakNotice](pid_t holder, const std::string& directory) {
-             auto notice = weakNotice.lock();
-             if (!notice)
-                 return;
-             std::lock_guard lock(notice->mutex);
-             // Once a run: each volume's journal may make it wait.
-             if (!notice->err || std::exchange(notice->told, true))
-                 return;
-             *notice->err << "tamber: waiting for "
-                          << (holder ? "Tamber process " + std::to_string(holder)
-                                     : std::string("another Tamber process"))
-                          << " to release the state directory " << directory << "\n";
-             notice->err->flush();
-         }});
-    return TremorService::shared();
+    if (auto error = prepareStorage())
+        return *error;
+    return runtime_->startJournal();
 }
 
 Status CliContext::prepareJournal() {
-    auto service = startJournal();
-    if (!service.ok())
-        return service.error();
-    return service.value()->watchTree(storage_.path());
+    if (auto error = prepareStorage())
+        return error;
+    return runtime_->prepareJournal();
 }
 
 Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
-    if (porter_)
-        return porter_;
-    if (auto error = prepareJournal())
+    if (auto error = prepareStorage())
         return *error;
-    SharedAppLibraryLookup::install();
-    auto porter = LocalPorter::create();
-    refreshOutcome_ = porter->refreshAppLibraries();
-    // Identifiers inside app libraries need their trees journaled like the storage folder.
-    auto service = TremorService::shared();
-    for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries()) {
-        if (auto error = service.value()->watchTree(root.path()))
-            logError("can't watch app library " + root.path() + "; " + error->description());
-    }
-    StagingCopies::sweepStale();  // copies left by imports that were killed part-way
-    porter_ = porter;
-    publishing_ = service.value();
-    return porter_;
+    return runtime_->provider();
 }
 
 void CliContext::setSignalHandler(SignalHandler handler) {
-    std::lock_guard lock(signals_->mutex);
-    signals_->handler = std::move(handler);
+    if (runtime_)
+        runtime_->setSignalHandler(std::move(handler));
 }
 
 void CliContext::setInvocation(std::string verb, std::vector<std::string> arguments) {

@@ -12,6 +12,7 @@
 #include "platform/Url.h"
 #include "platform/tremors/TremorService.h"
 #include "provider/LocalPorter.h"
+#include "runtime/ProviderRuntime.h"
 #include "support/Error.h"
 
 namespace tamber {
@@ -32,24 +33,20 @@ public:
     bool verbose = false;                      // --verbose
     double waitSeconds = kDefaultWaitSeconds;  // --wait: for another process using the journal
 
-    // Resolves and creates the document storage folder and installs the host manager for it.
-    // Fails when the folder cannot be created.
+    // Creates the run's runtime from the global options: resolves and creates the document
+    // storage folder and installs the host manager for it. Fails when the folder cannot be
+    // created. The start-up steps below are the runtime's (see ProviderRuntime).
     Status prepareStorage();
-    const Url& storageURL() const { return storage_; }
+    const Url& storageURL() const;
     // Starts the event journal and its document-ID service, watching nothing yet. When another
     // process holds the journal, waits up to waitSeconds for it, saying so once on standard
     // error; the error names that process.
     Result<std::shared_ptr<TremorService>> startJournal();
-    // Starts the journal and watches the storage folder, so that identifiers can be given and
-    // resolved.
+    // Starts the journal and watches the storage folder.
     Status prepareJournal();
-    // Runs the provider as a small host would: starts the journal, refreshes the app libraries
-    // from the installed applications, upgrades the shared manager, watches every published
-    // tree, and hands back the provider. Later calls return the same provider. What this run
-    // publishes is then known: when it ends, the trees the journal remembers but this run did
-    // not watch are marked unwatched.
+    // The provider, started as ProviderRuntime::provider() says.
     Result<std::shared_ptr<LocalPorter>> prepareProvider();
-    const LocalPorter::AppRefreshOutcome& appRefreshOutcome() const { return refreshOutcome_; }
+    const LocalPorter::AppRefreshOutcome& appRefreshOutcome() const;
 
     // Receives the container signals the provider sends to the host (a watching verb prints
     // them); may be called on any thread.
@@ -95,14 +92,7 @@ private:
     std::ostream& err_;
     std::string verb_;
     std::vector<std::string> arguments_;
-    Url storage_;
-    std::shared_ptr<LocalPorter> porter_;
-    struct SignalSlot {
-        std::mutex mutex;
-        SignalHandler handler;
-    };
-    std::shared_ptr<SignalSlot> signals_ = std::make_shared<SignalSlot>();
-    LocalPorter::AppRefreshOutcome refreshOutcome_;
+    std::unique_ptr<ProviderRuntime> runtime_;  // made by prepareStorage()
     // Where the notice of a wait for the journal goes; the journal may outlive this context.
     struct WaitNotice {
         std::mutex mutex;
@@ -110,7 +100,6 @@ private:
         bool told = false;
     };
     std::shared_ptr<WaitNotice> waitNotice_ = std::make_shared<WaitNotice>();
-    std::shared_ptr<TremorService> publishing_;  // set once the run's publication is known
 };
 
 }  // namespace tamber

@@ -10,10 +10,6 @@
 #include "runtime/JsonValues.h"
 
 #include "items/TBFileObjectIdentifier.h"
-#include "platform/objects/Array.h"
-#include "platform/objects/Dictionary.h"
-#include "platform/objects/Number.h"
-#include "platform/objects/String.h"
 #include "platform/tremors/TremorService.h"
 #include "platform/tremors/Tremors.h"
 #include "support/DispatchSemaphore.h"
@@ -30,37 +26,31 @@ struct Printer {
     DispatchSemaphore done;
 };
 
-void printEvents(TremorStreamRef, void* info, size_t count, const ObjectRef& paths,
-                 const uint32_t* flags, const uint64_t* ids) {
-    auto& printer = *static_cast<Printer*>(info);
-    auto array = objectCast<Array>(paths);
-    for (size_t i = 0; i < count; ++i) {
-        auto entry =
-            array && i < array->count() ? objectCast<Dictionary>(array->objects()[i]) : nullptr;
-        auto path = entry ? objectCast<String>(entry->objectForKey("path")) : nullptr;
-        auto fileID = entry ? objectCast<Number>(entry->objectForKey("fileID")) : nullptr;
+void printEvents(Printer& printer, const std::vector<JournalEvent>& events) {
+    for (const auto& event : events) {
         if (printer.json) {
-            nlohmann::json j{{"id", ids[i]},
-                             {"flags", flags[i]},
-                             {"fileID", fileID ? nlohmann::json(fileID->uint64Value()) : nullptr}};
-            setTextWithBytes(j, "path", "pathBytes", path ? path->value() : "");
+            nlohmann::json j{
+                {"id", event.id},
+                {"flags", event.flags},
+                {"fileID", event.fileID ? nlohmann::json(event.fileID) : nlohmann::json(nullptr)}};
+            setTextWithBytes(j, "path", "pathBytes", event.path);
             *printer.out << jsonText(j) << "\n";
         } else {
             char hex[16];
-            std::snprintf(hex, sizeof hex, "0x%05x", flags[i]);
-            *printer.out << ids[i] << " " << hex << " " << (path ? escapedText(path->value()) : "?")
-                         << " " << (fileID ? std::to_string(fileID->uint64Value()) : "-") << "\n";
+            std::snprintf(hex, sizeof hex, "0x%05x", event.flags);
+            *printer.out << event.id << " " << hex << " " << escapedText(event.path) << " "
+                         << (event.fileID ? std::to_string(event.fileID) : "-") << "\n";
         }
-        if (flags[i] & (kTremorUserDropped | kTremorKernelDropped)) {
+        if (event.flags & (kTremorUserDropped | kTremorKernelDropped)) {
             // Lost history (an overflow, a tree that could not be watched, a replay from before
             // the oldest kept event): say so, since the lines above may not be complete.
-            *printer.err << "tamber: warning: events under "
-                         << (path ? escapedText(path->value()) : "?") << " were lost ("
-                         << ((flags[i] & kTremorKernelDropped) ? "kernel" : "user")
+            *printer.err << "tamber: warning: events under " << escapedText(event.path)
+                         << " were lost ("
+                         << ((event.flags & kTremorKernelDropped) ? "kernel" : "user")
                          << " side); a rescan of that tree is needed\n";
             printer.err->flush();
         }
-        if (printer.noFollow && (flags[i] & kTremorHistoryDone))
+        if (printer.noFollow && (event.flags & kTremorHistoryDone))
             printer.done.signal();
     }
     printer.out->flush();
@@ -180,16 +170,16 @@ int EventsCommand::run(CliContext& context) {
     }
 
     Printer printer{&context.out(), &context.err(), json_, noFollow_, DispatchSemaphore(0)};
-    TremorStreamContext streamContext;
-    streamContext.info = &printer;
     uint32_t flags =
         kTremorCreateUseObjects | kTremorCreateFileEvents | kTremorCreateUseExtendedData;
+    auto print = [&printer](const std::vector<JournalEvent>& events) {
+        printEvents(printer, events);
+    };
     TremorStreamRef stream =
-        docid_ ? TremorStreamCreateRelativeToDevice(
-                     printEvents, &streamContext,
-                     TBFileObjectIdentifier::deviceID(context.storageURL()),
-                     {kTremorDocumentIdRoot}, *since, 0.1, flags)
-               : TremorStreamCreate(printEvents, &streamContext, paths, *since, 0.1, flags);
+        docid_ ? TremorStreamCreateWithEvents(
+                     print, TBFileObjectIdentifier::deviceID(context.storageURL()), {kTremorDocumentIdRoot},
+                     *since, 0.1, flags)
+               : TremorStreamCreateWithEvents(print, std::nullopt, paths, *since, 0.1, flags);
     if (!stream) {
         return context.fail(
             Error(kPosixErrorDomain, EIO, {{"description", "can't open the event journal stream"}}),

@@ -13,6 +13,7 @@
 #include "platform/TypeIdentifiers.h"
 #include "support/Log.h"
 #include "support/MutexLock.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -166,7 +167,7 @@ struct Cursor {
 class CursorCache {
 public:
     static CursorCache& shared() {
-        static auto* cache = new CursorCache;  // used from walks until the process ends
+        static ProcessWide<CursorCache> cache;  // used from walks until the process ends
         return *cache;
     }
 

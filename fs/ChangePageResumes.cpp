@@ -1,10 +1,12 @@
 #include "fs/ChangePageResumes.h"
 #include "support/MutexLock.h"
 
+#include "support/ProcessWide.h"
+
 namespace tamber {
 
 ChangePageResumes& ChangePageResumes::shared() {
-    static auto* resumes = new ChangePageResumes;  // used by readers until the process ends
+    static ProcessWide<ChangePageResumes> resumes;  // used by readers until the process ends
     return *resumes;
 }
 

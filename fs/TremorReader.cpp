@@ -38,35 +38,15 @@ constexpr double kLatencySeconds = 0.5;
 constexpr uint32_t kCreateFlags =
     kTremorCreateUseObjects | kTremorCreateFileEvents | kTremorCreateUseExtendedData;
 
-// Streams hold a number, not the reader: a batch that was already queued when its reader
-// stopped or was destroyed looks the number up, finds nothing and is dropped.
-std::mutex registryMutex;
-// Never destroyed: a stop still queued on a pool thread at exit may reach it after main.
-auto& registry = *new std::map<uint64_t, std::weak_ptr<TremorReader>>;  // guarded by registryMutex
-uint64_t lastRegistration = 0;                                          // guarded by registryMutex
-
-uint64_t registerReader(std::weak_ptr<TremorReader> reader) {
-    std::lock_guard lock(registryMutex);
-    registry.emplace(++lastRegistration, std::move(reader));
-    return lastRegistration;
-}
-
-void unregisterReader(uint64_t registration) {
-    std::lock_guard lock(registryMutex);
-    registry.erase(registration);
-}
-
-std::shared_ptr<TremorReader> registeredReader(uint64_t registration) {
-    std::lock_guard lock(registryMutex);
-    auto it = registry.find(registration);
-    return it == registry.end() ? nullptr : it->second.lock();
-}
-
-// The stream does not own its reader.
+// The stream's info is a weak reference to its reader, which the stream's retain hook copies
+// and its release hook deletes: the stream owns its copy for as long as it (or a batch it
+// queued) lives, and a batch that outlives its reader finds nothing.
 void* retainInfo(void* info) {
-    return info;
+    return new std::weak_ptr<TremorReader>(*static_cast<std::weak_ptr<TremorReader>*>(info));
 }
-void releaseInfo(void*) {}
+void releaseInfo(void* info) {
+    delete static_cast<std::weak_ptr<TremorReader>*>(info);
+}
 
 std::string joinedPaths(const std::vector<Url>& urls) {
     std::string text = "[";
@@ -102,7 +82,6 @@ TremorReader::~TremorReader() {
     if (!stream_)
         return;
     // The stream stays open (its owner broke the contract); its later batches find no reader.
-    unregisterReader(registration_);
     logError("stream deleted without being stopped; " + description());
 }
 
@@ -120,9 +99,9 @@ void TremorReader::start() {
         streamQueue_->async([self = shared_from_this()] { self->reportLostHistory(); });
         return;
     }
-    registration_ = registerReader(weak_from_this());
+    std::weak_ptr<TremorReader> self = weak_from_this();
     TremorStreamContext context;
-    context.info = reinterpret_cast<void*>(static_cast<uintptr_t>(registration_));
+    context.info = &self;  // the stream keeps its own copy
     context.retain = retainInfo;
     context.release = releaseInfo;
     uint64_t since = lastProcessedTremorID_.load();
@@ -141,10 +120,10 @@ void TremorReader::start() {
                                     kLatencySeconds, kCreateFlags);
     }
     if (!stream) {
-        unregisterReader(registration_);
         fatalError("can't create tremor stream for " + description());
     }
     stream_ = stream;
+    liveStream_.store(stream);
     TremorStreamSetDispatchQueue(stream, streamQueue_);
     if (!TremorStreamStart(stream)) {
         // A tree that can't be watched (gone, say) has no history to replay; a delegate that
@@ -162,11 +141,10 @@ void TremorReader::stop() {
         lostHistoryOwed_ = false;
         if (!stream_)
             return;
-        // From here on, batches the stream already queued find no reader.
-        unregisterReader(registration_);
-        registration_ = 0;
+        // From here on, batches the stream already queued are not the reader's stream's.
         stream = stream_;
         stream_ = nullptr;
+        liveStream_.store(nullptr);
     }
     TremorStreamStop(stream);
     TremorStreamInvalidate(stream);
@@ -237,29 +215,29 @@ std::pair<TremorReaderGatherPhaseResumeStatus, uint64_t> TremorReader::canResume
     return {checker->wait(), current};
 }
 
-void TremorReader::streamCallback(TremorStreamRef, void* info, size_t numEvents,
+void TremorReader::streamCallback(TremorStreamRef stream, void* info, size_t numEvents,
                                   const ObjectRef& paths, const uint32_t* flags,
                                   const uint64_t* ids) {
-    auto reader = registeredReader(static_cast<uint64_t>(reinterpret_cast<uintptr_t>(info)));
+    auto reader = static_cast<std::weak_ptr<TremorReader>*>(info)->lock();
     if (!reader)
+        return;
+    // A batch queued before the reader stopped (or restarted with a new stream) is dropped.
+    if (reader->liveStream_.load() != stream)
         return;
     reader->receiveBatch(numEvents, paths, flags, ids);
 }
 
 void TremorReader::receiveBatch(size_t numEvents, const ObjectRef& paths, const uint32_t* flags,
                                 const uint64_t* ids) {
+    // The stream was made with extended data: one {"path", "fileID"} dictionary per event. An
+    // entry that is not one has no path to report and is skipped like a pathless event.
     auto array = objectCast<Array>(paths);
-    if (!array || array->count() < numEvents)
-        fatalError("tremor paths are not an array of " + std::to_string(numEvents) + " entries");
-    for (const auto& entry : array->objects()) {
-        if (!objectCast<Dictionary>(entry))
-            fatalError("tremor paths are not an array of dictionaries");
-    }
+    const size_t available = array ? std::min(numEvents, array->count()) : 0;
     if (verbose_)
         logDebug([&] { return "tremor: received " + std::to_string(numEvents) + " events"; });
-    for (size_t i = 0; i < numEvents && !stopping_.load(); ++i) {
+    for (size_t i = 0; i < available && !stopping_.load(); ++i) {
         auto entry = objectCast<Dictionary>(array->objects()[i]);
-        auto path = objectCast<String>(entry->objectForKey("path"));
+        auto path = entry ? objectCast<String>(entry->objectForKey("path")) : nullptr;
         if (!path) {
             logError("ignore event " + std::to_string(ids[i]) +
                      " because no path can be extracted");

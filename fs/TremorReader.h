@@ -80,8 +80,9 @@ public:
     static std::optional<std::string> deviceUUID(const Url& url);
 
 private:
-    // The stream's callback. `info` names the reader through a registry, so that a batch still
-    // queued after the reader stopped or went away finds nothing instead of freed memory.
+    // The stream's callback. `info` is the stream's own weak reference to the reader (its
+    // retain and release hooks own it), so that a batch still queued after the reader stopped
+    // or went away finds nothing instead of freed memory.
     static void streamCallback(TremorStreamRef stream, void* info, size_t numEvents,
                                const ObjectRef& paths, const uint32_t* flags, const uint64_t* ids);
     void receiveBatch(size_t numEvents, const ObjectRef& paths, const uint32_t* flags,
@@ -109,8 +110,10 @@ private:
 
     std::atomic<uint64_t> lastProcessedTremorID_;
     mutable std::mutex mutex_;
-    TremorStreamRef stream_ = nullptr;              // guarded by mutex_
-    uint64_t registration_ = 0;                     // guarded by mutex_; 0 while no stream
+    TremorStreamRef stream_ = nullptr;  // guarded by mutex_
+    // stream_ as the stream's callback checks it, without the lock start() holds while the
+    // stream starts.
+    std::atomic<TremorStreamRef> liveStream_{nullptr};
     bool lostHistoryOwed_ = false;                  // guarded by mutex_; started without stream
     std::weak_ptr<TremorReaderDelegate> delegate_;  // guarded by mutex_
 };

@@ -3,14 +3,15 @@
 #include <atomic>
 
 #include "support/Log.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
 namespace {
 
 std::shared_ptr<HostPorterManager>& slot() {
-    static std::shared_ptr<HostPorterManager> manager;
-    return manager;
+    static ProcessWide<std::shared_ptr<HostPorterManager>> manager;
+    return *manager;
 }
 
 }  // namespace

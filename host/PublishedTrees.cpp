@@ -10,19 +10,20 @@
 #include "platform/FileSystem.h"
 #include "platform/ScopedFd.h"
 #include "support/Error.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
 namespace {
 
 std::mutex& sourceMutex() {
-    static std::mutex mutex;
-    return mutex;
+    static ProcessWide<std::mutex> mutex;
+    return *mutex;
 }
 
 PublishedTrees::RootsSource& rootsSource() {
-    static PublishedTrees::RootsSource source;
-    return source;
+    static ProcessWide<PublishedTrees::RootsSource> source;
+    return *source;
 }
 
 bool isAtOrBelow(const std::string& root, const std::string& path) {

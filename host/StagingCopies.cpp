@@ -17,19 +17,20 @@
 #include "platform/FileSystem.h"
 #include "platform/ScopedFd.h"
 #include "support/Log.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
 namespace {
 
 std::mutex& overrideMutex() {
-    static std::mutex mutex;
-    return mutex;
+    static ProcessWide<std::mutex> mutex;
+    return *mutex;
 }
 
 std::string& ledgerOverride() {
-    static std::string path;
-    return path;
+    static ProcessWide<std::string> path;
+    return *path;
 }
 
 // "<pid>-<random>": the ledger's name for a staging copy.

@@ -4,14 +4,15 @@
 #include <mutex>
 
 #include "host/PublishedTrees.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
 namespace {
 
 std::shared_ptr<AppLibraryLookup>& slot() {
-    static std::shared_ptr<AppLibraryLookup> lookup;
-    return lookup;
+    static ProcessWide<std::shared_ptr<AppLibraryLookup>> lookup;
+    return *lookup;
 }
 
 }  // namespace

@@ -19,6 +19,7 @@
 #include "platform/objects/String.h"
 #include "support/Error.h"
 #include "support/Log.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -163,8 +164,8 @@ StatusFields readStatus(const Url& url, const std::string& type) {
 }
 
 std::shared_ptr<LocalItem::PutBackResolver>& putBackResolverSlot() {
-    static std::shared_ptr<LocalItem::PutBackResolver> resolver;
-    return resolver;
+    static ProcessWide<std::shared_ptr<LocalItem::PutBackResolver>> resolver;
+    return *resolver;
 }
 
 }  // namespace

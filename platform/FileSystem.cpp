@@ -3,15 +3,16 @@
 #include <atomic>
 
 #include "platform/LinuxFileSystem.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
 namespace {
 
-// Never destroyed: services that outlive main (the journal closes its store from a static's
-// destructor at exit) still reach a file system, whatever the order of static destruction.
+// A runtime installs its file system here for its lifetime; threads that outlive main still
+// reach one, whatever the order of static destruction.
 std::shared_ptr<FileSystem>& slot() {
-    static auto* fs = new std::shared_ptr<FileSystem>(std::make_shared<LinuxFileSystem>());
+    static ProcessWide<std::shared_ptr<FileSystem>> fs(std::make_shared<LinuxFileSystem>());
     return *fs;
 }
 

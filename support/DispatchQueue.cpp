@@ -8,6 +8,7 @@
 
 #include "support/DispatchTimer.h"
 #include "support/Log.h"
+#include "support/ProcessWide.h"
 #include "support/WorkerPool.h"
 
 namespace tamber {
@@ -41,8 +42,8 @@ std::shared_ptr<DispatchQueue> DispatchQueue::makeSerial(std::string label) {
 }
 
 const std::shared_ptr<DispatchQueue>& DispatchQueue::global() {
-    // Never destroyed: blocks may still run while the process exits.
-    static auto* queue = new std::shared_ptr<DispatchQueue>(
+    // Blocks may still run while the process exits.
+    static ProcessWide<std::shared_ptr<DispatchQueue>> queue(
         std::make_shared<DispatchQueue>(Private{}, "tamber.global", globalWidth()));
     return *queue;
 }

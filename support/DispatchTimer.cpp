@@ -6,6 +6,7 @@
 #include <thread>
 
 #include "support/Log.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -25,7 +26,7 @@ struct Later {
 }  // namespace
 
 DispatchTimer& DispatchTimer::shared() {
-    static DispatchTimer* timer = new DispatchTimer();  // never destroyed: its thread outlives main
+    static ProcessWide<DispatchTimer> timer;
     return *timer;
 }
 
@@ -46,20 +47,42 @@ void DispatchTimer::schedule(Clock::time_point deadline, std::function<void()> f
         changed_.notify_one();
         return;
     }
+    // The previous thread, if any, has left run() (it cleared threadRunning_ on its way out).
+    if (thread_.joinable())
+        thread_.join();
     threadRunning_ = true;
-    lock.unlock();
     try {
-        std::thread([this] { run(); }).detach();
+        thread_ = std::thread([this] { run(); });
     } catch (const std::system_error& e) {
         fatalError(std::string("cannot start the timer thread: ") + e.what());
     }
 }
 
+void DispatchTimer::shutdown() {
+    std::unique_lock lock(mutex_);
+    stopping_ = true;
+    std::vector<Entry> dropped = std::move(heap_);
+    heap_.clear();
+    changed_.notify_all();
+    std::thread thread = std::move(thread_);
+    lock.unlock();
+    if (thread.joinable())
+        thread.join();
+    dropped.clear();  // captures go outside the lock
+    lock.lock();
+    stopping_ = false;
+}
+
 void DispatchTimer::run() {
     std::unique_lock lock(mutex_);
     for (;;) {
+        if (stopping_) {
+            threadRunning_ = false;
+            return;
+        }
         if (heap_.empty()) {
-            if (!changed_.wait_for(lock, kIdleLifetime, [&] { return !heap_.empty(); })) {
+            if (!changed_.wait_for(lock, kIdleLifetime,
+                                   [&] { return !heap_.empty() || stopping_; })) {
                 threadRunning_ = false;
                 return;
             }

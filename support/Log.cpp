@@ -4,6 +4,7 @@
 #include <cstring>
 
 #include "support/JournalLogSink.h"
+#include "support/ProcessWide.h"
 #include "support/StderrLogSink.h"
 
 namespace tamber {
@@ -29,7 +30,7 @@ Log::Log() {
 }
 
 Log& Log::shared() {
-    static Log* log = new Log();  // never destroyed: threads may log during exit
+    static ProcessWide<Log> log;  // threads may log while the process exits
     return *log;
 }
 

@@ -13,6 +13,9 @@
 
 namespace tamber {
 
+template <class T>
+class ProcessWide;
+
 // The program's one log handle (subsystem "com.velk.Porter", category "tamber"), created on
 // first use. Lines go to the journal when there is one, else to standard error; tests swap in
 // a capturing sink. Debug lines are written only while debug logging is enabled.
@@ -34,6 +37,7 @@ public:
     void write(LogLevel level, std::string_view line);
 
 private:
+    friend class ProcessWide<Log>;
     Log();
     std::atomic<bool> debugEnabled_{false};
     std::shared_ptr<LogSink> sink_;  // guarded by std::atomic_load/store

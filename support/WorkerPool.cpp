@@ -4,9 +4,9 @@
 #include <chrono>
 #include <exception>
 #include <system_error>
-#include <thread>
 
 #include "support/Log.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -17,27 +17,46 @@ constexpr auto kIdleLifetime = std::chrono::seconds(5);
 }  // namespace
 
 WorkerPool& WorkerPool::shared() {
-    static WorkerPool* pool = new WorkerPool();  // never destroyed: workers outlive main
+    // Blocks may still be submitted while the process exits.
+    static ProcessWide<WorkerPool> pool;
     return *pool;
 }
 
 void WorkerPool::submit(std::function<void()> task) {
     std::unique_lock lock(mutex_);
-    if (!idle_.empty()) {
-        Worker* worker = idle_.back();
-        idle_.pop_back();
-        worker->task = std::move(task);
-        // Still under the lock: the worker cannot time out and leave before it is woken.
-        worker->wake.notify_one();
+    reapExited(lock);
+    tasks_.push_back(std::move(task));
+    if (tasks_.size() <= idle_ || threads_ >= kMaxThreads) {
+        wake_.notify_one();
         return;
     }
-    ++threads_;
-    lock.unlock();
     try {
-        std::thread([this, t = std::move(task)]() mutable { run(std::move(t)); }).detach();
+        workers_.emplace_back([this] { run(); });
+        ++threads_;
     } catch (const std::system_error& e) {
-        fatalError(std::string("cannot start a worker thread: ") + e.what());
+        // Another worker will take the task when it comes free; with none there is no one.
+        if (threads_ == 0)
+            fatalError(std::string("cannot start a worker thread: ") + e.what());
+        logError(std::string("cannot start a worker thread: ") + e.what());
     }
+}
+
+void WorkerPool::shutdown() {
+    std::unique_lock lock(mutex_);
+    // Tasks may submit more tasks: wait until nothing is queued and nobody is busy.
+    quiet_.wait(lock, [&] { return tasks_.empty() && idle_ == threads_; });
+    leave_ = true;
+    wake_.notify_all();
+    while (!workers_.empty()) {
+        std::thread worker = std::move(workers_.front());
+        workers_.pop_front();
+        lock.unlock();
+        if (worker.joinable())
+            worker.join();
+        lock.lock();
+    }
+    exited_.clear();
+    leave_ = false;
 }
 
 size_t WorkerPool::threadCount() const {
@@ -45,9 +64,46 @@ size_t WorkerPool::threadCount() const {
     return threads_;
 }
 
-void WorkerPool::run(std::function<void()> task) {
-    Worker self;
+void WorkerPool::reapExited(std::unique_lock<std::mutex>& lock) {
+    if (exited_.empty())
+        return;
+    std::vector<std::thread> done;
+    for (auto id : exited_) {
+        auto it = std::find_if(workers_.begin(), workers_.end(),
+                               [&](const std::thread& t) { return t.get_id() == id; });
+        if (it != workers_.end()) {
+            done.push_back(std::move(*it));
+            workers_.erase(it);
+        }
+    }
+    exited_.clear();
+    lock.unlock();
+    for (auto& thread : done) thread.join();  // they have returned from run() already
+    lock.lock();
+}
+
+void WorkerPool::run() {
+    std::unique_lock lock(mutex_);
     for (;;) {
+        ++idle_;
+        if (idle_ == threads_ && tasks_.empty())
+            quiet_.notify_all();
+        bool woken = wake_.wait_for(lock, kIdleLifetime, [&] { return !tasks_.empty() || leave_; });
+        --idle_;
+        if (tasks_.empty()) {
+            if (woken && !leave_)
+                continue;
+            // Idle too long, or shutting down: leave, to be joined by someone else.
+            --threads_;
+            if (!leave_)
+                exited_.push_back(std::this_thread::get_id());
+            if (idle_ == threads_)
+                quiet_.notify_all();
+            return;
+        }
+        std::function<void()> task = std::move(tasks_.front());
+        tasks_.pop_front();
+        lock.unlock();
         try {
             task();
         } catch (const std::exception& e) {
@@ -56,16 +112,7 @@ void WorkerPool::run(std::function<void()> task) {
             logError("worker task failed with an unknown exception");
         }
         task = nullptr;  // release what the task captured before going idle
-
-        std::unique_lock lock(mutex_);
-        idle_.push_back(&self);
-        if (!self.wake.wait_for(lock, kIdleLifetime, [&] { return bool(self.task); })) {
-            idle_.erase(std::find(idle_.begin(), idle_.end(), &self));
-            --threads_;
-            return;
-        }
-        task = std::move(self.task);
-        self.task = nullptr;
+        lock.lock();
     }
 }
 

@@ -2,6 +2,7 @@
 
 #include "platform/apps/DesktopEntryRegistry.h"
 #include "support/MutexLock.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -13,8 +14,8 @@ struct DefaultRegistry {
 };
 
 DefaultRegistry& defaultState() {
-    static DefaultRegistry state;
-    return state;
+    static ProcessWide<DefaultRegistry> state;
+    return *state;
 }
 
 }  // namespace

@@ -1,4 +1,5 @@
 #include "platform/strata/StrataService.h"
+#include "support/ProcessWide.h"
 
 #include <atomic>
 #include <cerrno>
@@ -9,8 +10,8 @@ namespace tamber {
 namespace {
 
 std::shared_ptr<StrataService>& slot() {
-    static std::shared_ptr<StrataService> service;
-    return service;
+    static ProcessWide<std::shared_ptr<StrataService>> service;
+    return *service;
 }
 
 }  // namespace

@@ -75,7 +75,7 @@ std::shared_ptr<TremorService> TremorService::sharedIfRunning() {
     return global().service;
 }
 
-void TremorService::resetForTesting() {
+void TremorService::stopShared() {
     Shared& g = global();
     std::shared_ptr<TremorService> service;
     {
@@ -89,6 +89,32 @@ void TremorService::resetForTesting() {
     }
     if (service)
         service->shutdown();
+}
+
+Status TremorService::installShared(std::shared_ptr<TremorService> service) {
+    Shared& g = global();
+    std::lock_guard lock(g.mutex);
+    if (g.service)
+        return Error(kPosixErrorDomain, EBUSY,
+                     {{"description", "another event journal is running in this process"}});
+    g.service = std::move(service);
+    g.strata = std::make_shared<TremorStrataService>(g.service);
+    StrataService::setCurrent(g.strata);
+    TremorStrataService::installDocumentIdLookup();
+    return std::nullopt;
+}
+
+void TremorService::uninstallShared(const std::shared_ptr<TremorService>& service) {
+    Shared& g = global();
+    std::lock_guard lock(g.mutex);
+    if (!service || g.service != service)
+        return;
+    g.service.reset();
+    if (g.strata && StrataService::current() == g.strata) {
+        StrataService::setCurrent(nullptr);
+        setDocumentIdLookup(nullptr);
+    }
+    g.strata.reset();
 }
 
 Result<std::shared_ptr<TremorService>> TremorService::create(

@@ -56,7 +56,13 @@ public:
     // The process's service when it is running; never starts one.
     static std::shared_ptr<TremorService> sharedIfRunning();
     // Shuts the process's service down; the next shared() starts a fresh one.
-    static void resetForTesting();
+    static void stopShared();
+    static void resetForTesting() { stopShared(); }
+    // Makes `service` the process's service, and its document IDs the current ones, while its
+    // owner (a runtime) lives. Fails with EBUSY when another one is running.
+    static Status installShared(std::shared_ptr<TremorService> service);
+    // Undoes installShared when `service` is still the process's service; does not stop it.
+    static void uninstallShared(const std::shared_ptr<TremorService>& service);
 
     // A service on `stateDir`: opens every store found there (waiting for other processes as
     // `lockWait` says) and forgets the remembered trees whose folder is gone (an info line

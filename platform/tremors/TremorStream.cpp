@@ -19,7 +19,7 @@ namespace tamber {
 
 std::shared_ptr<TremorStream> TremorStream::create(std::shared_ptr<TremorService> service,
                                                    Options options) {
-    if (!service || !options.callback || options.paths.empty())
+    if (!service || (!options.callback && !options.events) || options.paths.empty())
         return nullptr;
     for (auto& path : options.paths) path = WatchedRoots::normalised(path);
     if (options.context.retain && options.context.info)
@@ -210,6 +210,10 @@ bool TremorStream::deliver(const std::vector<JournalEvent>& events, uint64_t run
             if (event.flags & kTremorHistoryDone)
                 historyOwed_ = false;
         }
+    }
+    if (options_.events) {
+        options_.events(events);
+        return true;
     }
     bool extended = (options_.flags & kTremorCreateUseExtendedData) != 0;
     std::vector<ObjectRef> paths;

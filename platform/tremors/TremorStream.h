@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -40,8 +41,12 @@ public:
     static constexpr uint64_t kSinceNow = UINT64_MAX;
     static constexpr size_t kReplayBatch = 1000;
 
+    // The typed form of the callback, for the program's own consumers of the journal.
+    using EventsCallback = std::function<void(const std::vector<JournalEvent>& events)>;
+
     struct Options {
         TremorStreamCallback callback = nullptr;
+        EventsCallback events;  // used instead of `callback` when set
         TremorStreamContext context;
         std::vector<std::string> paths;  // absolute, or relative to `device`
         std::optional<uint32_t> device;  // set for streams relative to a device

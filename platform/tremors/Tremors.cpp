@@ -52,6 +52,20 @@ TremorStreamRef TremorStreamCreate(TremorStreamCallback callback,
         streamOptions(callback, context, pathsToWatch, sinceWhen, latencySeconds, flags));
 }
 
+TremorStreamRef TremorStreamCreateWithEvents(TremorStream::EventsCallback callback,
+                                             std::optional<uint32_t> device,
+                                             const std::vector<std::string>& paths,
+                                             uint64_t sinceWhen, double latencySeconds,
+                                             uint32_t flags) {
+    if (!callback)
+        return nullptr;
+    TremorStream::Options options =
+        streamOptions(nullptr, nullptr, paths, sinceWhen, latencySeconds, flags);
+    options.events = std::move(callback);
+    options.device = device;
+    return createStream(std::move(options));
+}
+
 TremorStreamRef TremorStreamCreateRelativeToDevice(
     TremorStreamCallback callback, const TremorStreamContext* context, uint32_t device,
     const std::vector<std::string>& pathsRelativeToDevice, uint64_t sinceWhen,

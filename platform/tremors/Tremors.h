@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -26,6 +27,14 @@ TremorStreamRef TremorStreamCreateRelativeToDevice(
     TremorStreamCallback callback, const TremorStreamContext* context, uint32_t device,
     const std::vector<std::string>& pathsRelativeToDevice, uint64_t sinceWhen,
     double latencySeconds, uint32_t flags);
+// The same stream for the program's own consumers of the journal (`tamber events`, a server):
+// the callback gets the events as records (ID, path, inode, flags) instead of an array of
+// dictionaries to decode. With `device`, `paths` are relative to that volume.
+TremorStreamRef TremorStreamCreateWithEvents(TremorStream::EventsCallback callback,
+                                             std::optional<uint32_t> device,
+                                             const std::vector<std::string>& paths,
+                                             uint64_t sinceWhen, double latencySeconds,
+                                             uint32_t flags);
 void TremorStreamSetDispatchQueue(TremorStreamRef stream, std::shared_ptr<DispatchQueue> queue);
 // False when the stream is running, invalidated, has no queue or its trees cannot be watched.
 // A stopped stream may be started again: it goes on after the last event it delivered.

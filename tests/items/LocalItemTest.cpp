@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <deque>
 #include <filesystem>
+#include <optional>
 #include <tuple>
 
 #include "host/RecordingHostPorterManager.h"
@@ -20,6 +21,7 @@
 #include "tests/common/FakeStrataService.h"
 #include "tests/common/ScopedFileSystem.h"
 #include "tests/common/ScopedLogCapture.h"
+#include "tests/common/ScopedSlots.h"
 #include "tests/common/TempDir.h"
 
 namespace tamber {
@@ -61,16 +63,10 @@ protected:
         storage = dir.makeDir("Documents");
         library = dir.makeDir("Apps/app/Documents");
         libraries->libraries.emplace_back(Url::fileURLWithPath(library), "com.example.app");
-        previousManager = HostPorterManager::installDefaultManager(
-            std::make_shared<RecordingHostPorterManager>(Url::fileURLWithPath(storage)));
-        previousStrata = StrataService::setCurrent(strata);
-        previousLibraries = AppLibraryLookup::setCurrent(libraries);
+        slots.emplace(std::make_shared<RecordingHostPorterManager>(Url::fileURLWithPath(storage)),
+                      strata, libraries);
     }
-    void TearDown() override {
-        HostPorterManager::installDefaultManager(previousManager);
-        StrataService::setCurrent(previousStrata);
-        AppLibraryLookup::setCurrent(previousLibraries);
-    }
+    void TearDown() override { slots.reset(); }
     static std::string fid(const std::string& path) {
         struct stat st {};
         EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
@@ -108,9 +104,7 @@ protected:
     std::shared_ptr<FaultInjectingFileSystem> fs =
         std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
     testing::ScopedFileSystem scopedFileSystem{fs};
-    std::shared_ptr<HostPorterManager> previousManager;
-    std::shared_ptr<StrataService> previousStrata;
-    std::shared_ptr<AppLibraryLookup> previousLibraries;
+    std::optional<testing::ScopedSlots> slots;
 };
 
 TEST_F(ItemTest, RecordsAndIdentifierForms) {

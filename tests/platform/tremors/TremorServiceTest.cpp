@@ -496,5 +496,76 @@ TEST_F(TremorServiceStreamTest, AReplayFromBeyondTheLastEventIsALossAndReplaysNo
     queue_->sync([] {});
 }
 
+// The typed stream of the program's own consumers reports what the journal holds, record for
+// record (IDs in order, paths, inodes, flags), without a dictionary to decode.
+TEST_F(TremorServiceStreamTest, ATypedStreamDeliversTheJournalsRecordsAsTheyAre) {
+    ASSERT_FALSE(service()->watchTree(tree_));
+    for (int i = 0; i < 5; ++i) writeText(tree_ + "/f" + std::to_string(i), "x");
+    service()->sync();
+    Delivered typed;
+    TremorStreamRef stream = TremorStreamCreateWithEvents(
+        [&typed](const std::vector<JournalEvent>& events) {
+            std::lock_guard lock(typed.mutex);
+            typed.events.insert(typed.events.end(), events.begin(), events.end());
+        },
+        std::nullopt, {tree_}, 0, 0.01, kTremorCreateFileEvents);
+    ASSERT_NE(stream, nullptr);
+    streams_.push_back(stream);
+    TremorStreamSetDispatchQueue(stream, queue_);
+    ASSERT_TRUE(TremorStreamStart(stream));
+    ASSERT_TRUE(eventually([&] { return typed.has(kTremorHistoryDone); }));
+    TremorStreamStop(stream);
+    queue_->sync([] {});
+
+    std::vector<JournalEvent> got;
+    for (const auto& event : typed.snapshot())
+        if (!(event.flags & kTremorHistoryDone))
+            got.push_back(event);
+    auto expected = journaled(*service(), device_, 0, {tree_});
+    EXPECT_EQ(got, expected) << "typed:" << describe(got) << "\njournal:" << describe(expected);
+    const JournalEvent* file = findEvent(got, tree_ + "/f3", kTremorItemCreated);
+    ASSERT_NE(file, nullptr);
+    EXPECT_EQ(file->fileID, statPath(tree_ + "/f3").stx_ino);
+}
+
+// The stream owns its info through the hooks: one retain when it is made, one release when the
+// stream and every batch it queued are gone, never a release while a batch may still use it.
+struct CountedInfo {
+    std::atomic<int> retains{0};
+    std::atomic<int> releases{0};
+};
+void* retainCounted(void* info) {
+    ++static_cast<CountedInfo*>(info)->retains;
+    return info;
+}
+void releaseCounted(void* info) {
+    ++static_cast<CountedInfo*>(info)->releases;
+}
+void collectCounted(TremorStreamRef, void* info, size_t, const ObjectRef&, const uint32_t*,
+                    const uint64_t*) {
+    auto* counted = static_cast<CountedInfo*>(info);
+    EXPECT_EQ(counted->releases.load(), 0) << "a batch reached released info";
+}
+
+TEST_F(TremorServiceStreamTest, TheHooksRetainOnceAndReleaseOnceAfterTheLastBatch) {
+    ASSERT_FALSE(service()->watchTree(tree_));
+    for (int i = 0; i < 50; ++i) writeText(tree_ + "/f" + std::to_string(i), "x");
+    CountedInfo counted;
+    TremorStreamContext context{&counted, retainCounted, releaseCounted};
+    TremorStreamRef stream = TremorStreamCreate(&collectCounted, &context, {tree_}, 0, 0.01,
+                                                kTremorCreateUseObjects | kTremorCreateFileEvents);
+    ASSERT_NE(stream, nullptr);
+    EXPECT_EQ(counted.retains.load(), 1);
+    TremorStreamSetDispatchQueue(stream, queue_);
+    ASSERT_TRUE(TremorStreamStart(stream));
+    // Let go while the replay may still have batches queued.
+    TremorStreamStop(stream);
+    TremorStreamInvalidate(stream);
+    TremorStreamRelease(stream);
+    queue_->sync([] {});
+    ASSERT_TRUE(eventually([&] { return counted.releases.load() == 1; }));
+    EXPECT_EQ(counted.retains.load(), 1);
+}
+
 }  // namespace
 }  // namespace tamber

@@ -1,0 +1,184 @@
+#include "runtime/ProviderRuntime.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <utility>
+
+#include "applibraries/SharedAppLibraryLookup.h"
+#include "applibraries/TBPAppLibraryManager.h"
+#include "host/HostPorterManager.h"
+#include "host/StagingCopies.h"
+#include "items/AppLibraryLookup.h"
+#include "platform/FileContents.h"
+#include "platform/FileSystem.h"
+#include "support/DispatchTimer.h"
+#include "support/Log.h"
+#include "support/WorkerPool.h"
+
+namespace tamber {
+
+namespace {
+
+std::string defaultStoragePath() {
+    const char* home = std::getenv("HOME");
+    return std::string(home && *home ? home : "/") + "/Documents";
+}
+
+Error stoppedError() {
+    return Error(kPosixErrorDomain, ECANCELED, {{"description", "the runtime has shut down"}});
+}
+
+}  // namespace
+
+ProviderRuntime::ProviderRuntime(ProviderRuntimeOptions options) : options_(std::move(options)) {
+    signals_->handler = options_.onSignal;
+    if (options_.fileSystem)
+        previousFileSystem_ = FileSystem::setCurrent(options_.fileSystem);
+    if (options_.logSink)
+        previousSink_ = Log::shared().setSink(options_.logSink);
+}
+
+ProviderRuntime::~ProviderRuntime() {
+    shutdown();
+}
+
+Status ProviderRuntime::prepareStorage() {
+    std::lock_guard lock(mutex_);
+    if (stopped_)
+        return stoppedError();
+    if (storagePrepared_)
+        return std::nullopt;
+    std::string path = options_.storagePath.empty() ? defaultStoragePath() : options_.storagePath;
+    storage_ = Url::fileURLWithPath(path);
+    if (auto failure = FileContents::createDirectory(storage_)) {
+        const Error& error = *failure;
+        logError("can't create document storage folder " + storage_.path() + "; " +
+                 error.description());
+        return Error(error.domain(), error.code(),
+                     {{"description", "can't use document storage folder " + storage_.path() +
+                                          ": " + std::strerror(static_cast<int>(error.code()))}});
+    }
+    std::weak_ptr<SignalSlot> weakSlot = signals_;
+    previousManager_ =
+        HostPorterManager::installDefaultManager(std::make_shared<StorageHostPorterManager>(
+            storage_, [weakSlot](const HostPorterItemIdentifier& container) {
+                auto slot = weakSlot.lock();
+                if (!slot)
+                    return;
+                std::lock_guard lock(slot->mutex);
+                if (slot->handler)
+                    slot->handler(container);
+            }));
+    installedManager_ = true;
+    storagePrepared_ = true;
+    return std::nullopt;
+}
+
+Result<std::shared_ptr<TremorService>> ProviderRuntime::startJournal() {
+    std::lock_guard lock(mutex_);
+    if (stopped_)
+        return stoppedError();
+    if (journal_)
+        return journal_;
+    TremorStoreDirectory::LockWait lockWait{options_.lockWaitSeconds, options_.onLockWait};
+    if (options_.journal == ProviderRuntimeOptions::Journal::ProcessWide) {
+        TremorService::setLockWait(std::move(lockWait));
+        auto service = TremorService::shared();
+        if (!service.ok())
+            return service.error();
+        journal_ = service.value();
+        return journal_;
+    }
+    auto service = TremorService::create(
+        options_.stateDir.empty() ? TremorService::defaultStateDir() : options_.stateDir,
+        options_.inotify ? options_.inotify : InotifyApi::system(),
+        TremorService::kDefaultQueueLimit, std::move(lockWait));
+    if (!service.ok())
+        return service.error();
+    if (auto error = TremorService::installShared(service.value())) {
+        service.value()->shutdown();
+        return *error;
+    }
+    journal_ = service.value();
+    ownsJournal_ = true;
+    return journal_;
+}
+
+Status ProviderRuntime::prepareJournal() {
+    std::lock_guard lock(mutex_);
+    if (auto error = prepareStorage())
+        return error;
+    auto service = startJournal();
+    if (!service.ok())
+        return service.error();
+    return service.value()->watchTree(storage_.path());
+}
+
+Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
+    std::lock_guard lock(mutex_);
+    if (stopped_)
+        return stoppedError();
+    if (porter_)
+        return porter_;
+    if (auto error = prepareJournal())
+        return *error;
+    previousLookup_ = SharedAppLibraryLookup::install();
+    installedLookup_ = true;
+    auto porter = LocalPorter::create();
+    refreshOutcome_ = porter->refreshAppLibraries();
+    // Identifiers inside app libraries need their trees journaled like the storage folder.
+    for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries()) {
+        if (auto error = journal_->watchTree(root.path()))
+            logError("can't watch app library " + root.path() + "; " + error->description());
+    }
+    StagingCopies::sweepStale();  // copies left by imports that were killed part-way
+    porter_ = porter;
+    publishing_ = true;
+    return porter_;
+}
+
+void ProviderRuntime::setSignalHandler(
+    std::function<void(const HostPorterItemIdentifier&)> handler) {
+    std::lock_guard lock(signals_->mutex);
+    signals_->handler = std::move(handler);
+}
+
+void ProviderRuntime::drainThreads() {
+    DispatchTimer::shared().shutdown();
+    WorkerPool::shared().shutdown();
+}
+
+void ProviderRuntime::shutdown() {
+    std::lock_guard lock(mutex_);
+    if (std::exchange(stopped_, true))
+        return;
+    setSignalHandler({});
+    porter_.reset();
+    if (publishing_ && journal_)
+        journal_->retireUnwatched();
+    if (ownsJournal_) {
+        drainThreads();
+        journal_->shutdown();
+        drainThreads();
+        TremorService::uninstallShared(journal_);
+    }
+    // Blocks of a process-wide journal's run may still ask for the manager and the lookup
+    // until the process stops: they stay installed then.
+    if (ownsJournal_ && installedLookup_)
+        AppLibraryLookup::setCurrent(std::move(previousLookup_));
+    if (ownsJournal_ && installedManager_)
+        HostPorterManager::installDefaultManager(std::move(previousManager_));
+    if (options_.logSink)
+        Log::shared().setSink(std::move(previousSink_));
+    if (options_.fileSystem)
+        FileSystem::setCurrent(std::move(previousFileSystem_));
+    journal_.reset();
+}
+
+void ProviderRuntime::shutdownProcess() {
+    TremorService::stopShared();
+    drainThreads();
+}
+
+}  // namespace tamber
