@@ -44,8 +44,8 @@ std::string defaultStoragePath() {
 Status CliContext::prepareStorage() {
     std::string path = storagePath.empty() ? defaultStoragePath() : storagePath;
     storage_ = Url::fileURLWithPath(path);
-    if (auto failure = FileContents::createDirectory(storage_)) {
-        const Error& error = *failure;
+    if (auto failure = FileContents::createDirectory(storage_); !failure.ok()) {
+        const Error& error = failure.error();
         logError("can't create document storage folder " + storage_.path() + "; " +
                  error.description());
         return Error(error.domain(), error.code(),
@@ -62,7 +62,7 @@ Status CliContext::prepareStorage() {
             if (slot->handler)
                 slot->handler(container);
         }));
-    return std::nullopt;
+    return Status::OK();
 }
 
 Result<std::shared_ptr<TremorService>> CliContext::startJournal() {
@@ -95,16 +95,17 @@ Status CliContext::prepareJournal() {
 Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
     if (porter_)
         return porter_;
-    if (auto error = prepareJournal())
-        return *error;
+    if (auto status = prepareJournal(); !status.ok())
+        return status.error();
     SharedAppLibraryLookup::install();
     auto porter = LocalPorter::create();
     refreshOutcome_ = porter->refreshAppLibraries();
     // Identifiers inside app libraries need their trees journaled like the storage folder.
     auto service = TremorService::shared();
     for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries()) {
-        if (auto error = service.value()->watchTree(root.path()))
-            logError("can't watch app library " + root.path() + "; " + error->description());
+        if (auto status = service.value()->watchTree(root.path()); !status.ok())
+            logError("can't watch app library " + root.path() + "; " +
+                     status.error().description());
     }
     StagingCopies::sweepStale();  // copies left by imports that were killed part-way
     porter_ = porter;

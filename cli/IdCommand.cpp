@@ -19,8 +19,8 @@ int IdCommand::run(CliContext& context) {
     if (auto porter = context.prepareProvider(); !porter.ok())
         return context.fail(porter.error(), json_);
     Url url = Url::fileURLWithPath(path_);
-    if (auto outside = PublishedTrees::check(url))
-        return context.fail(*outside, json_);
+    if (auto outside = PublishedTrees::check(url); !outside.ok())
+        return context.fail(outside.error(), json_);
     auto identifier = TBFileObjectIdentifier::itemIdentifier(url);
     if (!identifier) {
         return context.fail(Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,

@@ -47,8 +47,8 @@ Result<HostPorterItemIdentifier> ItemAction::identifierFor(LocalPorter& porter,
     ItemArgument argument = ItemArgument::parse(text);
     if (argument.kind == ItemArgument::Kind::Identifier)
         return argument.identifier;
-    if (auto outside = PublishedTrees::check(argument.url))
-        return *outside;
+    if (auto outside = PublishedTrees::check(argument.url); !outside.ok())
+        return outside.error();
     auto identifier = porter._persistentIdentifierForItemAt(argument.url);
     if (!identifier)
         return Error::porterErrorForNonExistentItemWithIdentifier(argument.url.path());
@@ -70,7 +70,9 @@ Result<LocalPorter::LocalItemRef> ItemAction::waitForItem(const ItemStarter& sta
 
 Status ItemAction::waitForStatus(const ErrorStarter& start) {
     auto outcome = std::make_shared<Outcome<Status>>();
-    start([outcome](std::optional<Error> error) { outcome->deliver(std::move(error)); });
+    start([outcome](std::optional<Error> error) {
+        outcome->deliver(error ? Status(*error) : Status::OK());
+    });
     return outcome->wait();
 }
 

@@ -95,8 +95,8 @@ Status MetaCommand::applyChanges(const Url& url) {
                                               s + "\"");
             rank = Number::fromInt64(value);
         }
-        if (auto error = ItemMetadata::writeFavoriteRank(url, rank))
-            return error;
+        if (auto status = ItemMetadata::writeFavoriteRank(url, rank); !status.ok())
+            return status;
     }
     if (setLastUsed_) {
         std::shared_ptr<const Date> date;
@@ -110,15 +110,15 @@ Status MetaCommand::applyChanges(const Url& url) {
                     *setLastUsed_ + "\"");
             date = Date::make(*seconds);
         }
-        if (auto error = ItemMetadata::writeLastUsedDate(url, date))
-            return error;
+        if (auto status = ItemMetadata::writeLastUsedDate(url, date); !status.ok())
+            return status;
     }
     if (setTags_) {
         Bytes tagData = ItemMetadata::tagDataForLabels(TagLabels::cleaned(splitLabels(*setTags_)));
-        if (auto error = ItemMetadata::writeTagData(url, tagData))
-            return error;
+        if (auto status = ItemMetadata::writeTagData(url, tagData); !status.ok())
+            return status;
     }
-    return std::nullopt;
+    return Status::OK();
 }
 
 int MetaCommand::run(CliContext& context) {
@@ -130,8 +130,8 @@ int MetaCommand::run(CliContext& context) {
     auto mainCache = LocalAppLibraryCache::mainCache();
     mainCache->queue().sync([&] { mainCache->load(); });
     LocalAppLibraryManager::shared()->upgradeFromMainCache(nullptr, false);
-    if (auto outside = PublishedTrees::check(url))
-        return context.fail(*outside, json_);
+    if (auto outside = PublishedTrees::check(url); !outside.ok())
+        return context.fail(outside.error(), json_);
     auto exists = url.resourceValue(ResourceKeys::kFileID);
     if (!exists.ok()) {
         const Error& e = exists.error();
@@ -142,8 +142,8 @@ int MetaCommand::run(CliContext& context) {
     // A document saved while nothing watched gets its metadata back when the journal starts;
     // without one (held by another process, say) the attributes are still read and written.
     context.prepareJournal();
-    if (auto error = applyChanges(url))
-        return context.fail(*error, json_);
+    if (auto status = applyChanges(url); !status.ok())
+        return context.fail(status.error(), json_);
 
     ItemMetadata metadata = ItemMetadata::read(url);
     nlohmann::json j = toJson(metadata);

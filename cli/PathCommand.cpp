@@ -26,8 +26,8 @@ int PathCommand::run(CliContext& context) {
     ItemArgument argument = ItemArgument::parse(identifier_);
     std::optional<Url> url;
     if (argument.kind == ItemArgument::Kind::Path) {
-        if (auto outside = PublishedTrees::check(argument.url))
-            return context.fail(*outside, json_);
+        if (auto outside = PublishedTrees::check(argument.url); !outside.ok())
+            return context.fail(outside.error(), json_);
         // Only an item answers: something that exists and has an identifier.
         if (porter.value()->persistentIdentifierForItemAtURL(argument.url))
             url = argument.url;

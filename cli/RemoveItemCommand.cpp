@@ -24,8 +24,8 @@ int RemoveItemCommand::run(CliContext& context) {
         return context.fail(item.error(), json_);
     Status status = ItemAction::waitForStatus(
         [&](auto done) { provider.deleteItemWithIdentifier(item.value(), std::move(done)); });
-    if (status)
-        return context.fail(*status, json_);
+    if (!status.ok())
+        return context.fail(status.error(), json_);
     if (json_)
         context.out() << jsonText(nlohmann::json{{"deleted", item.value()}}) << "\n";
     else

@@ -39,16 +39,17 @@ int ThumbnailCommand::run(CliContext& context) {
                     std::optional<Error>) { png = std::move(data); }),
             std::move(done));
     });
-    if (status)
-        return context.fail(*status, json_);
+    if (!status.ok())
+        return context.fail(status.error(), json_);
     if (!png)
         return context.fail(
             Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
                   {{"description", identifier.value() + " has no thumbnail (only app libraries "
                                                         "whose app has an icon have one)"}}),
             json_);
-    if (auto error = FileContents::writeAtomically(Url::fileURLWithPath(output_), *png))
-        return context.fail(*error, json_);
+    if (auto status = FileContents::writeAtomically(Url::fileURLWithPath(output_), *png);
+        !status.ok())
+        return context.fail(status.error(), json_);
     if (!json_)
         context.err() << "wrote " << png->size() << " bytes to " << output_ << "\n";
     return ItemAction::printItem(context, *item.value(), json_);

@@ -129,16 +129,16 @@ Status PublishedTrees::check(const Url& url) {
     if (!root)
         return outsideError(url);
     if (root->path() == url.path())
-        return std::nullopt;
+        return Status::OK();
     auto parent = openParent(url, O_PATH);
     if (!parent.ok()) {
         // A missing folder on the way leaves nothing to escape through; only refusals count.
         if (isOutsideError(parent.error()))
             return parent.error();
-        return std::nullopt;
+        return Status::OK();
     }
     FileSystem::current().close(parent.value().fd);
-    return std::nullopt;
+    return Status::OK();
 }
 
 }  // namespace tamber

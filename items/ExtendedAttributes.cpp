@@ -53,7 +53,7 @@ Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::str
     if (!data) {
         if (fs.fremovexattr(fd, name) == 0 || errno == ENODATA) {
             noteWritten(fd, data, name);
-            return std::nullopt;
+            return Status::OK();
         }
         Error error = Error::errorWithPOSIXCode(errno);
         logAt(levelUnless(EACCES, error),
@@ -62,7 +62,7 @@ Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::str
     }
     if (fs.fsetxattr(fd, name, data->data(), data->size(), 0) == 0) {
         noteWritten(fd, data, name);
-        return std::nullopt;
+        return Status::OK();
     }
     Error error = Error::errorWithPOSIXCode(errno);
     logAt(levelUnless(EACCES, error), "can't set xattr \"" + name + "\"; " + error.description());
@@ -70,10 +70,10 @@ Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::str
 }
 
 Status WriteXattrAtURL(const Url& url, const std::optional<Bytes>& data, const std::string& name) {
-    bool ok = pt_withReadWriteAccess(
-        url, [&](int fd) { return !SetOrRemoveXattr(fd, data, name).has_value(); });
+    bool ok =
+        pt_withReadWriteAccess(url, [&](int fd) { return SetOrRemoveXattr(fd, data, name).ok(); });
     if (ok)
-        return std::nullopt;
+        return Status::OK();
     Error error = Error::errorWithPOSIXCode(errno);
     logError("can't set xattr " + name + " on " + url.absoluteString() + "; " +
              error.description());

@@ -33,13 +33,13 @@ Status writeAttribute(const Url& url, const ObjectRef& value, const std::string&
     Status written;
     if (!pt_withReadWriteAccess(url, [&](int fd) {
             written = SetOrRemoveXattr(fd, data, name);
-            return !written;
+            return written.ok();
         })) {
-        Error error = written.value_or(Error::errorWithPOSIXCode(errno));
+        Error error = written.ok() ? Error::errorWithPOSIXCode(errno) : written.error();
         logError("can't set xattr " + name + "; " + error.description());
         return error;
     }
-    return std::nullopt;
+    return Status::OK();
 }
 
 // The error a metadata update answers with when its write failed: says what could not be
@@ -92,8 +92,9 @@ void LocalPorter::setLastUsedDate(std::shared_ptr<const Date> date,
         if (!url.ok())
             return completion(nullptr, url.error());
         // Logged by the writer.
-        if (auto error = ItemMetadata::writeLastUsedDate(url.value(), date))
-            return completion(nullptr, updateFailed(*error, "set the last-used date", identifier));
+        if (auto status = ItemMetadata::writeLastUsedDate(url.value(), date); !status.ok())
+            return completion(nullptr,
+                              updateFailed(status.error(), "set the last-used date", identifier));
         completeWithItem(*this, url.value(), completion);
     });
 }
@@ -109,9 +110,10 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
                               Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         }
         // Never removed: no tags is an empty list, so that clearing them is a change too.
-        if (auto error = writeAttribute(url.value(), Array::make(labelsOf(tagData)),
-                                        LocalItem::xattrTagDataName()))
-            return completion(nullptr, updateFailed(*error, "set the tags", identifier));
+        if (auto status = writeAttribute(url.value(), Array::make(labelsOf(tagData)),
+                                         LocalItem::xattrTagDataName());
+            !status.ok())
+            return completion(nullptr, updateFailed(status.error(), "set the tags", identifier));
         completeWithItem(*this, url.value(), completion);
     });
 }
@@ -129,9 +131,10 @@ void LocalPorter::setFavoriteRank(std::shared_ptr<const Number> rank,
                 return completion(nullptr,
                                   Error::porterErrorForNonExistentItemWithIdentifier(identifier));
             }
-            if (auto error = writeAttribute(url.value(), rank, LocalItem::xattrFavoriteRankName()))
-                return completion(nullptr,
-                                  updateFailed(*error, "set the favourite rank", identifier));
+            if (auto status = writeAttribute(url.value(), rank, LocalItem::xattrFavoriteRankName());
+                !status.ok())
+                return completion(
+                    nullptr, updateFailed(status.error(), "set the favourite rank", identifier));
             completeWithItem(*this, url.value(), completion);
         });
 }

@@ -49,7 +49,7 @@ void setPutBackString(const Url& trashedURL, const Url& originalURL) {
     logDebug(
         [&] { return "setting putback '" + *relative + "' on " + trashedURL.absoluteString(); });
     bool written = pt_withReadWriteAccess(trashedURL, [&](int fd) {
-        return !SetOrRemoveXattr(fd, data.value(), LocalItem::xattrTrashPutBackName());
+        return SetOrRemoveXattr(fd, data.value(), LocalItem::xattrTrashPutBackName()).ok();
     });
     if (!written) {
         Error error = Error::errorWithPOSIXCode(errno);
@@ -95,8 +95,8 @@ void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identi
         logDebug([&] { return "trash is located at \"" + trash.path() + "\""; });
         // Made beneath the library without following links; a linked .Trash is refused
         // before anything moves.
-        if (auto error = pt_ensureTrashFolder(trash))
-            return completion(nullptr, *error);
+        if (auto status = pt_ensureTrashFolder(trash); !status.ok())
+            return completion(nullptr, status.error());
 
         Url original = *url;
         pt_trashUnderFolder(

@@ -97,8 +97,8 @@ Status writeTrashDate(const Url& url, const std::shared_ptr<const Date>& date) {
         }
         data = std::move(archived.value());
     }
-    if (pt_withReadWriteAccess(url, [&](int fd) { return !SetOrRemoveXattr(fd, data, name); }))
-        return std::nullopt;
+    if (pt_withReadWriteAccess(url, [&](int fd) { return SetOrRemoveXattr(fd, data, name).ok(); }))
+        return Status::OK();
     Error error = Error::errorWithPOSIXCode(errno);
     logError(std::string(date ? "can't set xattr " : "can't remove xattr ") + name + " on " +
              url.absoluteString() + "; " + error.description());

@@ -6,10 +6,12 @@
 #include <variant>
 
 #include "support/Error.h"
+#include "support/Status.h"
 
 namespace tamber {
 
-// A value or an error. The success type may be void-like through `Result<std::monostate>`.
+// A value or an error; test it with ok() (no conversion to bool, like Status). The success
+// type may be void-like through `Result<std::monostate>`.
 template <class T>
 class Result {
 public:
@@ -17,7 +19,8 @@ public:
     Result(Error error) : v_(std::move(error)) {}  // NOLINT
 
     bool ok() const { return v_.index() == 0; }
-    explicit operator bool() const { return ok(); }
+    // The outcome without the value.
+    Status status() const { return ok() ? Status() : Status(error()); }
 
     T& value() & {
         assert(ok());
@@ -43,8 +46,5 @@ public:
 private:
     std::variant<T, Error> v_;
 };
-
-// The outcome of an operation with no value: no error means success.
-using Status = std::optional<Error>;
 
 }  // namespace tamber

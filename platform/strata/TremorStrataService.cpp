@@ -59,8 +59,9 @@ uint32_t TremorStrataService::getOrAllocateDocumentId(int fd) {
     if (S_ISREG(st.stx_mode)) {
         auto values = DocumentAttributes::read(*path);
         if (values && !values->empty()) {
-            if (auto error = store->replaceDocumentAttributes(docID.value(), *values))
-                logError("Could not keep a document's metadata: " + error->description());
+            if (auto status = store->replaceDocumentAttributes(docID.value(), *values);
+                !status.ok())
+                logError("Could not keep a document's metadata: " + status.error().description());
         }
     }
     return docID.value();
@@ -119,8 +120,8 @@ void TremorStrataService::metadataAttributeWritten(
     auto docID = store ? store->documentIdForInode(st.stx_ino) : std::nullopt;
     if (!docID)
         return;
-    if (auto error = store->setDocumentAttribute(*docID, name, value))
-        logError("Could not keep a document's metadata: " + error->description());
+    if (auto status = store->setDocumentAttribute(*docID, name, value); !status.ok())
+        logError("Could not keep a document's metadata: " + status.error().description());
 }
 
 }  // namespace tamber

@@ -91,8 +91,8 @@ std::string nameOf(const std::string& path) {
 }
 
 void logIfFailed(const Status& status, std::string_view what) {
-    if (status)
-        logError(std::string(what) + ": " + status->description());
+    if (!status.ok())
+        logError(std::string(what) + ": " + status.error().description());
 }
 
 // Whether the index must be told about `found`, a newer look at the entry it keeps as `indexed`.
@@ -173,7 +173,7 @@ Result<std::vector<JournalEvent>> JournalWriter::commit(Settle settle,
         settleVanished(settle);
         events = std::move(pending_);
         if (events.empty())
-            return std::nullopt;
+            return Status::OK();
         auto last = store_.append(events);
         return last.ok() ? Status() : Status(last.error());
     });
@@ -181,8 +181,8 @@ Result<std::vector<JournalEvent>> JournalWriter::commit(Settle settle,
     vanished_.clear();
     staged_.clear();
     stagedNames_.clear();
-    if (status)
-        return *status;
+    if (!status.ok())
+        return status.error();
     return events;
 }
 
@@ -317,9 +317,9 @@ void JournalWriter::claimDocumentId(const std::string& path, uint64_t inode, uin
     if (store_.documentIdForInode(inode))
         return;  // the new file is a document of its own
     vanished_.erase(it);
-    if (auto error = store_.moveDocumentId(docID, inode)) {
+    if (auto status = store_.moveDocumentId(docID, inode); !status.ok()) {
         logError("Could not move document ID " + std::to_string(docID) + ": " +
-                 error->description());
+                 status.error().description());
         return;
     }
     pending_.push_back({0, documentIdPath(device_, docID, old, inode), inode,

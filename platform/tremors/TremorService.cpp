@@ -99,9 +99,9 @@ Result<std::shared_ptr<TremorService>> TremorService::create(
         return backend.error();
     auto service = std::make_shared<TremorService>(Private{}, stateDir, std::move(backend).value(),
                                                    queueLimit, std::move(lockWait));
-    if (auto error = service->openExistingStores()) {
+    if (auto status = service->openExistingStores(); !status.ok()) {
         service->shutdown();
-        return *error;
+        return status.error();
     }
     return service;
 }

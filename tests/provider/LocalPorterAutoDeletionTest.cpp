@@ -34,7 +34,7 @@ protected:
     std::string trashed(const std::string& path, std::shared_ptr<const Date> date) {
         writeFile(path);
         if (date) {
-            EXPECT_FALSE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(path), date));
+            EXPECT_TRUE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(path), date).ok());
         }
         return path;
     }
@@ -66,8 +66,9 @@ TEST_F(AutoDeletionTest, ItemsWithoutAReadableDateAreRestampedAndGoLater) {
     std::string broken = trashed(storage + "/.Trash/broken.txt", nullptr);
     auto notADate = KeyedArchiver::archivedDataWithRootObject(String::make("yesterday"));
     ASSERT_TRUE(notADate.ok());
-    ASSERT_FALSE(WriteXattrAtURL(Url::fileURLWithPath(broken), notADate.value(),
-                                 LocalItem::xattrTrashDateName()));
+    ASSERT_TRUE(WriteXattrAtURL(Url::fileURLWithPath(broken), notADate.value(),
+                                LocalItem::xattrTrashDateName())
+                    .ok());
 
     double before = Date::now()->timeIntervalSince1970();
     sweep(Date::make(before + 3600));
@@ -96,7 +97,7 @@ TEST_F(AutoDeletionTest, ATrashedFolderIsOneItemAndHiddenEntriesAreLeftAlone) {
     writeFile(folder + "/inner/a.txt");
     writeFile(folder + "/b.txt");
     std::string hidden = trashed(libraryTrash() + "/.hidden", nullptr);
-    ASSERT_FALSE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(folder), Date::make(5'000)));
+    ASSERT_TRUE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(folder), Date::make(5'000)).ok());
 
     sweep(Date::make(4'000));
     // Nothing below the folder was visited, so nothing there was stamped.
