@@ -209,7 +209,8 @@ int main(int argc, char** argv) {
     size_t lookups = std::min<size_t>(count, 20000);
     start = Clock::now();
     for (size_t i = 0; i < lookups; ++i) {
-        if (!store->pathForInode(records[i].inode))
+        auto path = store->pathForInode(records[i].inode);
+        if (!path.ok() || !path.value())
             die("unresolved inode");
     }
     double lookupStore = since(start);

@@ -436,20 +436,6 @@ bool TremorStore::knowsRoot(const std::string& path) const {
 
 // ---- Index of the watched trees and document IDs ----
 
-namespace {
-
-// Reads that answer "nothing" on failure still leave a trace of why.
-template <class T>
-std::optional<T> orLogged(Result<std::optional<T>> result) {
-    if (!result.ok()) {
-        logError(result.error().description());
-        return std::nullopt;
-    }
-    return std::move(result).value();
-}
-
-}  // namespace
-
 Status TremorStore::upsertInodes(const std::vector<InodeRecord>& records) {
     std::lock_guard lock(mutex_);
     return index_->upsert(records);
@@ -460,36 +446,26 @@ Status TremorStore::removeInodes(const std::vector<uint64_t>& inodes) {
     return index_->remove(inodes);
 }
 
-std::optional<InodeRecord> TremorStore::inode(uint64_t inode) const {
+Result<std::optional<InodeRecord>> TremorStore::inode(uint64_t inode) const {
     std::lock_guard lock(mutex_);
-    return orLogged(index_->find(inode));
+    return index_->find(inode);
 }
 
-std::optional<std::string> TremorStore::pathForInode(uint64_t inode) const {
+Result<std::optional<std::string>> TremorStore::pathForInode(uint64_t inode) const {
     std::lock_guard lock(mutex_);
-    return orLogged(index_->path(
-        inode, [this](uint64_t candidate) { return roots_->pathOfRootInode(candidate); }));
+    return index_->path(inode,
+                        [this](uint64_t candidate) { return roots_->pathOfRootInode(candidate); });
 }
 
-std::vector<InodeRecord> TremorStore::children(uint64_t parent) const {
+Result<std::vector<InodeRecord>> TremorStore::children(uint64_t parent) const {
     std::lock_guard lock(mutex_);
-    auto result = index_->children(parent);
-    if (!result.ok()) {
-        logError(result.error().description());
-        return {};
-    }
-    return std::move(result).value();
+    return index_->children(parent);
 }
 
-std::vector<InodeRecord> TremorStore::childrenNamed(uint64_t parent,
-                                                    const std::string& name) const {
+Result<std::vector<InodeRecord>> TremorStore::childrenNamed(uint64_t parent,
+                                                            const std::string& name) const {
     std::lock_guard lock(mutex_);
-    auto result = index_->childrenNamed(parent, name);
-    if (!result.ok()) {
-        logError(result.error().description());
-        return {};
-    }
-    return std::move(result).value();
+    return index_->childrenNamed(parent, name);
 }
 
 Result<uint32_t> TremorStore::allocateDocumentId(uint64_t inode) {
@@ -497,14 +473,14 @@ Result<uint32_t> TremorStore::allocateDocumentId(uint64_t inode) {
     return index_->allocateDocumentId(inode);
 }
 
-std::optional<uint64_t> TremorStore::inodeForDocumentId(uint32_t docID) const {
+Result<std::optional<uint64_t>> TremorStore::inodeForDocumentId(uint32_t docID) const {
     std::lock_guard lock(mutex_);
-    return orLogged(index_->inodeForDocumentId(docID));
+    return index_->inodeForDocumentId(docID);
 }
 
-std::optional<uint32_t> TremorStore::documentIdForInode(uint64_t inode) const {
+Result<std::optional<uint32_t>> TremorStore::documentIdForInode(uint64_t inode) const {
     std::lock_guard lock(mutex_);
-    return orLogged(index_->documentIdForInode(inode));
+    return index_->documentIdForInode(inode);
 }
 
 Status TremorStore::moveDocumentId(uint32_t docID, uint64_t newInode) {
@@ -522,14 +498,9 @@ Status TremorStore::clearDocumentId(uint32_t docID) {
     return index_->clearDocumentId(docID);
 }
 
-TremorStore::Attributes TremorStore::documentAttributes(uint32_t docID) const {
+Result<TremorStore::Attributes> TremorStore::documentAttributes(uint32_t docID) const {
     std::lock_guard lock(mutex_);
-    auto result = index_->documentAttributes(docID);
-    if (!result.ok()) {
-        logError(result.error().description());
-        return {};
-    }
-    return std::move(result).value();
+    return index_->documentAttributes(docID);
 }
 
 Status TremorStore::setDocumentAttribute(uint32_t docID, const std::string& name,

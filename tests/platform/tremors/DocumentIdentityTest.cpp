@@ -341,7 +341,7 @@ TEST(DocumentIdentityWriterTest, ABatchThatFindsTheOldInodeNumberBornAgainIsASaf
     auto events = writer.apply({{FileChange::Kind::Created, path + ".saving", {}, false, 0},
                                 {FileChange::Kind::Renamed, path, path + ".saving", false, 0}});
     ASSERT_TRUE(events.ok());
-    EXPECT_EQ(store.documentIdForInode(inode), docID);
+    EXPECT_EQ(store.documentIdForInode(inode).value(), docID);
     EXPECT_EQ(attribute(path, kTags), std::string(tags.begin(), tags.end()));
     bool journaled = false;
     for (const auto& event : events.value())
@@ -349,8 +349,8 @@ TEST(DocumentIdentityWriterTest, ABatchThatFindsTheOldInodeNumberBornAgainIsASaf
     EXPECT_TRUE(journaled);
     // The index now knows the new file: an event on it changes nothing more.
     EXPECT_TRUE(writer.apply({{FileChange::Kind::Modified, path, {}, false, 0}}).ok());
-    EXPECT_EQ(store.documentIdForInode(inode), docID);
-    EXPECT_EQ(store.documentAttributes(docID), (TremorStore::Attributes{{kTags, tags}}));
+    EXPECT_EQ(store.documentIdForInode(inode).value(), docID);
+    EXPECT_EQ(store.documentAttributes(docID).value(), (TremorStore::Attributes{{kTags, tags}}));
 }
 
 TEST_F(DocumentIdentityTest, AKnownFileMovedOntoADocumentIsAMoveNotASave) {

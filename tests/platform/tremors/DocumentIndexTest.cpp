@@ -70,35 +70,36 @@ TEST(DocumentIndexTest, MetadataCopiesFollowTheIdAndGoWithIt) {
     ASSERT_TRUE(store->setDocumentAttribute(doc, kTags, binary).ok());
     ASSERT_TRUE(store->setDocumentAttribute(doc, kRank, Bytes{'1'}).ok());
     ASSERT_TRUE(store->setDocumentAttribute(doc, kRank, Bytes{'2'}).ok());  // replaced
-    EXPECT_EQ(store->documentAttributes(doc),
+    EXPECT_EQ(store->documentAttributes(doc).value(),
               (TremorStore::Attributes{{kTags, binary}, {kRank, Bytes{'2'}}}));
     ASSERT_TRUE(store->setDocumentAttribute(doc, kRank, std::nullopt).ok());
-    EXPECT_EQ(store->documentAttributes(doc), (TremorStore::Attributes{{kTags, binary}}));
+    EXPECT_EQ(store->documentAttributes(doc).value(), (TremorStore::Attributes{{kTags, binary}}));
 
     // Detached from an inode that became another file: no inode has it, the copy waits.
     ASSERT_TRUE(store->detachDocumentId(doc).ok());
-    EXPECT_EQ(store->inodeForDocumentId(doc), std::nullopt);
-    EXPECT_EQ(store->documentIdForInode(10), std::nullopt);
+    EXPECT_EQ(store->inodeForDocumentId(doc).value(), std::nullopt);
+    EXPECT_EQ(store->documentIdForInode(10).value(), std::nullopt);
     store.reset();
     store = openStore(state.path());
     ASSERT_TRUE(store);
     ASSERT_TRUE(store->moveDocumentId(doc, 20).ok());
-    EXPECT_EQ(store->inodeForDocumentId(doc), 20u);
-    EXPECT_EQ(store->documentAttributes(doc), (TremorStore::Attributes{{kTags, binary}}));
+    EXPECT_EQ(store->inodeForDocumentId(doc).value(), 20u);
+    EXPECT_EQ(store->documentAttributes(doc).value(), (TremorStore::Attributes{{kTags, binary}}));
     // An ID never handed out cannot be brought into being by a move.
     Status unknown = store->moveDocumentId(doc + 1, 30);
     ASSERT_FALSE(unknown.ok());
     EXPECT_EQ(unknown.error().code(), ENOENT);
-    EXPECT_EQ(store->documentIdForInode(30), std::nullopt);
+    EXPECT_EQ(store->documentIdForInode(30).value(), std::nullopt);
 
     // Other documents' copies are their own; clearing an ID drops its copy for good.
     uint32_t other = store->allocateDocumentId(40).value();
     ASSERT_TRUE(store->replaceDocumentAttributes(other, {{kRank, Bytes{'9'}}}).ok());
     ASSERT_TRUE(store->clearDocumentId(doc).ok());
-    EXPECT_TRUE(store->documentAttributes(doc).empty());
-    EXPECT_EQ(store->documentAttributes(other), (TremorStore::Attributes{{kRank, Bytes{'9'}}}));
+    EXPECT_TRUE(store->documentAttributes(doc).value().empty());
+    EXPECT_EQ(store->documentAttributes(other).value(),
+              (TremorStore::Attributes{{kRank, Bytes{'9'}}}));
     ASSERT_TRUE(store->replaceDocumentAttributes(other, {}).ok());
-    EXPECT_TRUE(store->documentAttributes(other).empty());
+    EXPECT_TRUE(store->documentAttributes(other).value().empty());
 }
 
 TEST(DocumentIndexTest, AFailedBatchTakesBackDetachesMovesAndCopies) {
@@ -114,8 +115,9 @@ TEST(DocumentIndexTest, AFailedBatchTakesBackDetachesMovesAndCopies) {
         return Error::posix(EIO);
     });
     ASSERT_FALSE(failed.ok());
-    EXPECT_EQ(store->inodeForDocumentId(doc), 10u);
-    EXPECT_EQ(store->documentAttributes(doc), (TremorStore::Attributes{{kTags, Bytes{'t'}}}));
+    EXPECT_EQ(store->inodeForDocumentId(doc).value(), 10u);
+    EXPECT_EQ(store->documentAttributes(doc).value(),
+              (TremorStore::Attributes{{kTags, Bytes{'t'}}}));
 }
 
 // Databases of schemas 1 and 2, made by taking today's apart the way the older versions built
@@ -151,18 +153,18 @@ TEST(DocumentIndexTest, OlderDatabasesAreUpgradedInPlace) {
         ASSERT_TRUE(store);
         EXPECT_EQ(store->uuid(), uuid) << "upgraded, not replaced";
         EXPECT_EQ(store->lastEventId(), 1u);
-        EXPECT_EQ(store->inodeForDocumentId(doc), 2u);
+        EXPECT_EQ(store->inodeForDocumentId(doc).value(), 2u);
         // A reopened store answers paths only for the trees this process watches again.
         ASSERT_TRUE(store->resumeRoot("/watched"));
-        EXPECT_EQ(store->pathForInode(2), "/watched/a.txt");
-        auto record = store->inode(2);
+        EXPECT_EQ(store->pathForInode(2).value(), "/watched/a.txt");
+        auto record = store->inode(2).value();
         ASSERT_TRUE(record);
         EXPECT_EQ(record->stamped, version == 2);
         EXPECT_EQ(record->ctime, 0) << "not known yet";
-        EXPECT_TRUE(store->documentAttributes(doc).empty());
+        EXPECT_TRUE(store->documentAttributes(doc).value().empty());
         ASSERT_TRUE(store->setDocumentAttribute(doc, kTags, Bytes{'t'}).ok());
         ASSERT_TRUE(store->upsertInodes({stampedFile(3, 1, "b.txt")}).ok());
-        EXPECT_EQ(store->inode(3)->ctime, 3000);
+        EXPECT_EQ(store->inode(3).value()->ctime, 3000);
         EXPECT_EQ(store->allocateDocumentId(3).value(), doc + 1);
         EXPECT_EQ(log.sink().countStartingWith("[INFO] Upgraded the event journal in"), 1u);
         store.reset();
@@ -189,13 +191,13 @@ TEST(DocumentIndexTest, ACrawlReadsTheMetadataOfDocumentsWithAnUnknownOrNewChang
     struct statx st {};
     ASSERT_EQ(counting->statx(AT_FDCWD, path, 0, STATX_INO, &st), 0);
     uint32_t doc = store->allocateDocumentId(st.stx_ino).value();
-    auto record = store->inode(st.stx_ino);
+    auto record = store->inode(st.stx_ino).value();
     ASSERT_TRUE(record);
     record->ctime = 0;  // as an upgraded entry
     ASSERT_TRUE(store->upsertInodes({*record}).ok());
 
     ASSERT_TRUE(writer.reconcile(tree, true).ok());
-    EXPECT_EQ(store->documentAttributes(doc),
+    EXPECT_EQ(store->documentAttributes(doc).value(),
               (TremorStore::Attributes{{kTags, Bytes{'o', 'l', 'd'}}}));
 
     counting->resetCalls();
@@ -216,7 +218,7 @@ TEST(DocumentIndexTest, ACrawlReadsTheMetadataOfDocumentsWithAnUnknownOrNewChang
     }
     ASSERT_TRUE(writer.reconcile(tree, true).ok());
     EXPECT_EQ(counting->calls(FaultInjectingFileSystem::Operation::Llistxattr), 1u);
-    EXPECT_EQ(store->documentAttributes(doc),
+    EXPECT_EQ(store->documentAttributes(doc).value(),
               (TremorStore::Attributes{{kTags, Bytes{'n', 'e', 'w'}}}));
 }
 

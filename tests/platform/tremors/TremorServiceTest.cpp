@@ -27,11 +27,14 @@
 #include "platform/strata/TremorStrataService.h"
 #include "platform/tremors/JournalWriter.h"
 #include "platform/tremors/LinuxInotifyApi.h"
+#include "platform/tremors/SqliteDatabase.h"
 #include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/TremorService.h"
 #include "platform/tremors/TremorStore.h"
+#include "platform/tremors/TremorStoreDirectory.h"
 #include "platform/tremors/Tremors.h"
 #include "tests/common/ScopedFileSystem.h"
+#include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
 
 namespace tamber {
@@ -226,7 +229,7 @@ void pretendInodeWasReused(const std::string& stateDir, const std::string& path)
     ASSERT_EQ(FileSystem::current().statvfs(path, &vfs), 0);
     auto store = TremorStore::open(stateDir, vfs.f_fsid);
     ASSERT_TRUE(store.ok());
-    auto record = store.value()->inode(inodeOf(path));
+    auto record = store.value()->inode(inodeOf(path)).value();
     ASSERT_TRUE(record && record->stamped);
     record->birth += 1;
     ASSERT_TRUE(store.value()->upsertInodes({*record}).ok());
@@ -497,6 +500,43 @@ TEST_F(TremorServiceStreamTest, AReplayFromBeyondTheLastEventIsALossAndReplaysNo
     }
     for (auto stream : streams_) TremorStreamStop(stream);
     queue_->sync([] {});
+}
+
+// A batch the journal cannot write is rolled back whole: readers are then told to rescan the
+// tree rather than miss what the batch held.
+TEST_F(TremorServiceTest, ABatchThatCannotBeJournaledAsksReadersToRescan) {
+    ASSERT_NO_FATAL_FAILURE(startWatching());
+    service_->sync();
+    TremorStore* store = service_->storeForDevice(device_);
+    ASSERT_NE(store, nullptr);
+    std::string database = store->directory() + "/" + TremorStoreDirectory::kDatabaseName;
+    service_->shutdown();
+    strata_.reset();
+    service_.reset();
+    {
+        auto db = SqliteDatabase::open(database);
+        ASSERT_TRUE(db.ok());
+        ASSERT_TRUE(db.value()
+                        ->exec("CREATE TRIGGER refused BEFORE INSERT ON inodes WHEN NEW.name = "
+                               "'poison' BEGIN SELECT RAISE(ABORT, 'refused'); END")
+                        .ok());
+    }
+    ASSERT_NO_FATAL_FAILURE(startWatching());
+    uint64_t since = service_->currentEventId();
+
+    testing::ScopedLogCapture log;
+    writeText(tree_ + "/poison", "p");
+    std::vector<JournalEvent> events;
+    bool rescan = eventually([&] {
+        events = journaled(*service_, device_, since);
+        return findEvent(events, tree_, kTremorMustScanSubdirs) != nullptr;
+    });
+    std::string logged;
+    for (const auto& line : log->lines()) logged += line.text + "\n";
+    EXPECT_TRUE(rescan) << describe(events) << logged;
+    EXPECT_EQ(findEvent(events, tree_ + "/poison", kTremorItemCreated), nullptr)
+        << "half of a failed batch was journaled\n"
+        << describe(events);
 }
 
 }  // namespace
