@@ -58,10 +58,8 @@ Result<HostPorterItemIdentifier> ItemAction::identifierFor(LocalPorter& porter,
 Result<LocalPorter::LocalItemRef> ItemAction::waitForItem(const ItemStarter& start) {
     using ItemResult = Result<LocalPorter::LocalItemRef>;
     auto outcome = std::make_shared<Outcome<ItemResult>>();
-    start([outcome](LocalPorter::LocalItemRef item, std::optional<Error> error) {
-        if (error)
-            return outcome->deliver(*error);
-        if (!item)
+    start([outcome](ItemResult item) {
+        if (item.ok() && !item.value())
             return outcome->deliver(Error::porterErrorForNonExistentItemWithIdentifier(""));
         outcome->deliver(std::move(item));
     });
@@ -70,9 +68,7 @@ Result<LocalPorter::LocalItemRef> ItemAction::waitForItem(const ItemStarter& sta
 
 Status ItemAction::waitForStatus(const ErrorStarter& start) {
     auto outcome = std::make_shared<Outcome<Status>>();
-    start([outcome](std::optional<Error> error) {
-        outcome->deliver(error ? Status(*error) : Status::OK());
-    });
+    start([outcome](Status status) { outcome->deliver(std::move(status)); });
     return outcome->wait();
 }
 

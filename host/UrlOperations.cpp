@@ -448,10 +448,7 @@ Status deleteItem(const Url& url) {
 void finish(Result<Url> result, const UrlCompletion& completion) {
     if (!completion)
         return;
-    if (result.ok())
-        completion(std::move(result).value(), std::nullopt);
-    else
-        completion(std::nullopt, result.error());
+    completion(std::move(result));
 }
 
 }  // namespace
@@ -515,7 +512,7 @@ Status pt_ensureTrashFolder(const Url& trashFolder) {
 void pt_deleteWithCompletionHandler(const Url& url, const ErrorCompletion& completion) {
     Status status = deleteItem(url);
     if (completion)
-        completion(status.ok() ? std::nullopt : std::optional<Error>(status.error()));
+        completion(std::move(status));
 }
 
 }  // namespace tamber

@@ -11,6 +11,7 @@
 #include "platform/apps/AppRecord.h"
 #include "support/DispatchQueue.h"
 #include "support/Pacer.h"
+#include "support/Result.h"
 
 namespace tamber {
 
@@ -57,9 +58,9 @@ public:
         const HostPorterItemIdentifier& identifier) override;
 
     // Item operations. Every completion is called exactly once, on whatever thread the file
-    // operation finishes.
-    using ItemCompletion = std::function<void(LocalItemRef item, std::optional<Error> error)>;
-    using ErrorCompletion = std::function<void(std::optional<Error> error)>;
+    // operation finishes, with the item (or success) or the error.
+    using ItemCompletion = std::function<void(Result<LocalItemRef> item)>;
+    using ErrorCompletion = std::function<void(Status status)>;
     void importDocumentAtURL(const Url& source, const HostPorterItemIdentifier& parent,
                              ItemCompletion completion);
     // A taken name bounces to "name 2", ... (as a file browser's new folder does); with

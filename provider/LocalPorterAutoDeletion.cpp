@@ -92,8 +92,7 @@ void LocalPorter::_removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> r
                        " was trashed before reference date, let's remove it";
             });
             group->enter();
-            deleteItemWithIdentifier(*identifier,
-                                     [group](std::optional<Error>) { group->leave(); });
+            deleteItemWithIdentifier(*identifier, [group](Status) { group->leave(); });
         });
 
         logDebug("wait until all deletions are complete");

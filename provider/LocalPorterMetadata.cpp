@@ -68,8 +68,8 @@ void completeWithItem(LocalPorter& porter, const Url& url,
                       const LocalPorter::ItemCompletion& completion) {
     auto item = porter.itemForURL(url);
     if (!item.ok())
-        return completion(nullptr, item.error());
-    completion(item.value(), std::nullopt);
+        return completion(item.error());
+    completion(item.value());
 }
 
 }  // namespace
@@ -86,15 +86,14 @@ void LocalPorter::setLastUsedDate(std::shared_ptr<const Date> date,
             Error refused = Error::invalidParameter("itemIdentifier", identifier);
             std::map<std::string, std::string> info = refused.userInfo();
             info["description"] = "an app library has no last-used date: " + identifier;
-            return completion(nullptr, Error(refused.domain(), refused.code(), std::move(info)));
+            return completion(Error(refused.domain(), refused.code(), std::move(info)));
         }
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok())
-            return completion(nullptr, url.error());
+            return completion(url.error());
         // Logged by the writer.
         if (auto status = ItemMetadata::writeLastUsedDate(url.value(), date); !status.ok())
-            return completion(nullptr,
-                              updateFailed(status.error(), "set the last-used date", identifier));
+            return completion(updateFailed(status.error(), "set the last-used date", identifier));
         completeWithItem(*this, url.value(), completion);
     });
 }
@@ -106,14 +105,13 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok()) {
             logError("can't find URL for item; " + url.error().description());
-            return completion(nullptr,
-                              Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+            return completion(Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         }
         // Never removed: no tags is an empty list, so that clearing them is a change too.
         if (auto status = writeAttribute(url.value(), Array::make(labelsOf(tagData)),
                                          LocalItem::xattrTagDataName());
             !status.ok())
-            return completion(nullptr, updateFailed(status.error(), "set the tags", identifier));
+            return completion(updateFailed(status.error(), "set the tags", identifier));
         completeWithItem(*this, url.value(), completion);
     });
 }
@@ -128,13 +126,12 @@ void LocalPorter::setFavoriteRank(std::shared_ptr<const Number> rank,
             auto url = urlForIdentifierLogged(identifier);
             if (!url.ok()) {
                 logError("can't find URL for item; " + url.error().description());
-                return completion(nullptr,
-                                  Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+                return completion(Error::porterErrorForNonExistentItemWithIdentifier(identifier));
             }
             if (auto status = writeAttribute(url.value(), rank, LocalItem::xattrFavoriteRankName());
                 !status.ok())
                 return completion(
-                    nullptr, updateFailed(status.error(), "set the favourite rank", identifier));
+                    updateFailed(status.error(), "set the favourite rank", identifier));
             completeWithItem(*this, url.value(), completion);
         });
 }

@@ -195,7 +195,7 @@ void LocalPorter::fetchThumbnailsForItemIdentifiers(
     withLogSection("fetching thumbnails for " + identifierList(identifiers), [&] {
         for (const auto& identifier : identifiers)
             perThumbnailCompletion(identifier, thumbnailFor(*this, identifier), std::nullopt);
-        completion(std::nullopt);
+        completion(Status::OK());
     });
 }
 
@@ -207,7 +207,7 @@ void LocalPorter::fetchThumbnailsForItemIdentifiers(
         const std::string type(ImageEncoder::kPNGType);
         for (const auto& identifier : identifiers)
             perThumbnailCompletion(identifier, thumbnailFor(*this, identifier), type, std::nullopt);
-        completion(std::nullopt);
+        completion(Status::OK());
     });
 }
 

@@ -36,9 +36,11 @@ struct Outcome {
 template <class Operation>
 Outcome run(Operation operation) {
     Outcome outcome;
-    operation([&](std::optional<Url> url, std::optional<Error> error) {
-        outcome.url = std::move(url);
-        outcome.error = std::move(error);
+    operation([&](Result<Url> result) {
+        if (result.ok())
+            outcome.url = std::move(result).value();
+        else
+            outcome.error = result.error();
     });
     return outcome;
 }
@@ -128,8 +130,8 @@ TEST_F(PublishedTreesTest, OperationsRefuseOutsideBeforeTouchingAnything) {
     EXPECT_TRUE(refused(run([&](auto done) { pt_renameWithNewName(at(source), "c.txt", done); })));
     EXPECT_TRUE(refused(run(
         [&](auto done) { pt_trashUnderFolder(at(file), at(storage + "/away/.Trash"), done); })));
-    std::optional<Error> deleted;
-    pt_deleteWithCompletionHandler(at(outside + "/x"), [&](auto error) { deleted = error; });
+    Status deleted;
+    pt_deleteWithCompletionHandler(at(outside + "/x"), [&](Status status) { deleted = status; });
     EXPECT_TRUE(refused(deleted));
 
     bool ran = false;
@@ -160,9 +162,9 @@ TEST_F(PublishedTreesTest, ALinkInsideIsMovedRenamedAndDeletedAsALink) {
     });
     ASSERT_TRUE(imported.url) << descriptionOf(imported.error);
     EXPECT_TRUE(fs::is_symlink(storage + "/Work/gone"));
-    std::optional<Error> deleted = Error::posix(EIO);
-    pt_deleteWithCompletionHandler(at(library + "/gone"), [&](auto error) { deleted = error; });
-    EXPECT_FALSE(deleted);
+    Status deleted = Error::posix(EIO);
+    pt_deleteWithCompletionHandler(at(library + "/gone"), [&](Status status) { deleted = status; });
+    EXPECT_TRUE(deleted.ok());
     EXPECT_FALSE(fs::exists(fs::symlink_status(library + "/gone")));
     EXPECT_TRUE(fs::exists(outside + "/keep.txt"));
 }

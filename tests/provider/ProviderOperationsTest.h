@@ -23,10 +23,12 @@ struct ItemOutcome {
     std::optional<Error> error;
 
     LocalPorter::ItemCompletion handler() {
-        return [this](LocalItemRef received, std::optional<Error> failure) {
+        return [this](Result<LocalItemRef> received) {
             ++calls;
-            item = std::move(received);
-            error = std::move(failure);
+            if (received.ok())
+                item = std::move(received).value();
+            else
+                error = received.error();
         };
     }
 };
@@ -36,9 +38,10 @@ struct ErrorOutcome {
     std::optional<Error> error;
 
     LocalPorter::ErrorCompletion handler() {
-        return [this](std::optional<Error> failure) {
+        return [this](Status status) {
             ++calls;
-            error = std::move(failure);
+            if (!status.ok())
+                error = status.error();
         };
     }
 };
