@@ -94,6 +94,22 @@ private:
     std::string previousLedger_;
 };
 
+// A refusal is known by its mark, never by its words: another "no such item" that happens to
+// say the same, or one that wraps a refusal under a description of its own, is not one.
+TEST_F(PublishedTreesTest, ARefusalIsKnownByItsMarkNotItsText) {
+    Error refusal = PublishedTrees::outsideError(at(outside + "/f"));
+    EXPECT_TRUE(PublishedTrees::isOutsideError(refusal));
+    Error sameWords(kHostPorterErrorDomain, kHostPorterNoSuchItem,
+                    {{"description", PublishedTrees::kOutsideMessage}});
+    EXPECT_FALSE(PublishedTrees::isOutsideError(sameWords));
+
+    std::map<std::string, std::string> info = refusal.userInfo();
+    info["description"] = "can't list " + outside + ": " + refusal.reason();
+    Error wrapped = PublishedTrees::unmarked(Error(refusal.domain(), refusal.code(), info));
+    EXPECT_FALSE(PublishedTrees::isOutsideError(wrapped));
+    EXPECT_EQ(wrapped.userInfo().at("path"), outside + "/f") << "the rest of the info stays";
+}
+
 TEST_F(PublishedTreesTest, InsideMeansAtOrBelowARootWithoutALinkOnTheWay) {
     EXPECT_TRUE(PublishedTrees::check(at(storage)).ok());
     EXPECT_TRUE(PublishedTrees::check(at(storage + "/Work/new.txt")).ok());
