@@ -156,8 +156,9 @@ LocalAppLibraryCache::Content LocalAppLibraryCache::load() {
 Result<uint64_t> LocalAppLibraryCache::save(const std::vector<BundleRecordRef>& bundleRecords,
                                             uint64_t versionToken, bool bumpVersion) {
     queue_->assertCurrent();
-    if (auto error = FileContents::createDirectory(cacheURL_.deletingLastPathComponent()))
-        return *error;
+    if (auto status = FileContents::createDirectory(cacheURL_.deletingLastPathComponent());
+        !status.ok())
+        return status.error();
 
     uint64_t token = versionToken;
     if (bumpVersion) {
@@ -172,8 +173,8 @@ Result<uint64_t> LocalAppLibraryCache::save(const std::vector<BundleRecordRef>& 
     auto data = KeyedArchiver::archivedDataWithRootObject(root);
     if (!data.ok())
         return data.error();
-    if (auto error = FileContents::writeAtomically(cacheURL_, data.value()))
-        return *error;
+    if (auto status = FileContents::writeAtomically(cacheURL_, data.value()); !status.ok())
+        return status.error();
     logDebug([&] {
         return "wrote on disk " + std::to_string(data.value().size()) + " bytes at " +
                abbreviatedPath(cacheURL_);

@@ -252,7 +252,7 @@ Status LocalAppLibraryManager::saveToCache() {
         cache->queue().sync([&] { return cache->save(records, content->versionToken, false); });
     if (!saved.ok())
         return saved.error();
-    return std::nullopt;
+    return Status::OK();
 }
 
 uint64_t LocalAppLibraryManager::versionToken() const {

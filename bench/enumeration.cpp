@@ -249,8 +249,8 @@ int main(int argc, char** argv) {
         for (size_t i = 0; i < perFolder; ++i) writeFile(folder + "/f-" + std::to_string(i));
     }
     // Watching starts the journal (and its crawl) before anything is timed.
-    if (auto error = TremorService::shared().value()->watchTree(storage))
-        die("can't watch " + storage + ": " + error->description());
+    if (auto status = TremorService::shared().value()->watchTree(storage); !status.ok())
+        die("can't watch " + storage + ": " + status.error().description());
     TremorReader::currentEventID();
 
     std::printf("%-44s %8s %9s %12s %-9s %8s  %s\n", "measure", "items", "seconds", "per second",

@@ -498,8 +498,8 @@ int main(int argc, char** argv) {
     if (!service.ok())
         die("the journal did not start: " + service.error().description());
     run.service = service.value();
-    if (auto error = run.service->watchTree(run.watched.root))
-        die("can't watch " + run.watched.root + ": " + error->description());
+    if (auto status = run.service->watchTree(run.watched.root); !status.ok())
+        die("can't watch " + run.watched.root + ": " + status.error().description());
     HostPorterManager::installDefaultManager(
         std::make_shared<StorageHostPorterManager>(Url::fileURLWithPath(run.watched.root)));
 

@@ -41,15 +41,15 @@ void report(const char* what, size_t n, double store, double baseline, const cha
 }
 
 void check(const Status& status) {
-    if (status)
-        die(status->description());
+    if (!status.ok())
+        die(status.error().description());
 }
 
 // Configured as the store configures its own, so that the figures differ only by the store's
 // indexes and bookkeeping.
 std::unique_ptr<SqliteDatabase> plainDatabase(const std::string& path) {
     auto db = SqliteDatabase::open(path);
-    if (!db)
+    if (!db.ok())
         die(db.error().description());
     check(db.value()->exec(
         "PRAGMA locking_mode = EXCLUSIVE; PRAGMA journal_mode = WAL; PRAGMA synchronous = NORMAL;"
@@ -61,12 +61,12 @@ std::unique_ptr<SqliteDatabase> plainDatabase(const std::string& path) {
 template <class F>
 double plainInsert(SqliteDatabase& db, const std::string& sql, size_t rows, F&& bindRow) {
     auto stmt = db.prepare(sql);
-    if (!stmt)
+    if (!stmt.ok())
         die(stmt.error().description());
     auto start = Clock::now();
     for (size_t done = 0; done < rows;) {
         auto txn = db.begin();
-        if (!txn)
+        if (!txn.ok())
             die(txn.error().description());
         for (size_t end = std::min(rows, done + kBatch); done < end; ++done) {
             bindRow(stmt.value(), done);
@@ -87,7 +87,7 @@ int main(int argc, char** argv) {
         die("mkdtemp failed");
 
     auto opened = TremorStore::open(root + "/state", 1);
-    if (!opened)
+    if (!opened.ok())
         die(opened.error().description());
     auto store = std::move(opened).value();
     for (int r = 0; r < kRoots; ++r) check(store->addRoot("/bench/r" + std::to_string(r), 0));
@@ -116,7 +116,7 @@ int main(int argc, char** argv) {
     for (size_t done = 0; done < count; done += kBatch) {
         std::vector<JournalEvent> batch(events.begin() + done,
                                         events.begin() + std::min(count, done + kBatch));
-        if (auto last = store->append(batch); !last)
+        if (auto last = store->append(batch); !last.ok())
             die(last.error().description());
     }
     double appendStore = since(start);
@@ -138,7 +138,7 @@ int main(int argc, char** argv) {
         die("replay lost events");
     auto scanAll = [&](const std::string& prefix) {
         auto stmt = plain->prepare("SELECT id, path, file_id, flags FROM events ORDER BY id");
-        if (!stmt)
+        if (!stmt.ok())
             die(stmt.error().description());
         size_t matched = 0;
         for (auto row = stmt->step(); row.ok() && row.value(); row = stmt->step()) {
@@ -209,12 +209,13 @@ int main(int argc, char** argv) {
     size_t lookups = std::min<size_t>(count, 20000);
     start = Clock::now();
     for (size_t i = 0; i < lookups; ++i) {
-        if (!store->pathForInode(records[i].inode))
+        auto path = store->pathForInode(records[i].inode);
+        if (!path.ok() || !path.value())
             die("unresolved inode");
     }
     double lookupStore = since(start);
     auto lookup = plain->prepare("SELECT parent, name FROM inodes WHERE inode = ?");
-    if (!lookup)
+    if (!lookup.ok())
         die(lookup.error().description());
     start = Clock::now();
     for (size_t i = 0; i < lookups; ++i) {
@@ -230,7 +231,7 @@ int main(int argc, char** argv) {
     store.reset();
     start = Clock::now();
     auto reopened = TremorStore::open(root + "/state", 1);
-    if (!reopened)
+    if (!reopened.ok())
         die(reopened.error().description());
     std::printf("\nreopen with quick check: %.3f s\n", since(start));
     reopened.value().reset();

@@ -78,20 +78,20 @@ const LocalPorter::AppRefreshOutcome& CliContext::appRefreshOutcome() const {
 }
 
 Result<std::shared_ptr<TremorService>> CliContext::startJournal() {
-    if (auto error = prepareStorage())
-        return *error;
+    if (auto error = prepareStorage(); !error.ok())
+        return error.error();
     return runtime_->startJournal();
 }
 
 Status CliContext::prepareJournal() {
-    if (auto error = prepareStorage())
+    if (auto error = prepareStorage(); !error.ok())
         return error;
     return runtime_->prepareJournal();
 }
 
 Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
-    if (auto error = prepareStorage())
-        return *error;
+    if (auto error = prepareStorage(); !error.ok())
+        return error.error();
     return runtime_->provider();
 }
 

@@ -152,8 +152,8 @@ int runParsed(int argc, char** argv, CliContext& context, std::ostream& out, std
         if (!sub->parsed())
             continue;
         context.setInvocation(sub->get_name(), positionalArguments(*sub));
-        if (auto error = context.prepareStorage())
-            return context.fail(*error, wantsJson(argc, argv));
+        if (auto status = context.prepareStorage(); !status.ok())
+            return context.fail(status.error(), wantsJson(argc, argv));
         return command->run(context);
     }
     return context.fail(CliContext::usageError("no verb given (see tamber --help)"),

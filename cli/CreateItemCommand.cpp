@@ -32,7 +32,7 @@ Status CreateItemCommand::checkArguments() {
         return Error(
             kHostPorterErrorDomain, kHostPorterInvalidParameter,
             {{"parameter", "source"}, {"description", "the source path must not be empty"}});
-    return std::nullopt;
+    return Status::OK();
 }
 
 int CreateItemCommand::runWith(CliContext& context, HostPorterExtension& provider) {

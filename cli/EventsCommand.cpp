@@ -65,16 +65,16 @@ Status EventsCommand::watchUncovered(CliContext& context, const std::vector<std:
     for (const auto& path : paths) {
         if (service.value()->isWatched(path))
             continue;
-        if (auto error = service.value()->watchTree(path)) {
-            return Error(
-                error->domain(), error->code(),
-                {{"description", "can't watch " + path + ": " + CliContext::errorMessage(*error)}});
+        if (auto status = service.value()->watchTree(path); !status.ok()) {
+            return Error(status.error().domain(), status.error().code(),
+                         {{"description", "can't watch " + path + ": " +
+                                              CliContext::errorMessage(status.error())}});
         }
         // Its earlier history was never journaled: say so rather than show an empty replay.
         context.err() << "tamber: warning: " << path
                       << " was not in a watched tree; watching it from now on\n";
     }
-    return std::nullopt;
+    return Status::OK();
 }
 
 CLI::App* EventsCommand::add(CLI::App& app) {
@@ -165,8 +165,8 @@ int EventsCommand::run(CliContext& context) {
         paths.push_back(context.storageURL().path());
 
     if (!docid_) {
-        if (auto error = watchUncovered(context, paths))
-            return context.fail(*error, json_);
+        if (auto status = watchUncovered(context, paths); !status.ok())
+            return context.fail(status.error(), json_);
     }
 
     Printer printer{&context.out(), &context.err(), json_, noFollow_, DispatchSemaphore(0)};
@@ -177,8 +177,8 @@ int EventsCommand::run(CliContext& context) {
     };
     TremorStreamRef stream =
         docid_ ? TremorStreamCreateWithEvents(
-                     print, TBFileObjectIdentifier::deviceID(context.storageURL()), {kTremorDocumentIdRoot},
-                     *since, 0.1, flags)
+                     print, TBFileObjectIdentifier::deviceID(context.storageURL()),
+                     {kTremorDocumentIdRoot}, *since, 0.1, flags)
                : TremorStreamCreateWithEvents(print, std::nullopt, paths, *since, 0.1, flags);
     if (!stream) {
         return context.fail(

@@ -16,8 +16,8 @@ CLI::App* IdCommand::add(CLI::App& app) {
 
 int IdCommand::runWith(CliContext& context, HostPorterExtension& provider) {
     Url url = Url::fileURLWithPath(path_);
-    if (auto outside = PublishedTrees::check(url))
-        return fail(context, *outside);
+    if (auto outside = PublishedTrees::check(url); !outside.ok())
+        return fail(context, outside.error());
     auto identifier = provider.persistentIdentifierForItemAtURL(url);
     if (!identifier) {
         return fail(context, Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,

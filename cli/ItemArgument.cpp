@@ -38,8 +38,8 @@ Result<HostPorterItemIdentifier> ItemArgument::resolve(HostPorterExtension& prov
     ItemArgument argument = parse(text);
     if (argument.kind == Kind::Identifier)
         return argument.identifier;
-    if (auto outside = PublishedTrees::check(argument.url))
-        return *outside;
+    if (auto outside = PublishedTrees::check(argument.url); !outside.ok())
+        return outside.error();
     auto identifier = provider.persistentIdentifierForItemAtURL(argument.url);
     if (!identifier)
         return Error::porterErrorForNonExistentItemWithIdentifier(argument.url.path());

@@ -36,13 +36,13 @@ CLI::App* ItemMetadataCommand::add(CLI::App& app) {
 
 Status ItemMetadataCommand::checkArguments() {
     if (verb_ != Verb::Rank || rank_ == "none")
-        return std::nullopt;
+        return Status::OK();
     int64_t value = 0;
     auto [end, ec] = std::from_chars(rank_.data(), rank_.data() + rank_.size(), value);
     if (ec != std::errc() || end != rank_.data() + rank_.size())
         return CliContext::usageError("RANK takes an integer or \"none\", not \"" + rank_ + "\"");
     rankValue_ = Number::fromInt64(value);
-    return std::nullopt;
+    return Status::OK();
 }
 
 int ItemMetadataCommand::runWith(CliContext& context, HostPorterExtension& provider) {

@@ -127,8 +127,8 @@ int MetaCommand::run(CliContext& context) {
     auto mainCache = LocalAppLibraryCache::mainCache();
     mainCache->queue().sync([&] { mainCache->load(); });
     LocalAppLibraryManager::shared()->upgradeFromMainCache(nullptr, false);
-    if (auto outside = PublishedTrees::check(url))
-        return context.fail(*outside, json_);
+    if (auto outside = PublishedTrees::check(url); !outside.ok())
+        return context.fail(outside.error(), json_);
     auto exists = url.resourceValue(ResourceKeys::kFileID);
     if (!exists.ok()) {
         const Error& e = exists.error();
@@ -143,8 +143,8 @@ int MetaCommand::run(CliContext& context) {
     auto changes = parseChanges();
     if (!changes.ok())
         return context.fail(changes.error(), json_);
-    if (auto error = LocalPorter::changeMetadataAtURL(url, changes.value()))
-        return context.fail(*error, json_);
+    if (auto error = LocalPorter::changeMetadataAtURL(url, changes.value()); !error.ok())
+        return context.fail(error.error(), json_);
 
     ItemMetadata metadata = LocalPorter::metadataAtURL(url);
     nlohmann::json j = toJson(metadata);

@@ -22,8 +22,8 @@ int PathCommand::runWith(CliContext& context, HostPorterExtension& provider) {
     ItemArgument argument = ItemArgument::parse(identifier_);
     std::optional<Url> url;
     if (argument.kind == ItemArgument::Kind::Path) {
-        if (auto outside = PublishedTrees::check(argument.url))
-            return fail(context, *outside);
+        if (auto outside = PublishedTrees::check(argument.url); !outside.ok())
+            return fail(context, outside.error());
         // Only an item answers: something that exists and has an identifier.
         if (provider.persistentIdentifierForItemAtURL(argument.url))
             url = argument.url;

@@ -9,8 +9,8 @@
 namespace tamber {
 
 int ProviderCommand::run(CliContext& context) {
-    if (auto refused = checkArguments())
-        return fail(context, *refused);
+    if (auto refused = checkArguments(); !refused.ok())
+        return fail(context, refused.error());
     auto provider = context.prepareProvider();
     if (!provider.ok())
         return fail(context, provider.error());

@@ -18,7 +18,7 @@ public:
 
 protected:
     // What can be refused before the provider starts; nothing by default.
-    virtual Status checkArguments() { return std::nullopt; }
+    virtual Status checkArguments() { return Status::OK(); }
     // The verb itself; returns the exit status.
     virtual int runWith(CliContext& context, HostPorterExtension& provider) = 0;
 

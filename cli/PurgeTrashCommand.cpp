@@ -56,7 +56,7 @@ Status PurgeTrashCommand::checkArguments() {
             "45s, not \"" +
             olderThan_ + "\"");
     seconds_ = *seconds;
-    return std::nullopt;
+    return Status::OK();
 }
 
 int PurgeTrashCommand::runWith(CliContext& context, HostPorterExtension& provider) {

@@ -21,8 +21,8 @@ int RemoveItemCommand::runWith(CliContext& context, HostPorterExtension& provide
         return fail(context, item.error());
     Status status = ProviderCalls::waitForStatus(
         [&](auto done) { provider.deleteItemWithIdentifier(item.value(), std::move(done)); });
-    if (status)
-        return fail(context, *status);
+    if (!status.ok())
+        return fail(context, status.error());
     if (json_)
         context.out() << jsonText(nlohmann::json{{"deleted", item.value()}}) << "\n";
     else

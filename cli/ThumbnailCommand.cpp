@@ -36,16 +36,17 @@ int ThumbnailCommand::runWith(CliContext& context, HostPorterExtension& provider
                     std::optional<Error>) { png = std::move(data); }),
             std::move(done));
     });
-    if (status)
-        return fail(context, *status);
+    if (!status.ok())
+        return fail(context, status.error());
     if (!png)
         return fail(
             context,
             Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
                   {{"description", identifier.value() + " has no thumbnail (only app libraries "
                                                         "whose app has an icon have one)"}}));
-    if (auto error = FileContents::writeAtomically(Url::fileURLWithPath(output_), *png))
-        return fail(context, *error);
+    if (auto error = FileContents::writeAtomically(Url::fileURLWithPath(output_), *png);
+        !error.ok())
+        return fail(context, error.error());
     if (!json_)
         context.err() << "wrote " << png->size() << " bytes to " << output_ << "\n";
     return printItem(context, *item.value());

@@ -36,7 +36,7 @@ Result<DirectoryListingCache::Listing> DirectoryListingCache::listing(const std:
         return listingError(errno, path);
 
     Result<Stamp> stamp = stampOf(*fs, fd, path);
-    if (!stamp) {
+    if (!stamp.ok()) {
         fs->close(fd);
         return stamp.error();
     }

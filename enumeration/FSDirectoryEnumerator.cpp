@@ -77,7 +77,7 @@ std::optional<std::vector<Frame>> openRoot(const Url& root, Pager& pager) {
     }
     Result<DirectoryListingCache::Listing> listing =
         DirectoryListingCache::shared().listing(root.path());
-    if (!listing) {
+    if (!listing.ok()) {
         const Error& error = listing.error();
         if (error.is(kPosixErrorDomain, ENOTDIR) || error.is(kPosixErrorDomain, ELOOP)) {
             // A file or a link: there is no directory to walk.
@@ -132,8 +132,9 @@ void walkFrames(std::vector<Frame>& stack, DirectoryEnumerationOptions options, 
         ++pager.counter;
         if (pager.counter > pager.offset) {
             Url url = Url::fileURLWithPath(path);
-            if (Status prefetched = url.prefetchResourceValues(LocalItem::urlKeys())) {
-                if (!pager.handleError(url, *prefetched))
+            if (Status prefetched = url.prefetchResourceValues(LocalItem::urlKeys());
+                !prefetched.ok()) {
+                if (!pager.handleError(url, prefetched.error()))
                     return;
             } else {
                 pager.deliver(url);
@@ -142,7 +143,7 @@ void walkFrames(std::vector<Frame>& stack, DirectoryEnumerationOptions options, 
 
         if (descend) {
             Result<DirectoryListingCache::Listing> listing = cache.listing(path);
-            if (!listing) {
+            if (!listing.ok()) {
                 if (!pager.handleError(Url::fileURLWithPath(path), listing.error()))
                     return;
                 continue;
@@ -211,7 +212,7 @@ bool stillValid(Cursor& cursor) {
     for (Frame& frame : cursor.stack) {
         Result<DirectoryListingCache::Listing> now =
             DirectoryListingCache::shared().listing(frame.path);
-        if (!now || !(*now == frame.listing || sameEntries(**now, *frame.listing)))
+        if (!now.ok() || !(*now == frame.listing || sameEntries(**now, *frame.listing)))
             return false;
     }
     return true;

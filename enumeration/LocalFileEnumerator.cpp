@@ -2,6 +2,7 @@
 
 #include "enumeration/FSDirectoryEnumerator.h"
 #include "enumeration/LocalChangesObserverContext.h"
+#include "host/PublishedTrees.h"
 #include "items/LocalItem.h"
 #include "support/Log.h"
 #include "support/LogSection.h"
@@ -196,8 +197,8 @@ void LocalFileEnumerator::gatherPhase(HostPorterEnumerationObserver& observer,
         std::map<std::string, std::string> info = unreadable->userInfo();
         info["description"] =
             "can't list " + enumeratedItemURL_.path() + ": " + unreadable->reason();
-        observer.finishEnumeratingWithError(
-            Error(unreadable->domain(), unreadable->code(), std::move(info)));
+        observer.finishEnumeratingWithError(PublishedTrees::unmarked(
+            Error(unreadable->domain(), unreadable->code(), std::move(info))));
         return;
     }
     logDebug([&] { return "discovered " + std::to_string(items.size()) + " items"; });

@@ -200,8 +200,8 @@ bool LocalRootEnumerator::updateAppLibraries(HostPorterChangeObserver& observer,
 }
 
 void LocalRootEnumerator::saveWorkingSetCache() {
-    if (Status saved = appLibraryManager_->saveToCache())
-        logError("can't save working-set cache to disk; " + saved->description());
+    if (Status saved = appLibraryManager_->saveToCache(); !saved.ok())
+        logError("can't save working-set cache to disk; " + saved.error().description());
 }
 
 void LocalRootEnumerator::currentSyncAnchorWithCompletionHandler(

@@ -38,7 +38,7 @@ Status removeItem(int dirfd, const std::string& name) {
     if (!S_ISDIR(type->mode)) {
         if (fs.unlinkat(dirfd, name, 0) != 0)
             return lastError();
-        return std::nullopt;
+        return Status::OK();
     }
 
     struct Frame {
@@ -95,7 +95,7 @@ Status removeItem(int dirfd, const std::string& name) {
             return error;
         }
     }
-    return std::nullopt;
+    return Status::OK();
 }
 
 // Copies the bytes of one open file into another, in the kernel when it can, else by reading
@@ -107,7 +107,7 @@ static Status copyBytes(int in, int out) {
         if (n > 0)
             continue;
         if (n == 0)
-            return std::nullopt;
+            return Status::OK();
         if (errno == EINTR)
             continue;
         if (errno != EXDEV && errno != EINVAL && errno != ENOSYS && errno != EOPNOTSUPP)
@@ -122,7 +122,7 @@ static Status copyBytes(int in, int out) {
         if (n < 0)
             return lastError();
         if (n == 0)
-            return std::nullopt;
+            return Status::OK();
         for (ssize_t done = 0; done < n;) {
             ssize_t w = fs.write(out, buffer.data() + done, size_t(n - done));
             if (w < 0 && errno == EINTR)
@@ -142,11 +142,11 @@ Status copyFileInto(int fromDir, const std::string& from, int out) {
     ScopedFd in(fs.openat(fromDir, from, O_RDONLY | O_NOFOLLOW | O_NONBLOCK));
     if (!in.ok())
         return lastError();
-    if (Status copied = copyBytes(in.get(), out))
+    if (Status copied = copyBytes(in.get(), out); !copied.ok())
         return copied;
     if (fs.fsync(out) != 0)
         return lastError();
-    return std::nullopt;
+    return Status::OK();
 }
 
 // Imported documents stay editable by their owner, whatever the source allowed.
@@ -180,7 +180,7 @@ static Status copyLink(int fromDir, const std::string& from, int toDir, const st
         return target.error();
     if (FileSystem::current().symlinkat(*target, toDir, to) != 0)
         return lastError();
-    return std::nullopt;
+    return Status::OK();
 }
 
 // Copies what the folder `from` of `fromDir` holds into the existing empty folder `to` of
@@ -240,11 +240,11 @@ Status copyFolderInto(int fromDir, const std::string& from, int toDir, const std
         } else if (S_ISLNK(type->mode)) {
             failure = copyLink(in, name, out, name);
         }
-        if (failure) {
+        if (!failure.ok()) {
             return failure;
         }
     }
-    return std::nullopt;
+    return Status::OK();
 }
 
 }  // namespace tamber::filetree

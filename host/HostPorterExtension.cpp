@@ -48,7 +48,7 @@ void HostPorterExtension::stopProvidingItemAtURL(const Url&) {}
 
 void HostPorterExtension::importDocumentAtURL(const Url&, const HostPorterItemIdentifier&,
                                               ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("import"));
+    completion(unsupportedOperationError("import"));
 }
 
 void HostPorterExtension::createDirectoryWithName(const std::string& name,
@@ -60,19 +60,19 @@ void HostPorterExtension::createDirectoryWithName(const std::string& name,
 void HostPorterExtension::createDirectoryWithName(const std::string&,
                                                   const HostPorterItemIdentifier&, bool,
                                                   ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("create directory"));
+    completion(unsupportedOperationError("create directory"));
 }
 
 void HostPorterExtension::renameItemWithIdentifier(const HostPorterItemIdentifier&,
                                                    const std::string&, ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("rename"));
+    completion(unsupportedOperationError("rename"));
 }
 
 void HostPorterExtension::reparentItemWithIdentifier(const HostPorterItemIdentifier&,
                                                      const HostPorterItemIdentifier&,
                                                      const std::optional<std::string>&,
                                                      ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("move"));
+    completion(unsupportedOperationError("move"));
 }
 
 void HostPorterExtension::deleteItemWithIdentifier(const HostPorterItemIdentifier&,
@@ -82,13 +82,13 @@ void HostPorterExtension::deleteItemWithIdentifier(const HostPorterItemIdentifie
 
 void HostPorterExtension::trashItemWithIdentifier(const HostPorterItemIdentifier&,
                                                   ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("trash"));
+    completion(unsupportedOperationError("trash"));
 }
 
 void HostPorterExtension::untrashItemWithIdentifier(const HostPorterItemIdentifier&,
                                                     const std::optional<HostPorterItemIdentifier>&,
                                                     ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("untrash"));
+    completion(unsupportedOperationError("untrash"));
 }
 
 void HostPorterExtension::removeTrashedItemsOlderThanDate(
@@ -100,18 +100,18 @@ void HostPorterExtension::removeTrashedItemsOlderThanDate(
 void HostPorterExtension::setLastUsedDate(std::shared_ptr<const Date>,
                                           const HostPorterItemIdentifier&,
                                           ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("set last used date"));
+    completion(unsupportedOperationError("set last used date"));
 }
 
 void HostPorterExtension::setTagData(const std::optional<Bytes>&, const HostPorterItemIdentifier&,
                                      ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("set tag data"));
+    completion(unsupportedOperationError("set tag data"));
 }
 
 void HostPorterExtension::setFavoriteRank(std::shared_ptr<const Number>,
                                           const HostPorterItemIdentifier&,
                                           ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("set favorite rank"));
+    completion(unsupportedOperationError("set favorite rank"));
 }
 
 void HostPorterExtension::fetchThumbnailsForItemIdentifiers(
@@ -128,7 +128,7 @@ void HostPorterExtension::fetchThumbnailsForItemIdentifiers(
 
 void HostPorterExtension::defaultApplicationContainerForBundleIdentifier(
     const std::string&, ItemCompletion completion) {
-    completion(nullptr, unsupportedOperationError("default application container"));
+    completion(unsupportedOperationError("default application container"));
 }
 
 void HostPorterExtension::refreshInstalledAppsWithCompletionHandler(

@@ -55,8 +55,8 @@ public:
 
     // Item operations. Every completion is called exactly once, with an item or an error, on
     // whatever thread the operation finishes.
-    using ItemCompletion = std::function<void(HostPorterItemRef item, std::optional<Error> error)>;
-    using ErrorCompletion = std::function<void(std::optional<Error> error)>;
+    using ItemCompletion = std::function<void(Result<HostPorterItemRef> item)>;
+    using ErrorCompletion = std::function<void(Status status)>;
     virtual void importDocumentAtURL(const Url& source, const HostPorterItemIdentifier& parent,
                                      ItemCompletion completion);
     // A taken name bounces to "name 2", ... (as a file browser's new folder does); with

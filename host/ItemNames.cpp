@@ -24,7 +24,7 @@ Status checkItemName(const std::string& name) {
         return nameError(name, "name must not contain a NUL byte");
     if (name == kTrashFolderName)
         return nameError(name, "name '" + name + "' is reserved");
-    return std::nullopt;
+    return Status::OK();
 }
 
 }  // namespace tamber

@@ -84,15 +84,25 @@ std::optional<Url> PublishedTrees::rootOf(const Url& url) {
     return deepest;
 }
 
+// Marks the boundary's refusals, so that they are told apart by a key rather than by their
+// text. An error that wraps one under a description of its own drops the mark: it reports
+// something else.
+constexpr const char* kOutsideKey = "outsidePublishedTrees";
+
 Error PublishedTrees::outsideError(const Url& url) {
     return Error(kHostPorterErrorDomain, kHostPorterNoSuchItem,
-                 {{"description", kOutsideMessage}, {"path", url.path()}});
+                 {{"description", kOutsideMessage}, {"path", url.path()}, {kOutsideKey, "1"}});
 }
 
 bool PublishedTrees::isOutsideError(const Error& error) {
-    auto it = error.userInfo().find("description");
     return error.is(kHostPorterErrorDomain, kHostPorterNoSuchItem) &&
-           it != error.userInfo().end() && it->second == kOutsideMessage;
+           error.userInfo().contains(kOutsideKey);
+}
+
+Error PublishedTrees::unmarked(Error error) {
+    std::map<std::string, std::string> info = error.userInfo();
+    info.erase(kOutsideKey);
+    return Error(error.domain(), error.code(), std::move(info));
 }
 
 Result<int> PublishedTrees::openFolder(const Url& folder, int flags) {
@@ -129,16 +139,16 @@ Status PublishedTrees::check(const Url& url) {
     if (!root)
         return outsideError(url);
     if (root->path() == url.path())
-        return std::nullopt;
+        return Status::OK();
     auto parent = openParent(url, O_PATH);
     if (!parent.ok()) {
         // A missing folder on the way leaves nothing to escape through; only refusals count.
         if (isOutsideError(parent.error()))
             return parent.error();
-        return std::nullopt;
+        return Status::OK();
     }
     ScopedFd opened(parent.value().fd);  // only its opening mattered
-    return std::nullopt;
+    return Status::OK();
 }
 
 }  // namespace tamber

@@ -33,7 +33,11 @@ public:
     static std::optional<Url> rootOf(const Url& url);
 
     static Error outsideError(const Url& url);
+    // Tells a refusal by a mark in its user info, not by its description.
     static bool isOutsideError(const Error& error);
+    // `error` without that mark: for an error that wraps a refusal under a description of its
+    // own, and so reports something else.
+    static Error unmarked(Error error);
 
     // Nothing when `url` is inside: at or below a root, and the folder holding it reachable
     // from that root without a symbolic link. The item itself may be a link, or missing.

@@ -92,8 +92,8 @@ void StagingCopies::record(const std::string& path) {
     if (name.empty())
         return;
     std::string ledger = ledgerDirectory();
-    if (auto error = FileContents::createDirectory(Url::fileURLWithPath(ledger))) {
-        logError("can't create staging ledger " + ledger + "; " + error->description());
+    if (auto status = FileContents::createDirectory(Url::fileURLWithPath(ledger)); !status.ok()) {
+        logError("can't create staging ledger " + ledger + "; " + status.error().description());
         return;
     }
     FileSystem& fs = FileSystem::current();
@@ -139,12 +139,12 @@ size_t StagingCopies::sweepStale() {
             if (parent.ok()) {
                 ScopedFd folder(parent.value().fd);
                 Status status = filetree::removeItem(folder.get(), parent.value().name);
-                if (!status) {
+                if (status.ok()) {
                     ++removed;
                     logInfo("removed stale staging copy " + copy.path());
-                } else if (!status->is(kPosixErrorDomain, ENOENT)) {
+                } else if (!status.error().is(kPosixErrorDomain, ENOENT)) {
                     logError("can't remove stale staging copy " + copy.path() + "; " +
-                             status->description());
+                             status.error().description());
                     continue;  // keep the record: a later sweep tries again
                 }
             }

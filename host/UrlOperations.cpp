@@ -255,8 +255,8 @@ int renameNoReplace(int fromDir, const std::string& from, int toDir, const std::
 Result<Url> moveItem(const Url& url, const Url& folder, const std::optional<std::string>& newName,
                      bool bounce) {
     if (newName) {
-        if (auto bad = checkItemName(*newName))
-            return *bad;
+        if (auto bad = checkItemName(*newName); !bad.ok())
+            return bad.error();
     }
     auto from = PublishedTrees::openParent(url, O_PATH);
     if (!from.ok())
@@ -331,10 +331,10 @@ Result<std::string> copyToTemporary(int fromDir, const std::string& from, const 
         temporary = reserveTemporaryName(
             folder, [&](const std::string& name) { return fs.symlinkat(*target, toDir, name); });
     }
-    if (temporary.ok() && filled) {
+    if (temporary.ok() && !filled.ok()) {
         removeItem(toDir, *temporary);
         StagingCopies::forget(folder.appendingPathComponent(*temporary).path());
-        return *filled;
+        return filled.error();
     }
     return temporary;
 }
@@ -416,8 +416,8 @@ Result<Url> importItem(const Url& source, const Url& folder) {
 }
 
 Result<Url> createFolder(const Url& folder, const std::string& name, bool bounce) {
-    if (auto bad = checkItemName(name))
-        return *bad;
+    if (auto bad = checkItemName(name); !bad.ok())
+        return bad.error();
     auto dir = openFolder(folder);
     if (!dir.ok())
         return dir.error();
@@ -441,10 +441,7 @@ Status deleteItem(const Url& url) {
 void finish(Result<Url> result, const UrlCompletion& completion) {
     if (!completion)
         return;
-    if (result.ok())
-        completion(std::move(result).value(), std::nullopt);
-    else
-        completion(std::nullopt, result.error());
+    completion(std::move(result));
 }
 
 }  // namespace
@@ -491,7 +488,7 @@ Status pt_ensureTrashFolder(const Url& trashFolder) {
     ScopedFd dir(parent.value().fd);
     const std::string& name = parent.value().name;
     if (FileSystem::current().mkdirat(dir.get(), name, 0777) == 0)
-        return std::nullopt;
+        return Status::OK();
     if (errno != EEXIST)
         return lastError();
     auto type = itemTypeAt(dir.get(), name);
@@ -502,7 +499,7 @@ Status pt_ensureTrashFolder(const Url& trashFolder) {
         return PublishedTrees::outsideError(trashFolder);
     if (!S_ISDIR(type->mode))
         return Error::posix(ENOTDIR);
-    return std::nullopt;
+    return Status::OK();
 }
 
 void pt_deleteWithCompletionHandler(const Url& url, const ErrorCompletion& completion) {

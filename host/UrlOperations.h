@@ -32,7 +32,7 @@ Result<uint64_t> pt_directorySizeWithError(const Url& url);
 bool pt_withReadWriteAccess(const Url& url, const std::function<bool(int fd)>& body);
 
 // The file operations below run on the calling thread and call their completion exactly once,
-// before returning, with the resulting URL or an error (never both, never neither).
+// before returning, with the resulting URL or the error.
 //
 // Every operation works only inside the published trees (see PublishedTrees): a source item,
 // a destination folder or a folder to create in that lies outside them, or is reached through a
@@ -46,8 +46,8 @@ bool pt_withReadWriteAccess(const Url& url, const std::function<bool(int fd)>& b
 // is never followed when it is a symbolic link, and walks never follow links inside a folder.
 // Moves are single renames: an item is never left in two places or in none, and a move to
 // another file system fails with EXDEV instead of copying.
-using UrlCompletion = std::function<void(std::optional<Url>, std::optional<Error>)>;
-using ErrorCompletion = std::function<void(std::optional<Error>)>;
+using UrlCompletion = std::function<void(Result<Url>)>;
+using ErrorCompletion = std::function<void(Status)>;
 
 // Copies `source` (a file, a folder with everything below it, or a symbolic link as a link)
 // into `folder` under its own name, bouncing. The source may lie anywhere; `folder` must be

@@ -42,7 +42,7 @@ Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::str
     FileSystem& fs = FileSystem::current();
     if (!data) {
         if (fs.fremovexattr(fd, name) == 0 || errno == ENODATA) {
-            return std::nullopt;
+            return Status::OK();
         }
         Error error = Error::errorWithPOSIXCode(errno);
         logAt(levelUnless(EACCES, error),
@@ -50,7 +50,7 @@ Status SetOrRemoveXattr(int fd, const std::optional<Bytes>& data, const std::str
         return error;
     }
     if (fs.fsetxattr(fd, name, data->data(), data->size(), 0) == 0) {
-        return std::nullopt;
+        return Status::OK();
     }
     Error error = Error::errorWithPOSIXCode(errno);
     logAt(levelUnless(EACCES, error), "can't set xattr \"" + name + "\"; " + error.description());

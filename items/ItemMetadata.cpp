@@ -186,15 +186,15 @@ Status ItemMetadata::writeAttributeData(const Url& url, const std::string& name,
     Status written;
     bool ok = pt_withReadWriteAccess(url, [&](int fd) {
         written = SetOrRemoveXattr(fd, data, name);
-        if (written)
+        if (!written.ok())
             return false;
         noteWritten(fd, data, name);
         return true;
     });
     if (ok)
-        return std::nullopt;
+        return Status::OK();
     // The attribute call's own error when it was the one that failed, else the access's.
-    Error error = written.value_or(Error::errorWithPOSIXCode(errno));
+    Error error = written.ok() ? Error::errorWithPOSIXCode(errno) : written.error();
     logError("can't set xattr " + name + " on " + url.absoluteString() + "; " +
              error.description());
     return error;

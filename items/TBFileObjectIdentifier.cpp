@@ -102,7 +102,7 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     }
     // Reached through a link below a root: not an item of ours (outside the trees is logged
     // below).
-    if (PublishedTrees::rootOf(url) && PublishedTrees::check(url)) {
+    if (PublishedTrees::rootOf(url) && !PublishedTrees::check(url).ok()) {
         logFormat(LogLevel::Info, "can't compute file object identifier for \"%@\"; %@",
                   {url.path(), std::string(PublishedTrees::kOutsideMessage)});
         return std::nullopt;
@@ -173,11 +173,12 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     bool isDocument = type == 0x8000 || (type == 0x4000 && isPackage);
     if (!isDocument) {
         fd.reset();
-        if (auto error = url.setResourceValue(Number::fromUInt64(attributes.fileId),
-                                              ResourceKeys::kFileID)) {
+        if (auto status =
+                url.setResourceValue(Number::fromUInt64(attributes.fileId), ResourceKeys::kFileID);
+            !status.ok()) {
             logFormat(LogLevel::Info,
                       "can't cache value %@ for key HostURLFileResourceIdentifierKey; %@",
-                      {std::to_string(attributes.fileId), error->description()});
+                      {std::to_string(attributes.fileId), status.error().description()});
         }
         return TBPFileObjectIdentifier::fromFileID(attributes.fileId);
     }
@@ -191,9 +192,10 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
     }
     fd.reset();
     if (auto error =
-            url.setResourceValue(Number::fromUInt64(documentId), ResourceKeys::kDocumentID)) {
+            url.setResourceValue(Number::fromUInt64(documentId), ResourceKeys::kDocumentID);
+        !error.ok()) {
         logFormat(LogLevel::Info, "can't cache value %@ for key HostURLDocumentIdentifierKey; %@",
-                  {std::to_string(documentId), error->description()});
+                  {std::to_string(documentId), error.error().description()});
     }
     return TBPFileObjectIdentifier::fromDocumentID(documentId);
 }
@@ -274,7 +276,7 @@ std::optional<Url> TBFileObjectIdentifier::_fileURLWithFileIdentifier(uint64_t f
     Url url = Url::fileURLWithPath(buffer);
     // The journal may remember trees no longer published, and a path that now runs through a
     // link: neither names an item.
-    if (auto outside = PublishedTrees::check(url)) {
+    if (auto outside = PublishedTrees::check(url); !outside.ok()) {
         logFormat(LogLevel::Info, "file ID \"%lld\" resolves to \"%@\"; %@",
                   {int64_t(fileID), url.path(), std::string(PublishedTrees::kOutsideMessage)});
         return std::nullopt;

@@ -108,7 +108,7 @@ Result<Bytes> FileContents::read(const Url& url) {
 Status FileContents::createDirectory(const Url& url) {
     if (!makeDirectories(url.path()))
         return Error::errorWithPOSIXCode(errno);
-    return std::nullopt;
+    return Status::OK();
 }
 
 Status FileContents::writeAtomically(const Url& url, const Bytes& bytes) {
@@ -138,7 +138,7 @@ Status FileContents::writeAtomically(const Url& url, const Bytes& bytes) {
     else if (fd.close() != 0)
         ok = false;
     if (ok && fs.renameat2(AT_FDCWD, temporary, AT_FDCWD, url.path(), 0) == 0)
-        return std::nullopt;
+        return Status::OK();
 
     Error error = Error::errorWithPOSIXCode(errno);
     fs.unlinkat(AT_FDCWD, temporary, 0);

@@ -162,7 +162,7 @@ Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<R
         } else if (key == K::kIsReadable || key == K::kIsWritable) {
             Result<bool> allowed =
                 access(path, key == K::kIsReadable ? R_OK : W_OK, isSymbolicLink);
-            if (!allowed)
+            if (!allowed.ok())
                 return allowed.error();
             value = Number::fromBool(*allowed);
         } else if (key == K::kIsDirectory) {

@@ -182,14 +182,14 @@ Result<ObjectRef> Url::resourceValue(ResourceKey key) const {
             // as for every other key.
             Result<std::vector<ObjectRef>> exists =
                 ResourceValues::read(storage_->text, {ResourceKeys::kFileID});
-            if (!exists)
+            if (!exists.ok())
                 return exists.error();
             return ObjectRef();
         }
         value = Number::fromUInt64(*id);
     } else {
         Result<std::vector<ObjectRef>> values = ResourceValues::read(storage_->text, {key});
-        if (!values)
+        if (!values.ok())
             return values.error();
         value = std::move(values->front());
     }
@@ -213,7 +213,7 @@ Status Url::setResourceValue(const ObjectRef& value, ResourceKey key) const {
     }
     std::lock_guard lock(storage_->mutex);
     storage_->cache.insert_or_assign(std::string(key), value);
-    return std::nullopt;
+    return Status::OK();
 }
 
 Status Url::prefetchResourceValues(const std::vector<ResourceKey>& keys) const {
@@ -241,7 +241,7 @@ Status Url::prefetchResourceValues(const std::vector<ResourceKey>& keys) const {
     std::vector<ObjectRef> values;
     if (!fromFile.empty()) {
         Result<std::vector<ObjectRef>> read = ResourceValues::read(storage_->text, fromFile);
-        if (!read)
+        if (!read.ok())
             return read.error();
         values = std::move(*read);
     }
@@ -256,11 +256,11 @@ Status Url::prefetchResourceValues(const std::vector<ResourceKey>& keys) const {
 
     std::lock_guard lock(storage_->mutex);
     if (storage_->generation != generation)
-        return std::nullopt;
+        return Status::OK();
     for (size_t i = 0; i < fromFile.size(); ++i) {
         storage_->cache.try_emplace(std::string(fromFile[i]), std::move(values[i]));
     }
-    return std::nullopt;
+    return Status::OK();
 }
 
 void Url::removeCachedResourceValue(ResourceKey key) const {

@@ -63,8 +63,8 @@ void LocalPorter::installPacerHandler() {
 LocalPorter::LocalItemRef LocalPorter::temporaryLocalFolderItem() {
     Url url = HostPorterManager::defaultManager()->documentStorageURL().appendingPathComponent(
         kTemporaryLocalFolderName);
-    if (auto error = FileContents::createDirectory(url)) {
-        logError("can't create temporary directory; " + error->description());
+    if (auto status = FileContents::createDirectory(url); !status.ok()) {
+        logError("can't create temporary directory; " + status.error().description());
         return nullptr;
     }
     return LocalItem::make(url);
@@ -178,9 +178,9 @@ Result<HostPorterItemRef> LocalPorter::itemAtURL(const Url& url) {
 }
 
 Result<LocalPorter::LocalItemRef> LocalPorter::itemForURL(const Url& url) {
-    if (auto outside = PublishedTrees::check(url)) {
+    if (auto outside = PublishedTrees::check(url); !outside.ok()) {
         logDebug([&] { return "\"" + url.path() + "\" is " + PublishedTrees::kOutsideMessage; });
-        return *outside;
+        return outside.error();
     }
     auto identifier = identifierForURLLogged(url);
     if (!identifier) {

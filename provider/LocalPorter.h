@@ -12,6 +12,7 @@
 #include "platform/apps/AppRecord.h"
 #include "support/DispatchQueue.h"
 #include "support/Pacer.h"
+#include "support/Result.h"
 
 namespace tamber {
 

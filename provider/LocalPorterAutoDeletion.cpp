@@ -110,8 +110,8 @@ void LocalPorter::sweepTrash(std::shared_ptr<const Date> referenceDate,
                        " was trashed before reference date, let's remove it";
             });
             group->enter();
-            deleteItemWithIdentifier(*identifier, [group, removed](std::optional<Error> error) {
-                if (!error)
+            deleteItemWithIdentifier(*identifier, [group, removed](Status status) {
+                if (status.ok())
                     ++*removed;
                 group->leave();
             });

@@ -13,15 +13,15 @@ void LocalPorter::_defaultApplicationContainerForBundleIdentifier(
         auto record = BundleRecord::bundleRecordWithBundleIdentifier(bundleIdentifier);
         if (!record) {
             logError("can't create bundle proxy with '" + bundleIdentifier + "'");
-            return completion(nullptr, Error::invalidParameter("bundleIdentifier"));
+            return completion(Error::invalidParameter("bundleIdentifier"));
         }
         // An installed app without a data container has no library to show.
         auto item = LocalAppLibraryItem::initFrom(record);
         if (!item) {
             logError("can't create an app library item with " + record->description());
-            return completion(nullptr, Error::invalidParameter("bundleIdentifier"));
+            return completion(Error::invalidParameter("bundleIdentifier"));
         }
-        completion(item, std::nullopt);
+        completion(LocalItemRef(item));
     });
 }
 

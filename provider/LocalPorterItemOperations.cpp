@@ -24,38 +24,35 @@ bool isFixedContainer(const HostPorterItemIdentifier& identifier) {
 }
 
 // Turns the outcome of a host file operation into the completion of an item operation.
-void finishWithItem(LocalPorter& porter, const std::optional<Url>& url,
-                    const std::optional<Error>& error,
+void finishWithItem(LocalPorter& porter, const Result<Url>& url,
                     const LocalPorter::ItemCompletion& completion) {
-    if (error || !url) {
-        completion(nullptr, error.value_or(Error::posix(EIO)));
+    if (!url.ok()) {
+        completion(url.error());
         return;
     }
-    auto item = porter.itemForURL(*url);
+    auto item = porter.itemForURL(url.value());
     if (!item.ok()) {
-        completion(nullptr, item.error());
+        completion(item.error());
         return;
     }
-    completion(item.value(), std::nullopt);
+    completion(item.value());
 }
 
 }  // namespace
 
 void LocalPorter::importDocumentAtURL(const Url& source, const HostPorterItemIdentifier& parent,
                                       ItemCompletion completion) {
-    withLogSection("import document at \"" + source.path() + "\" to parent \"" + parent + "\"",
-                   [&] {
-                       if (isRootContainer(parent))
-                           return completion(nullptr, Error::errorFileWriteNoPermission());
-                       auto folder = urlForIdentifierLogged(parent);
-                       if (!folder.ok())
-                           return completion(nullptr, folder.error());
-                       pt_importUnderFolder(
-                           source, folder.value(),
-                           [this, completion](std::optional<Url> url, std::optional<Error> error) {
-                               finishWithItem(*this, url, error, completion);
-                           });
-                   });
+    withLogSection(
+        "import document at \"" + source.path() + "\" to parent \"" + parent + "\"", [&] {
+            if (isRootContainer(parent))
+                return completion(Error::errorFileWriteNoPermission());
+            auto folder = urlForIdentifierLogged(parent);
+            if (!folder.ok())
+                return completion(folder.error());
+            pt_importUnderFolder(source, folder.value(), [this, completion](Result<Url> url) {
+                finishWithItem(*this, url, completion);
+            });
+        });
 }
 
 void LocalPorter::createDirectoryWithName(const std::string& name,
@@ -69,14 +66,13 @@ void LocalPorter::createDirectoryWithName(const std::string& name,
                                           ItemCompletion completion) {
     withLogSection("create directory with name \"" + name + "\" in parent \"" + parent + "\"", [&] {
         if (isRootContainer(parent))
-            return completion(nullptr, Error::errorFileWriteNoPermission());
+            return completion(Error::errorFileWriteNoPermission());
         auto folder = urlForIdentifierLogged(parent);
         if (!folder.ok())
-            return completion(nullptr, folder.error());
-        pt_createSubFolder(folder.value(), name, bounce,
-                           [this, completion](std::optional<Url> url, std::optional<Error> error) {
-                               finishWithItem(*this, url, error, completion);
-                           });
+            return completion(folder.error());
+        pt_createSubFolder(folder.value(), name, bounce, [this, completion](Result<Url> url) {
+            finishWithItem(*this, url, completion);
+        });
     });
 }
 
@@ -84,15 +80,13 @@ void LocalPorter::renameItemWithIdentifier(const HostPorterItemIdentifier& ident
                                            const std::string& name, ItemCompletion completion) {
     withLogSection("rename item \"" + identifier + "\" to name \"" + name + "\"", [&] {
         if (isFixedContainer(identifier))
-            return completion(nullptr, Error::errorFileWriteNoPermission());
+            return completion(Error::errorFileWriteNoPermission());
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok())
-            return completion(nullptr, url.error());
-        pt_renameWithNewName(
-            url.value(), name,
-            [this, completion](std::optional<Url> renamed, std::optional<Error> error) {
-                finishWithItem(*this, renamed, error, completion);
-            });
+            return completion(url.error());
+        pt_renameWithNewName(url.value(), name, [this, completion](Result<Url> renamed) {
+            finishWithItem(*this, renamed, completion);
+        });
     });
 }
 
@@ -102,19 +96,16 @@ void LocalPorter::reparentItemWithIdentifier(const HostPorterItemIdentifier& ide
                                              ItemCompletion completion) {
     withLogSection("move item \"" + identifier + "\" to parent \"" + parent + "\"", [&] {
         if (isRootContainer(parent) || isFixedContainer(identifier))
-            return completion(nullptr, Error::errorFileWriteNoPermission());
+            return completion(Error::errorFileWriteNoPermission());
         auto url = _urlForItemWithPersistentIdentifier(identifier);
         if (!url)
-            return completion(nullptr,
-                              Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+            return completion(Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         auto folder = _urlForItemWithPersistentIdentifier(parent);
         if (!folder)
-            return completion(nullptr, Error::porterErrorForNonExistentItemWithIdentifier(parent));
-        pt_reparentUnderFolder(
-            *url, *folder, newName,
-            [this, completion](std::optional<Url> moved, std::optional<Error> error) {
-                finishWithItem(*this, moved, error, completion);
-            });
+            return completion(Error::porterErrorForNonExistentItemWithIdentifier(parent));
+        pt_reparentUnderFolder(*url, *folder, newName, [this, completion](Result<Url> moved) {
+            finishWithItem(*this, moved, completion);
+        });
     });
 }
 
@@ -126,8 +117,7 @@ void LocalPorter::deleteItemWithIdentifier(const HostPorterItemIdentifier& ident
         auto url = _urlForItemWithPersistentIdentifier(identifier);
         if (!url)
             return completion(Error::porterErrorForNonExistentItemWithIdentifier(identifier));
-        pt_deleteWithCompletionHandler(
-            *url, [completion](std::optional<Error> error) { completion(error); });
+        pt_deleteWithCompletionHandler(*url, completion);
     });
 }
 

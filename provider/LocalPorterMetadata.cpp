@@ -23,8 +23,8 @@ void completeWithItem(LocalPorter& porter, const Url& url,
                       const LocalPorter::ItemCompletion& completion) {
     auto item = porter.itemForURL(url);
     if (!item.ok())
-        return completion(nullptr, item.error());
-    completion(item.value(), std::nullopt);
+        return completion(item.error());
+    completion(item.value());
 }
 
 }  // namespace
@@ -41,14 +41,14 @@ void LocalPorter::setLastUsedDate(std::shared_ptr<const Date> date,
             Error refused = Error::invalidParameter("itemIdentifier", identifier);
             std::map<std::string, std::string> info = refused.userInfo();
             info["description"] = "an app library has no last-used date: " + identifier;
-            return completion(nullptr, Error(refused.domain(), refused.code(), std::move(info)));
+            return completion(Error(refused.domain(), refused.code(), std::move(info)));
         }
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok())
-            return completion(nullptr, url.error());
+            return completion(url.error());
         // Logged by the writer.
-        if (auto error = ItemMetadata::writeLastUsedDate(url.value(), date))
-            return completion(nullptr, updateFailed(*error, "set the last-used date", identifier));
+        if (auto status = ItemMetadata::writeLastUsedDate(url.value(), date); !status.ok())
+            return completion(updateFailed(status.error(), "set the last-used date", identifier));
         completeWithItem(*this, url.value(), completion);
     });
 }
@@ -60,12 +60,11 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok()) {
             logError("can't find URL for item; " + url.error().description());
-            return completion(nullptr,
-                              Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+            return completion(Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         }
         // Logged by the writer; no tags is written as an empty list, never a removal.
-        if (auto error = ItemMetadata::writeTagData(url.value(), tagData))
-            return completion(nullptr, updateFailed(*error, "set the tags", identifier));
+        if (auto error = ItemMetadata::writeTagData(url.value(), tagData); !error.ok())
+            return completion(updateFailed(error.error(), "set the tags", identifier));
         completeWithItem(*this, url.value(), completion);
     });
 }
@@ -73,34 +72,33 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
 void LocalPorter::setFavoriteRank(std::shared_ptr<const Number> rank,
                                   const HostPorterItemIdentifier& identifier,
                                   ItemCompletion completion) {
-    withLogSection("set favorite rank \"" + (rank ? rank->description() : std::string("nil")) +
-                       "\" to item \"" + identifier,
-                   [&] {
-                       auto url = urlForIdentifierLogged(identifier);
-                       if (!url.ok()) {
-                           logError("can't find URL for item; " + url.error().description());
-                           return completion(
-                               nullptr,
-                               Error::porterErrorForNonExistentItemWithIdentifier(identifier));
-                       }
-                       if (auto error = ItemMetadata::writeFavoriteRank(url.value(), rank))
-                           return completion(
-                               nullptr, updateFailed(*error, "set the favourite rank", identifier));
-                       completeWithItem(*this, url.value(), completion);
-                   });
+    withLogSection(
+        "set favorite rank \"" + (rank ? rank->description() : std::string("nil")) +
+            "\" to item \"" + identifier,
+        [&] {
+            auto url = urlForIdentifierLogged(identifier);
+            if (!url.ok()) {
+                logError("can't find URL for item; " + url.error().description());
+                return completion(Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+            }
+            if (auto error = ItemMetadata::writeFavoriteRank(url.value(), rank); !error.ok())
+                return completion(
+                    updateFailed(error.error(), "set the favourite rank", identifier));
+            completeWithItem(*this, url.value(), completion);
+        });
 }
 
 Status LocalPorter::changeMetadataAtURL(const Url& url, const MetadataChanges& changes) {
     if (changes.favoriteRank)
-        if (auto error = ItemMetadata::writeFavoriteRank(url, *changes.favoriteRank))
+        if (auto error = ItemMetadata::writeFavoriteRank(url, *changes.favoriteRank); !error.ok())
             return error;
     if (changes.lastUsedDate)
-        if (auto error = ItemMetadata::writeLastUsedDate(url, *changes.lastUsedDate))
+        if (auto error = ItemMetadata::writeLastUsedDate(url, *changes.lastUsedDate); !error.ok())
             return error;
     if (changes.tagData)
-        if (auto error = ItemMetadata::writeTagData(url, *changes.tagData))
+        if (auto error = ItemMetadata::writeTagData(url, *changes.tagData); !error.ok())
             return error;
-    return std::nullopt;
+    return Status::OK();
 }
 
 ItemMetadata LocalPorter::metadataAtURL(const Url& url) {

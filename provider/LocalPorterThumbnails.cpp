@@ -197,7 +197,7 @@ void LocalPorter::fetchThumbnailsForItemIdentifiers(
     withLogSection("fetching thumbnails for " + identifierList(identifiers), [&] {
         for (const auto& identifier : identifiers)
             perThumbnailCompletion(identifier, thumbnailFor(*this, identifier), std::nullopt);
-        completion(std::nullopt);
+        completion(Status::OK());
     });
 }
 
@@ -209,7 +209,7 @@ void LocalPorter::fetchThumbnailsForItemIdentifiers(
         const std::string type(ImageEncoder::kPNGType);
         for (const auto& identifier : identifiers)
             perThumbnailCompletion(identifier, thumbnailFor(*this, identifier), type, std::nullopt);
-        completion(std::nullopt);
+        completion(Status::OK());
     });
 }
 

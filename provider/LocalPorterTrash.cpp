@@ -42,9 +42,9 @@ void setPutBackString(const Url& trashedURL, const Url& originalURL) {
     }
     logDebug(
         [&] { return "setting putback '" + *relative + "' on " + trashedURL.absoluteString(); });
-    if (auto error = ItemMetadata::writePutBack(trashedURL, String::make(*relative)))
+    if (auto error = ItemMetadata::writePutBack(trashedURL, String::make(*relative)); !error.ok())
         logError("couldn't set putback xattr (" + *relative + ") on " +
-                 trashedURL.absoluteString() + "; " + error->description());
+                 trashedURL.absoluteString() + "; " + error.error().description());
 }
 
 bool isReachableFolder(const Url& url) {
@@ -62,46 +62,43 @@ void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identi
     withLogSection("trash item \"" + identifier + "\"", [&] {
         auto url = _urlForItemWithPersistentIdentifier(identifier);
         if (!url)
-            return completion(nullptr,
-                              Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+            return completion(Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         // Trashing a library or the storage itself would move it into its own trash.
         auto kind = ItemIdentifier::parse(identifier).kind();
         if (kind == ItemIdentifier::Kind::RootContainer || kind == ItemIdentifier::Kind::AppLibrary)
-            return completion(nullptr, Error::errorFileWriteNoPermission());
+            return completion(Error::errorFileWriteNoPermission());
 
         auto components = componentsThroughFirstDocuments(*url);
         if (!components) {
             logError("no Documents directory found in path \"" + url->path() + "\"");
-            return completion(nullptr, Error::invalidParameter("sourceURL", url->path()));
+            return completion(Error::invalidParameter("sourceURL", url->path()));
         }
         auto documents = urlFromPathComponents(*components);
         if (!documents) {
             logError("can't build trash URL from components \"" + joinedComponents(*components) +
                      "\"");
             return completion(
-                nullptr, Error::invalidParameter("trashComponents", joinedComponents(*components)));
+                Error::invalidParameter("trashComponents", joinedComponents(*components)));
         }
         Url trash = documents->appendingPathComponent(kTrashFolderName);
         logDebug([&] { return "trash is located at \"" + trash.path() + "\""; });
         // Made beneath the library without following links; a linked .Trash is refused
         // before anything moves.
-        if (auto error = pt_ensureTrashFolder(trash))
-            return completion(nullptr, *error);
+        if (auto status = pt_ensureTrashFolder(trash); !status.ok())
+            return completion(status.error());
 
         Url original = *url;
-        pt_trashUnderFolder(
-            original, trash,
-            [this, original, completion](std::optional<Url> trashed, std::optional<Error> error) {
-                if (error || !trashed)
-                    return completion(nullptr, error.value_or(Error::posix(EIO)));
-                // The move stands whatever happens to the attributes.
-                (void)ItemMetadata::writeTrashDate(*trashed, Date::now());
-                setPutBackString(*trashed, original);
-                auto item = itemForURL(*trashed);
-                if (!item.ok())
-                    return completion(nullptr, item.error());
-                completion(item.value(), std::nullopt);
-            });
+        pt_trashUnderFolder(original, trash, [this, original, completion](Result<Url> trashed) {
+            if (!trashed.ok())
+                return completion(trashed.error());
+            // The move stands whatever happens to the attributes.
+            (void)ItemMetadata::writeTrashDate(trashed.value(), Date::now());
+            setPutBackString(trashed.value(), original);
+            auto item = itemForURL(trashed.value());
+            if (!item.ok())
+                return completion(item.error());
+            completion(item.value());
+        });
     });
 }
 
@@ -111,17 +108,16 @@ void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& iden
     withLogSection("untrash item \"" + identifier + "\"", [&] {
         auto url = _urlForItemWithPersistentIdentifier(identifier);
         if (!url)
-            return completion(nullptr,
-                              Error::porterErrorForNonExistentItemWithIdentifier(identifier));
+            return completion(Error::porterErrorForNonExistentItemWithIdentifier(identifier));
         auto item = itemForURL(*url);
         if (!item.ok())
-            return completion(nullptr, item.error());
+            return completion(item.error());
         if (!item.value()->isTrashed()) {
             logDebug("item is not in trash");
-            return completion(nullptr, Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
-                                             {{"parameter", "itemIdentifier"},
-                                              {"value", identifier},
-                                              {"description", "item is not in the trash"}}));
+            return completion(Error(kHostPorterErrorDomain, kHostPorterInvalidParameter,
+                                    {{"parameter", "itemIdentifier"},
+                                     {"value", identifier},
+                                     {"description", "item is not in the trash"}}));
         }
 
         std::optional<Url> destination;
@@ -165,23 +161,20 @@ void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& iden
         if (!destination) {
             logError("can't compute valid parent URL for " + url->absoluteString() +
                      "; it is in no library");
-            return completion(nullptr,
-                              makeLocalPorterError(LocalPorterError::invalidItemURL, url->path()));
+            return completion(makeLocalPorterError(LocalPorterError::invalidItemURL, url->path()));
         }
 
-        pt_reparentUnderFolder(
-            *url, *destination, true,
-            [this, completion](std::optional<Url> restored, std::optional<Error> error) {
-                if (error || !restored)
-                    return completion(nullptr, error.value_or(Error::posix(EIO)));
-                // Only the date goes; the next trashing rewrites the put-back path anyway.
-                logDebug("removing trash date xattr");
-                (void)ItemMetadata::writeTrashDate(*restored, nullptr);
-                auto restoredItem = itemForURL(*restored);
-                if (!restoredItem.ok())
-                    return completion(nullptr, restoredItem.error());
-                completion(restoredItem.value(), std::nullopt);
-            });
+        pt_reparentUnderFolder(*url, *destination, true, [this, completion](Result<Url> restored) {
+            if (!restored.ok())
+                return completion(restored.error());
+            // Only the date goes; the next trashing rewrites the put-back path anyway.
+            logDebug("removing trash date xattr");
+            (void)ItemMetadata::writeTrashDate(restored.value(), nullptr);
+            auto restoredItem = itemForURL(restored.value());
+            if (!restoredItem.ok())
+                return completion(restoredItem.error());
+            completion(restoredItem.value());
+        });
     });
 }
 

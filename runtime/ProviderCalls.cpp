@@ -9,10 +9,8 @@ namespace tamber {
 Result<HostPorterItemRef> ProviderCalls::waitForItem(const ItemStarter& start) {
     using ItemResult = Result<HostPorterItemRef>;
     auto waiter = std::make_shared<CompletionWaiter<ItemResult>>();
-    start([waiter](HostPorterItemRef item, std::optional<Error> error) {
-        if (error)
-            waiter->finish(*error);
-        else if (!item)
+    start([waiter](Result<HostPorterItemRef> item) {
+        if (item.ok() && !item.value())  // a provider's bug: no item and no error
             waiter->finish(Error::porterErrorForNonExistentItemWithIdentifier(""));
         else
             waiter->finish(std::move(item));
@@ -22,7 +20,7 @@ Result<HostPorterItemRef> ProviderCalls::waitForItem(const ItemStarter& start) {
 
 Status ProviderCalls::waitForStatus(const ErrorStarter& start) {
     auto waiter = std::make_shared<CompletionWaiter<Status>>();
-    start([waiter](std::optional<Error> error) { waiter->finish(std::move(error)); });
+    start([waiter](Status status) { waiter->finish(std::move(status)); });
     return waiter->wait();
 }
 

@@ -48,11 +48,11 @@ Status ProviderRuntime::prepareStorage() {
     if (stopped_)
         return stoppedError();
     if (storagePrepared_)
-        return std::nullopt;
+        return Status::OK();
     std::string path = options_.storagePath.empty() ? defaultStoragePath() : options_.storagePath;
     storage_ = Url::fileURLWithPath(path);
-    if (auto failure = FileContents::createDirectory(storage_)) {
-        const Error& error = *failure;
+    if (auto failure = FileContents::createDirectory(storage_); !failure.ok()) {
+        const Error& error = failure.error();
         logError("can't create document storage folder " + storage_.path() + "; " +
                  error.description());
         return Error(error.domain(), error.code(),
@@ -72,7 +72,7 @@ Status ProviderRuntime::prepareStorage() {
             }));
     installedManager_ = true;
     storagePrepared_ = true;
-    return std::nullopt;
+    return Status::OK();
 }
 
 Result<std::shared_ptr<TremorService>> ProviderRuntime::startJournal() {
@@ -96,9 +96,9 @@ Result<std::shared_ptr<TremorService>> ProviderRuntime::startJournal() {
         TremorService::kDefaultQueueLimit, std::move(lockWait));
     if (!service.ok())
         return service.error();
-    if (auto error = TremorService::installShared(service.value())) {
+    if (auto error = TremorService::installShared(service.value()); !error.ok()) {
         service.value()->shutdown();
-        return *error;
+        return error.error();
     }
     journal_ = service.value();
     ownsJournal_ = true;
@@ -107,7 +107,7 @@ Result<std::shared_ptr<TremorService>> ProviderRuntime::startJournal() {
 
 Status ProviderRuntime::prepareJournal() {
     std::lock_guard lock(mutex_);
-    if (auto error = prepareStorage())
+    if (auto error = prepareStorage(); !error.ok())
         return error;
     auto service = startJournal();
     if (!service.ok())
@@ -121,16 +121,16 @@ Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
         return stoppedError();
     if (porter_)
         return porter_;
-    if (auto error = prepareJournal())
-        return *error;
+    if (auto error = prepareJournal(); !error.ok())
+        return error.error();
     previousLookup_ = SharedAppLibraryLookup::install();
     installedLookup_ = true;
     auto porter = LocalPorter::create();
     refreshOutcome_ = porter->refreshAppLibraries();
     // Identifiers inside app libraries need their trees journaled like the storage folder.
     for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries()) {
-        if (auto error = journal_->watchTree(root.path()))
-            logError("can't watch app library " + root.path() + "; " + error->description());
+        if (auto error = journal_->watchTree(root.path()); !error.ok())
+            logError("can't watch app library " + root.path() + "; " + error.error().description());
     }
     StagingCopies::sweepStale();  // copies left by imports that were killed part-way
     porter_ = porter;

@@ -261,7 +261,7 @@ Status BinaryPlistValidator::validate(const uint8_t* data, size_t size, const Li
     Expansion expansion;
     if (!walk.visit(root, 1, expansion))
         return invalid(walk.failure());
-    return std::nullopt;
+    return Status::OK();
 }
 
 }  // namespace tamber

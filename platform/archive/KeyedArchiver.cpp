@@ -20,7 +20,7 @@ public:
     uint64_t encodeReference(const ObjectRef& object);
     void setValue(std::string_view key, PlistNode value);
     void fail(Error error) {
-        if (!error_)
+        if (error_.ok())
             error_ = std::move(error);
     }
     Result<Bytes> finish(uint64_t rootUid);
@@ -85,7 +85,7 @@ uint64_t KeyedArchiver::Impl::appendObject(const ObjectRef& object, PlistNode no
 }
 
 uint64_t KeyedArchiver::Impl::encodeReference(const ObjectRef& object) {
-    if (error_ || !object)
+    if (!error_.ok() || !object)
         return 0;
     if (auto it = uids_.find(object.get()); it != uids_.end())
         return it->second.second;
@@ -120,7 +120,7 @@ uint64_t KeyedArchiver::Impl::encodeReference(const ObjectRef& object) {
         return 0;
     }
     uint64_t classReference = classUid(*archiveClass);
-    if (error_)
+    if (!error_.ok())
         return 0;
 
     // Appended before its fields are encoded: the node stays where it is, and the UID is known
@@ -141,7 +141,7 @@ uint64_t KeyedArchiver::Impl::encodeReference(const ObjectRef& object) {
 }
 
 void KeyedArchiver::Impl::setValue(std::string_view key, PlistNode value) {
-    if (error_)
+    if (!error_.ok())
         return;
     if (!current_) {
         fail(archiveError(ArchiveErrorCode::UnencodableValue, "value encoded outside an object"));
@@ -156,8 +156,8 @@ void KeyedArchiver::Impl::setValue(std::string_view key, PlistNode value) {
 }
 
 Result<Bytes> KeyedArchiver::Impl::finish(uint64_t rootUid) {
-    if (error_)
-        return *error_;
+    if (!error_.ok())
+        return error_.error();
     PlistNode top = PlistNode::dictionary();
     PlistNode::set(top.get(), "$archiver", PlistNode::string("KeyedArchiver"));
     PlistNode::set(top.get(), "$version", PlistNode::unsignedInteger(100000));

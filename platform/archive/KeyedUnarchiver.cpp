@@ -34,10 +34,10 @@ public:
     std::optional<std::vector<uint64_t>> uidArray(plist_t value);
     plist_t member(std::string_view key) const { return PlistNode::member(current_, key); }
     void fail(Error error) {
-        if (!error_)
+        if (error_.ok())
             error_ = std::move(error);
     }
-    bool failed() const { return error_.has_value(); }
+    bool failed() const { return !error_.ok(); }
 
     // While decoding a field its class asked for by class.
     void pushClasses(const std::vector<std::string>& classes) {
@@ -101,7 +101,7 @@ Status KeyedUnarchiver::Impl::checkTopLevel(plist_t top, uint64_t& rootUid) {
     if (count_ == 0 || PlistNode::stringValue(objects_[0]) != "$null")
         return shape("$objects does not start with $null");
     rootUid = *root;
-    return std::nullopt;
+    return Status::OK();
 }
 
 Result<ObjectRef> KeyedUnarchiver::Impl::run(const Bytes& data) {
@@ -117,11 +117,11 @@ Result<ObjectRef> KeyedUnarchiver::Impl::run(const Bytes& data) {
     }
     top_ = std::move(parsed).value();
     uint64_t rootUid = 0;
-    if (auto bad = checkTopLevel(top_.get(), rootUid))
-        return *bad;
+    if (auto bad = checkTopLevel(top_.get(), rootUid); !bad.ok())
+        return bad.error();
     ObjectRef root = decodeUid(rootUid);
-    if (error_)
-        return *error_;
+    if (!error_.ok())
+        return error_.error();
     return root;
 }
 
@@ -196,7 +196,7 @@ ObjectRef KeyedUnarchiver::Impl::decodeFields(uint64_t uid, plist_t fields,
     ObjectRef object = archiveClass.decode(unarchiver);
     --depth_;
     current_ = saved;
-    if (error_)
+    if (!error_.ok())
         return nullptr;
     if (!object)
         fail(archiveError(ArchiveErrorCode::InvalidValue,
@@ -205,7 +205,7 @@ ObjectRef KeyedUnarchiver::Impl::decodeFields(uint64_t uid, plist_t fields,
 }
 
 ObjectRef KeyedUnarchiver::Impl::decodeUid(uint64_t uid) {
-    if (error_ || uid == 0)
+    if (!error_.ok() || uid == 0)
         return nullptr;
     if (uid >= count_) {
         fail(archiveError(ArchiveErrorCode::UidOutOfRange,

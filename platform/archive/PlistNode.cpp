@@ -41,8 +41,9 @@ Result<PlistNode> PlistNode::fromBinary(const uint8_t* bytes, size_t size, size_
                             std::to_string(size) + " bytes is more than the " +
                                 std::to_string(maxSize) + " allowed");
     if (auto invalid =
-            BinaryPlistValidator::validate(bytes, size, BinaryPlistValidator::limitsForSize(size)))
-        return *invalid;
+            BinaryPlistValidator::validate(bytes, size, BinaryPlistValidator::limitsForSize(size));
+        !invalid.ok())
+        return invalid.error();
     plist_t node = nullptr;
     plist_from_bin(reinterpret_cast<const char*>(bytes), static_cast<uint32_t>(size), &node);
     if (!node)

@@ -17,6 +17,20 @@ void TremorStrataService::installDocumentIdLookup() {
     setDocumentIdLookup(&TremorStrataService::lookUpDocumentId);
 }
 
+namespace {
+
+// Identifier look-ups answer nothing when the index cannot be read; the cause is logged here,
+// once. Callers that would act on "nothing" (hand out a new ID) check the read themselves.
+template <class T>
+std::optional<T> orLogged(Result<std::optional<T>> read) {
+    if (read.ok())
+        return std::move(read).value();
+    logError("Could not read the document index: " + read.error().description());
+    return std::nullopt;
+}
+
+}  // namespace
+
 std::optional<uint32_t> TremorStrataService::lookUpDocumentId(const std::string& path) {
     // A look-up must not start the journal: it answers only for a running one.
     auto service = TremorService::sharedIfRunning();
@@ -28,7 +42,7 @@ std::optional<uint32_t> TremorStrataService::lookUpDocumentId(const std::string&
     TremorStore* store = service->storeForDevice(encodeDevice(st.stx_dev_major, st.stx_dev_minor));
     if (!store)
         return std::nullopt;
-    return store->documentIdForInode(st.stx_ino);
+    return orLogged(store->documentIdForInode(st.stx_ino));
 }
 
 uint32_t TremorStrataService::getOrAllocateDocumentId(int fd) {
@@ -43,12 +57,21 @@ uint32_t TremorStrataService::getOrAllocateDocumentId(int fd) {
         return 0;
     }
     auto path = store->pathForInode(st.stx_ino);
-    if (!path) {
+    Result<std::optional<uint32_t>> existing = path.ok()
+                                                   ? store->documentIdForInode(st.stx_ino)
+                                                   : Result<std::optional<uint32_t>>(path.error());
+    if (!existing.ok()) {
+        // Unknown is not "none": a second ID for a document would split it.
+        logError("Could not read the document index: " + existing.error().description());
+        errno = EIO;
+        return 0;
+    }
+    if (!path.value()) {
         errno = ENOENT;  // not inside a watched tree
         return 0;
     }
-    if (auto existing = store->documentIdForInode(st.stx_ino))
-        return *existing;
+    if (existing.value())
+        return *existing.value();
     auto docID = store->allocateDocumentId(st.stx_ino);
     if (!docID.ok()) {
         errno = EIO;
@@ -57,10 +80,11 @@ uint32_t TremorStrataService::getOrAllocateDocumentId(int fd) {
     // Metadata the file had before it became a document (given by another program, or copied
     // in with it) follows it from now on too. Once per document: one listing, usually empty.
     if (S_ISREG(st.stx_mode)) {
-        auto values = DocumentAttributes::read(*path);
+        auto values = DocumentAttributes::read(*path.value());
         if (values && !values->empty()) {
-            if (auto error = store->replaceDocumentAttributes(docID.value(), *values))
-                logError("Could not keep a document's metadata: " + error->description());
+            if (auto status = store->replaceDocumentAttributes(docID.value(), *values);
+                !status.ok())
+                logError("Could not keep a document's metadata: " + status.error().description());
         }
     }
     return docID.value();
@@ -72,7 +96,7 @@ uint32_t TremorStrataService::documentIdForInode(uint32_t device, uint64_t inode
         errno = ENOENT;
         return 0;
     }
-    return store->documentIdForInode(inode).value_or(0);
+    return orLogged(store->documentIdForInode(inode)).value_or(0);
 }
 
 uint64_t TremorStrataService::resolveDocumentId(uint32_t device, uint32_t documentId) {
@@ -84,7 +108,7 @@ uint64_t TremorStrataService::resolveDocumentId(uint32_t device, uint32_t docume
     // identifier right after the provider moved its file would otherwise find the old place.
     service_->sync();
     TremorStore* store = service_->storeForDevice(device);
-    auto inode = store ? store->inodeForDocumentId(documentId) : std::nullopt;
+    auto inode = store ? orLogged(store->inodeForDocumentId(documentId)) : std::nullopt;
     if (!inode) {
         errno = ENOENT;
         return 0;
@@ -95,7 +119,7 @@ uint64_t TremorStrataService::resolveDocumentId(uint32_t device, uint32_t docume
 bool TremorStrataService::pathForFileId(uint32_t device, uint64_t fileId, std::string& path) {
     service_->sync();  // as for document IDs: a rename that completed is in the index
     TremorStore* store = service_->storeForDevice(device);
-    auto found = store ? store->pathForInode(fileId) : std::nullopt;
+    auto found = store ? orLogged(store->pathForInode(fileId)) : std::nullopt;
     if (!found) {
         errno = ENOENT;
         return false;
@@ -116,11 +140,11 @@ void TremorStrataService::metadataAttributeWritten(
         !S_ISREG(st.stx_mode))
         return;
     TremorStore* store = service_->storeForDevice(encodeDevice(st.stx_dev_major, st.stx_dev_minor));
-    auto docID = store ? store->documentIdForInode(st.stx_ino) : std::nullopt;
+    auto docID = store ? orLogged(store->documentIdForInode(st.stx_ino)) : std::nullopt;
     if (!docID)
         return;
-    if (auto error = store->setDocumentAttribute(*docID, name, value))
-        logError("Could not keep a document's metadata: " + error->description());
+    if (auto status = store->setDocumentAttribute(*docID, name, value); !status.ok())
+        logError("Could not keep a document's metadata: " + status.error().description());
 }
 
 }  // namespace tamber

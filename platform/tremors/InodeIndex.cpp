@@ -98,17 +98,17 @@ const char* InodeIndex::upgradeFrom(int64_t version) {
 
 Status InodeIndex::load() {
     auto next = db_.queryInt64("SELECT next_document_id FROM meta WHERE id = 1");
-    if (!next)
+    if (!next.ok())
         return next.error();
     auto highest = db_.queryInt64("SELECT coalesce(max(doc_id), 0) FROM documents");
-    if (!highest)
+    if (!highest.ok())
         return highest.error();
     if (next.value() < 1 || highest.value() >= next.value()) {
         return SqliteDatabase::makeError(SQLITE_CORRUPT, "checking the event journal",
                                          "document IDs beyond the counter");
     }
     nextDocumentId_ = fromSqlite(next.value());
-    return std::nullopt;
+    return Status::OK();
 }
 
 // ---- Tree ----
@@ -120,9 +120,9 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
         }
     }
     if (records.empty())
-        return std::nullopt;
+        return Status::OK();
     auto txn = db_.begin();
-    if (!txn)
+    if (!txn.ok())
         return txn.error();
     auto upsert = db_.cached(
         "INSERT INTO inodes(inode, parent, name, kind, birth, size, mtime, ctime) "
@@ -130,7 +130,7 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
         "ON CONFLICT(inode) DO UPDATE SET parent = excluded.parent, name = excluded.name, "
         "kind = excluded.kind, birth = excluded.birth, size = excluded.size, "
         "mtime = excluded.mtime, ctime = excluded.ctime");
-    if (!upsert)
+    if (!upsert.ok())
         return upsert.error();
     for (const InodeRecord& record : records) {
         upsert->bind(1, toSqlite(record.inode))
@@ -144,7 +144,7 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
             if (record.ctime != 0)
                 upsert->bind(8, record.ctime);
         }  // else left NULL
-        if (Status status = upsert->run())
+        if (Status status = upsert->run(); !status.ok())
             return status;
     }
     return txn->commit();
@@ -152,15 +152,15 @@ Status InodeIndex::upsert(const std::vector<InodeRecord>& records) {
 
 Status InodeIndex::remove(const std::vector<uint64_t>& inodes) {
     if (inodes.empty())
-        return std::nullopt;
+        return Status::OK();
     auto txn = db_.begin();
-    if (!txn)
+    if (!txn.ok())
         return txn.error();
     auto erase = db_.cached("DELETE FROM inodes WHERE inode = ?");
-    if (!erase)
+    if (!erase.ok())
         return erase.error();
     for (uint64_t inode : inodes) {
-        if (Status status = erase->bind(1, toSqlite(inode)).run())
+        if (Status status = erase->bind(1, toSqlite(inode)).run(); !status.ok())
             return status;
     }
     return txn->commit();
@@ -169,10 +169,10 @@ Status InodeIndex::remove(const std::vector<uint64_t>& inodes) {
 template <class T, class Read>
 Result<std::optional<T>> InodeIndex::findOne(std::string_view sql, int64_t key, Read read) {
     auto stmt = db_.cached(sql);
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     auto row = stmt->bind(1, key).step();
-    if (!row)
+    if (!row.ok())
         return row.error();
     if (!row.value())
         return std::optional<T>();
@@ -186,7 +186,7 @@ Result<std::optional<InodeRecord>> InodeIndex::find(uint64_t inode) {
 Result<std::optional<std::string>> InodeIndex::path(
     uint64_t inode, const std::function<const std::string*(uint64_t)>& rootPath) {
     auto stmt = db_.cached("SELECT parent, name FROM inodes WHERE inode = ?");
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     std::vector<std::string> names;
     std::unordered_set<uint64_t> seen;
@@ -204,7 +204,7 @@ Result<std::optional<std::string>> InodeIndex::path(
         if (names.size() == kMaxPathComponents || !seen.insert(current).second)
             break;
         auto row = stmt->bind(1, toSqlite(current)).step();
-        if (!row)
+        if (!row.ok())
             return row.error();
         if (!row.value())
             break;
@@ -220,14 +220,14 @@ Result<std::optional<std::string>> InodeIndex::path(
 
 Result<std::vector<InodeRecord>> InodeIndex::children(uint64_t parent) {
     auto stmt = db_.cached(kFindByParent);
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     return readAll(stmt->bind(1, toSqlite(parent)));
 }
 
 Result<std::vector<InodeRecord>> InodeIndex::childrenNamed(uint64_t parent, std::string_view name) {
     auto stmt = db_.cached(kFindByName);
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     return readAll(stmt->bind(1, toSqlite(parent)).bind(2, name));
 }
@@ -236,7 +236,7 @@ Result<std::vector<InodeRecord>> InodeIndex::readAll(SqliteDatabase::Statement& 
     std::vector<InodeRecord> result;
     Result<bool> r = stmt.step();
     for (; r.ok() && r.value(); r = stmt.step()) result.push_back(readInode(stmt));
-    if (!r)
+    if (!r.ok())
         return r.error();
     return result;
 }
@@ -259,7 +259,7 @@ Result<uint32_t> InodeIndex::allocateDocumentId(uint64_t inode) {
     if (inode == 0)
         return Error::invalidParameter("inode", "0");
     auto existing = documentIdForInode(inode);
-    if (!existing)
+    if (!existing.ok())
         return existing.error();
     if (existing.value())
         return *existing.value();
@@ -269,20 +269,21 @@ Result<uint32_t> InodeIndex::allocateDocumentId(uint64_t inode) {
     }
     // The counter moves in the same transaction as the row, so a crash cannot reuse an ID.
     auto txn = db_.begin();
-    if (!txn)
+    if (!txn.ok())
         return txn.error();
     auto insert = db_.cached("INSERT INTO documents(doc_id, inode) VALUES(?, ?)");
-    if (!insert)
+    if (!insert.ok())
         return insert.error();
-    if (Status status = insert->bind(1, toSqlite(nextDocumentId_)).bind(2, toSqlite(inode)).run())
-        return *status;
+    if (Status status = insert->bind(1, toSqlite(nextDocumentId_)).bind(2, toSqlite(inode)).run();
+        !status.ok())
+        return status.error();
     auto meta = db_.cached("UPDATE meta SET next_document_id = ? WHERE id = 1");
-    if (!meta)
+    if (!meta.ok())
         return meta.error();
-    if (Status status = meta->bind(1, toSqlite(nextDocumentId_ + 1)).run())
-        return *status;
-    if (Status status = txn->commit())
-        return *status;
+    if (Status status = meta->bind(1, toSqlite(nextDocumentId_ + 1)).run(); !status.ok())
+        return status.error();
+    if (Status status = txn->commit(); !status.ok())
+        return status.error();
     return static_cast<uint32_t>(nextDocumentId_++);
 }
 
@@ -294,10 +295,10 @@ Status InodeIndex::moveDocumentId(uint32_t docID, uint64_t newInode) {
                      {{"description", "No document has the ID " + std::to_string(docID)}});
     }
     auto holder = documentIdForInode(newInode);
-    if (!holder)
+    if (!holder.ok())
         return holder.error();
     if (holder.value() == docID)
-        return std::nullopt;
+        return Status::OK();
     if (holder.value()) {
         return Error(
             kPosixErrorDomain, EEXIST,
@@ -309,23 +310,23 @@ Status InodeIndex::moveDocumentId(uint32_t docID, uint64_t newInode) {
     auto update = db_.cached(
         "INSERT INTO documents(doc_id, inode) VALUES(?, ?) "
         "ON CONFLICT(doc_id) DO UPDATE SET inode = excluded.inode");
-    if (!update)
+    if (!update.ok())
         return update.error();
     return update->bind(1, int64_t{docID}).bind(2, toSqlite(newInode)).run();
 }
 
 Status InodeIndex::detachDocumentId(uint32_t docID) {
     auto erase = db_.cached("DELETE FROM documents WHERE doc_id = ?");
-    if (!erase)
+    if (!erase.ok())
         return erase.error();
     return erase->bind(1, int64_t{docID}).run();
 }
 
 Status InodeIndex::clearDocumentId(uint32_t docID) {
-    if (Status status = detachDocumentId(docID))
+    if (Status status = detachDocumentId(docID); !status.ok())
         return status;
     auto erase = db_.cached("DELETE FROM document_attributes WHERE doc_id = ?");
-    if (!erase)
+    if (!erase.ok())
         return erase.error();
     return erase->bind(1, int64_t{docID}).run();
 }
@@ -334,14 +335,14 @@ Status InodeIndex::clearDocumentId(uint32_t docID) {
 
 Result<InodeIndex::Attributes> InodeIndex::documentAttributes(uint32_t docID) {
     auto stmt = db_.cached("SELECT name, value FROM document_attributes WHERE doc_id = ?");
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     stmt->bind(1, int64_t{docID});
     Attributes attributes;
     Result<bool> r = stmt->step();
     for (; r.ok() && r.value(); r = stmt->step())
         attributes.emplace(stmt->columnText(0), stmt->columnBlob(1));
-    if (!r)
+    if (!r.ok())
         return r.error();
     return attributes;
 }
@@ -350,29 +351,29 @@ Status InodeIndex::setDocumentAttribute(uint32_t docID, const std::string& name,
                                         const std::optional<Bytes>& value) {
     if (!value) {
         auto erase = db_.cached("DELETE FROM document_attributes WHERE doc_id = ? AND name = ?");
-        if (!erase)
+        if (!erase.ok())
             return erase.error();
         return erase->bind(1, int64_t{docID}).bind(2, name).run();
     }
     auto upsert = db_.cached(
         "INSERT INTO document_attributes(doc_id, name, value) VALUES(?, ?, ?) "
         "ON CONFLICT(doc_id, name) DO UPDATE SET value = excluded.value");
-    if (!upsert)
+    if (!upsert.ok())
         return upsert.error();
     return upsert->bind(1, int64_t{docID}).bind(2, name).bindBlob(3, *value).run();
 }
 
 Status InodeIndex::replaceDocumentAttributes(uint32_t docID, const Attributes& attributes) {
     auto txn = db_.begin();
-    if (!txn)
+    if (!txn.ok())
         return txn.error();
     auto erase = db_.cached("DELETE FROM document_attributes WHERE doc_id = ?");
-    if (!erase)
+    if (!erase.ok())
         return erase.error();
-    if (Status status = erase->bind(1, int64_t{docID}).run())
+    if (Status status = erase->bind(1, int64_t{docID}).run(); !status.ok())
         return status;
     for (const auto& [name, value] : attributes) {
-        if (Status status = setDocumentAttribute(docID, name, value))
+        if (Status status = setDocumentAttribute(docID, name, value); !status.ok())
             return status;
     }
     return txn->commit();
@@ -387,7 +388,7 @@ Result<std::vector<InodeRecord>> InodeIndex::subtree(uint64_t top,
         uint64_t dir = stack.back();
         stack.pop_back();
         auto entries = children(dir);
-        if (!entries)
+        if (!entries.ok())
             return entries.error();
         for (InodeRecord& child : entries.value()) {
             if (!stops.insert(child.inode).second)

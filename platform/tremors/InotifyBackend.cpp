@@ -83,7 +83,7 @@ Status InotifyBackend::watchTree(const std::string& root, std::vector<FileChange
     MutexLock lock(mutex_);
     int error = watchDirectories(top, false, discovered);
     if (error == 0)
-        return std::nullopt;
+        return Status::OK();
     // Asked for explicitly, so even a missing root is worth a line.
     if (vanished(error))
         reportUnwatched(top, error, discovered);

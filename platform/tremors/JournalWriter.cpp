@@ -83,8 +83,8 @@ bool changedWhileAway(const InodeRecord& indexed, const InodeRecord& found) {
 }
 
 void logIfFailed(const Status& status, std::string_view what) {
-    if (status)
-        logError(std::string(what) + ": " + status->description());
+    if (!status.ok())
+        logError(std::string(what) + ": " + status.error().description());
 }
 
 // Whether the index must be told about `found`, a newer look at the entry it keeps as `indexed`.
@@ -159,13 +159,16 @@ Result<std::vector<JournalEvent>> JournalWriter::commit(Settle settle,
                                                         const std::function<void()>& work) {
     std::vector<JournalEvent> events;
     // One transaction for the journal rows and the index: a crash keeps both or neither.
+    failure_ = Status::OK();
     Status status = store_.transact([&]() -> Status {
         work();
         flushStaged();
         settleVanished(settle);
+        if (!failure_.ok())
+            return failure_;  // rolls back what the batch wrote before it failed
         events = std::move(pending_);
         if (events.empty())
-            return std::nullopt;
+            return Status::OK();
         auto last = store_.append(events);
         return last.ok() ? Status() : Status(last.error());
     });
@@ -173,12 +176,29 @@ Result<std::vector<JournalEvent>> JournalWriter::commit(Settle settle,
     vanished_.clear();
     staged_.clear();
     stagedNames_.clear();
-    if (status)
-        return *status;
+    failure_ = Status::OK();
+    if (!status.ok())
+        return status.error();
     return events;
 }
 
 // ---- Index entries of one batch ----
+
+void JournalWriter::fail(const Status& status, std::string_view what) {
+    if (status.ok())
+        return;
+    logError(std::string(what) + ": " + status.error().description());
+    if (failure_.ok())
+        failure_ = status;
+}
+
+template <class T>
+T JournalWriter::orFail(Result<T> read, T fallback) {
+    if (read.ok())
+        return std::move(read).value();
+    fail(read.status(), "Could not read the file index");
+    return fallback;
+}
 
 void JournalWriter::stage(InodeRecord record) {
     auto [it, inserted] = staged_.try_emplace(record.inode, record);
@@ -202,20 +222,20 @@ void JournalWriter::flushStaged() {
     }
     staged_.clear();
     stagedNames_.clear();
-    logIfFailed(store_.upsertInodes(records), "Could not update the file index");
+    fail(store_.upsertInodes(records), "Could not update the file index");
 }
 
 std::optional<InodeRecord> JournalWriter::stagedOrIndexed(uint64_t inode) {
     if (auto it = staged_.find(inode); it != staged_.end())
         return it->second;
-    return store_.inode(inode);
+    return orFail(store_.inode(inode), std::optional<InodeRecord>());
 }
 
 std::vector<InodeRecord> JournalWriter::entriesAt(uint64_t parent, const std::string& name) {
     std::vector<InodeRecord> found;
     if (auto it = stagedNames_.find({parent, name}); it != stagedNames_.end())
         found.push_back(staged_.at(it->second));
-    for (auto& record : store_.childrenNamed(parent, name)) {
+    for (auto& record : orFail(store_.childrenNamed(parent, name), std::vector<InodeRecord>())) {
         if (!staged_.contains(record.inode))  // else the staged entry is newer
             found.push_back(std::move(record));
     }
@@ -234,7 +254,7 @@ std::optional<InodeRecord> JournalWriter::recordAt(const std::string& path) {
     if (!best)
         return std::nullopt;
     if (path == best->path)
-        return store_.inode(best->inode);
+        return orFail(store_.inode(best->inode), std::optional<InodeRecord>());
     std::string_view rest(path);
     rest.remove_prefix(best->path == "/" ? 1 : best->path.size() + 1);
     uint64_t parent = best->inode;
@@ -243,7 +263,7 @@ std::optional<InodeRecord> JournalWriter::recordAt(const std::string& path) {
         size_t slash = rest.find('/');
         std::string name(rest.substr(0, slash));
         rest = slash == std::string_view::npos ? std::string_view() : rest.substr(slash + 1);
-        auto entries = store_.childrenNamed(parent, name);
+        auto entries = orFail(store_.childrenNamed(parent, name), std::vector<InodeRecord>());
         if (entries.empty())
             return std::nullopt;
         // Lost events may leave a stale twin behind; only a directory can be walked into.
@@ -267,16 +287,17 @@ void JournalWriter::forgetSubtree(const InodeRecord& top, const std::string& pat
         auto [record, at] = std::move(stack.back());
         stack.pop_back();
         gone.push_back(record.inode);
-        if (auto docID = store_.documentIdForInode(record.inode)) {
+        if (auto docID =
+                orFail(store_.documentIdForInode(record.inode), std::optional<uint32_t>())) {
             record.docID = *docID;
             vanish(record, at);
         }
         if (record.kind == InodeRecord::kDirectory) {
-            for (auto& child : store_.children(record.inode))
+            for (auto& child : orFail(store_.children(record.inode), std::vector<InodeRecord>()))
                 stack.emplace_back(child, at + "/" + child.name);
         }
     }
-    logIfFailed(store_.removeInodes(gone), "Could not update the file index");
+    fail(store_.removeInodes(gone), "Could not update the file index");
 }
 
 void JournalWriter::forgetReusedNumber(const struct statx& st) {
@@ -288,7 +309,8 @@ void JournalWriter::forgetReusedNumber(const struct statx& st) {
         return;
     flushStaged();
     // Its document waits under its old path for its own new file, later in the batch.
-    forgetSubtree(*indexed, store_.pathForInode(st.stx_ino).value_or(std::string()));
+    forgetSubtree(*indexed, orFail(store_.pathForInode(st.stx_ino), std::optional<std::string>())
+                                .value_or(std::string()));
 }
 
 // ---- Document IDs ----
@@ -296,7 +318,7 @@ void JournalWriter::forgetReusedNumber(const struct statx& st) {
 void JournalWriter::vanish(const InodeRecord& record, const std::string& path) {
     // Detached at once: the inode number may already belong to the file that takes another
     // document's place in this batch.
-    logIfFailed(store_.detachDocumentId(record.docID), "Could not detach a document ID");
+    fail(store_.detachDocumentId(record.docID), "Could not detach a document ID");
     vanished_[path] = record;
 }
 
@@ -306,12 +328,11 @@ void JournalWriter::claimDocumentId(const std::string& path, uint64_t inode, uin
         return;
     uint32_t docID = it->second.docID;
     uint64_t old = it->second.inode;
-    if (store_.documentIdForInode(inode))
+    if (orFail(store_.documentIdForInode(inode), std::optional<uint32_t>()))
         return;  // the new file is a document of its own
     vanished_.erase(it);
-    if (auto error = store_.moveDocumentId(docID, inode)) {
-        logError("Could not move document ID " + std::to_string(docID) + ": " +
-                 error->description());
+    if (Status moved = store_.moveDocumentId(docID, inode); !moved.ok()) {
+        fail(moved, "Could not move document ID " + std::to_string(docID));
         return;
     }
     pending_.push_back({0, documentIdPath(device_, docID, old, inode), inode,
@@ -320,13 +341,13 @@ void JournalWriter::claimDocumentId(const std::string& path, uint64_t inode, uin
 }
 
 void JournalWriter::restoreAttributes(uint32_t docID, const std::string& path, uint64_t inode) {
-    auto saved = store_.documentAttributes(docID);
+    auto saved = orFail(store_.documentAttributes(docID), TremorStore::Attributes());
     if (saved.empty())
         return;  // the common case costs no file-system call
     auto kept = DocumentAttributes::restore(path, inode, saved);
     if (kept && *kept != saved) {
-        logIfFailed(store_.replaceDocumentAttributes(docID, *kept),
-                    "Could not update a document's metadata");
+        fail(store_.replaceDocumentAttributes(docID, *kept),
+             "Could not update a document's metadata");
     }
 }
 
@@ -336,9 +357,14 @@ void JournalWriter::refreshAttributes(uint32_t docID, const std::string& path, u
     // Read by path: if another file took the path meanwhile, what was read is not this one's.
     if (!values || !statPath(path, st) || st.stx_ino != inode)
         return;
-    if (*values != store_.documentAttributes(docID)) {
-        logIfFailed(store_.replaceDocumentAttributes(docID, *values),
-                    "Could not update a document's metadata");
+    auto saved = store_.documentAttributes(docID);
+    if (!saved.ok()) {
+        fail(saved.status(), "Could not read a document's metadata");
+        return;
+    }
+    if (*values != saved.value()) {
+        fail(store_.replaceDocumentAttributes(docID, *values),
+             "Could not update a document's metadata");
     }
 }
 
@@ -367,7 +393,7 @@ void JournalWriter::settleVanished(Settle settle) {
         }
     }
     for (auto& [path, record] : vanished_) {
-        logIfFailed(store_.clearDocumentId(record.docID), "Could not clear a document ID");
+        fail(store_.clearDocumentId(record.docID), "Could not clear a document ID");
         pending_.push_back({0, documentIdPath(device_, record.docID, record.inode, 0), record.inode,
                             kTremorItemRemoved | kTremorItemIsFile});
     }
@@ -462,7 +488,8 @@ void JournalWriter::touched(const FileChange& change, uint32_t flag) {
                 stage(std::move(now));
             // Only documents keep a copy of their metadata: other files cost nothing here.
             if (flag == kTremorItemAttributes && indexed->kind == InodeRecord::kFile) {
-                if (auto docID = store_.documentIdForInode(inode))
+                if (auto docID =
+                        orFail(store_.documentIdForInode(inode), std::optional<uint32_t>()))
                     refreshAttributes(*docID, change.path, inode);
             }
         }
@@ -523,7 +550,7 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
     while (!stack.empty()) {
         auto [dir, at] = std::move(stack.back());
         stack.pop_back();
-        for (auto& child : store_.children(dir)) {
+        for (auto& child : orFail(store_.children(dir), std::vector<InodeRecord>())) {
             std::string path = at + "/" + child.name;
             if (child.kind == InodeRecord::kDirectory)
                 stack.emplace_back(child.inode, path);
@@ -567,7 +594,7 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
             refreshAttributes(found.record.docID, now.path, inode);
     }
     // Removed first: a replaced inode comes back with its new self.
-    logIfFailed(store_.removeInodes(gone), "Could not update the file index");
+    fail(store_.removeInodes(gone), "Could not update the file index");
     for (auto& [inode, found] : onDisk) {
         if (indexed.contains(inode) && !replaced.contains(inode))
             continue;
@@ -577,7 +604,7 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
                 {0, found.path, inode, kTremorItemCreated | kindFlag(found.record.kind)});
         claimDocumentId(found.path, inode, found.record.kind);
     }
-    logIfFailed(store_.upsertInodes(updates), "Could not update the file index");
+    fail(store_.upsertInodes(updates), "Could not update the file index");
     if (journal && unstamped) {
         // Indexed before contents were tracked: what changed inside files is not known.
         logInfo("Files in " + root + " may have changed unseen; asking readers to rescan it");

@@ -7,6 +7,7 @@
 #include <map>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <utility>
 #include <vector>
@@ -98,9 +99,17 @@ private:
     // Clears the document IDs of files that vanished for good and journals their deletion.
     void settleVanished(Settle settle);
 
+    // A batch is all or nothing: the first index read or write that fails is logged and kept,
+    // the rest of the batch runs on without effect, and commit() rolls the transaction back.
+    void fail(const Status& status, std::string_view what);
+    // The value read, or (after recording the failure) `fallback`.
+    template <class T>
+    T orFail(Result<T> read, T fallback);
+
     TremorStore& store_;
     const uint32_t device_;
     std::vector<JournalEvent> pending_;
+    Status failure_;                               // of the batch being applied
     std::map<std::string, InodeRecord> vanished_;  // by path, only those with a document ID
     std::unordered_map<uint64_t, InodeRecord> staged_;
     std::map<std::pair<uint64_t, std::string>, uint64_t> stagedNames_;  // (parent, name) -> inode

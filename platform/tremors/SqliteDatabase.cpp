@@ -137,7 +137,7 @@ Status SqliteDatabase::Transaction::commit() {
     if (!db_)
         return makeError(SQLITE_MISUSE, "COMMIT", "no transaction");
     Status status = db_->exec(nested_ ? "RELEASE nested" : "COMMIT");
-    if (!status)
+    if (status.ok())
         db_ = nullptr;
     return status;
 }
@@ -186,7 +186,7 @@ Status SqliteDatabase::exec(const std::string& sql) {
     char* message = nullptr;
     int rc = sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, &message);
     if (rc == SQLITE_OK)
-        return std::nullopt;
+        return Status::OK();
     Error error = makeError(rc, sql, message ? message : sqlite3_errstr(rc));
     sqlite3_free(message);
     return error;
@@ -204,7 +204,7 @@ Result<SqliteDatabase::Statement> SqliteDatabase::cached(std::string_view sql) {
     auto it = cache_.find(sql);
     if (it == cache_.end()) {
         auto stmt = prepare(sql);
-        if (!stmt)
+        if (!stmt.ok())
             return stmt.error();
         it = cache_.emplace(std::string(sql), std::move(stmt).value()).first;
     }
@@ -213,10 +213,10 @@ Result<SqliteDatabase::Statement> SqliteDatabase::cached(std::string_view sql) {
 
 Result<SqliteDatabase::Statement> SqliteDatabase::firstRow(std::string_view sql) {
     auto stmt = prepare(sql);
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     auto row = stmt->step();
-    if (!row)
+    if (!row.ok())
         return row.error();
     if (!row.value())
         return makeError(SQLITE_ERROR, sql, "no row");
@@ -225,22 +225,22 @@ Result<SqliteDatabase::Statement> SqliteDatabase::firstRow(std::string_view sql)
 
 Result<int64_t> SqliteDatabase::queryInt64(std::string_view sql) {
     auto stmt = firstRow(sql);
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     return stmt->columnInt64(0);
 }
 
 Result<std::string> SqliteDatabase::queryText(std::string_view sql) {
     auto stmt = firstRow(sql);
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     return stmt->columnText(0);
 }
 
 Result<SqliteDatabase::Transaction> SqliteDatabase::begin() {
     bool nested = !sqlite3_get_autocommit(db_);
-    if (Status status = exec(nested ? "SAVEPOINT nested" : "BEGIN IMMEDIATE"))
-        return *status;
+    if (Status status = exec(nested ? "SAVEPOINT nested" : "BEGIN IMMEDIATE"); !status.ok())
+        return status.error();
     return Transaction(this, nested);
 }
 

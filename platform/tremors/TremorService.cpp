@@ -101,7 +101,7 @@ Status TremorService::installShared(std::shared_ptr<TremorService> service) {
     g.strata = std::make_shared<TremorStrataService>(g.service);
     StrataService::setCurrent(g.strata);
     TremorStrataService::installDocumentIdLookup();
-    return std::nullopt;
+    return Status::OK();
 }
 
 void TremorService::uninstallShared(const std::shared_ptr<TremorService>& service) {
@@ -125,9 +125,9 @@ Result<std::shared_ptr<TremorService>> TremorService::create(
         return backend.error();
     auto service = std::make_shared<TremorService>(Private{}, stateDir, std::move(backend).value(),
                                                    queueLimit, std::move(lockWait));
-    if (auto error = service->openExistingStores()) {
+    if (auto status = service->openExistingStores(); !status.ok()) {
         service->shutdown();
-        return *error;
+        return status.error();
     }
     return service;
 }
@@ -261,6 +261,18 @@ void TremorService::journal(Item& item) {
         }
         return;
     }
+    // A batch that could not be journaled was rolled back whole: readers are told to look for
+    // themselves, and the index is brought back in step, as after lost events.
+    auto applyBatch = [this](Volume& volume, const std::vector<FileChange>& changes) {
+        auto events = volume.writer->apply(changes);
+        const bool failed = !events.ok();
+        publish(volume, std::move(events));
+        if (failed) {
+            publish(volume, volume.writer->journalDropped(
+                                rootPaths(volume), kTremorUserDropped | kTremorMustScanSubdirs));
+            reconcileAll(volume);
+        }
+    };
     std::map<Volume*, std::vector<FileChange>> byVolume;
     bool overflow = false;
     for (auto& change : item.changes) {
@@ -274,7 +286,7 @@ void TremorService::journal(Item& item) {
         if (!volume)
             continue;
         if (change.kind == FileChange::Kind::WatchFailed) {
-            publish(*volume, volume->writer->apply(byVolume[volume]));
+            applyBatch(*volume, byVolume[volume]);
             byVolume[volume].clear();
             logError("A tree is not watched: " + change.path);
             publish(*volume, volume->writer->journalDropped(
@@ -283,7 +295,7 @@ void TremorService::journal(Item& item) {
         }
         byVolume[volume].push_back(std::move(change));
     }
-    for (auto& [volume, changes] : byVolume) publish(*volume, volume->writer->apply(changes));
+    for (auto& [volume, changes] : byVolume) applyBatch(*volume, changes);
     if (overflow) {
         logError("inotify dropped events; rescanning the watched trees");
         for (auto [volume, writer] : volumes) {

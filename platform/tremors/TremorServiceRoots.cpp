@@ -63,7 +63,7 @@ Status TremorService::openExistingStores() {
             return added.error();
     }
     indexReady_ = true;
-    return std::nullopt;
+    return Status::OK();
 }
 
 void TremorService::pruneVanishedRoots(TremorStore& store) {
@@ -97,8 +97,9 @@ Result<TremorService::Volume*> TremorService::addVolume(uint64_t fsid,
         hasDocIdRoot |= root.path == TremorStore::kDocumentIdRoot;
     if (!hasDocIdRoot) {
         if (auto error =
-                volume->store->addRoot(TremorStore::kDocumentIdRoot, volume->store->lastEventId()))
-            return *error;
+                volume->store->addRoot(TremorStore::kDocumentIdRoot, volume->store->lastEventId());
+            !error.ok())
+            return error.error();
     }
     volumes_.push_back(std::move(volume));
     return volumes_.back().get();
@@ -142,7 +143,7 @@ Status TremorService::watchTree(const std::string& path) {
         return Error::posix(ESHUTDOWN);
     std::string root = WatchedRoots::normalised(path);
     if (isWatched(root))
-        return std::nullopt;
+        return Status::OK();
     // A tree's history starts after what is journaled by now: a replay from before it must not
     // pass for complete because queued events of other trees got their IDs later.
     sync();
@@ -151,7 +152,7 @@ Status TremorService::watchTree(const std::string& path) {
 
 Status TremorService::watch(const std::string& path) {
     if (isWatched(path))
-        return std::nullopt;
+        return Status::OK();
     auto volume = volumeFor(path);
     if (!volume.ok())
         return volume.error();
@@ -172,8 +173,8 @@ Status TremorService::watch(const std::string& path) {
         if (v.store->knowsRoot(path))
             publish(v,
                     v.writer->journalDropped({path}, kTremorUserDropped | kTremorMustScanSubdirs));
-        if (auto error = v.store->addRoot(path, v.store->lastEventId(), st.stx_ino))
-            return error;
+        if (auto status = v.store->addRoot(path, v.store->lastEventId(), st.stx_ino); !status.ok())
+            return status;
     }
     {
         std::lock_guard lock(volumesMutex_);
@@ -183,7 +184,7 @@ Status TremorService::watch(const std::string& path) {
     Status watched = backend_->watchTree(path, discovered);
     if (!discovered.empty())
         enqueue(std::move(discovered));
-    if (watched) {
+    if (!watched.ok()) {
         std::lock_guard lock(volumesMutex_);
         std::erase_if(roots_, [&](const auto& root) { return root.first == path; });
         v.store->releaseRoot(path);
@@ -192,7 +193,7 @@ Status TremorService::watch(const std::string& path) {
     // Watched first, then crawled: nothing that changes from now on is missed. What changed
     // while no run watched a resumed tree is journaled, as live watching would have.
     publish(v, v.writer->reconcile(path, resumed));
-    return std::nullopt;
+    return Status::OK();
 }
 
 Status TremorService::watchRemembered() {
@@ -208,10 +209,11 @@ Status TremorService::watchRemembered() {
     }
     Status first;
     for (const auto& path : paths) {
-        if (auto error = watchTree(path)) {
-            logError("A remembered tree is not watched: " + path + ": " + error->description());
-            if (!first)
-                first = error;
+        if (auto status = watchTree(path); !status.ok()) {
+            logError("A remembered tree is not watched: " + path + ": " +
+                     status.error().description());
+            if (first.ok())
+                first = status;
         }
     }
     return first;

@@ -38,30 +38,31 @@ bool isTransient(const Error& error) {
 Result<std::unique_ptr<TremorStore>> TremorStore::open(
     const std::string& stateDir, uint64_t fsid, const TremorStoreDirectory::LockWait& lockWait) {
     auto dir = TremorStoreDirectory::acquire(stateDir, fsid, lockWait);
-    if (!dir)
+    if (!dir.ok())
         return dir.error();
     std::unique_ptr<TremorStore> store(new TremorStore(std::move(dir).value()));
     Status status = store->load();
-    if (!status)
+    if (status.ok())
         return store;
 
     std::string database = store->dir_->databasePath();
-    if (isTransient(*status)) {
-        logError("Cannot open the event journal " + database + ": " + status->description());
-        return *status;
+    if (isTransient(status.error())) {
+        logError("Cannot open the event journal " + database + ": " + status.error().description());
+        return status.error();
     }
-    logError("The event journal " + database + " is unusable (" + status->description() +
+    logError("The event journal " + database + " is unusable (" + status.error().description() +
              "); moving it aside and starting a new one");
     store->index_.reset();
     store->roots_.reset();
     store->db_.reset();
     auto moved = store->dir_->moveDatabaseAside();
-    if (!moved)
+    if (!moved.ok())
         return moved.error();
     status = store->load();
-    if (status) {
-        logError("Cannot create the event journal " + database + ": " + status->description());
-        return *status;
+    if (!status.ok()) {
+        logError("Cannot create the event journal " + database + ": " +
+                 status.error().description());
+        return status.error();
     }
     return store;
 }
@@ -76,22 +77,22 @@ TremorStore::~TremorStore() {
 Status TremorStore::load() {
     dir_->removeOrphanedSidecars();
     auto db = SqliteDatabase::open(dir_->databasePath());
-    if (!db)
+    if (!db.ok())
         return db.error();
     db_ = std::move(db).value();
     roots_ = std::make_unique<WatchedRoots>(*db_);
     index_ = std::make_unique<InodeIndex>(*db_);
-    if (Status status = TremorStoreSchema::prepare(*db_, dir_->path()))
+    if (Status status = TremorStoreSchema::prepare(*db_, dir_->path()); !status.ok())
         return status;
     return readState();
 }
 
 Status TremorStore::readState() {
     auto meta = db_->prepare("SELECT uuid, next_event_id, oldest_event_id FROM meta WHERE id = 1");
-    if (!meta)
+    if (!meta.ok())
         return meta.error();
     auto row = meta->step();
-    if (!row)
+    if (!row.ok())
         return row.error();
     if (!row.value())
         return corrupt("no meta row");
@@ -103,15 +104,15 @@ Status TremorStore::readState() {
     }
     // Rows beyond the counter would make the next append reuse their IDs.
     auto range = db_->prepare("SELECT min(id), max(id) FROM events");
-    if (!range)
+    if (!range.ok())
         return range.error();
-    if (auto r = range->step(); !r)
+    if (auto r = range->step(); !r.ok())
         return r.error();
     if (!range->columnIsNull(0) &&
         (range->columnInt64(0) < oldest || range->columnInt64(1) >= next)) {
         return corrupt("events outside the kept range");
     }
-    if (Status status = index_->load())
+    if (Status status = index_->load(); !status.ok())
         return status;
     nextEventId_ = fromSqlite(next);
     oldestEventId_ = fromSqlite(oldest);
@@ -134,17 +135,17 @@ Status TremorStore::transact(const std::function<Status()>& work) {
     Status status;
     {
         auto txn = db_->begin();
-        if (!txn)
+        if (!txn.ok())
             return txn.error();
         status = work();
-        if (!status)
+        if (status.ok())
             status = txn->commit();
     }  // rolled back unless committed
-    if (status) {
+    if (!status.ok()) {
         // The counters go back with the rows: IDs not written were never handed out.
         nextEventId_ = nextEventId;
-        if (Status reloaded = index_->load())
-            logError("Cannot reread the document-ID counter: " + reloaded->description());
+        if (Status reloaded = index_->load(); !reloaded.ok())
+            logError("Cannot reread the document-ID counter: " + reloaded.error().description());
     }
     return status;
 }
@@ -162,11 +163,11 @@ Result<uint64_t> TremorStore::append(std::vector<JournalEvent>& events) {
         return Error(kPosixErrorDomain, EOVERFLOW, {{"description", std::move(description)}});
     }
     auto txn = db_->begin();
-    if (!txn)
+    if (!txn.ok())
         return txn.error();
     auto insert =
         db_->cached("INSERT INTO events(id, root, path, file_id, flags) VALUES(?, ?, ?, ?, ?)");
-    if (!insert)
+    if (!insert.ok())
         return insert.error();
     uint64_t id = nextEventId_;
     for (const JournalEvent& event : events) {
@@ -175,16 +176,16 @@ Result<uint64_t> TremorStore::append(std::vector<JournalEvent>& events) {
             .bind(3, event.path)
             .bind(4, toSqlite(event.fileID))
             .bind(5, static_cast<int64_t>(event.flags));
-        if (Status status = insert->run())
-            return *status;
+        if (Status status = insert->run(); !status.ok())
+            return status.error();
     }
     auto meta = db_->cached("UPDATE meta SET next_event_id = ? WHERE id = 1");
-    if (!meta)
+    if (!meta.ok())
         return meta.error();
-    if (Status status = meta->bind(1, toSqlite(id)).run())
-        return *status;
-    if (Status status = txn->commit())
-        return *status;
+    if (Status status = meta->bind(1, toSqlite(id)).run(); !status.ok())
+        return status.error();
+    if (Status status = txn->commit(); !status.ok())
+        return status.error();
     for (JournalEvent& event : events) event.id = nextEventId_++;
     return nextEventId_ - 1;
 }
@@ -212,7 +213,7 @@ Status TremorStore::fetch(Cursor& cursor, size_t chunk, uint64_t upTo) {
                                       "SELECT id, path, file_id, flags FROM events "
                                       "INDEXED BY events_by_root WHERE root = ?4 "
                                       "AND id > ?1 AND id <= ?2 ORDER BY id LIMIT ?3");
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     cursor.buffered.clear();
     cursor.next = 0;
@@ -226,13 +227,13 @@ Status TremorStore::fetch(Cursor& cursor, size_t chunk, uint64_t upTo) {
                                    fromSqlite(stmt->columnInt64(2)),
                                    static_cast<uint32_t>(stmt->columnInt64(3))});
     }
-    if (!r)
+    if (!r.ok())
         return r.error();
     if (rows < chunk)
         cursor.exhausted = true;
     if (!cursor.buffered.empty())
         cursor.after = cursor.buffered.back().id;
-    return std::nullopt;
+    return Status::OK();
 }
 
 Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::string>& paths,
@@ -252,7 +253,7 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
         // SQLite, whose keys are signed: bound as it is, it would read as a negative number
         // and replay the whole journal.
         if (sinceExclusive >= upTo)
-            return std::nullopt;
+            return Status::OK();
         if (!everything) {
             for (uint64_t root : roots_->mayHoldEventsBelow(wanted))
                 cursors.push_back({toSqlite(root), sinceExclusive, {}});
@@ -275,7 +276,7 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
         Cursor* next = nullptr;
         for (Cursor& cursor : cursors) {
             if (cursor.empty() && !cursor.exhausted) {
-                if (Status status = fetch(cursor, chunk, upTo))
+                if (Status status = fetch(cursor, chunk, upTo); !status.ok())
                     return status;
             }
             if (!cursor.empty() && (!next || cursor.front().id < next->front().id)) {
@@ -283,10 +284,10 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
             }
         }
         if (!next)
-            return std::nullopt;
+            return Status::OK();
         const JournalEvent& event = next->buffered[next->next++];
         if (matches(event.path) && !each(event))
-            return std::nullopt;
+            return Status::OK();
     }
 }
 
@@ -321,24 +322,24 @@ Status TremorStore::trim(uint64_t keepAtMost) {
     uint64_t last = nextEventId_ - 1;
     uint64_t oldest = last >= keepAtMost ? last - keepAtMost + 1 : 1;
     if (oldest <= oldestEventId_)
-        return std::nullopt;
+        return Status::OK();
     auto txn = db_->begin();
-    if (!txn)
+    if (!txn.ok())
         return txn.error();
     auto erase = db_->cached("DELETE FROM events WHERE id < ?");
-    if (!erase)
+    if (!erase.ok())
         return erase.error();
-    if (Status status = erase->bind(1, toSqlite(oldest)).run())
+    if (Status status = erase->bind(1, toSqlite(oldest)).run(); !status.ok())
         return status;
     auto meta = db_->cached("UPDATE meta SET oldest_event_id = ? WHERE id = 1");
-    if (!meta)
+    if (!meta.ok())
         return meta.error();
-    if (Status status = meta->bind(1, toSqlite(oldest)).run())
+    if (Status status = meta->bind(1, toSqlite(oldest)).run(); !status.ok())
         return status;
-    if (Status status = txn->commit())
+    if (Status status = txn->commit(); !status.ok())
         return status;
     oldestEventId_ = oldest;
-    return std::nullopt;
+    return Status::OK();
 }
 
 // ---- Roots ----
@@ -377,14 +378,14 @@ Result<TremorStore::Forgotten> TremorStore::forgetRoot(const std::string& rawPat
     std::lock_guard lock(mutex_);
     std::string path = WatchedRoots::normalised(rawPath);
     auto forgotten = roots_->forget(path);
-    if (!forgotten)
+    if (!forgotten.ok())
         return forgotten.error();
     Forgotten outcome;
     uint64_t top = forgotten.value().top;
     if (top == 0)
         return outcome;
     auto tree = index_->subtree(top, std::move(forgotten.value().kept));
-    if (!tree)
+    if (!tree.ok())
         return tree.error();
     std::vector<uint64_t> gone;
     std::vector<uint32_t> documents;
@@ -396,19 +397,19 @@ Result<TremorStore::Forgotten> TremorStore::forgetRoot(const std::string& rawPat
     outcome.entries = gone.size();
     gone.push_back(top);
     auto topDocument = index_->documentIdForInode(top);
-    if (topDocument && topDocument.value())
+    if (topDocument.ok() && topDocument.value())
         documents.push_back(*topDocument.value());
     Status status = transact([&]() -> Status {
-        if (Status removed = index_->remove(gone))
+        if (Status removed = index_->remove(gone); !removed.ok())
             return removed;
         for (uint32_t docID : documents) {
-            if (Status cleared = index_->clearDocumentId(docID))
+            if (Status cleared = index_->clearDocumentId(docID); !cleared.ok())
                 return cleared;
         }
-        return std::nullopt;
+        return Status::OK();
     });
-    if (status)
-        return *status;
+    if (!status.ok())
+        return status.error();
     outcome.documents = documents.size();
     return outcome;
 }
@@ -430,20 +431,6 @@ bool TremorStore::knowsRoot(const std::string& path) const {
 
 // ---- Index of the watched trees and document IDs ----
 
-namespace {
-
-// Reads that answer "nothing" on failure still leave a trace of why.
-template <class T>
-std::optional<T> orLogged(Result<std::optional<T>> result) {
-    if (!result) {
-        logError(result.error().description());
-        return std::nullopt;
-    }
-    return std::move(result).value();
-}
-
-}  // namespace
-
 Status TremorStore::upsertInodes(const std::vector<InodeRecord>& records) {
     std::lock_guard lock(mutex_);
     return index_->upsert(records);
@@ -454,36 +441,26 @@ Status TremorStore::removeInodes(const std::vector<uint64_t>& inodes) {
     return index_->remove(inodes);
 }
 
-std::optional<InodeRecord> TremorStore::inode(uint64_t inode) const {
+Result<std::optional<InodeRecord>> TremorStore::inode(uint64_t inode) const {
     std::lock_guard lock(mutex_);
-    return orLogged(index_->find(inode));
+    return index_->find(inode);
 }
 
-std::optional<std::string> TremorStore::pathForInode(uint64_t inode) const {
+Result<std::optional<std::string>> TremorStore::pathForInode(uint64_t inode) const {
     std::lock_guard lock(mutex_);
-    return orLogged(index_->path(
-        inode, [this](uint64_t candidate) { return roots_->pathOfRootInode(candidate); }));
+    return index_->path(inode,
+                        [this](uint64_t candidate) { return roots_->pathOfRootInode(candidate); });
 }
 
-std::vector<InodeRecord> TremorStore::children(uint64_t parent) const {
+Result<std::vector<InodeRecord>> TremorStore::children(uint64_t parent) const {
     std::lock_guard lock(mutex_);
-    auto result = index_->children(parent);
-    if (!result) {
-        logError(result.error().description());
-        return {};
-    }
-    return std::move(result).value();
+    return index_->children(parent);
 }
 
-std::vector<InodeRecord> TremorStore::childrenNamed(uint64_t parent,
-                                                    const std::string& name) const {
+Result<std::vector<InodeRecord>> TremorStore::childrenNamed(uint64_t parent,
+                                                            const std::string& name) const {
     std::lock_guard lock(mutex_);
-    auto result = index_->childrenNamed(parent, name);
-    if (!result) {
-        logError(result.error().description());
-        return {};
-    }
-    return std::move(result).value();
+    return index_->childrenNamed(parent, name);
 }
 
 Result<uint32_t> TremorStore::allocateDocumentId(uint64_t inode) {
@@ -491,14 +468,14 @@ Result<uint32_t> TremorStore::allocateDocumentId(uint64_t inode) {
     return index_->allocateDocumentId(inode);
 }
 
-std::optional<uint64_t> TremorStore::inodeForDocumentId(uint32_t docID) const {
+Result<std::optional<uint64_t>> TremorStore::inodeForDocumentId(uint32_t docID) const {
     std::lock_guard lock(mutex_);
-    return orLogged(index_->inodeForDocumentId(docID));
+    return index_->inodeForDocumentId(docID);
 }
 
-std::optional<uint32_t> TremorStore::documentIdForInode(uint64_t inode) const {
+Result<std::optional<uint32_t>> TremorStore::documentIdForInode(uint64_t inode) const {
     std::lock_guard lock(mutex_);
-    return orLogged(index_->documentIdForInode(inode));
+    return index_->documentIdForInode(inode);
 }
 
 Status TremorStore::moveDocumentId(uint32_t docID, uint64_t newInode) {
@@ -516,14 +493,9 @@ Status TremorStore::clearDocumentId(uint32_t docID) {
     return index_->clearDocumentId(docID);
 }
 
-TremorStore::Attributes TremorStore::documentAttributes(uint32_t docID) const {
+Result<TremorStore::Attributes> TremorStore::documentAttributes(uint32_t docID) const {
     std::lock_guard lock(mutex_);
-    auto result = index_->documentAttributes(docID);
-    if (!result) {
-        logError(result.error().description());
-        return {};
-    }
-    return std::move(result).value();
+    return index_->documentAttributes(docID);
 }
 
 Status TremorStore::setDocumentAttribute(uint32_t docID, const std::string& name,

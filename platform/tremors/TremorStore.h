@@ -143,20 +143,22 @@ public:
     // document moved to another inode (moveDocumentId) or was deleted (clearDocumentId), and
     // journals that first.
     Status removeInodes(const std::vector<uint64_t>& inodes);
-    std::optional<InodeRecord> inode(uint64_t inode) const;
+    // The reads below fail with the database's error rather than answer "nothing": an index
+    // that could not be read is not an empty one.
+    Result<std::optional<InodeRecord>> inode(uint64_t inode) const;
     // The absolute path, from the parent chain up to a root's inode. Nothing for inodes outside
     // the watched roots, broken or cyclic chains, or chains deeper than kMaxPathComponents.
-    std::optional<std::string> pathForInode(uint64_t inode) const;
-    std::vector<InodeRecord> children(uint64_t parent) const;
+    Result<std::optional<std::string>> pathForInode(uint64_t inode) const;
+    Result<std::vector<InodeRecord>> children(uint64_t parent) const;
     // The entries indexed under that name in `parent`: one, unless events were lost.
-    std::vector<InodeRecord> childrenNamed(uint64_t parent, const std::string& name) const;
+    Result<std::vector<InodeRecord>> childrenNamed(uint64_t parent, const std::string& name) const;
 
     // ---- Document IDs ----
 
     // The inode's document ID, or the next one (from 1, never reused).
     Result<uint32_t> allocateDocumentId(uint64_t inode);
-    std::optional<uint64_t> inodeForDocumentId(uint32_t docID) const;
-    std::optional<uint32_t> documentIdForInode(uint64_t inode) const;
+    Result<std::optional<uint64_t>> inodeForDocumentId(uint32_t docID) const;
+    Result<std::optional<uint32_t>> documentIdForInode(uint64_t inode) const;
     // A safe save: the ID follows the document to `newInode` and the old inode loses it. Fails
     // when `newInode` already has another ID (clear that one first).
     Status moveDocumentId(uint32_t docID, uint64_t newInode);
@@ -169,7 +171,7 @@ public:
     // ---- Copies of the documents' metadata attributes (raw bytes by attribute name) ----
 
     using Attributes = InodeIndex::Attributes;
-    Attributes documentAttributes(uint32_t docID) const;
+    Result<Attributes> documentAttributes(uint32_t docID) const;
     // Nothing as `value` drops that attribute from the copy.
     Status setDocumentAttribute(uint32_t docID, const std::string& name,
                                 const std::optional<Bytes>& value);

@@ -59,26 +59,26 @@ Error TremorStoreSchema::corrupt(const std::string& what) {
 }
 
 Status TremorStoreSchema::prepare(SqliteDatabase& db, const std::string& directory) {
-    if (Status status = configure(db))
+    if (Status status = configure(db); !status.ok())
         return status;
 
     auto version = db.queryInt64("PRAGMA user_version");
-    if (!version)
+    if (!version.ok())
         return version.error();
     if (version.value() == 0) {
         auto objects = db.queryInt64("SELECT count(*) FROM sqlite_schema");
-        if (!objects)
+        if (!objects.ok())
             return objects.error();
         if (objects.value() != 0)
             return corrupt("tables without a schema version");
-        if (Status status = create(db, directory))
+        if (Status status = create(db, directory); !status.ok())
             return status;
     } else if (version.value() < 1 || version.value() > kVersion) {
         return corrupt("schema version " + std::to_string(version.value()) + ", expected " +
                        std::to_string(kVersion));
     } else {
         auto check = db.queryText("PRAGMA quick_check(1)");
-        if (!check)
+        if (!check.ok())
             return check.error();
         if (check.value() != "ok") {
             std::string found = check.value();
@@ -86,21 +86,22 @@ Status TremorStoreSchema::prepare(SqliteDatabase& db, const std::string& directo
             return corrupt("quick check: " + found);
         }
         if (version.value() < kVersion) {
-            if (Status status = upgrade(db, directory, version.value()))
+            if (Status status = upgrade(db, directory, version.value()); !status.ok())
                 return status;
         }
     }
-    return std::nullopt;
+    return Status::OK();
 }
 
 Status TremorStoreSchema::configure(SqliteDatabase& db) {
     // The directory lock already keeps every other Tamber process out, so the connection may
     // keep its file locks for good: that saves two fcntl calls per statement, and with WAL
     // entered in this mode the WAL index lives in memory rather than in a -shm file.
-    if (Status status = db.exec("PRAGMA busy_timeout = 5000; PRAGMA locking_mode = EXCLUSIVE"))
+    if (Status status = db.exec("PRAGMA busy_timeout = 5000; PRAGMA locking_mode = EXCLUSIVE");
+        !status.ok())
         return status;
     auto mode = db.queryText("PRAGMA journal_mode = WAL");
-    if (!mode)
+    if (!mode.ok())
         return mode.error();
     if (mode.value() != "wal") {
         return SqliteDatabase::makeError(SQLITE_ERROR, "switching to WAL", "mode " + mode.value());
@@ -112,47 +113,48 @@ Status TremorStoreSchema::configure(SqliteDatabase& db) {
 
 Status TremorStoreSchema::create(SqliteDatabase& db, const std::string& directory) {
     auto uuid = randomUuid();
-    if (!uuid)
+    if (!uuid.ok())
         return uuid.error();
     auto txn = db.begin();
-    if (!txn)
+    if (!txn.ok())
         return txn.error();
     if (Status status =
-            db.exec(std::string(kSchema) + WatchedRoots::schema() + InodeIndex::schema()))
+            db.exec(std::string(kSchema) + WatchedRoots::schema() + InodeIndex::schema());
+        !status.ok())
         return status;
     auto insert = db.prepare(
         "INSERT INTO meta(id, uuid, next_event_id, oldest_event_id, next_document_id) "
         "VALUES(1, ?, 1, 1, 1)");
-    if (!insert)
+    if (!insert.ok())
         return insert.error();
-    if (Status status = insert->bind(1, uuid.value()).run())
+    if (Status status = insert->bind(1, uuid.value()).run(); !status.ok())
         return status;
-    if (Status status = db.exec("PRAGMA user_version = " + std::to_string(kVersion)))
+    if (Status status = db.exec("PRAGMA user_version = " + std::to_string(kVersion)); !status.ok())
         return status;
-    if (Status status = txn->commit())
+    if (Status status = txn->commit(); !status.ok())
         return status;
     logInfo("Started a new event journal " + uuid.value() + " in " + directory);
-    return std::nullopt;
+    return Status::OK();
 }
 
 Status TremorStoreSchema::upgrade(SqliteDatabase& db, const std::string& directory, int64_t from) {
     // Only the index changed: the journal, the roots and the document IDs stay as they are.
     auto txn = db.begin();
-    if (!txn)
+    if (!txn.ok())
         return txn.error();
     for (int64_t version = from; version < kVersion; ++version) {
         if (const char* sql = InodeIndex::upgradeFrom(version)) {
-            if (Status status = db.exec(sql))
+            if (Status status = db.exec(sql); !status.ok())
                 return status;
         }
     }
-    if (Status status = db.exec("PRAGMA user_version = " + std::to_string(kVersion)))
+    if (Status status = db.exec("PRAGMA user_version = " + std::to_string(kVersion)); !status.ok())
         return status;
-    if (Status status = txn->commit())
+    if (Status status = txn->commit(); !status.ok())
         return status;
     logInfo("Upgraded the event journal in " + directory + " from schema " + std::to_string(from) +
             " to " + std::to_string(kVersion));
-    return std::nullopt;
+    return Status::OK();
 }
 
 }  // namespace tamber

@@ -57,8 +57,8 @@ bool TremorStream::start() {
     } else if (first) {
         for (const auto& path : options_.paths) {
             // A stream for a tree nobody watched yet makes the service watch it.
-            if (auto error = service_->watchTree(path)) {
-                logError("Cannot watch " + path + ": " + error->description());
+            if (auto status = service_->watchTree(path); !status.ok()) {
+                logError("Cannot watch " + path + ": " + status.error().description());
                 return false;
             }
         }
@@ -150,8 +150,8 @@ void TremorStream::replay(uint64_t since, uint64_t ceiling, uint64_t run) {
             }
             return going;
         });
-    if (status)
-        logError("Replay failed: " + status->description());
+    if (!status.ok())
+        logError("Replay failed: " + status.error().description());
     if (!going || !deliver(batch, run))
         return;
     bool owed;

@@ -40,7 +40,7 @@ std::string WatchedRoots::normalised(std::string path) {
 Status WatchedRoots::load() {
     rows_.clear();
     auto stmt = db_.prepare("SELECT id, path, since_event_id, inode, active FROM roots");
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     Result<bool> r = stmt->step();
     for (; r.ok() && r.value(); r = stmt->step()) {
@@ -53,9 +53,9 @@ Status WatchedRoots::load() {
                                                          : State::Unwatched;
         rows_.push_back(std::move(row));
     }
-    if (!r)
+    if (!r.ok())
         return r.error();
-    return std::nullopt;
+    return Status::OK();
 }
 
 WatchedRoots::Row* WatchedRoots::find(const std::string& path) {
@@ -69,7 +69,7 @@ Status WatchedRoots::write(const Row& row) {
         "INSERT INTO roots(id, path, since_event_id, inode, active) VALUES(?, ?, ?, ?, ?) "
         "ON CONFLICT(id) DO UPDATE SET since_event_id = excluded.since_event_id, "
         "inode = excluded.inode, active = excluded.active");
-    if (!stmt)
+    if (!stmt.ok())
         return stmt.error();
     return stmt->bind(1, toSqlite(row.root.id))
         .bind(2, row.root.path)
@@ -93,7 +93,7 @@ Status WatchedRoots::add(const std::string& rawPath, uint64_t sinceEventId, uint
     } else if (existing->watched()) {
         existing->live = true;
         if (inode == 0 || inode == existing->root.inode)
-            return std::nullopt;
+            return Status::OK();
         updated = *existing;
         updated.root.inode = inode;
     } else {
@@ -104,14 +104,14 @@ Status WatchedRoots::add(const std::string& rawPath, uint64_t sinceEventId, uint
         updated.state = State::Watched;
     }
     updated.live = true;
-    if (Status status = write(updated))
+    if (Status status = write(updated); !status.ok())
         return status;
     if (existing) {
         *existing = std::move(updated);
     } else {
         rows_.push_back(std::move(updated));
     }
-    return std::nullopt;
+    return Status::OK();
 }
 
 Status WatchedRoots::setInode(const std::string& path, uint64_t inode) {
@@ -120,24 +120,24 @@ Status WatchedRoots::setInode(const std::string& path, uint64_t inode) {
         return Error::invalidParameter("root", path);
     Row updated = *row;
     updated.root.inode = inode;
-    if (Status status = write(updated))
+    if (Status status = write(updated); !status.ok())
         return status;
     *row = std::move(updated);
-    return std::nullopt;
+    return Status::OK();
 }
 
 Status WatchedRoots::remove(const std::string& path) {
     Row* row = find(normalised(path));
     if (!row || !row->watched())
-        return std::nullopt;
+        return Status::OK();
     Row updated = *row;
     updated.state = State::Unwatched;
     updated.live = false;
     updated.root.inode = 0;
-    if (Status status = write(updated))
+    if (Status status = write(updated); !status.ok())
         return status;
     *row = std::move(updated);
-    return std::nullopt;
+    return Status::OK();
 }
 
 bool WatchedRoots::resume(const std::string& path) {
@@ -161,8 +161,8 @@ Result<std::vector<std::string>> WatchedRoots::retire() {
         // The inode stays: a later forget still finds the tree's index entries from it.
         Row updated = row;
         updated.state = State::Unwatched;
-        if (Status status = write(updated))
-            return *status;
+        if (Status status = write(updated); !status.ok())
+            return status.error();
         row = std::move(updated);
         retired.push_back(row.root.path);
     }
@@ -178,8 +178,8 @@ Result<WatchedRoots::Forgotten> WatchedRoots::forget(const std::string& path) {
     updated.state = State::Forgotten;
     updated.live = false;
     updated.root.inode = 0;
-    if (Status status = write(updated))
-        return *status;
+    if (Status status = write(updated); !status.ok())
+        return status.error();
     Forgotten forgotten{row->root.inode, {}};
     *row = std::move(updated);
     for (const Row& other : rows_) {

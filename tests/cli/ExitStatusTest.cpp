@@ -13,11 +13,11 @@
 #include <stdexcept>
 
 #include "cli/CommandLine.h"
-#include "runtime/JsonValues.h"
 #include "items/ItemMetadata.h"
 #include "platform/FaultInjectingFileSystem.h"
 #include "platform/LinuxFileSystem.h"
 #include "platform/tremors/TremorService.h"
+#include "runtime/JsonValues.h"
 #include "support/Log.h"
 #include "support/StderrLogSink.h"
 #include "tests/common/CliRunner.h"
@@ -200,7 +200,7 @@ TEST_F(ExitStatusTest, DatesWithoutACalendarDatePrintAsNull) {
     ASSERT_EQ(tamber({"item", file}).status, 0);
     for (double seconds : {std::numeric_limits<double>::quiet_NaN(),
                            std::numeric_limits<double>::infinity(), 1e300, -1e300, 4e11}) {
-        ASSERT_FALSE(ItemMetadata::writeLastUsedDate(url, Date::make(seconds)));
+        ASSERT_TRUE(ItemMetadata::writeLastUsedDate(url, Date::make(seconds)).ok());
         EXPECT_TRUE(dateJson(Date::make(seconds)).is_null()) << seconds;
 
         json item = json::parse(tamber({"item", file, "--json"}).out, nullptr, false);

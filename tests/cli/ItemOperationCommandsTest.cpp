@@ -166,9 +166,10 @@ TEST_F(ItemOperationCommandsTest, TrashUntrashAndPurgeByAge) {
     tamberJson({"trash", old});
     tamberJson({"trash", fresh});
     // Trashed forty days ago.
-    ASSERT_FALSE(ItemMetadata::writeTrashDate(
-        Url::fileURLWithPath(library + "/.Trash/old.txt"),
-        Date::make(Date::now()->timeIntervalSince1970() - 40 * 86400)));
+    ASSERT_TRUE(
+        ItemMetadata::writeTrashDate(Url::fileURLWithPath(library + "/.Trash/old.txt"),
+                                     Date::make(Date::now()->timeIntervalSince1970() - 40 * 86400))
+            .ok());
 
     EXPECT_EQ(tamberJson({"purge-trash", "--older-than", "30d"}), (json{{"removed", 1}}));
     EXPECT_FALSE(std::filesystem::exists(library + "/.Trash/old.txt"));

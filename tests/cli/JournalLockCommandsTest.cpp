@@ -38,7 +38,7 @@ protected:
         if (!service.ok())
             return {};
         holder = service.value();
-        EXPECT_FALSE(holder->watchTree(storage));
+        EXPECT_TRUE(holder->watchTree(storage).ok());
         auto device = holder->deviceForPath(storage);
         EXPECT_TRUE(device);
         TremorStore* store = device ? holder->storeForDevice(*device) : nullptr;

@@ -107,8 +107,8 @@ protected:
         // The host registers the trees it publishes with the journal before it browses them.
         auto service = TremorService::shared();
         ASSERT_TRUE(service.ok());
-        ASSERT_FALSE(service.value()->watchTree(storage));
-        ASSERT_FALSE(service.value()->watchTree(library));
+        ASSERT_TRUE(service.value()->watchTree(storage).ok());
+        ASSERT_TRUE(service.value()->watchTree(library).ok());
     }
     void TearDown() override {
         if (enumerator)

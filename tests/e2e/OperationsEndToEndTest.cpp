@@ -16,9 +16,12 @@ protected:
         std::pair<LocalItemRef, std::optional<Error>> result;
         DispatchSemaphore done;
         int calls = 0;
-        operation([&](HostPorterItemRef item, std::optional<Error> error) {
+        operation([&](Result<HostPorterItemRef> item) {
             ++calls;
-            result = {std::dynamic_pointer_cast<const LocalItem>(item), error};
+            if (item.ok())
+                result.first = std::dynamic_pointer_cast<const LocalItem>(item.value());
+            else
+                result.second = item.error();
             done.signal();
         });
         EXPECT_TRUE(done.wait(10));
@@ -33,8 +36,9 @@ protected:
     std::optional<Error> remove(const HostPorterItemIdentifier& identifier) {
         std::optional<Error> error;
         DispatchSemaphore done;
-        porter->deleteItemWithIdentifier(identifier, [&](std::optional<Error> e) {
-            error = e;
+        porter->deleteItemWithIdentifier(identifier, [&](Status status) {
+            if (!status.ok())
+                error = status.error();
             done.signal();
         });
         EXPECT_TRUE(done.wait(10));

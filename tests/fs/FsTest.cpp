@@ -70,7 +70,7 @@ void TremorTest::SetUp() {
     storage_ = host->documentStorageURL().path();
     auto shared = TremorService::shared();
     ASSERT_TRUE(shared.ok()) << shared.error().description();
-    ASSERT_FALSE(shared.value()->watchTree(storage_));
+    ASSERT_TRUE(shared.value()->watchTree(storage_).ok());
 }
 
 void TremorTest::TearDown() {

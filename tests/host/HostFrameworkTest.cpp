@@ -50,19 +50,19 @@ TEST(HostPorterExtensionTest, OperationsAProviderLeavesOutCompleteOnceAsUnsuppor
     HostPorterExtension provider;
     std::vector<std::string> answered;  // one entry per completion call
     auto item = [&](const std::string& operation) {
-        return [&answered, operation](HostPorterItemRef received, std::optional<Error> error) {
-            EXPECT_FALSE(received) << operation;
-            ASSERT_TRUE(error) << operation;
-            EXPECT_TRUE(error->is(kHostPorterErrorDomain, kHostPorterFeatureUnsupported))
+        return [&answered, operation](Result<HostPorterItemRef> received) {
+            ASSERT_FALSE(received.ok()) << operation;
+            const Error& error = received.error();
+            EXPECT_TRUE(error.is(kHostPorterErrorDomain, kHostPorterFeatureUnsupported))
                 << operation;
-            EXPECT_NE(error->reason().find("not supported"), std::string::npos) << operation;
+            EXPECT_NE(error.reason().find("not supported"), std::string::npos) << operation;
             answered.push_back(operation);
         };
     };
     auto status = [&](const std::string& operation) {
-        return [&answered, operation](std::optional<Error> error) {
-            ASSERT_TRUE(error) << operation;
-            EXPECT_TRUE(error->is(kHostPorterErrorDomain, kHostPorterFeatureUnsupported))
+        return [&answered, operation](Status status) {
+            ASSERT_FALSE(status.ok()) << operation;
+            EXPECT_TRUE(status.error().is(kHostPorterErrorDomain, kHostPorterFeatureUnsupported))
                 << operation;
             answered.push_back(operation);
         };
@@ -112,18 +112,17 @@ TEST(HostPorterExtensionTest, CreatingAFolderWithoutTheFlagBounces) {
         void createDirectoryWithName(const std::string&, const HostPorterItemIdentifier&,
                                      bool bounce, ItemCompletion completion) override {
             bounces.push_back(bounce);
-            completion(nullptr, Error::posix(EEXIST));
+            completion(Error::posix(EEXIST));
         }
         using HostPorterExtension::createDirectoryWithName;
     } provider;
     int calls = 0;
     HostPorterExtension& host = provider;
-    host.createDirectoryWithName("a", "fid=2", [&](HostPorterItemRef, std::optional<Error> error) {
+    host.createDirectoryWithName("a", "fid=2", [&](Result<HostPorterItemRef> made) {
         ++calls;
-        EXPECT_TRUE(error && error->is(kPosixErrorDomain, EEXIST));
+        EXPECT_TRUE(!made.ok() && made.error().is(kPosixErrorDomain, EEXIST));
     });
-    host.createDirectoryWithName("a", "fid=2", false,
-                                 [&](HostPorterItemRef, std::optional<Error>) { ++calls; });
+    host.createDirectoryWithName("a", "fid=2", false, [&](Result<HostPorterItemRef>) { ++calls; });
     EXPECT_EQ(calls, 2);
     EXPECT_EQ(provider.bounces, (std::vector<bool>{true, false}));
 }

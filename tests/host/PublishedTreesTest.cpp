@@ -36,9 +36,11 @@ struct Outcome {
 template <class Operation>
 Outcome run(Operation operation) {
     Outcome outcome;
-    operation([&](std::optional<Url> url, std::optional<Error> error) {
-        outcome.url = std::move(url);
-        outcome.error = std::move(error);
+    operation([&](Result<Url> result) {
+        if (result.ok())
+            outcome.url = std::move(result).value();
+        else
+            outcome.error = result.error();
     });
     return outcome;
 }
@@ -48,6 +50,10 @@ std::string descriptionOf(const std::optional<Error>& error) {
         return "<no error>";
     auto it = error->userInfo().find("description");
     return it == error->userInfo().end() ? error->description() : it->second;
+}
+
+std::string descriptionOf(const Status& status) {
+    return descriptionOf(status.ok() ? std::nullopt : std::optional<Error>(status.error()));
 }
 
 // A storage folder "storage", an app library "apps/lib/Documents", and "outside" beside them;
@@ -72,7 +78,10 @@ protected:
         HostPorterManager::installDefaultManager(previous_);
     }
     static bool refused(const Status& status) {
-        return status && PublishedTrees::isOutsideError(*status);
+        return !status.ok() && PublishedTrees::isOutsideError(status.error());
+    }
+    static bool refused(const std::optional<Error>& error) {
+        return error && PublishedTrees::isOutsideError(*error);
     }
     static bool refused(const Outcome& outcome) { return refused(outcome.error); }
 
@@ -85,11 +94,27 @@ private:
     std::string previousLedger_;
 };
 
+// A refusal is known by its mark, never by its words: another "no such item" that happens to
+// say the same, or one that wraps a refusal under a description of its own, is not one.
+TEST_F(PublishedTreesTest, ARefusalIsKnownByItsMarkNotItsText) {
+    Error refusal = PublishedTrees::outsideError(at(outside + "/f"));
+    EXPECT_TRUE(PublishedTrees::isOutsideError(refusal));
+    Error sameWords(kHostPorterErrorDomain, kHostPorterNoSuchItem,
+                    {{"description", PublishedTrees::kOutsideMessage}});
+    EXPECT_FALSE(PublishedTrees::isOutsideError(sameWords));
+
+    std::map<std::string, std::string> info = refusal.userInfo();
+    info["description"] = "can't list " + outside + ": " + refusal.reason();
+    Error wrapped = PublishedTrees::unmarked(Error(refusal.domain(), refusal.code(), info));
+    EXPECT_FALSE(PublishedTrees::isOutsideError(wrapped));
+    EXPECT_EQ(wrapped.userInfo().at("path"), outside + "/f") << "the rest of the info stays";
+}
+
 TEST_F(PublishedTreesTest, InsideMeansAtOrBelowARootWithoutALinkOnTheWay) {
-    EXPECT_FALSE(PublishedTrees::check(at(storage)));
-    EXPECT_FALSE(PublishedTrees::check(at(storage + "/Work/new.txt")));
-    EXPECT_FALSE(PublishedTrees::check(at(library + "/a/b")));
-    EXPECT_FALSE(PublishedTrees::check(at(storage + "/away"))) << "a link is an item";
+    EXPECT_TRUE(PublishedTrees::check(at(storage)).ok());
+    EXPECT_TRUE(PublishedTrees::check(at(storage + "/Work/new.txt")).ok());
+    EXPECT_TRUE(PublishedTrees::check(at(library + "/a/b")).ok());
+    EXPECT_TRUE(PublishedTrees::check(at(storage + "/away")).ok()) << "a link is an item";
     EXPECT_EQ(PublishedTrees::rootOf(at(library + "/x"))->path(), library);
 
     for (const std::string& path :
@@ -97,8 +122,8 @@ TEST_F(PublishedTreesTest, InsideMeansAtOrBelowARootWithoutALinkOnTheWay) {
           storage + "/away/sub/f", std::string("/")}) {
         Status status = PublishedTrees::check(at(path));
         ASSERT_TRUE(refused(status)) << path;
-        EXPECT_EQ(status->domain(), kHostPorterErrorDomain);
-        EXPECT_EQ(status->code(), kHostPorterNoSuchItem);
+        EXPECT_EQ(status.error().domain(), kHostPorterErrorDomain);
+        EXPECT_EQ(status.error().code(), kHostPorterNoSuchItem);
         EXPECT_EQ(descriptionOf(status), "not inside the document storage or an app library");
     }
     // Without the library hook only the storage is published.
@@ -121,8 +146,8 @@ TEST_F(PublishedTreesTest, OperationsRefuseOutsideBeforeTouchingAnything) {
     EXPECT_TRUE(refused(run([&](auto done) { pt_renameWithNewName(at(source), "c.txt", done); })));
     EXPECT_TRUE(refused(run(
         [&](auto done) { pt_trashUnderFolder(at(file), at(storage + "/away/.Trash"), done); })));
-    std::optional<Error> deleted;
-    pt_deleteWithCompletionHandler(at(outside + "/x"), [&](auto error) { deleted = error; });
+    Status deleted;
+    pt_deleteWithCompletionHandler(at(outside + "/x"), [&](Status status) { deleted = status; });
     EXPECT_TRUE(refused(deleted));
 
     bool ran = false;
@@ -131,7 +156,7 @@ TEST_F(PublishedTreesTest, OperationsRefuseOutsideBeforeTouchingAnything) {
     EXPECT_FALSE(pt_withReadWriteAccess(at(storage + "/away/x"), [&](int) { return ran = true; }));
     EXPECT_FALSE(ran);
     EXPECT_TRUE(pt_withReadWriteAccess(at(file), [&](int fd) { return fd >= 0; }));
-    EXPECT_TRUE(refused(pt_directorySizeWithError(at(outside)).error()));
+    EXPECT_TRUE(refused(pt_directorySizeWithError(at(outside)).status()));
 
     EXPECT_TRUE(fs::exists(file));
     EXPECT_TRUE(fs::exists(source));
@@ -153,9 +178,9 @@ TEST_F(PublishedTreesTest, ALinkInsideIsMovedRenamedAndDeletedAsALink) {
     });
     ASSERT_TRUE(imported.url) << descriptionOf(imported.error);
     EXPECT_TRUE(fs::is_symlink(storage + "/Work/gone"));
-    std::optional<Error> deleted = Error::posix(EIO);
-    pt_deleteWithCompletionHandler(at(library + "/gone"), [&](auto error) { deleted = error; });
-    EXPECT_FALSE(deleted);
+    Status deleted = Error::posix(EIO);
+    pt_deleteWithCompletionHandler(at(library + "/gone"), [&](Status status) { deleted = status; });
+    EXPECT_TRUE(deleted.ok());
     EXPECT_FALSE(fs::exists(fs::symlink_status(library + "/gone")));
     EXPECT_TRUE(fs::exists(outside + "/keep.txt"));
 }
@@ -185,7 +210,7 @@ private:
 TEST_F(PublishedTreesTest, AFolderSwappedForALinkAfterTheLookupIsRefused) {
     std::string file = dir.writeFile("storage/a.txt", "a");
     dir.makeDir("storage/Work/Sub");
-    ASSERT_FALSE(PublishedTrees::check(at(storage + "/Work/Sub")));
+    ASSERT_TRUE(PublishedTrees::check(at(storage + "/Work/Sub")).ok());
     auto swapping = std::make_shared<SwappingFileSystem>(storage + "/Work", outside);
     {
         testing::ScopedFileSystem scoped(swapping);
@@ -199,15 +224,15 @@ TEST_F(PublishedTreesTest, AFolderSwappedForALinkAfterTheLookupIsRefused) {
 }
 
 TEST_F(PublishedTreesTest, ALinkedTrashIsRefusedAndAMissingOneMade) {
-    EXPECT_FALSE(pt_ensureTrashFolder(at(library + "/.Trash")));
+    EXPECT_TRUE(pt_ensureTrashFolder(at(library + "/.Trash")).ok());
     EXPECT_TRUE(fs::is_directory(library + "/.Trash"));
-    EXPECT_FALSE(pt_ensureTrashFolder(at(library + "/.Trash"))) << "an existing one is fine";
+    EXPECT_TRUE(pt_ensureTrashFolder(at(library + "/.Trash")).ok()) << "an existing one is fine";
     fs::create_directory_symlink(outside, storage + "/.Trash");
     EXPECT_TRUE(refused(pt_ensureTrashFolder(at(storage + "/.Trash"))));
     dir.writeFile("storage/Work/.Trash", "not a folder");
     Status file = pt_ensureTrashFolder(at(storage + "/Work/.Trash"));
-    ASSERT_TRUE(file);
-    EXPECT_TRUE(file->is(kPosixErrorDomain, ENOTDIR));
+    ASSERT_FALSE(file.ok());
+    EXPECT_TRUE(file.error().is(kPosixErrorDomain, ENOTDIR));
 }
 
 TEST_F(PublishedTreesTest, CreateFailsOnATakenNameUnlessItBounces) {

@@ -38,10 +38,12 @@ template <class Operation>
 Outcome run(Operation operation) {
     Outcome outcome;
     int calls = 0;
-    operation([&](std::optional<Url> url, std::optional<Error> error) {
+    operation([&](Result<Url> result) {
         ++calls;
-        outcome.url = std::move(url);
-        outcome.error = std::move(error);
+        if (result.ok())
+            outcome.url = std::move(result).value();
+        else
+            outcome.error = result.error();
     });
     EXPECT_EQ(calls, 1);
     EXPECT_NE(outcome.url.has_value(), outcome.error.has_value());
@@ -51,9 +53,10 @@ Outcome run(Operation operation) {
 std::optional<Error> runDelete(const std::string& path) {
     int calls = 0;
     std::optional<Error> result;
-    pt_deleteWithCompletionHandler(at(path), [&](std::optional<Error> error) {
+    pt_deleteWithCompletionHandler(at(path), [&](Status status) {
         ++calls;
-        result = std::move(error);
+        if (!status.ok())
+            result = status.error();
     });
     EXPECT_EQ(calls, 1);
     return result;

@@ -43,7 +43,7 @@ protected:
     void store(const std::string& name, const ObjectRef& object) {
         auto data = KeyedArchiver::archivedDataWithRootObject(object);
         ASSERT_TRUE(data.ok());
-        ASSERT_FALSE(ItemMetadata::writeAttributeData(file, name, data.value()).has_value());
+        ASSERT_TRUE(ItemMetadata::writeAttributeData(file, name, data.value()).ok());
     }
 
     testing::TempDir dir;
@@ -57,13 +57,13 @@ TEST_F(ExtendedAttributesTest, RoundTripAndMissingAttributesAreSilent) {
     ScopedLogCapture log;
     EXPECT_FALSE(ReadXattrData(kName, file).has_value());
     Bytes value{0, 1, 2, 0xff, 0};
-    ASSERT_FALSE(ItemMetadata::writeAttributeData(file, kName, value).has_value());
+    ASSERT_TRUE(ItemMetadata::writeAttributeData(file, kName, value).ok());
     EXPECT_EQ(ReadXattrData(kName, file), value);
     char raw[16];  // stored in the user namespace under the same name
     EXPECT_EQ(::getxattr(file.path().c_str(), ("user." + kName).c_str(), raw, sizeof raw), 5);
-    ASSERT_FALSE(ItemMetadata::writeAttributeData(file, kName, std::nullopt).has_value());
+    ASSERT_TRUE(ItemMetadata::writeAttributeData(file, kName, std::nullopt).ok());
     EXPECT_FALSE(ReadXattrData(kName, file).has_value());
-    EXPECT_FALSE(ItemMetadata::writeAttributeData(file, kName, std::nullopt).has_value());
+    EXPECT_TRUE(ItemMetadata::writeAttributeData(file, kName, std::nullopt).ok());
     EXPECT_TRUE(log->lines().empty());
 }
 
@@ -102,8 +102,8 @@ TEST_F(ExtendedAttributesTest, RefusedSetIsDebugOtherFailuresAreErrors) {
         fs->inject(c.op, c.error);
         auto data = c.op == Op::Fsetxattr ? std::optional(Bytes{1}) : std::nullopt;
         Status status = SetOrRemoveXattr(fd, data, kName);
-        ASSERT_TRUE(status.has_value()) << c.line;
-        EXPECT_EQ(*status, Error::posix(c.error));
+        ASSERT_FALSE(status.ok()) << c.line;
+        EXPECT_EQ(status.error(), Error::posix(c.error));
         EXPECT_EQ(log->texts(), std::vector<std::string>{c.line + kName + "\"; " +
                                                          Error::posix(c.error).description()});
     }
@@ -111,10 +111,11 @@ TEST_F(ExtendedAttributesTest, RefusedSetIsDebugOtherFailuresAreErrors) {
 }
 
 TEST_F(ExtendedAttributesTest, MetadataReadsBackAndOnlyNothingRemovesIt) {
-    ASSERT_FALSE(ItemMetadata::writeTagData(
-        file, GetTagsDataForTags({Tag::make("Red", 6), Tag::make("Home", 0)})));
-    ASSERT_FALSE(ItemMetadata::writeLastUsedDate(file, Date::make(1700000000.25)));
-    ASSERT_FALSE(ItemMetadata::writeFavoriteRank(file, Number::fromInt64(-3)));
+    ASSERT_TRUE(ItemMetadata::writeTagData(
+                    file, GetTagsDataForTags({Tag::make("Red", 6), Tag::make("Home", 0)}))
+                    .ok());
+    ASSERT_TRUE(ItemMetadata::writeLastUsedDate(file, Date::make(1700000000.25)).ok());
+    ASSERT_TRUE(ItemMetadata::writeFavoriteRank(file, Number::fromInt64(-3)).ok());
     ItemMetadata m = ItemMetadata::read(file);
     ASSERT_TRUE(m.lastUsedDate && m.favoriteRank && m.tagData);
     EXPECT_EQ(m.lastUsedDate->timeIntervalSince1970(), 1700000000.25);
@@ -125,10 +126,10 @@ TEST_F(ExtendedAttributesTest, MetadataReadsBackAndOnlyNothingRemovesIt) {
     ASSERT_TRUE(tags && tags->size() == 2);
     EXPECT_EQ((*tags)[0]->colour(), 0);
 
-    ASSERT_FALSE(ItemMetadata::writeLastUsedDate(file, nullptr));
-    ASSERT_FALSE(ItemMetadata::writeFavoriteRank(file, nullptr));
+    ASSERT_TRUE(ItemMetadata::writeLastUsedDate(file, nullptr).ok());
+    ASSERT_TRUE(ItemMetadata::writeFavoriteRank(file, nullptr).ok());
     // Garbage tag data writes an empty list, never removes.
-    ASSERT_FALSE(ItemMetadata::writeTagData(file, Bytes{1, 2}));
+    ASSERT_TRUE(ItemMetadata::writeTagData(file, Bytes{1, 2}).ok());
     m = ItemMetadata::read(file);
     EXPECT_FALSE(m.lastUsedDate || m.favoriteRank);
     EXPECT_TRUE(ReadXattrData(LocalItem::xattrTagDataName(), file).has_value());
@@ -139,8 +140,9 @@ TEST_F(ExtendedAttributesTest, ValuesOfTheWrongClassOrGarbageReadAsAbsent) {
     store(LocalItem::xattrLastUsedDateName(), String::make("yesterday"));
     store(LocalItem::xattrFavoriteRankName(), Date::make(1));
     store(LocalItem::xattrTagDataName(), Array::make({Number::fromInt64(1)}));
-    ASSERT_FALSE(ItemMetadata::writeAttributeData(file, LocalItem::xattrTrashPutBackName(),
-                                                  Bytes{'b', 'p', 'l', 'i', 's', 't'}));
+    ASSERT_TRUE(ItemMetadata::writeAttributeData(file, LocalItem::xattrTrashPutBackName(),
+                                                 Bytes{'b', 'p', 'l', 'i', 's', 't'})
+                    .ok());
     ItemMetadata m = ItemMetadata::read(file);
     EXPECT_FALSE(m.lastUsedDate || m.favoriteRank || m.putBack);
     EXPECT_FALSE(m.tagLabels.has_value() || m.tagData.has_value());
@@ -179,16 +181,16 @@ TEST_F(ExtendedAttributesTest, TheDocumentIdServiceHearsOfEveryWriteThatHappened
     ASSERT_EQ(::stat(file.path().c_str(), &st), 0);
     const std::string& tags = LocalItem::xattrTagDataName();
     Bytes value{1, 2, 3};
-    EXPECT_FALSE(ItemMetadata::writeAttributeData(file, tags, value));
-    EXPECT_FALSE(ItemMetadata::writeAttributeData(file, tags, std::nullopt));
-    EXPECT_FALSE(
-        ItemMetadata::writeAttributeData(file, tags, std::nullopt));  // not there: still a removal
+    EXPECT_TRUE(ItemMetadata::writeAttributeData(file, tags, value).ok());
+    EXPECT_TRUE(ItemMetadata::writeAttributeData(file, tags, std::nullopt).ok());
+    EXPECT_TRUE(ItemMetadata::writeAttributeData(file, tags, std::nullopt)
+                    .ok());  // not there: still a removal
     {
         ScopedLogCapture quiet;
         fs->inject(Op::Fsetxattr, ENOSPC);
-        EXPECT_TRUE(ItemMetadata::writeAttributeData(file, tags, value));
+        EXPECT_FALSE(ItemMetadata::writeAttributeData(file, tags, value).ok());
         fs->inject(Op::Fremovexattr, EACCES);
-        EXPECT_TRUE(ItemMetadata::writeAttributeData(file, tags, std::nullopt));
+        EXPECT_FALSE(ItemMetadata::writeAttributeData(file, tags, std::nullopt).ok());
     }
     StrataService::setCurrent(previous);
     using Write = RecordingStrataService::Write;

@@ -209,7 +209,7 @@ TEST_F(ItemTest, DescriptionNamesParentTypeTrashAndRank) {
                                         " name:\"a.txt\" parent:root type:public.plain-text>");
 
     std::string old = dir.writeFile("Documents/.Trash/old.txt", "x");
-    if (ItemMetadata::writeFavoriteRank(Url::fileURLWithPath(old), Number::fromInt64(3)))
+    if (!ItemMetadata::writeFavoriteRank(Url::fileURLWithPath(old), Number::fromInt64(3)).ok())
         GTEST_SKIP() << "no user attributes on this file system";
     auto trashed = make(old);
     ASSERT_TRUE(trashed);
@@ -288,7 +288,7 @@ TEST_F(ItemTest, AppLibraryCountLeavesOutWhatListingsLeaveOut) {
 TEST_F(ItemTest, AFailedStatusQueryStillGivesARecord) {
     std::string file = dir.writeFile("Documents/a.txt", "x");
     Url url = Url::fileURLWithPath(file);
-    ASSERT_FALSE(url.prefetchResourceValues(LocalItem::urlKeys()));
+    ASSERT_TRUE(url.prefetchResourceValues(LocalItem::urlKeys()).ok());
     ASSERT_TRUE(LocalItem::make(url, {.customItemID = "did=1", .customParentItemID = "fid=2"}));
     ASSERT_TRUE(LocalItem::make(url));
     for (int error : {ENOENT, EIO}) {

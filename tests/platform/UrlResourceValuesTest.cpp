@@ -113,17 +113,16 @@ TEST_F(UrlResourceValuesTest, MissingFilesAndFailures) {
         ASSERT_FALSE(result.ok()) << path;
         EXPECT_TRUE(result.error().is(kHostPlatformErrorDomain, kHostPlatformFileNoSuchFile));
         EXPECT_EQ(result.error().userInfo().at("path"), path);
-        std::optional<Error> prefetch =
-            Url::fileURLWithPath(path).prefetchResourceValues({K::kName});
-        ASSERT_TRUE(prefetch);
-        EXPECT_EQ(prefetch->code(), kHostPlatformFileNoSuchFile);
+        Status prefetch = Url::fileURLWithPath(path).prefetchResourceValues({K::kName});
+        ASSERT_FALSE(prefetch.ok());
+        EXPECT_EQ(prefetch.error().code(), kHostPlatformFileNoSuchFile);
     }
 
     Url file = Url::fileURLWithPath(dir_.writeFile("present", "abc"));
     fs_->inject(Op::Statx, EIO);
-    std::optional<Error> failed = file.prefetchResourceValues({K::kFileSize});
-    ASSERT_TRUE(failed);
-    EXPECT_TRUE(failed->is(kPosixErrorDomain, EIO));
+    Status failed = file.prefetchResourceValues({K::kFileSize});
+    ASSERT_FALSE(failed.ok());
+    EXPECT_TRUE(failed.error().is(kPosixErrorDomain, EIO));
     EXPECT_EQ(number(file, K::kFileSize), 3u) << "the failure was not cached";
 
     // Access checks: a denial is "no", any other failure an error.
@@ -145,13 +144,13 @@ TEST_F(UrlResourceValuesTest, CachedValuesServeLaterReadsUntilRemoved) {
     Url url = Url::fileURLWithPath(path);
     Url copy = url;
     fs_->resetCalls();
-    ASSERT_FALSE(url.prefetchResourceValues({K::kFileSize, K::kIsDirectory, K::kFileSize}));
+    ASSERT_TRUE(url.prefetchResourceValues({K::kFileSize, K::kIsDirectory, K::kFileSize}).ok());
     EXPECT_EQ(fs_->calls(Op::Statx), 1u);
     std::ofstream(path, std::ios::app) << "cdef";
     EXPECT_EQ(number(url, K::kFileSize), 2u);
     EXPECT_EQ(number(copy, K::kFileSize), 2u) << "copies share the cache";
     EXPECT_EQ(flag(url, K::kIsDirectory), 0u);
-    ASSERT_FALSE(url.prefetchResourceValues({K::kFileSize}));
+    ASSERT_TRUE(url.prefetchResourceValues({K::kFileSize}).ok());
     EXPECT_EQ(fs_->calls(Op::Statx), 1u) << "cached values need no system call";
     // A URL made anew, even for the same path, and a derived one start empty.
     EXPECT_EQ(number(Url::fileURLWithPath(path), K::kFileSize), 6u);
@@ -170,15 +169,15 @@ TEST_F(UrlResourceValuesTest, CachedValuesServeLaterReadsUntilRemoved) {
 
     // Only identifiers can be set, and they stay in memory.
     fs_->resetCalls();
-    EXPECT_FALSE(url.setResourceValue(Number::fromUInt64(4242), K::kFileID));
-    EXPECT_FALSE(url.setResourceValue(Number::fromUInt64(17), K::kDocumentID));
+    EXPECT_TRUE(url.setResourceValue(Number::fromUInt64(4242), K::kFileID).ok());
+    EXPECT_TRUE(url.setResourceValue(Number::fromUInt64(17), K::kDocumentID).ok());
     EXPECT_EQ(number(url, K::kFileID), 4242u);
     EXPECT_EQ(number(url, K::kDocumentID), 17u);
     EXPECT_EQ(fs_->calls(Op::Statx), 0u);
     EXPECT_EQ(fs_->calls(Op::Fsetxattr), 0u);
-    std::optional<Error> refused = url.setResourceValue(String::make("x"), K::kName);
-    ASSERT_TRUE(refused);
-    EXPECT_TRUE(refused->is(kPosixErrorDomain, EINVAL));
+    Status refused = url.setResourceValue(String::make("x"), K::kName);
+    ASSERT_FALSE(refused.ok());
+    EXPECT_TRUE(refused.error().is(kPosixErrorDomain, EINVAL));
     url.removeCachedResourceValue(K::kFileID);
     EXPECT_EQ(number(url, K::kFileID), inode(path));
 }

@@ -34,7 +34,7 @@ protected:
     std::string trashed(const std::string& path, std::shared_ptr<const Date> date) {
         writeFile(path);
         if (date) {
-            EXPECT_FALSE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(path), date));
+            EXPECT_TRUE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(path), date).ok());
         }
         return path;
     }
@@ -68,7 +68,7 @@ TEST_F(AutoDeletionTest, TheHostFacingSweepReportsWhatItDeleted) {
     std::string older = trashed(libraryTrash() + "/older.txt", Date::make(1'000));
     std::string folder = makeFolder(storage + "/.Trash/old folder");
     writeFile(folder + "/inside.txt");
-    ASSERT_FALSE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(folder), Date::make(2'000)));
+    ASSERT_TRUE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(folder), Date::make(2'000)).ok());
     std::string kept = trashed(storage + "/.Trash/kept.txt", reference);
     std::string undated = trashed(libraryTrash() + "/undated.txt", nullptr);
 
@@ -100,8 +100,9 @@ TEST_F(AutoDeletionTest, ItemsWithoutAReadableDateAreRestampedAndGoLater) {
     std::string broken = trashed(storage + "/.Trash/broken.txt", nullptr);
     auto notADate = KeyedArchiver::archivedDataWithRootObject(String::make("yesterday"));
     ASSERT_TRUE(notADate.ok());
-    ASSERT_FALSE(ItemMetadata::writeAttributeData(
-        Url::fileURLWithPath(broken), LocalItem::xattrTrashDateName(), notADate.value()));
+    ASSERT_TRUE(ItemMetadata::writeAttributeData(Url::fileURLWithPath(broken),
+                                                 LocalItem::xattrTrashDateName(), notADate.value())
+                    .ok());
 
     double before = Date::now()->timeIntervalSince1970();
     sweep(Date::make(before + 3600));
@@ -130,7 +131,7 @@ TEST_F(AutoDeletionTest, ATrashedFolderIsOneItemAndHiddenEntriesAreLeftAlone) {
     writeFile(folder + "/inner/a.txt");
     writeFile(folder + "/b.txt");
     std::string hidden = trashed(libraryTrash() + "/.hidden", nullptr);
-    ASSERT_FALSE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(folder), Date::make(5'000)));
+    ASSERT_TRUE(ItemMetadata::writeTrashDate(Url::fileURLWithPath(folder), Date::make(5'000)).ok());
 
     sweep(Date::make(4'000));
     // Nothing below the folder was visited, so nothing there was stamped.

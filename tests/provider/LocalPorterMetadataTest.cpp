@@ -212,7 +212,7 @@ TEST_F(MetadataJournalTest, EveryProviderMetadataWriteIsToldToTheJournal) {
     LocalPorter::MetadataChanges changes;
     changes.favoriteRank = std::shared_ptr<const Number>();
     changes.tagData = Bytes();
-    ASSERT_FALSE(LocalPorter::changeMetadataAtURL(Url::fileURLWithPath(file), changes));
+    ASSERT_TRUE(LocalPorter::changeMetadataAtURL(Url::fileURLWithPath(file), changes).ok());
     EXPECT_EQ(recorder->writes,
               (std::vector<Write>{{inode, LocalItem::xattrTagDataName(), true},
                                   {inode, LocalItem::xattrFavoriteRankName(), true},

@@ -92,8 +92,8 @@ protected:
         std::vector<Thumbnail> thumbnails;
         int completions = 0;
         size_t seenAtCompletion = 0;
-        auto done = [&](std::optional<Error> error) {
-            EXPECT_FALSE(error);
+        auto done = [&](Status status) {
+            EXPECT_TRUE(status.ok());
             ++completions;
             seenAtCompletion = thumbnails.size();
         };

@@ -222,7 +222,8 @@ TEST_F(TrashTest, UntrashFallsBackToTheLibraryRoot) {
     strata->publish(outcome.item->fileURL().path());
     trashed = trash(outcome.item->fileURL().path());
     ASSERT_TRUE(trashed);
-    ASSERT_FALSE(ItemMetadata::writePutBack(trashed->fileURL(), String::make("../../../y.txt")));
+    ASSERT_TRUE(
+        ItemMetadata::writePutBack(trashed->fileURL(), String::make("../../../y.txt")).ok());
     ItemOutcome escaped = untrash(trashed->itemIdentifier());
     ASSERT_TRUE(escaped.item) << escaped.error->description();
     EXPECT_EQ(escaped.item->fileURL().path(), library + "/x.txt");
@@ -231,7 +232,7 @@ TEST_F(TrashTest, UntrashFallsBackToTheLibraryRoot) {
     strata->publish(library + "/x.txt");
     trashed = trash(library + "/x.txt");
     ASSERT_TRUE(trashed);
-    ASSERT_FALSE(ItemMetadata::writePutBack(trashed->fileURL(), nullptr));
+    ASSERT_TRUE(ItemMetadata::writePutBack(trashed->fileURL(), nullptr).ok());
     log->clear();
     ItemOutcome bare = untrash(trashed->itemIdentifier());
     ASSERT_TRUE(bare.item) << bare.error->description();

@@ -23,11 +23,13 @@ struct ItemOutcome {
     std::optional<Error> error;
 
     LocalPorter::ItemCompletion handler() {
-        return [this](HostPorterItemRef received, std::optional<Error> failure) {
+        return [this](Result<HostPorterItemRef> received) {
             ++calls;
             // The provider answers with its own records; anything else reads as no item.
-            item = std::dynamic_pointer_cast<const LocalItem>(received);
-            error = std::move(failure);
+            if (received.ok())
+                item = std::dynamic_pointer_cast<const LocalItem>(received.value());
+            else
+                error = received.error();
         };
     }
 };
@@ -37,9 +39,10 @@ struct ErrorOutcome {
     std::optional<Error> error;
 
     LocalPorter::ErrorCompletion handler() {
-        return [this](std::optional<Error> failure) {
+        return [this](Status status) {
             ++calls;
-            error = std::move(failure);
+            if (!status.ok())
+                error = status.error();
         };
     }
 };

@@ -45,8 +45,8 @@ TEST(ProviderCallsTest, WaitsForACompletionOnAnotherThreadAndIgnoresASecondOne) 
     std::thread late;
     auto item = ProviderCalls::waitForItem([&](HostPorterExtension::ItemCompletion done) {
         late = std::thread([done] {
-            done(FakeItem::make("did=1", "first"), std::nullopt);
-            done(nullptr, Error::posix(EIO));  // a provider's bug: must change nothing
+            done(FakeItem::make("did=1", "first"));
+            done(Error::posix(EIO));  // a provider's bug: must change nothing
         });
     });
     late.join();
@@ -54,22 +54,22 @@ TEST(ProviderCallsTest, WaitsForACompletionOnAnotherThreadAndIgnoresASecondOne) 
     EXPECT_EQ(item.value()->filename(), "first");
 
     auto failed = ProviderCalls::waitForItem([](auto done) {
-        done(nullptr, Error::posix(EACCES));
-        done(FakeItem::make("did=1", "late"), std::nullopt);
+        done(Error::posix(EACCES));
+        done(FakeItem::make("did=1", "late"));
     });
     ASSERT_FALSE(failed.ok());
     EXPECT_TRUE(failed.error().is(kPosixErrorDomain, EACCES));
 
-    // Neither an item nor an error: the host still gets an answer, not a crash or a hang.
-    auto neither = ProviderCalls::waitForItem([](auto done) { done(nullptr, std::nullopt); });
+    // A success without an item: the host still gets an answer, not a crash or a hang.
+    auto neither = ProviderCalls::waitForItem([](auto done) { done(HostPorterItemRef()); });
     ASSERT_FALSE(neither.ok());
     EXPECT_TRUE(neither.error().is(kHostPorterErrorDomain, kHostPorterNoSuchItem));
 
     Status status = ProviderCalls::waitForStatus([](auto done) {
-        done(std::nullopt);
+        done(Status::OK());
         done(Error::posix(EIO));
     });
-    EXPECT_FALSE(status);
+    EXPECT_TRUE(status.ok());
     EXPECT_EQ(ProviderCalls::waitForCount([](auto done) {
                   done(3);
                   done(4);

@@ -109,7 +109,7 @@ protected:
         service_ = service.value();
         strata_ = std::make_shared<TremorStrataService>(service_);
         if (!service_->isWatched(tree_)) {
-            ASSERT_FALSE(service_->watchTree(tree_));
+            ASSERT_TRUE(service_->watchTree(tree_).ok());
         }
     }
     void stop() {
@@ -151,11 +151,13 @@ protected:
         TremorStore* store = service_->storeForDevice(device_);
         EXPECT_NE(store, nullptr);
         if (store) {
-            EXPECT_FALSE(store->replay(since, {TremorStore::kDocumentIdRoot}, 0,
-                                       [&](const JournalEvent& event) {
-                                           paths.push_back(event.path);
-                                           return true;
-                                       }));
+            EXPECT_TRUE(store
+                            ->replay(since, {TremorStore::kDocumentIdRoot}, 0,
+                                     [&](const JournalEvent& event) {
+                                         paths.push_back(event.path);
+                                         return true;
+                                     })
+                            .ok());
         }
         return paths;
     }
@@ -326,12 +328,12 @@ TEST(DocumentIdentityWriterTest, ABatchThatFindsTheOldInodeNumberBornAgainIsASaf
     ASSERT_TRUE(opened.ok());
     TremorStore& store = *opened.value();
     JournalWriter writer(store, 7);
-    ASSERT_FALSE(store.addRoot(tree, 0));
+    ASSERT_TRUE(store.addRoot(tree, 0).ok());
     ASSERT_TRUE(writer.reconcile(tree, false).ok());
     uint64_t inode = inodeOf(path);
     uint32_t docID = store.allocateDocumentId(inode).value();
     Bytes tags{'t', 'a', 'g', 's', 0, 1};
-    ASSERT_FALSE(store.setDocumentAttribute(docID, kTags, tags));
+    ASSERT_TRUE(store.setDocumentAttribute(docID, kTags, tags).ok());
 
     safeSave(path, "v1");
     renumbering->renumber(inodeOf(path), inode);
@@ -339,7 +341,7 @@ TEST(DocumentIdentityWriterTest, ABatchThatFindsTheOldInodeNumberBornAgainIsASaf
     auto events = writer.apply({{FileChange::Kind::Created, path + ".saving", {}, false, 0},
                                 {FileChange::Kind::Renamed, path, path + ".saving", false, 0}});
     ASSERT_TRUE(events.ok());
-    EXPECT_EQ(store.documentIdForInode(inode), docID);
+    EXPECT_EQ(store.documentIdForInode(inode).value(), docID);
     EXPECT_EQ(attribute(path, kTags), std::string(tags.begin(), tags.end()));
     bool journaled = false;
     for (const auto& event : events.value())
@@ -347,8 +349,8 @@ TEST(DocumentIdentityWriterTest, ABatchThatFindsTheOldInodeNumberBornAgainIsASaf
     EXPECT_TRUE(journaled);
     // The index now knows the new file: an event on it changes nothing more.
     EXPECT_TRUE(writer.apply({{FileChange::Kind::Modified, path, {}, false, 0}}).ok());
-    EXPECT_EQ(store.documentIdForInode(inode), docID);
-    EXPECT_EQ(store.documentAttributes(docID), (TremorStore::Attributes{{kTags, tags}}));
+    EXPECT_EQ(store.documentIdForInode(inode).value(), docID);
+    EXPECT_EQ(store.documentAttributes(docID).value(), (TremorStore::Attributes{{kTags, tags}}));
 }
 
 TEST_F(DocumentIdentityTest, AKnownFileMovedOntoADocumentIsAMoveNotASave) {

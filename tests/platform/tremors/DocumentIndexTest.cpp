@@ -42,7 +42,7 @@ std::string databaseIn(const testing::TempDir& state) {
 void runSql(const std::string& database, const std::string& sql) {
     auto db = SqliteDatabase::open(database, SQLITE_OPEN_READWRITE);
     ASSERT_TRUE(db.ok());
-    ASSERT_FALSE(db.value()->exec(sql)) << sql;
+    ASSERT_TRUE(db.value()->exec(sql).ok()) << sql;
 }
 
 int64_t userVersion(const std::string& database) {
@@ -67,38 +67,39 @@ TEST(DocumentIndexTest, MetadataCopiesFollowTheIdAndGoWithIt) {
     ASSERT_TRUE(store);
     uint32_t doc = store->allocateDocumentId(10).value();
     Bytes binary{0, 0xff, 'a', 0, 0x80};  // raw bytes, NULs included
-    ASSERT_FALSE(store->setDocumentAttribute(doc, kTags, binary));
-    ASSERT_FALSE(store->setDocumentAttribute(doc, kRank, Bytes{'1'}));
-    ASSERT_FALSE(store->setDocumentAttribute(doc, kRank, Bytes{'2'}));  // replaced
-    EXPECT_EQ(store->documentAttributes(doc),
+    ASSERT_TRUE(store->setDocumentAttribute(doc, kTags, binary).ok());
+    ASSERT_TRUE(store->setDocumentAttribute(doc, kRank, Bytes{'1'}).ok());
+    ASSERT_TRUE(store->setDocumentAttribute(doc, kRank, Bytes{'2'}).ok());  // replaced
+    EXPECT_EQ(store->documentAttributes(doc).value(),
               (TremorStore::Attributes{{kTags, binary}, {kRank, Bytes{'2'}}}));
-    ASSERT_FALSE(store->setDocumentAttribute(doc, kRank, std::nullopt));
-    EXPECT_EQ(store->documentAttributes(doc), (TremorStore::Attributes{{kTags, binary}}));
+    ASSERT_TRUE(store->setDocumentAttribute(doc, kRank, std::nullopt).ok());
+    EXPECT_EQ(store->documentAttributes(doc).value(), (TremorStore::Attributes{{kTags, binary}}));
 
     // Detached from an inode that became another file: no inode has it, the copy waits.
-    ASSERT_FALSE(store->detachDocumentId(doc));
-    EXPECT_EQ(store->inodeForDocumentId(doc), std::nullopt);
-    EXPECT_EQ(store->documentIdForInode(10), std::nullopt);
+    ASSERT_TRUE(store->detachDocumentId(doc).ok());
+    EXPECT_EQ(store->inodeForDocumentId(doc).value(), std::nullopt);
+    EXPECT_EQ(store->documentIdForInode(10).value(), std::nullopt);
     store.reset();
     store = openStore(state.path());
     ASSERT_TRUE(store);
-    ASSERT_FALSE(store->moveDocumentId(doc, 20));
-    EXPECT_EQ(store->inodeForDocumentId(doc), 20u);
-    EXPECT_EQ(store->documentAttributes(doc), (TremorStore::Attributes{{kTags, binary}}));
+    ASSERT_TRUE(store->moveDocumentId(doc, 20).ok());
+    EXPECT_EQ(store->inodeForDocumentId(doc).value(), 20u);
+    EXPECT_EQ(store->documentAttributes(doc).value(), (TremorStore::Attributes{{kTags, binary}}));
     // An ID never handed out cannot be brought into being by a move.
     Status unknown = store->moveDocumentId(doc + 1, 30);
-    ASSERT_TRUE(unknown);
-    EXPECT_EQ(unknown->code(), ENOENT);
-    EXPECT_EQ(store->documentIdForInode(30), std::nullopt);
+    ASSERT_FALSE(unknown.ok());
+    EXPECT_EQ(unknown.error().code(), ENOENT);
+    EXPECT_EQ(store->documentIdForInode(30).value(), std::nullopt);
 
     // Other documents' copies are their own; clearing an ID drops its copy for good.
     uint32_t other = store->allocateDocumentId(40).value();
-    ASSERT_FALSE(store->replaceDocumentAttributes(other, {{kRank, Bytes{'9'}}}));
-    ASSERT_FALSE(store->clearDocumentId(doc));
-    EXPECT_TRUE(store->documentAttributes(doc).empty());
-    EXPECT_EQ(store->documentAttributes(other), (TremorStore::Attributes{{kRank, Bytes{'9'}}}));
-    ASSERT_FALSE(store->replaceDocumentAttributes(other, {}));
-    EXPECT_TRUE(store->documentAttributes(other).empty());
+    ASSERT_TRUE(store->replaceDocumentAttributes(other, {{kRank, Bytes{'9'}}}).ok());
+    ASSERT_TRUE(store->clearDocumentId(doc).ok());
+    EXPECT_TRUE(store->documentAttributes(doc).value().empty());
+    EXPECT_EQ(store->documentAttributes(other).value(),
+              (TremorStore::Attributes{{kRank, Bytes{'9'}}}));
+    ASSERT_TRUE(store->replaceDocumentAttributes(other, {}).ok());
+    EXPECT_TRUE(store->documentAttributes(other).value().empty());
 }
 
 TEST(DocumentIndexTest, AFailedBatchTakesBackDetachesMovesAndCopies) {
@@ -106,16 +107,17 @@ TEST(DocumentIndexTest, AFailedBatchTakesBackDetachesMovesAndCopies) {
     auto store = openStore(state.path());
     ASSERT_TRUE(store);
     uint32_t doc = store->allocateDocumentId(10).value();
-    ASSERT_FALSE(store->setDocumentAttribute(doc, kTags, Bytes{'t'}));
+    ASSERT_TRUE(store->setDocumentAttribute(doc, kTags, Bytes{'t'}).ok());
     Status failed = store->transact([&]() -> Status {
-        EXPECT_FALSE(store->detachDocumentId(doc));
-        EXPECT_FALSE(store->moveDocumentId(doc, 11));
-        EXPECT_FALSE(store->setDocumentAttribute(doc, kTags, Bytes{'u'}));
+        EXPECT_TRUE(store->detachDocumentId(doc).ok());
+        EXPECT_TRUE(store->moveDocumentId(doc, 11).ok());
+        EXPECT_TRUE(store->setDocumentAttribute(doc, kTags, Bytes{'u'}).ok());
         return Error::posix(EIO);
     });
-    ASSERT_TRUE(failed);
-    EXPECT_EQ(store->inodeForDocumentId(doc), 10u);
-    EXPECT_EQ(store->documentAttributes(doc), (TremorStore::Attributes{{kTags, Bytes{'t'}}}));
+    ASSERT_FALSE(failed.ok());
+    EXPECT_EQ(store->inodeForDocumentId(doc).value(), 10u);
+    EXPECT_EQ(store->documentAttributes(doc).value(),
+              (TremorStore::Attributes{{kTags, Bytes{'t'}}}));
 }
 
 // Databases of schemas 1 and 2, made by taking today's apart the way the older versions built
@@ -138,8 +140,8 @@ TEST(DocumentIndexTest, OlderDatabasesAreUpgradedInPlace) {
             auto store = openStore(state.path());
             ASSERT_TRUE(store);
             uuid = store->uuid();
-            ASSERT_FALSE(store->addRoot("/watched", 0, 1));
-            ASSERT_FALSE(store->upsertInodes({stampedFile(2, 1, "a.txt")}));
+            ASSERT_TRUE(store->addRoot("/watched", 0, 1).ok());
+            ASSERT_TRUE(store->upsertInodes({stampedFile(2, 1, "a.txt")}).ok());
             doc = store->allocateDocumentId(2).value();
             std::vector<JournalEvent> events{{0, "/watched/a.txt", 2, 0x100}};
             ASSERT_TRUE(store->append(events).ok());
@@ -151,18 +153,18 @@ TEST(DocumentIndexTest, OlderDatabasesAreUpgradedInPlace) {
         ASSERT_TRUE(store);
         EXPECT_EQ(store->uuid(), uuid) << "upgraded, not replaced";
         EXPECT_EQ(store->lastEventId(), 1u);
-        EXPECT_EQ(store->inodeForDocumentId(doc), 2u);
+        EXPECT_EQ(store->inodeForDocumentId(doc).value(), 2u);
         // A reopened store answers paths only for the trees this process watches again.
         ASSERT_TRUE(store->resumeRoot("/watched"));
-        EXPECT_EQ(store->pathForInode(2), "/watched/a.txt");
-        auto record = store->inode(2);
+        EXPECT_EQ(store->pathForInode(2).value(), "/watched/a.txt");
+        auto record = store->inode(2).value();
         ASSERT_TRUE(record);
         EXPECT_EQ(record->stamped, version == 2);
         EXPECT_EQ(record->ctime, 0) << "not known yet";
-        EXPECT_TRUE(store->documentAttributes(doc).empty());
-        ASSERT_FALSE(store->setDocumentAttribute(doc, kTags, Bytes{'t'}));
-        ASSERT_FALSE(store->upsertInodes({stampedFile(3, 1, "b.txt")}));
-        EXPECT_EQ(store->inode(3)->ctime, 3000);
+        EXPECT_TRUE(store->documentAttributes(doc).value().empty());
+        ASSERT_TRUE(store->setDocumentAttribute(doc, kTags, Bytes{'t'}).ok());
+        ASSERT_TRUE(store->upsertInodes({stampedFile(3, 1, "b.txt")}).ok());
+        EXPECT_EQ(store->inode(3).value()->ctime, 3000);
         EXPECT_EQ(store->allocateDocumentId(3).value(), doc + 1);
         EXPECT_EQ(log.sink().countStartingWith("[INFO] Upgraded the event journal in"), 1u);
         store.reset();
@@ -184,18 +186,18 @@ TEST(DocumentIndexTest, ACrawlReadsTheMetadataOfDocumentsWithAnUnknownOrNewChang
     auto store = openStore(state.path());
     ASSERT_TRUE(store);
     JournalWriter writer(*store, 7);
-    ASSERT_FALSE(store->addRoot(tree, 0));
+    ASSERT_TRUE(store->addRoot(tree, 0).ok());
     ASSERT_TRUE(writer.reconcile(tree, false).ok());
     struct statx st {};
     ASSERT_EQ(counting->statx(AT_FDCWD, path, 0, STATX_INO, &st), 0);
     uint32_t doc = store->allocateDocumentId(st.stx_ino).value();
-    auto record = store->inode(st.stx_ino);
+    auto record = store->inode(st.stx_ino).value();
     ASSERT_TRUE(record);
     record->ctime = 0;  // as an upgraded entry
-    ASSERT_FALSE(store->upsertInodes({*record}));
+    ASSERT_TRUE(store->upsertInodes({*record}).ok());
 
     ASSERT_TRUE(writer.reconcile(tree, true).ok());
-    EXPECT_EQ(store->documentAttributes(doc),
+    EXPECT_EQ(store->documentAttributes(doc).value(),
               (TremorStore::Attributes{{kTags, Bytes{'o', 'l', 'd'}}}));
 
     counting->resetCalls();
@@ -216,7 +218,7 @@ TEST(DocumentIndexTest, ACrawlReadsTheMetadataOfDocumentsWithAnUnknownOrNewChang
     }
     ASSERT_TRUE(writer.reconcile(tree, true).ok());
     EXPECT_EQ(counting->calls(FaultInjectingFileSystem::Operation::Llistxattr), 1u);
-    EXPECT_EQ(store->documentAttributes(doc),
+    EXPECT_EQ(store->documentAttributes(doc).value(),
               (TremorStore::Attributes{{kTags, Bytes{'n', 'e', 'w'}}}));
 }
 

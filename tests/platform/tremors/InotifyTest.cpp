@@ -286,7 +286,7 @@ TEST_F(InotifyBackendTest, NewDirectoriesAreWatchedBeforeTheyAreListedAndFollowe
     auto hooked = std::make_shared<HookedFileSystem>();
     ScopedFileSystem scoped(hooked);
     Changes discovered;
-    ASSERT_FALSE(backend_->watchTree(root_, discovered).has_value());
+    ASSERT_TRUE(backend_->watchTree(root_, discovered).ok());
     ASSERT_EQ(discovered, Changes{});
     // Written before the watch exists: only the listing can find it. Written right after the
     // listing: only the watch can, so it must already be in place.
@@ -331,7 +331,7 @@ TEST_F(InotifyBackendTest, AWatchThatCannotBeAddedIsReportedAndTheRestIsWatched)
     fs::create_directories(path("blocked/inner"));
     api_->failAddWatch("/blocked", ENOSPC);
     Changes discovered;
-    EXPECT_FALSE(backend_->watchTree(root_, discovered).has_value());
+    EXPECT_TRUE(backend_->watchTree(root_, discovered).ok());
     EXPECT_EQ(discovered, (Changes{watchFailed(path("blocked"), ENOSPC)}));
     EXPECT_EQ(log->count("[ERROR] Cannot watch " + path("blocked") + ": [28: " +
                              std::strerror(ENOSPC) + "]; changes in that tree are not journaled",

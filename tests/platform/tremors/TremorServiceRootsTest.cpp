@@ -84,8 +84,8 @@ protected:
 TEST_F(TremorServiceRootsTest, ARememberedTreeIsNeitherWatchedNorCrawledNorResolvedUntilAskedFor) {
     std::string file = root_.writeFile("other/file.txt", "x");
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(storage_));
-    ASSERT_FALSE(service_->watchTree(other_));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
+    ASSERT_TRUE(service_->watchTree(other_).ok());
     ASSERT_TRUE(resolves(file));
     uint64_t last = service_->currentEventId();
     stop();
@@ -93,7 +93,7 @@ TEST_F(TremorServiceRootsTest, ARememberedTreeIsNeitherWatchedNorCrawledNorResol
     // Changed while nothing ran: a crawl at start would journal it.
     root_.writeFile("other/while-stopped.txt", "y");
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(storage_));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
     EXPECT_FALSE(service_->isWatched(other_));
     EXPECT_EQ(service_->currentEventId(), last) << "a tree nobody asked for was crawled";
     EXPECT_FALSE(resolves(file)) << "an unpublished tree answered a path";
@@ -101,37 +101,40 @@ TEST_F(TremorServiceRootsTest, ARememberedTreeIsNeitherWatchedNorCrawledNorResol
     EXPECT_EQ(service_->currentEventId(), last) << "a tree nobody asked for is watched";
 
     // Asked for again in the same run: its history goes on where it stopped.
-    ASSERT_FALSE(service_->watchTree(other_));
+    ASSERT_TRUE(service_->watchTree(other_).ok());
     EXPECT_TRUE(resolves(file));
     EXPECT_TRUE(store().replayability(last, {other_}).complete)
         << store().replayability(last, {other_}).reason;
     bool journaled = false;
-    ASSERT_FALSE(store().replay(last, {other_}, 0, [&](const JournalEvent& event) {
-        journaled |=
-            event.path == other_ + "/while-stopped.txt" && (event.flags & kTremorItemCreated) != 0;
-        return true;
-    }));
+    ASSERT_TRUE(store()
+                    .replay(last, {other_}, 0,
+                            [&](const JournalEvent& event) {
+                                journaled |= event.path == other_ + "/while-stopped.txt" &&
+                                             (event.flags & kTremorItemCreated) != 0;
+                                return true;
+                            })
+                    .ok());
     EXPECT_TRUE(journaled);
 }
 
 TEST_F(TremorServiceRootsTest, ATreeARunLeftAsideStartsItsHistoryAnewWhenAskedForAgain) {
     std::string file = root_.writeFile("other/file.txt", "x");
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(storage_));
-    ASSERT_FALSE(service_->watchTree(other_));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
+    ASSERT_TRUE(service_->watchTree(other_).ok());
     uint64_t anchor = service_->currentEventId();
     stop();
 
     // A run that publishes only the storage folder.
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(storage_));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
     EXPECT_EQ(service_->retireUnwatched(), std::vector<std::string>{other_});
     EXPECT_TRUE(service_->retireUnwatched().empty()) << "retired twice";
     stop();
 
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(storage_));
-    ASSERT_FALSE(service_->watchTree(other_));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
+    ASSERT_TRUE(service_->watchTree(other_).ok());
     EXPECT_TRUE(store().replayability(anchor, {storage_}).complete);
     auto check = store().replayability(anchor, {other_});
     EXPECT_FALSE(check.complete) << "the run that left it aside hid a gap";
@@ -143,8 +146,8 @@ TEST_F(TremorServiceRootsTest, AForgottenTreeNoLongerAnswersNorJournalsAndIsForg
     std::string file = root_.writeFile("other/deep/file.txt", "x");
     std::string kept = root_.writeFile("storage/sub/kept.txt", "k");
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(storage_));
-    ASSERT_FALSE(service_->watchTree(other_));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
+    ASSERT_TRUE(service_->watchTree(other_).ok());
     uint32_t docID = documentIdOf(file);
     ASSERT_NE(docID, 0u);
     ASSERT_NE(documentIdOf(kept), 0u);
@@ -170,11 +173,11 @@ TEST_F(TremorServiceRootsTest, AForgottenTreeNoLongerAnswersNorJournalsAndIsForg
 
     // A tree inside one this run publishes stays that tree's: nothing of it is dropped.
     std::string sub = storage_ + "/sub";
-    ASSERT_FALSE(service_->watchTree(sub));  // covered: not a root of its own
+    ASSERT_TRUE(service_->watchTree(sub).ok());  // covered: not a root of its own
     stop();
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(sub));
-    ASSERT_FALSE(service_->watchTree(storage_));
+    ASSERT_TRUE(service_->watchTree(sub).ok());
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
     forgotten = service_->forget(sub);
     ASSERT_TRUE(forgotten.ok()) << forgotten.error().description();
     EXPECT_EQ(forgotten.value().entries, 0u);
@@ -185,7 +188,7 @@ TEST_F(TremorServiceRootsTest, AForgottenTreeNoLongerAnswersNorJournalsAndIsForg
     stop();
     ASSERT_NO_FATAL_FAILURE(start());
     EXPECT_FALSE(service_->forget(other_).ok());
-    ASSERT_FALSE(service_->watchTree(other_));
+    ASSERT_TRUE(service_->watchTree(other_).ok());
     EXPECT_FALSE(store().replayability(last, {other_}).complete);
     EXPECT_TRUE(resolves(file));
     EXPECT_NE(documentIdOf(file), docID) << "a forgotten document ID came back";
@@ -195,8 +198,8 @@ TEST_F(TremorServiceRootsTest, ATreeWhoseFolderIsGoneIsForgottenAtStartWithOneIn
     std::string gone = root_.makeDir("gone");
     std::string file = root_.writeFile("gone/file.txt", "x");
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(storage_));
-    ASSERT_FALSE(service_->watchTree(gone));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
+    ASSERT_TRUE(service_->watchTree(gone).ok());
     uint32_t docID = documentIdOf(file);
     ASSERT_NE(docID, 0u);
     stop();
@@ -213,7 +216,7 @@ TEST_F(TremorServiceRootsTest, ATreeWhoseFolderIsGoneIsForgottenAtStartWithOneIn
         ASSERT_NO_FATAL_FAILURE(start());
         EXPECT_EQ(infoLines(log.sink()), 1u);
     }
-    ASSERT_FALSE(service_->watchTree(storage_));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
     for (const auto& root : store().rememberedRoots()) EXPECT_NE(root.path, gone);
     EXPECT_EQ(strata_->resolveDocumentId(device_, docID), 0u);
     {
@@ -226,12 +229,12 @@ TEST_F(TremorServiceRootsTest, ATreeWhoseFolderIsGoneIsForgottenAtStartWithOneIn
 TEST_F(TremorServiceRootsTest, WatchRememberedResumesWhatTheLastRunWatched) {
     std::string file = root_.writeFile("other/file.txt", "x");
     ASSERT_NO_FATAL_FAILURE(start());
-    ASSERT_FALSE(service_->watchTree(storage_));
-    ASSERT_FALSE(service_->watchTree(other_));
+    ASSERT_TRUE(service_->watchTree(storage_).ok());
+    ASSERT_TRUE(service_->watchTree(other_).ok());
     uint64_t anchor = service_->currentEventId();
     stop();
     ASSERT_NO_FATAL_FAILURE(start());
-    EXPECT_FALSE(service_->watchRemembered());
+    EXPECT_TRUE(service_->watchRemembered().ok());
     EXPECT_TRUE(service_->isWatched(storage_));
     EXPECT_TRUE(service_->isWatched(other_));
     EXPECT_TRUE(store().replayability(anchor, {storage_, other_}).complete);

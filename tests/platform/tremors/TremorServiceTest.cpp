@@ -27,11 +27,14 @@
 #include "platform/strata/TremorStrataService.h"
 #include "platform/tremors/JournalWriter.h"
 #include "platform/tremors/LinuxInotifyApi.h"
+#include "platform/tremors/SqliteDatabase.h"
 #include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/TremorService.h"
 #include "platform/tremors/TremorStore.h"
+#include "platform/tremors/TremorStoreDirectory.h"
 #include "platform/tremors/Tremors.h"
 #include "tests/common/ScopedFileSystem.h"
+#include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
 
 namespace tamber {
@@ -83,10 +86,13 @@ std::vector<JournalEvent> journaled(TremorService& service, uint32_t device, uin
     TremorStore* store = service.storeForDevice(device);
     EXPECT_NE(store, nullptr);
     if (store) {
-        EXPECT_FALSE(store->replay(since, paths, 0, [&](const JournalEvent& event) {
-            events.push_back(event);
-            return true;
-        }));
+        EXPECT_TRUE(store
+                        ->replay(since, paths, 0,
+                                 [&](const JournalEvent& event) {
+                                     events.push_back(event);
+                                     return true;
+                                 })
+                        .ok());
     }
     return events;
 }
@@ -125,7 +131,7 @@ protected:
     }
     void startWatching() {
         ASSERT_NO_FATAL_FAILURE(start());
-        ASSERT_FALSE(service_->watchTree(tree_));
+        ASSERT_TRUE(service_->watchTree(tree_).ok());
     }
     uint32_t documentIdOf(const std::string& path) {
         int fd = FileSystem::current().open(path, O_RDONLY | O_CLOEXEC);
@@ -223,10 +229,10 @@ void pretendInodeWasReused(const std::string& stateDir, const std::string& path)
     ASSERT_EQ(FileSystem::current().statvfs(path, &vfs), 0);
     auto store = TremorStore::open(stateDir, vfs.f_fsid);
     ASSERT_TRUE(store.ok());
-    auto record = store.value()->inode(inodeOf(path));
+    auto record = store.value()->inode(inodeOf(path)).value();
     ASSERT_TRUE(record && record->stamped);
     record->birth += 1;
-    ASSERT_FALSE(store.value()->upsertInodes({*record}));
+    ASSERT_TRUE(store.value()->upsertInodes({*record}).ok());
 }
 
 TEST_F(TremorServiceTest, ARestartJournalsWhatChangedWhileStopped) {
@@ -307,7 +313,7 @@ TEST_F(TremorServiceTest, AFullQueueDropsAndJournalsTheLossInsteadOfGrowing) {
     auto created = TremorService::create(state_.path(), InotifyApi::system(), 1);
     ASSERT_TRUE(created.ok());
     service_ = created.value();
-    ASSERT_FALSE(service_->watchTree(tree_));
+    ASSERT_TRUE(service_->watchTree(tree_).ok());
     uint64_t since = service_->currentEventId();
     for (int i = 0; i < 200; ++i) writeText(tree_ + "/f" + std::to_string(i), "x");
     auto events = journaled(*service_, device_, since, {tree_});
@@ -403,7 +409,7 @@ protected:
 };
 
 TEST_F(TremorServiceStreamTest, ReplayLiveAndARestartedStreamDeliverExactlyTheJournal) {
-    ASSERT_FALSE(service()->watchTree(tree_));
+    ASSERT_TRUE(service()->watchTree(tree_).ok());
     for (int i = 0; i < 1100; ++i)  // more than one replay batch
         writeText(tree_ + "/old" + std::to_string(i), "x");
 
@@ -465,7 +471,7 @@ TEST_F(TremorServiceStreamTest, AnOverflowOrTrimmedHistoryReachesTheStreamAsDrop
     TremorStore* store = service()->storeForDevice(device_);
     ASSERT_NE(store, nullptr);
     ASSERT_GT(store->lastEventId(), 2u);
-    ASSERT_FALSE(store->trim(1));
+    ASSERT_TRUE(store->trim(1).ok());
     open(replayed_, 1);
     ASSERT_TRUE(eventually([&] { return replayed_.has(kTremorHistoryDone); }));
     auto replayed = replayed_.snapshot();
@@ -476,7 +482,7 @@ TEST_F(TremorServiceStreamTest, AnOverflowOrTrimmedHistoryReachesTheStreamAsDrop
 }
 
 TEST_F(TremorServiceStreamTest, AReplayFromBeyondTheLastEventIsALossAndReplaysNothing) {
-    ASSERT_FALSE(service()->watchTree(tree_));
+    ASSERT_TRUE(service()->watchTree(tree_).ok());
     for (int i = 0; i < 5; ++i) writeText(tree_ + "/f" + std::to_string(i), "x");
     const uint64_t last = TremorsGetCurrentEventId();
     ASSERT_GT(last, 2u);
@@ -499,7 +505,7 @@ TEST_F(TremorServiceStreamTest, AReplayFromBeyondTheLastEventIsALossAndReplaysNo
 // The typed stream of the program's own consumers reports what the journal holds, record for
 // record (IDs in order, paths, inodes, flags), without a dictionary to decode.
 TEST_F(TremorServiceStreamTest, ATypedStreamDeliversTheJournalsRecordsAsTheyAre) {
-    ASSERT_FALSE(service()->watchTree(tree_));
+    ASSERT_TRUE(service()->watchTree(tree_).ok());
     for (int i = 0; i < 5; ++i) writeText(tree_ + "/f" + std::to_string(i), "x");
     service()->sync();
     Delivered typed;
@@ -548,7 +554,7 @@ void collectCounted(TremorStreamRef, void* info, size_t, const ObjectRef&, const
 }
 
 TEST_F(TremorServiceStreamTest, TheHooksRetainOnceAndReleaseOnceAfterTheLastBatch) {
-    ASSERT_FALSE(service()->watchTree(tree_));
+    ASSERT_TRUE(service()->watchTree(tree_).ok());
     for (int i = 0; i < 50; ++i) writeText(tree_ + "/f" + std::to_string(i), "x");
     CountedInfo counted;
     TremorStreamContext context{&counted, retainCounted, releaseCounted};
@@ -565,6 +571,43 @@ TEST_F(TremorServiceStreamTest, TheHooksRetainOnceAndReleaseOnceAfterTheLastBatc
     queue_->sync([] {});
     ASSERT_TRUE(eventually([&] { return counted.releases.load() == 1; }));
     EXPECT_EQ(counted.retains.load(), 1);
+}
+
+// A batch the journal cannot write is rolled back whole: readers are then told to rescan the
+// tree rather than miss what the batch held.
+TEST_F(TremorServiceTest, ABatchThatCannotBeJournaledAsksReadersToRescan) {
+    ASSERT_NO_FATAL_FAILURE(startWatching());
+    service_->sync();
+    TremorStore* store = service_->storeForDevice(device_);
+    ASSERT_NE(store, nullptr);
+    std::string database = store->directory() + "/" + TremorStoreDirectory::kDatabaseName;
+    service_->shutdown();
+    strata_.reset();
+    service_.reset();
+    {
+        auto db = SqliteDatabase::open(database);
+        ASSERT_TRUE(db.ok());
+        ASSERT_TRUE(db.value()
+                        ->exec("CREATE TRIGGER refused BEFORE INSERT ON inodes WHEN NEW.name = "
+                               "'poison' BEGIN SELECT RAISE(ABORT, 'refused'); END")
+                        .ok());
+    }
+    ASSERT_NO_FATAL_FAILURE(startWatching());
+    uint64_t since = service_->currentEventId();
+
+    testing::ScopedLogCapture log;
+    writeText(tree_ + "/poison", "p");
+    std::vector<JournalEvent> events;
+    bool rescan = eventually([&] {
+        events = journaled(*service_, device_, since);
+        return findEvent(events, tree_, kTremorMustScanSubdirs) != nullptr;
+    });
+    std::string logged;
+    for (const auto& line : log->lines()) logged += line.text + "\n";
+    EXPECT_TRUE(rescan) << describe(events) << logged;
+    EXPECT_EQ(findEvent(events, tree_ + "/poison", kTremorItemCreated), nullptr)
+        << "half of a failed batch was journaled\n"
+        << describe(events);
 }
 
 }  // namespace

@@ -428,7 +428,7 @@ TEST(KeyedArchiveRoundTrip, RegistryServesReadersWhileAnotherLayerRegisters) {
 std::string rejection(const Bytes& bytes) {
     auto error = BinaryPlistValidator::validate(bytes.data(), bytes.size(),
                                                 BinaryPlistValidator::limitsForSize(bytes.size()));
-    return error ? error->userInfo().at("description") : "";
+    return !error.ok() ? error.error().userInfo().at("description") : "";
 }
 
 // Each object but the last is an array referring `fanOut` times to the next one.
