@@ -5,6 +5,8 @@
 #include <cstring>
 #include <utility>
 
+#include "applibraries/LocalAppLibraryCache.h"
+#include "applibraries/LocalAppLibraryManager.h"
 #include "applibraries/SharedAppLibraryLookup.h"
 #include "applibraries/TBPAppLibraryManager.h"
 #include "host/HostPorterManager.h"
@@ -123,8 +125,10 @@ Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
         return porter_;
     if (auto error = prepareJournal(); !error.ok())
         return error.error();
-    previousLookup_ = SharedAppLibraryLookup::install();
-    installedLookup_ = true;
+    if (!installedLookup_) {
+        previousLookup_ = SharedAppLibraryLookup::install();
+        installedLookup_ = true;
+    }
     auto porter = LocalPorter::create();
     refreshOutcome_ = porter->refreshAppLibraries();
     // Identifiers inside app libraries need their trees journaled like the storage folder.
@@ -136,6 +140,20 @@ Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
     porter_ = porter;
     publishing_ = true;
     return porter_;
+}
+
+Status ProviderRuntime::publishFromCache() {
+    std::lock_guard lock(mutex_);
+    if (stopped_)
+        return stoppedError();
+    if (!installedLookup_ && !AppLibraryLookup::current()) {
+        previousLookup_ = SharedAppLibraryLookup::install();
+        installedLookup_ = true;
+    }
+    auto mainCache = LocalAppLibraryCache::mainCache();
+    mainCache->queue().sync([&] { mainCache->load(); });
+    LocalAppLibraryManager::shared()->upgradeFromMainCache(nullptr, false);
+    return Status::OK();
 }
 
 void ProviderRuntime::setSignalHandler(
