@@ -62,16 +62,16 @@ Status ProviderRuntime::prepareStorage() {
                                           ": " + std::strerror(static_cast<int>(error.code()))}});
     }
     std::weak_ptr<SignalSlot> weakSlot = signals_;
-    previousManager_ =
-        HostPorterManager::installDefaultManager(std::make_shared<StorageHostPorterManager>(
-            storage_, [weakSlot](const HostPorterItemIdentifier& container) {
-                auto slot = weakSlot.lock();
-                if (!slot)
-                    return;
-                std::lock_guard lock(slot->mutex);
-                if (slot->handler)
-                    slot->handler(container);
-            }));
+    manager_ = std::make_shared<StorageHostPorterManager>(
+        storage_, [weakSlot](const HostPorterItemIdentifier& container) {
+            auto slot = weakSlot.lock();
+            if (!slot)
+                return;
+            std::lock_guard lock(slot->mutex);
+            if (slot->handler)
+                slot->handler(container);
+        });
+    previousManager_ = HostPorterManager::installDefaultManager(manager_);
     installedManager_ = true;
     storagePrepared_ = true;
     return Status::OK();
@@ -129,7 +129,9 @@ Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
         previousLookup_ = SharedAppLibraryLookup::install();
         installedLookup_ = true;
     }
-    auto porter = LocalPorter::create();
+    // The provider is handed the runtime's own objects rather than reaching for the slots.
+    auto porter = LocalPorter::create(
+        {manager_, options_.fileSystem ? options_.fileSystem.get() : &FileSystem::current()});
     refreshOutcome_ = porter->refreshAppLibraries();
     // Identifiers inside app libraries need their trees journaled like the storage folder.
     for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries()) {

@@ -126,6 +126,8 @@ private:
     LocalPorter::AppRefreshOutcome refreshOutcome_;
     bool publishing_ = false;  // the run's publication is known
 
+    std::shared_ptr<HostPorterManager> manager_;  // made by prepareStorage()
+
     // What the runtime replaced in the process-wide slots, given back at shutdown.
     bool installedManager_ = false;
     std::shared_ptr<HostPorterManager> previousManager_;
