@@ -28,8 +28,16 @@ CliContext::~CliContext() {
 }
 
 Status CliContext::prepareStorage() {
+    return runtime().prepareStorage();
+}
+
+Status CliContext::publishFromCache() {
+    return runtime().publishFromCache();
+}
+
+ProviderRuntime& CliContext::runtime() {
     if (runtime_)
-        return runtime_->prepareStorage();
+        return *runtime_;
     ProviderRuntimeOptions options;
     // The process stops the journal once, when it exits; tests run verb after verb in one
     // process as separate runs of the same program.
@@ -52,7 +60,7 @@ Status CliContext::prepareStorage() {
         notice->err->flush();
     };
     runtime_ = std::make_unique<ProviderRuntime>(std::move(options));
-    return runtime_->prepareStorage();
+    return *runtime_;
 }
 
 namespace {

@@ -47,6 +47,9 @@ public:
     // The provider, started as ProviderRuntime::provider() says.
     Result<std::shared_ptr<LocalPorter>> prepareProvider();
     const LocalPorter::AppRefreshOutcome& appRefreshOutcome() const;
+    // Publishes the app libraries last found without starting the provider, as
+    // ProviderRuntime::publishFromCache() says; the storage folder is not prepared for it.
+    Status publishFromCache();
 
     // Receives the container signals the provider sends to the host (a watching verb prints
     // them); may be called on any thread.
@@ -88,6 +91,9 @@ public:
     std::string failureLine(const Error& error) const;
 
 private:
+    // The run's runtime, made from the global options on first use.
+    ProviderRuntime& runtime();
+
     std::ostream& out_;
     std::ostream& err_;
     std::string verb_;

@@ -85,7 +85,7 @@ CLI::App* EventsCommand::add(CLI::App& app) {
                              "Replay events after this event ID (default 0: all)");
     sub->add_flag("--docid", docid_, "Show document-ID events instead of path events");
     sub->add_flag("--no-follow", noFollow_, "Stop after the history has been replayed");
-    sub->add_flag("--json", json_, "One JSON object per line: id, flags, path, fileID");
+    addJsonFlag(sub, "One JSON object per line: id, flags, path, fileID");
     sub->add_option("--forget", forget_,
                     "Stop watching a remembered tree and drop its index entries (its "
                     "identifiers no longer resolve; its events stay)");
@@ -136,28 +136,34 @@ std::optional<uint64_t> EventsCommand::parseEventID(const std::string& text) {
     return value;
 }
 
-int EventsCommand::run(CliContext& context) {
-    if (!forget_.empty())
-        return forget(context);
+std::optional<int> EventsCommand::runBeforeProvider(CliContext& context) {
+    if (forget_.empty())
+        return std::nullopt;
+    return forget(context);
+}
+
+Status EventsCommand::checkArguments() {
     std::optional<uint64_t> since = since_->count() ? parseEventID(sinceText_) : uint64_t{0};
     if (!since) {
-        return context.fail(
-            CliContext::usageError("--since takes an event ID (0 to " + std::to_string(UINT64_MAX) +
-                                   "), not \"" + sinceText_ + "\""),
-            json_);
+        return CliContext::usageError("--since takes an event ID (0 to " +
+                                      std::to_string(UINT64_MAX) + "), not \"" + sinceText_ + "\"");
     }
-    // The trees of this run are those it publishes, and the paths asked for here.
-    if (auto porter = context.prepareProvider(); !porter.ok())
-        return context.fail(porter.error(), json_);
+    sinceID_ = *since;
+    return Status::OK();
+}
+
+// The trees of this run are those it publishes (the provider is started for that), and the
+// paths asked for here.
+int EventsCommand::runWith(CliContext& context, HostPorterExtension&) {
     // A replay from past the journal's end has nothing to show and never ends: an ID from
     // another journal, or mistyped.
     const uint64_t last = TremorsGetCurrentEventId();
-    if (*since > last) {
-        return context.fail(Error(kHostPorterErrorDomain, kHostPorterSyncAnchorExpired,
-                                  {{"description", "--since " + std::to_string(*since) +
-                                                       " is beyond the last event " +
-                                                       std::to_string(last) + " of the journal"}}),
-                            json_);
+    if (sinceID_ > last) {
+        return fail(context,
+                    Error(kHostPorterErrorDomain, kHostPorterSyncAnchorExpired,
+                          {{"description", "--since " + std::to_string(sinceID_) +
+                                               " is beyond the last event " + std::to_string(last) +
+                                               " of the journal"}}));
     }
     std::vector<std::string> paths;
     for (const auto& p : paths_) paths.push_back(Url::fileURLWithPath(p).path());
@@ -166,7 +172,7 @@ int EventsCommand::run(CliContext& context) {
 
     if (!docid_) {
         if (auto status = watchUncovered(context, paths); !status.ok())
-            return context.fail(status.error(), json_);
+            return fail(context, status.error());
     }
 
     Printer printer{&context.out(), &context.err(), json_, noFollow_, DispatchSemaphore(0)};
@@ -178,21 +184,19 @@ int EventsCommand::run(CliContext& context) {
     TremorStreamRef stream =
         docid_ ? TremorStreamCreateWithEvents(
                      print, TBFileObjectIdentifier::deviceID(context.storageURL()),
-                     {kTremorDocumentIdRoot}, *since, 0.1, flags)
-               : TremorStreamCreateWithEvents(print, std::nullopt, paths, *since, 0.1, flags);
+                     {kTremorDocumentIdRoot}, sinceID_, 0.1, flags)
+               : TremorStreamCreateWithEvents(print, std::nullopt, paths, sinceID_, 0.1, flags);
     if (!stream) {
-        return context.fail(
-            Error(kPosixErrorDomain, EIO, {{"description", "can't open the event journal stream"}}),
-            json_);
+        return fail(context, Error(kPosixErrorDomain, EIO,
+                                   {{"description", "can't open the event journal stream"}}));
     }
     auto queue = DispatchQueue::makeSerial("tamber.cli-events");
     TremorStreamSetDispatchQueue(stream, queue);
     catchInterrupts();
     if (!TremorStreamStart(stream)) {
         TremorStreamRelease(stream);
-        return context.fail(Error(kPosixErrorDomain, EIO,
-                                  {{"description", "can't start the event journal stream"}}),
-                            json_);
+        return fail(context, Error(kPosixErrorDomain, EIO,
+                                   {{"description", "can't start the event journal stream"}}));
     }
     // Without --no-follow nothing signals `done`: only an interrupt ends the wait.
     while (!interrupted() && !printer.done.wait(0.2)) {

@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "cli/Command.h"
+#include "cli/ProviderCommand.h"
 #include "support/Result.h"
 
 namespace tamber {
@@ -17,10 +17,16 @@ namespace tamber {
 //
 // `tamber events --forget PATH`: the journal stops remembering that tree (see
 // TremorService::forget) and says what it dropped.
-class EventsCommand : public Command {
+class EventsCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
-    int run(CliContext& context) override;
+
+protected:
+    // --forget: the journal alone answers it.
+    std::optional<int> runBeforeProvider(CliContext& context) override;
+    // --since must be a whole event ID.
+    Status checkArguments() override;
+    int runWith(CliContext& context, HostPorterExtension& provider) override;
 
 private:
     // Watches each of `paths` that no watched tree covers, with a warning on standard error.
@@ -32,11 +38,11 @@ private:
 
     std::vector<std::string> paths_;
     CLI::Option* since_ = nullptr;
-    std::string sinceText_;  // parsed by run(), which can say what is wrong with it
+    std::string sinceText_;  // parsed by checkArguments(), which can say what is wrong with it
+    uint64_t sinceID_ = 0;
     std::string forget_;
     bool docid_ = false;
     bool noFollow_ = false;
-    bool json_ = false;
 };
 
 }  // namespace tamber

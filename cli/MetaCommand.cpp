@@ -4,9 +4,6 @@
 #include <ctime>
 #include <ostream>
 
-#include "applibraries/LocalAppLibraryCache.h"
-#include "applibraries/LocalAppLibraryManager.h"
-#include "applibraries/SharedAppLibraryLookup.h"
 #include "cli/TagLabels.h"
 #include "host/PublishedTrees.h"
 #include "platform/objects/Number.h"
@@ -122,11 +119,8 @@ int MetaCommand::run(CliContext& context) {
     Url url = Url::fileURLWithPath(path_);
     // The app libraries are published trees too, even when the provider is not started: take
     // the libraries last found (the main cache) without asking the registry again.
-    if (!AppLibraryLookup::current())
-        SharedAppLibraryLookup::install();
-    auto mainCache = LocalAppLibraryCache::mainCache();
-    mainCache->queue().sync([&] { mainCache->load(); });
-    LocalAppLibraryManager::shared()->upgradeFromMainCache(nullptr, false);
+    if (auto stopped = context.publishFromCache(); !stopped.ok())
+        return context.fail(stopped.error(), json_);
     if (auto outside = PublishedTrees::check(url); !outside.ok())
         return context.fail(outside.error(), json_);
     auto exists = url.resourceValue(ResourceKeys::kFileID);

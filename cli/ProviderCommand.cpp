@@ -9,6 +9,8 @@
 namespace tamber {
 
 int ProviderCommand::run(CliContext& context) {
+    if (auto answered = runBeforeProvider(context))
+        return *answered;
     if (auto refused = checkArguments(); !refused.ok())
         return fail(context, refused.error());
     auto provider = context.prepareProvider();

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <optional>
 #include <string>
 
 #include "cli/Command.h"
@@ -8,15 +9,18 @@
 
 namespace tamber {
 
-// A verb that works through the provider, as every verb but the journal's does. It runs the
-// shared preamble once for all of them: the arguments that can be checked without the
-// provider are checked first (a usage error wins), then the provider is prepared, then the verb
-// runs against the host interface. Failures print in the form --json asked for.
+// A verb that works through the provider. It runs the shared preamble once for all of them: a
+// verb may first answer without the provider (the journal's --forget), then the arguments that
+// can be checked without the provider are checked (a usage error wins), then the provider is
+// prepared, then the verb runs against the host interface. Failures print in the form --json
+// asked for.
 class ProviderCommand : public Command {
 public:
     int run(CliContext& context) final;
 
 protected:
+    // An exit status when the verb is done before the provider starts; nothing by default.
+    virtual std::optional<int> runBeforeProvider(CliContext&) { return std::nullopt; }
     // What can be refused before the provider starts; nothing by default.
     virtual Status checkArguments() { return Status::OK(); }
     // The verb itself; returns the exit status.

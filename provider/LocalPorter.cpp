@@ -32,18 +32,23 @@ bool isAppLibraryIdentifier(const HostPorterItemIdentifier& identifier) {
 
 }  // namespace
 
-LocalPorter::LocalPorter()
-    : appRefreshQueue_(DispatchQueue::makeSerial("tamber.app-refresh.queue")),
+LocalPorter::LocalPorter(ProviderServices services)
+    : services_(std::move(services)),
+      appRefreshQueue_(DispatchQueue::makeSerial("tamber.app-refresh.queue")),
       appRefreshPacer_(std::make_unique<Pacer>("tamber.app-refresh.pacer", appRefreshQueue_,
                                                kAppRefreshMinimumInterval)) {}
 
 std::shared_ptr<LocalPorter> LocalPorter::create() {
-    auto porter = std::make_shared<LocalPorter>();
+    return create(ProviderServices::fromCurrentSlots());
+}
+
+std::shared_ptr<LocalPorter> LocalPorter::create(ProviderServices services) {
+    auto porter = std::make_shared<LocalPorter>(std::move(services));
     porter->installPacerHandler();
     installPutBackResolver();
     // The host may hold a working set from an earlier run: have it ask what changed since.
     logInfo("auto notify changes on HostPorterWorkingSetContainerItemIdentifier at startup");
-    HostPorterManager::defaultManager()->signalEnumeratorForContainerItemIdentifier(
+    porter->services_.manager->signalEnumeratorForContainerItemIdentifier(
         HostPorterWorkingSetContainerItemIdentifier, [](std::optional<Error>) {});
     return porter;
 }
@@ -61,8 +66,8 @@ void LocalPorter::installPacerHandler() {
 // MARK: lookups
 
 LocalPorter::LocalItemRef LocalPorter::temporaryLocalFolderItem() {
-    Url url = HostPorterManager::defaultManager()->documentStorageURL().appendingPathComponent(
-        kTemporaryLocalFolderName);
+    Url url =
+        services_.manager->documentStorageURL().appendingPathComponent(kTemporaryLocalFolderName);
     if (auto status = FileContents::createDirectory(url); !status.ok()) {
         logError("can't create temporary directory; " + status.error().description());
         return nullptr;

@@ -10,6 +10,7 @@
 #include "items/ItemMetadata.h"
 #include "items/LocalItem.h"
 #include "platform/apps/AppRecord.h"
+#include "provider/ProviderServices.h"
 #include "support/DispatchQueue.h"
 #include "support/Pacer.h"
 #include "support/Result.h"
@@ -23,8 +24,12 @@ public:
     using LocalItemRef = std::shared_ptr<const LocalItem>;
 
     // Use `create`: the pacer's handler needs a weak reference to the provider.
-    LocalPorter();
+    explicit LocalPorter(ProviderServices services);
+    // Without services, the process's current manager and file system.
     static std::shared_ptr<LocalPorter> create();
+    static std::shared_ptr<LocalPorter> create(ProviderServices services);
+
+    const ProviderServices& services() const { return services_; }
 
     const std::shared_ptr<DispatchQueue>& appRefreshQueue() const { return appRefreshQueue_; }
 
@@ -156,6 +161,7 @@ private:
                     std::function<void(size_t removed)> completion);
 
     std::vector<std::function<void()>> appRefreshCompletionHandlers_;
+    const ProviderServices services_;
     std::shared_ptr<DispatchQueue> appRefreshQueue_;
     std::unique_ptr<Pacer> appRefreshPacer_;
 };

@@ -7,10 +7,9 @@ namespace tamber {
 
 namespace {
 
-void signalContainer(const HostPorterItemIdentifier& container) {
+void signalContainer(HostPorterManager& manager, const HostPorterItemIdentifier& container) {
     logInfo("notify changes on " + container);
-    HostPorterManager::defaultManager()->signalEnumeratorForContainerItemIdentifier(
-        container, [](std::optional<Error>) {});
+    manager.signalEnumeratorForContainerItemIdentifier(container, [](std::optional<Error>) {});
 }
 
 }  // namespace
@@ -33,9 +32,9 @@ LocalPorter::AppRefreshOutcome LocalPorter::refreshAppLibraries() {
     for (auto& handler : handlers) handler();
 
     if (outcome.rootChanged)
-        signalContainer(HostPorterRootContainerItemIdentifier);
+        signalContainer(*services_.manager, HostPorterRootContainerItemIdentifier);
     if (outcome.workingSetChanged)
-        signalContainer(HostPorterWorkingSetContainerItemIdentifier);
+        signalContainer(*services_.manager, HostPorterWorkingSetContainerItemIdentifier);
     return outcome;
 }
 

@@ -23,7 +23,7 @@ namespace {
 
 // Every trash folder, each once: the app libraries' (in the manager's order), then the shared
 // area's. Two libraries may share a trash folder when one lies inside the other.
-std::vector<Url> trashFoldersToSweep() {
+std::vector<Url> trashFoldersToSweep(const ProviderServices& services) {
     std::vector<Url> folders;
     auto add = [&](const Url& folder) {
         if (std::find(folders.begin(), folders.end(), folder) != folders.end())
@@ -32,14 +32,14 @@ std::vector<Url> trashFoldersToSweep() {
         auto opened = PublishedTrees::openFolder(folder, O_PATH);
         if (!opened.ok())
             return;
-        FileSystem::current().close(opened.value());
+        services.fileSystem->close(opened.value());
         folders.push_back(folder);
     };
     for (const auto& library : LocalAppLibraryManager::shared()->allItems()) {
         if (auto trash = trashFolderForURL(library->fileURL()))
             add(*trash);
     }
-    add(HostPorterManager::defaultManager()->documentStorageURL().appendingPathComponent(".Trash"));
+    add(services.manager->documentStorageURL().appendingPathComponent(".Trash"));
     return folders;
 }
 
@@ -74,7 +74,7 @@ void LocalPorter::sweepTrash(std::shared_ptr<const Date> referenceDate,
         auto removed = std::make_shared<std::atomic<size_t>>(0);
 
         FSDirectoryEnumerator walk;
-        walk.urls = trashFoldersToSweep();
+        walk.urls = trashFoldersToSweep(services_);
         walk.limit = std::numeric_limits<uint64_t>::max();  // a limit of 0 delivers nothing
         // Only the top level: what lies inside a trashed folder goes with the folder.
         walk.directoryEnumerationOptionsFor =

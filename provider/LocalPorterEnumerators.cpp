@@ -27,7 +27,7 @@ Result<HostPorterEnumeratorRef> LocalPorter::enumeratorForContainerItemIdentifie
             return url.error();
         // A link is an item, not a container: listing it would read what lies behind it.
         if (auto opened = PublishedTrees::openFolder(url.value(), O_PATH); opened.ok())
-            FileSystem::current().close(opened.value());
+            services_.fileSystem->close(opened.value());
         else if (PublishedTrees::isOutsideError(opened.error()))
             return opened.error();
         // A file has no children: listing one would answer with an empty page, which a caller

@@ -5,6 +5,8 @@
 #include <cstring>
 #include <utility>
 
+#include "applibraries/LocalAppLibraryCache.h"
+#include "applibraries/LocalAppLibraryManager.h"
 #include "applibraries/SharedAppLibraryLookup.h"
 #include "applibraries/TBPAppLibraryManager.h"
 #include "host/HostPorterManager.h"
@@ -60,16 +62,16 @@ Status ProviderRuntime::prepareStorage() {
                                           ": " + std::strerror(static_cast<int>(error.code()))}});
     }
     std::weak_ptr<SignalSlot> weakSlot = signals_;
-    previousManager_ =
-        HostPorterManager::installDefaultManager(std::make_shared<StorageHostPorterManager>(
-            storage_, [weakSlot](const HostPorterItemIdentifier& container) {
-                auto slot = weakSlot.lock();
-                if (!slot)
-                    return;
-                std::lock_guard lock(slot->mutex);
-                if (slot->handler)
-                    slot->handler(container);
-            }));
+    manager_ = std::make_shared<StorageHostPorterManager>(
+        storage_, [weakSlot](const HostPorterItemIdentifier& container) {
+            auto slot = weakSlot.lock();
+            if (!slot)
+                return;
+            std::lock_guard lock(slot->mutex);
+            if (slot->handler)
+                slot->handler(container);
+        });
+    previousManager_ = HostPorterManager::installDefaultManager(manager_);
     installedManager_ = true;
     storagePrepared_ = true;
     return Status::OK();
@@ -123,9 +125,13 @@ Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
         return porter_;
     if (auto error = prepareJournal(); !error.ok())
         return error.error();
-    previousLookup_ = SharedAppLibraryLookup::install();
-    installedLookup_ = true;
-    auto porter = LocalPorter::create();
+    if (!installedLookup_) {
+        previousLookup_ = SharedAppLibraryLookup::install();
+        installedLookup_ = true;
+    }
+    // The provider is handed the runtime's own objects rather than reaching for the slots.
+    auto porter = LocalPorter::create(
+        {manager_, options_.fileSystem ? options_.fileSystem.get() : &FileSystem::current()});
     refreshOutcome_ = porter->refreshAppLibraries();
     // Identifiers inside app libraries need their trees journaled like the storage folder.
     for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries()) {
@@ -136,6 +142,20 @@ Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
     porter_ = porter;
     publishing_ = true;
     return porter_;
+}
+
+Status ProviderRuntime::publishFromCache() {
+    std::lock_guard lock(mutex_);
+    if (stopped_)
+        return stoppedError();
+    if (!installedLookup_ && !AppLibraryLookup::current()) {
+        previousLookup_ = SharedAppLibraryLookup::install();
+        installedLookup_ = true;
+    }
+    auto mainCache = LocalAppLibraryCache::mainCache();
+    mainCache->queue().sync([&] { mainCache->load(); });
+    LocalAppLibraryManager::shared()->upgradeFromMainCache(nullptr, false);
+    return Status::OK();
 }
 
 void ProviderRuntime::setSignalHandler(

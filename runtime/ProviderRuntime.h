@@ -96,6 +96,10 @@ public:
     // the journal remembers but this run did not watch are marked unwatched.
     Result<std::shared_ptr<LocalPorter>> provider();
     const LocalPorter::AppRefreshOutcome& appRefreshOutcome() const { return refreshOutcome_; }
+    // Publishes the app libraries as last found (the main cache), without asking the registry
+    // and without starting the provider, so that a host can tell published trees from others.
+    // Keeps an app-library lookup already current. Fails with ECANCELED after shutdown.
+    Status publishFromCache();
 
     // Replaces the handler of the container signals (empty: they are dropped).
     void setSignalHandler(std::function<void(const HostPorterItemIdentifier&)> handler);
@@ -121,6 +125,8 @@ private:
     std::shared_ptr<LocalPorter> porter_;
     LocalPorter::AppRefreshOutcome refreshOutcome_;
     bool publishing_ = false;  // the run's publication is known
+
+    std::shared_ptr<HostPorterManager> manager_;  // made by prepareStorage()
 
     // What the runtime replaced in the process-wide slots, given back at shutdown.
     bool installedManager_ = false;

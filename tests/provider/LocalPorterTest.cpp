@@ -179,6 +179,17 @@ TEST_F(LocalPorterTest, TemporaryLocalFolderIsCreatedOnDemand) {
     EXPECT_EQ(log->countStartingWith("[ERROR] can't create temporary directory; "), 1u);
 }
 
+// A provider handed its own manager signals that one, not the process default: two runtimes'
+// hosts must not see each other's provider.
+TEST_F(LocalPorterTest, AProviderGivenAManagerSignalsThatManager) {
+    auto given =
+        std::make_shared<RecordingHostPorterManager>(Url::fileURLWithPath(dir.makeDir("given")));
+    auto own = LocalPorter::create({given, &FileSystem::current()});
+    EXPECT_EQ(given->signals(),
+              std::vector<HostPorterItemIdentifier>{HostPorterWorkingSetContainerItemIdentifier});
+    EXPECT_TRUE(host->signals().empty());
+}
+
 TEST_F(LocalPorterTest, AppLibraryDocumentsFolderIsItsHashIdentifier) {
     install({"com.example.notes"});
     porter->refreshAppLibraries();
