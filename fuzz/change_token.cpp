@@ -48,14 +48,14 @@ Journal& openJournal() {
     journal->store = std::move(store).value();
     std::atexit(closeJournal);
     TremorStore& s = *journal->store;
-    if (s.addRoot("/w", 0))
+    if (!s.addRoot("/w", 0).ok())
         std::abort();
     std::vector<JournalEvent> events;
     for (int i = 0; i < kEvents; ++i)
         events.push_back(
             {0, (i % 3 ? "/w/f" : "/x/f") + std::to_string(i), uint64_t(i + 1), 0x100});
     auto appended = s.append(events);
-    if (!appended.ok() || s.addRoot("/x", 20) || s.trim(kEvents - 10))
+    if (!appended.ok() || !s.addRoot("/x", 20).ok() || !s.trim(kEvents - 10).ok())
         std::abort();
     journal->last = appended.value();
     return *journal;
@@ -96,7 +96,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
         previous = event.id;
         return true;
     });
-    if (status || (since >= j.last && seen != 0))
+    if (!status.ok() || (since >= j.last && seen != 0))
         std::abort();
     return 0;
 }

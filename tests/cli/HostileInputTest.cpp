@@ -11,12 +11,12 @@
 #include <sstream>
 #include <thread>
 
-#include "runtime/Base64.h"
-#include "runtime/JsonValues.h"
 #include "cli/TextEscape.h"
 #include "fs/FSChangeToken.h"
 #include "platform/archive/PlistNode.h"
 #include "platform/tremors/TremorService.h"
+#include "runtime/Base64.h"
+#include "runtime/JsonValues.h"
 #include "tests/common/CliRunner.h"
 #include "tests/common/CommandLineTest.h"
 #include "tests/common/TempDir.h"
