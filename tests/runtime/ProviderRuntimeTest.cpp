@@ -7,6 +7,7 @@
 #include "host/HostPorterEnumerator.h"
 #include "platform/strata/StrataService.h"
 #include "platform/tremors/TremorService.h"
+#include "runtime/ChangeCollector.h"
 #include "runtime/ProviderRuntime.h"
 #include "support/DispatchSemaphore.h"
 #include "support/DispatchTimer.h"
@@ -40,35 +41,6 @@ struct PageRecorder : HostPorterEnumerationObserver {
         done.signal();
     }
     std::set<std::string> names;
-    std::optional<Error> error;
-    DispatchSemaphore done;
-};
-
-struct ChangeRecorder : HostPorterChangeObserver {
-    void didUpdateItems(const std::vector<HostPorterItemRef>& items) override {
-        std::lock_guard lock(mutex);
-        for (const auto& item : items) updated.insert(item->filename());
-    }
-    void didDeleteItemsWithIdentifiers(const std::vector<HostPorterItemIdentifier>&) override {}
-    void finishEnumeratingChangesUpToSyncAnchor(const HostPorterSyncAnchor& a, bool more) override {
-        {
-            std::lock_guard lock(mutex);
-            anchor = a;
-            moreComing = more;
-        }
-        done.signal();
-    }
-    void finishEnumeratingWithError(const Error& e) override {
-        {
-            std::lock_guard lock(mutex);
-            error = e;
-        }
-        done.signal();
-    }
-    std::mutex mutex;
-    std::set<std::string> updated;
-    HostPorterSyncAnchor anchor;
-    bool moreComing = false;
     std::optional<Error> error;
     DispatchSemaphore done;
 };
@@ -140,14 +112,15 @@ protected:
 
         std::set<std::string> updated;
         for (int requests = 0; requests < 20; ++requests) {
-            auto changes = std::make_shared<ChangeRecorder>();
+            auto changes = std::make_shared<ChangeCollector>();
             enumerator->enumerateChangesForObserver(changes, *anchor);
-            ASSERT_TRUE(changes->done.wait(kPatience)) << "run " << run;
-            std::lock_guard lock(changes->mutex);
-            ASSERT_FALSE(changes->error) << changes->error->description();
-            updated.insert(changes->updated.begin(), changes->updated.end());
-            anchor = changes->anchor;
-            if (!changes->moreComing)
+            auto batch = changes->waitFor(kPatience);
+            ASSERT_TRUE(batch) << "run " << run;
+            ASSERT_FALSE(batch->error) << batch->error->description();
+            for (const auto& item : batch->updated) updated.insert(item->filename());
+            ASSERT_TRUE(batch->anchor) << "run " << run;
+            anchor = batch->anchor;
+            if (!batch->moreComing)
                 break;
         }
         EXPECT_TRUE(updated.contains(name)) << "run " << run;
