@@ -10,9 +10,10 @@
 #include "fs/TremorReader.h"
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/tremors/TremorFlags.h"
+#include "tests/common/Sanitizers.h"
 #include "tests/fs/FsTest.h"
 
-#if defined(__SANITIZE_ADDRESS__)
+#if defined(TAMBER_TESTS_ASAN)
 #include <sanitizer/lsan_interface.h>
 #endif
 
@@ -314,7 +315,7 @@ TEST_F(TremorTest, AReaderDestroyedWhileRunningSaysSoAndLaterBatchesFindNothing)
         TremorReader::make({storageURL()}, currentID(), TremorReaderMode::pathBased, true);
     reader->setDelegate(delegate);
     {
-#if defined(__SANITIZE_ADDRESS__)
+#if defined(TAMBER_TESTS_ASAN)
         // The abandoned stream is never released, by design.
         __lsan::ScopedDisabler leaksOfTheAbandonedStream;
 #endif

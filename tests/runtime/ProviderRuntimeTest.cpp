@@ -13,6 +13,7 @@
 #include "support/DispatchTimer.h"
 #include "support/WorkerPool.h"
 #include "tests/common/AppLibraryTest.h"
+#include "tests/common/Sanitizers.h"
 #include "tests/common/TempStagingLedger.h"
 #include "tests/common/ThreadCount.h"
 
@@ -25,7 +26,7 @@ const auto* const ledger = ::testing::AddGlobalTestEnvironment(new TempStagingLe
 
 constexpr double kPatience = 30;  // seconds: only a hang gets near it
 
-#if defined(__SANITIZE_THREAD__)
+#if defined(TAMBER_TESTS_TSAN)
 constexpr size_t kSanitizerThreads = 1;  // ThreadSanitizer starts a thread of its own once
 #else
 constexpr size_t kSanitizerThreads = 0;
