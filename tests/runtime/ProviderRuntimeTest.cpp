@@ -13,7 +13,6 @@
 #include "support/DispatchTimer.h"
 #include "support/WorkerPool.h"
 #include "tests/common/AppLibraryTest.h"
-#include "tests/common/Sanitizers.h"
 #include "tests/common/TempStagingLedger.h"
 #include "tests/common/ThreadCount.h"
 
@@ -25,12 +24,6 @@ using namespace testing;
 const auto* const ledger = ::testing::AddGlobalTestEnvironment(new TempStagingLedger);
 
 constexpr double kPatience = 30;  // seconds: only a hang gets near it
-
-#if defined(TAMBER_TESTS_TSAN)
-constexpr size_t kSanitizerThreads = 1;  // ThreadSanitizer starts a thread of its own once
-#else
-constexpr size_t kSanitizerThreads = 0;
-#endif
 
 struct PageRecorder : HostPorterEnumerationObserver {
     void didEnumerateItems(const std::vector<HostPorterItemRef>& page) override {
