@@ -18,7 +18,7 @@ struct InodeRecord {
     // How the file looked when it was last seen, so that a restart can tell a file changed while
     // nothing watched, and an inode number reused by another file, from the file itself.
     // Entries indexed before these were kept have `stamped` false.
-    uint64_t birth = 0;  // see JournalWriter::birthOf; 0: unknown
+    uint64_t birth = 0;  // see FileStamp::birthOf; 0: unknown
     uint64_t size = 0;
     int64_t mtime = 0;  // nanoseconds since the epoch
     // Moves with attribute changes too: a restart rereads the kept metadata of a document whose

@@ -12,6 +12,7 @@
 #include "platform/ScopedFd.h"
 #include "platform/UrlPath.h"
 #include "platform/strata/DocumentAttributes.h"
+#include "platform/tremors/FileStamp.h"
 #include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/WatchedRoots.h"
 #include "support/Log.h"
@@ -20,100 +21,12 @@ namespace tamber {
 
 namespace {
 
-// What an index entry keeps of a file.
-constexpr unsigned kStampMask =
-    STATX_INO | STATX_TYPE | STATX_BTIME | STATX_CTIME | STATX_MTIME | STATX_SIZE;
-
-bool statPath(const std::string& path, struct statx& st) {
-    return FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, kStampMask, &st) == 0;
-}
-
-int64_t nanoseconds(const struct statx_timestamp& t) {
-    return t.tv_sec * 1'000'000'000 + t.tv_nsec;
-}
-
-uint8_t kindOf(uint32_t mode) {
-    if (S_ISREG(mode))
-        return InodeRecord::kFile;
-    if (S_ISDIR(mode))
-        return InodeRecord::kDirectory;
-    if (S_ISLNK(mode))
-        return InodeRecord::kSymlink;
-    return InodeRecord::kOther;
-}
-
-uint32_t kindFlag(uint8_t kind) {
-    switch (kind) {
-        case InodeRecord::kFile:
-            return kTremorItemIsFile;
-        case InodeRecord::kDirectory:
-            return kTremorItemIsDir;
-        case InodeRecord::kSymlink:
-            return kTremorItemIsSymlink;
-        default:
-            return 0;
-    }
-}
-
-bool hasBirthTime(const struct statx& st) {
-    return (st.stx_mask & STATX_BTIME) && (st.stx_btime.tv_sec != 0 || st.stx_btime.tv_nsec != 0);
-}
-
-// Whether the indexed entry is the file `st` describes, as seen while watching: only a birth time
-// tells a reused inode number from the file itself (a change time moves with every write).
-bool isIndexedFile(const InodeRecord& indexed, const struct statx& st) {
-    if (indexed.inode != st.stx_ino || indexed.kind != kindOf(st.stx_mode))
-        return false;
-    return !hasBirthTime(st) || !indexed.stamped || indexed.birth == 0 ||
-           indexed.birth == JournalWriter::birthOf(st);
-}
-
-// The same file: a reused inode number of another kind or birth is another file. Entries
-// without a birth (indexed before it was kept, or on a file system without one) can only be
-// told apart by kind.
-bool sameFile(const InodeRecord& indexed, const InodeRecord& found) {
-    return indexed.kind == found.kind && (!indexed.stamped || indexed.birth == 0 ||
-                                          found.birth == 0 || indexed.birth == found.birth);
-}
-
-// A directory's own size and time change with its entries, which are reported one by one.
-bool changedWhileAway(const InodeRecord& indexed, const InodeRecord& found) {
-    return indexed.stamped && indexed.kind != InodeRecord::kDirectory &&
-           (indexed.size != found.size || indexed.mtime != found.mtime);
-}
-
 void logIfFailed(const Status& status, std::string_view what) {
     if (!status.ok())
         logError(std::string(what) + ": " + status.error().description());
 }
 
-// Whether the index must be told about `found`, a newer look at the entry it keeps as `indexed`.
-bool differs(const InodeRecord& indexed, InodeRecord found) {
-    found.docID = indexed.docID;  // kept apart from the entry
-    return !(found == indexed);
-}
-
 }  // namespace
-
-uint64_t JournalWriter::birthOf(const struct statx& st) {
-    if (hasBirthTime(st))
-        return static_cast<uint64_t>(nanoseconds(st.stx_btime));
-    // A directory's change time moves with every entry: it would make every folder that changed
-    // while nothing watched read as replaced.
-    if (S_ISDIR(st.stx_mode))
-        return 0;
-    return static_cast<uint64_t>(nanoseconds(st.stx_ctime));
-}
-
-InodeRecord JournalWriter::recordOf(const struct statx& st, uint64_t parent, std::string name) {
-    InodeRecord record{st.stx_ino, parent, std::move(name), kindOf(st.stx_mode), 0};
-    record.birth = birthOf(st);
-    record.size = st.stx_size;
-    record.mtime = nanoseconds(st.stx_mtime);
-    record.ctime = nanoseconds(st.stx_ctime);
-    record.stamped = true;
-    return record;
-}
 
 std::string JournalWriter::documentIdPath(uint32_t device, uint32_t docID, uint64_t src,
                                           uint64_t dst) {
@@ -302,10 +215,10 @@ void JournalWriter::forgetSubtree(const InodeRecord& top, const std::string& pat
 
 void JournalWriter::forgetReusedNumber(const struct statx& st) {
     // Without a birth time a reused number cannot be told from a move whose event was lost.
-    if (!hasBirthTime(st))
+    if (!FileStamp::hasBirthTime(st))
         return;
     auto indexed = stagedOrIndexed(st.stx_ino);
-    if (!indexed || isIndexedFile(*indexed, st))
+    if (!indexed || FileStamp::isIndexedFile(*indexed, st))
         return;
     flushStaged();
     // Its document waits under its old path for its own new file, later in the batch.
@@ -355,7 +268,7 @@ void JournalWriter::refreshAttributes(uint32_t docID, const std::string& path, u
     auto values = DocumentAttributes::read(path);
     struct statx st {};
     // Read by path: if another file took the path meanwhile, what was read is not this one's.
-    if (!values || !statPath(path, st) || st.stx_ino != inode)
+    if (!values || !FileStamp::read(path, st) || st.stx_ino != inode)
         return;
     auto saved = store_.documentAttributes(docID);
     if (!saved.ok()) {
@@ -384,11 +297,11 @@ void JournalWriter::settleVanished(Settle settle) {
             }
             for (const std::string& path : waiting) {
                 struct statx st {};
-                if (!statPath(path, st))
+                if (!FileStamp::read(path, st))
                     continue;
                 more = true;
                 forgetReusedNumber(st);
-                claimDocumentId(path, st.stx_ino, kindOf(st.stx_mode));
+                claimDocumentId(path, st.stx_ino, FileStamp::kindOf(st.stx_mode));
             }
         }
     }
@@ -406,22 +319,23 @@ void JournalWriter::created(const FileChange& change) {
     uint32_t kind = change.isDirectory ? kTremorItemIsDir : kTremorItemIsFile;
     struct statx st {};
     struct statx parent {};
-    if (!statPath(change.path, st) ||
-        !statPath(std::string(UrlPath::deletingLastComponent(change.path)), parent)) {
+    if (!FileStamp::read(change.path, st) ||
+        !FileStamp::read(std::string(UrlPath::deletingLastComponent(change.path)), parent)) {
         // Gone already; its removal follows in this batch or the next.
         pending_.push_back({0, change.path, 0, kTremorItemCreated | kind});
         return;
     }
     std::string name = std::string(UrlPath::lastComponent(change.path));
     for (const InodeRecord& existing : entriesAt(parent.stx_ino, name)) {
-        if (!isIndexedFile(existing, st))
+        if (!FileStamp::isIndexedFile(existing, st))
             forgetSubtree(existing, change.path);
     }
     forgetReusedNumber(st);
-    InodeRecord record = recordOf(st, parent.stx_ino, std::move(name));
+    InodeRecord record = FileStamp::recordOf(st, parent.stx_ino, std::move(name));
     uint8_t recordKind = record.kind;
     stage(std::move(record));
-    pending_.push_back({0, change.path, st.stx_ino, kTremorItemCreated | kindFlag(recordKind)});
+    pending_.push_back(
+        {0, change.path, st.stx_ino, kTremorItemCreated | FileStamp::kindFlag(recordKind)});
     claimDocumentId(change.path, st.stx_ino, recordKind);
 }
 
@@ -431,7 +345,7 @@ void JournalWriter::removed(const FileChange& change) {
     uint64_t inode = 0;
     if (record) {
         inode = record->inode;
-        kind = kindFlag(record->kind);
+        kind = FileStamp::kindFlag(record->kind);
         forgetSubtree(*record, change.path);
     }
     pending_.push_back({0, change.path, inode, kTremorItemRemoved | kind});
@@ -443,8 +357,9 @@ void JournalWriter::renamed(const FileChange& change) {
     struct statx parent {};
     uint32_t kind = change.isDirectory ? kTremorItemIsDir : kTremorItemIsFile;
     uint64_t inode = from ? from->inode : 0;
-    bool present = statPath(change.path, st) &&
-                   statPath(std::string(UrlPath::deletingLastComponent(change.path)), parent);
+    bool present =
+        FileStamp::read(change.path, st) &&
+        FileStamp::read(std::string(UrlPath::deletingLastComponent(change.path)), parent);
     if (present)
         inode = st.stx_ino;
     std::vector<InodeRecord> existing;
@@ -454,37 +369,37 @@ void JournalWriter::renamed(const FileChange& change) {
         existing.push_back(std::move(*at));
     }
     for (const InodeRecord& replaced : existing) {
-        if (present ? !isIndexedFile(replaced, st) : replaced.inode != inode)
+        if (present ? !FileStamp::isIndexedFile(replaced, st) : replaced.inode != inode)
             forgetSubtree(replaced, change.path);
     }
     if (present) {
         forgetReusedNumber(st);
-        InodeRecord record =
-            recordOf(st, parent.stx_ino, std::string(UrlPath::lastComponent(change.path)));
-        kind = kindFlag(record.kind);
+        InodeRecord record = FileStamp::recordOf(st, parent.stx_ino,
+                                                 std::string(UrlPath::lastComponent(change.path)));
+        kind = FileStamp::kindFlag(record.kind);
         stage(std::move(record));
     }
     if (!change.fromPath.empty())
         pending_.push_back({0, change.fromPath, inode, kTremorItemRenamed | kind});
     pending_.push_back({0, change.path, inode, kTremorItemRenamed | kind});
     if (present)
-        claimDocumentId(change.path, inode, kindOf(st.stx_mode));
+        claimDocumentId(change.path, inode, FileStamp::kindOf(st.stx_mode));
 }
 
 void JournalWriter::touched(const FileChange& change, uint32_t flag) {
     struct statx st {};
     uint64_t inode = 0;
     uint32_t kind = change.isDirectory ? kTremorItemIsDir : kTremorItemIsFile;
-    if (statPath(change.path, st)) {
+    if (FileStamp::read(change.path, st)) {
         inode = st.stx_ino;
-        kind = kindFlag(kindOf(st.stx_mode));
+        kind = FileStamp::kindFlag(FileStamp::kindOf(st.stx_mode));
         // The index keeps up, so that a restart does not report the change again. Another file
         // that took the inode number is left to its own creation event.
         auto indexed = stagedOrIndexed(inode);
         if (indexed && indexed->name == std::string(UrlPath::lastComponent(change.path)) &&
-            isIndexedFile(*indexed, st)) {
-            InodeRecord now = recordOf(st, indexed->parent, indexed->name);
-            if (differs(*indexed, now))
+            FileStamp::isIndexedFile(*indexed, st)) {
+            InodeRecord now = FileStamp::recordOf(st, indexed->parent, indexed->name);
+            if (FileStamp::differs(*indexed, now))
                 stage(std::move(now));
             // Only documents keep a copy of their metadata: other files cost nothing here.
             if (flag == kTremorItemAttributes && indexed->kind == InodeRecord::kFile) {
@@ -501,7 +416,7 @@ void JournalWriter::touched(const FileChange& change, uint32_t flag) {
 
 Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& root, bool journal) {
     struct statx top {};
-    if (!statPath(root, top))
+    if (!FileStamp::read(root, top))
         return Error::posix(errno);
     uint64_t oldTop = 0;
     for (const auto& r : store_.roots()) {
@@ -527,9 +442,9 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
         bool listed = fs.readDirectory(fd.get(), entries);
         for (const auto& entry : listed ? entries : std::vector<FileSystem::DirectoryEntry>{}) {
             struct statx st {};
-            if (fs.statx(fd.get(), entry.name, AT_SYMLINK_NOFOLLOW, kStampMask, &st) != 0)
+            if (fs.statx(fd.get(), entry.name, AT_SYMLINK_NOFOLLOW, FileStamp::kMask, &st) != 0)
                 continue;
-            InodeRecord record = recordOf(st, dir, entry.name);
+            InodeRecord record = FileStamp::recordOf(st, dir, entry.name);
             std::string path = at + "/" + entry.name;
             if (record.kind == InodeRecord::kDirectory)
                 stack.emplace_back(record.inode, path);
@@ -564,7 +479,7 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
     bool unstamped = false;
     for (auto& [inode, found] : indexed) {
         auto it = onDisk.find(inode);
-        if (it != onDisk.end() && !sameFile(found.record, it->second.record)) {
+        if (it != onDisk.end() && !FileStamp::sameFile(found.record, it->second.record)) {
             replaced.insert(inode);
             it = onDisk.end();
         }
@@ -573,20 +488,20 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
             if (found.record.docID != 0)
                 vanish(found.record, found.path);
             if (journal)
-                pending_.push_back(
-                    {0, found.path, inode, kTremorItemRemoved | kindFlag(found.record.kind)});
+                pending_.push_back({0, found.path, inode,
+                                    kTremorItemRemoved | FileStamp::kindFlag(found.record.kind)});
             continue;
         }
         unstamped |= !found.record.stamped;
         const Found& now = it->second;
-        uint32_t kind = kindFlag(now.record.kind);
+        uint32_t kind = FileStamp::kindFlag(now.record.kind);
         if (journal && now.path != found.path) {
             pending_.push_back({0, found.path, inode, kTremorItemRenamed | kind});
             pending_.push_back({0, now.path, inode, kTremorItemRenamed | kind});
         }
-        if (journal && changedWhileAway(found.record, now.record))
+        if (journal && FileStamp::changedWhileAway(found.record, now.record))
             pending_.push_back({0, now.path, inode, kTremorItemModified | kind});
-        if (differs(found.record, now.record))
+        if (FileStamp::differs(found.record, now.record))
             updates.push_back(now.record);
         // Attributes change only the change time; unknown after an upgrade, so read once then.
         if (found.record.docID != 0 && now.record.kind == InodeRecord::kFile &&
@@ -600,8 +515,8 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
             continue;
         updates.push_back(found.record);
         if (journal)
-            pending_.push_back(
-                {0, found.path, inode, kTremorItemCreated | kindFlag(found.record.kind)});
+            pending_.push_back({0, found.path, inode,
+                                kTremorItemCreated | FileStamp::kindFlag(found.record.kind)});
         claimDocumentId(found.path, inode, found.record.kind);
     }
     fail(store_.upsertInodes(updates), "Could not update the file index");

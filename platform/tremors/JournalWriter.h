@@ -47,14 +47,6 @@ public:
 
     static std::string documentIdPath(uint32_t device, uint32_t docID, uint64_t src, uint64_t dst);
 
-    // What tells a file from a later one given the same inode number: its birth time where the
-    // file system keeps one, else (for all but directories) its change time. The change time
-    // also moves when the file is changed or renamed while nothing watches; such a file then
-    // reads as replaced and keeps its document ID only if it is still at its path (the
-    // safe-save rule), which is the safe way to be wrong. 0 when there is nothing to go by.
-    static uint64_t birthOf(const struct statx& st);
-    static InodeRecord recordOf(const struct statx& st, uint64_t parent, std::string name);
-
 private:
     struct Found {
         InodeRecord record;
