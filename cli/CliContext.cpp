@@ -92,20 +92,15 @@ Result<std::shared_ptr<TremorService>> CliContext::startJournal() {
 }
 
 Status CliContext::prepareJournal() {
-    if (auto error = prepareStorage(); !error.ok())
-        return error;
-    return runtime_->prepareJournal();
+    return runtime().prepareJournal();
 }
 
 Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
-    if (auto error = prepareStorage(); !error.ok())
-        return error.error();
-    return runtime_->provider();
+    return runtime().provider();
 }
 
 void CliContext::setSignalHandler(SignalHandler handler) {
-    if (runtime_)
-        runtime_->setSignalHandler(std::move(handler));
+    runtime().setSignalHandler(std::move(handler));
 }
 
 void CliContext::setInvocation(std::string verb, std::vector<std::string> arguments) {

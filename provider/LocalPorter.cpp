@@ -176,10 +176,7 @@ Result<HostPorterItemRef> LocalPorter::itemForIdentifier(
 }
 
 Result<HostPorterItemRef> LocalPorter::itemAtURL(const Url& url) {
-    auto item = itemForURL(url);
-    if (!item.ok())
-        return item.error();
-    return HostPorterItemRef(item.value());
+    return itemForURL(url);
 }
 
 Result<LocalPorter::LocalItemRef> LocalPorter::itemForURL(const Url& url) {

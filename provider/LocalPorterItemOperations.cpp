@@ -30,12 +30,7 @@ void finishWithItem(LocalPorter& porter, const Result<Url>& url,
         completion(url.error());
         return;
     }
-    auto item = porter.itemForURL(url.value());
-    if (!item.ok()) {
-        completion(item.error());
-        return;
-    }
-    completion(item.value());
+    completion(porter.itemForURL(url.value()));
 }
 
 }  // namespace

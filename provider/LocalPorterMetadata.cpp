@@ -19,14 +19,6 @@ Error updateFailed(const Error& cause, const std::string& what,
     return Error(cause.domain(), cause.code(), std::move(info));
 }
 
-void completeWithItem(LocalPorter& porter, const Url& url,
-                      const LocalPorter::ItemCompletion& completion) {
-    auto item = porter.itemForURL(url);
-    if (!item.ok())
-        return completion(item.error());
-    completion(item.value());
-}
-
 }  // namespace
 
 void LocalPorter::setLastUsedDate(std::shared_ptr<const Date> date,
@@ -49,7 +41,7 @@ void LocalPorter::setLastUsedDate(std::shared_ptr<const Date> date,
         // Logged by the writer.
         if (auto status = ItemMetadata::writeLastUsedDate(url.value(), date); !status.ok())
             return completion(updateFailed(status.error(), "set the last-used date", identifier));
-        completeWithItem(*this, url.value(), completion);
+        completion(itemForURL(url.value()));
     });
 }
 
@@ -65,7 +57,7 @@ void LocalPorter::setTagData(const std::optional<Bytes>& tagData,
         // Logged by the writer; no tags is written as an empty list, never a removal.
         if (auto error = ItemMetadata::writeTagData(url.value(), tagData); !error.ok())
             return completion(updateFailed(error.error(), "set the tags", identifier));
-        completeWithItem(*this, url.value(), completion);
+        completion(itemForURL(url.value()));
     });
 }
 
@@ -84,7 +76,7 @@ void LocalPorter::setFavoriteRank(std::shared_ptr<const Number> rank,
             if (auto error = ItemMetadata::writeFavoriteRank(url.value(), rank); !error.ok())
                 return completion(
                     updateFailed(error.error(), "set the favourite rank", identifier));
-            completeWithItem(*this, url.value(), completion);
+            completion(itemForURL(url.value()));
         });
 }
 

@@ -94,10 +94,7 @@ void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identi
             // The move stands whatever happens to the attributes.
             (void)ItemMetadata::writeTrashDate(trashed.value(), Date::now());
             setPutBackString(trashed.value(), original);
-            auto item = itemForURL(trashed.value());
-            if (!item.ok())
-                return completion(item.error());
-            completion(item.value());
+            completion(itemForURL(trashed.value()));
         });
     });
 }
@@ -170,10 +167,7 @@ void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& iden
             // Only the date goes; the next trashing rewrites the put-back path anyway.
             logDebug("removing trash date xattr");
             (void)ItemMetadata::writeTrashDate(restored.value(), nullptr);
-            auto restoredItem = itemForURL(restored.value());
-            if (!restoredItem.ok())
-                return completion(restoredItem.error());
-            completion(restoredItem.value());
+            completion(itemForURL(restored.value()));
         });
     });
 }

@@ -13,6 +13,7 @@
 #include "platform/tremors/TremorService.h"
 #include "tests/common/AppLibraryTest.h"
 #include "tests/common/CliRunner.h"
+#include "tests/common/CommandLineTest.h"
 #include "tests/common/TempDir.h"
 
 namespace tamber {
@@ -28,20 +29,13 @@ const char* const kOutside = "not inside the document storage or an app library"
 
 // A storage folder with a folder "Shelf", one app library, and a folder "elsewhere" outside
 // both, which symbolic links inside the trees point to.
-class BoundaryCommandsTest : public testing::AppLibraryTest {
+class BoundaryCommandsTest : public testing::CommandLineTest {
 protected:
     void SetUp() override {
-        AppLibraryTest::SetUp();
-        AppRegistry::setDefaultRegistry(nullptr);
-        TremorService::resetForTesting();
-        TremorService::configure(state.path());
+        CommandLineTest::SetUp();
         previousLedger_ = StagingCopies::setLedgerDirectoryForTesting(state / "ledger");
-        storage = dir.makeDir("Documents");
         inbox = dir.makeDir("Documents/Shelf");
         elsewhere = dir.makeDir("elsewhere");
-        if (const char* dirs = std::getenv("XDG_DATA_DIRS"))
-            previousDataDirs = dirs;
-        setenv("XDG_DATA_DIRS", systemData.path().c_str(), 1);
         library = dir.makeDir("container/Documents");
         dir.writeFile("applications/com.example.Notes.desktop",
                       "[Desktop Entry]\nType=Application\nName=Notes\nExec=true\n"
@@ -50,12 +44,7 @@ protected:
     }
     void TearDown() override {
         StagingCopies::setLedgerDirectoryForTesting(previousLedger_);
-        TremorService::resetForTesting();
-        if (previousDataDirs)
-            setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
-        else
-            unsetenv("XDG_DATA_DIRS");
-        AppLibraryTest::TearDown();
+        CommandLineTest::TearDown();
     }
 
     json tamberJson(std::vector<std::string> args, int expectedStatus = 0) {
@@ -85,10 +74,8 @@ protected:
         return st.st_ino;
     }
 
-    TempDir state, systemData;
-    std::optional<std::string> previousDataDirs;
     std::string previousLedger_;
-    std::string storage, inbox, elsewhere, library;
+    std::string inbox, elsewhere, library;
 };
 
 TEST_F(BoundaryCommandsTest, NothingIsCreatedOrShownThroughALinkToOutside) {

@@ -6,6 +6,7 @@
 #include "platform/tremors/TremorService.h"
 #include "tests/common/AppLibraryTest.h"
 #include "tests/common/CliRunner.h"
+#include "tests/common/CommandLineTest.h"
 #include "tests/common/TempDir.h"
 
 namespace tamber {
@@ -17,32 +18,17 @@ using testing::TempDir;
 
 // One installed application, described by a real desktop entry, whose library is
 // <dir>/container/Documents.
-class ItemAndAppsCommandTest : public testing::AppLibraryTest {
+class ItemAndAppsCommandTest : public testing::CommandLineTest {
 protected:
     void SetUp() override {
-        AppLibraryTest::SetUp();
-        // The real registry reads the desktop entry below.
-        AppRegistry::setDefaultRegistry(nullptr);
-        TremorService::resetForTesting();
-        TremorService::configure(state.path());
-        storage = dir.makeDir("Documents");
-        if (const char* dirs = std::getenv("XDG_DATA_DIRS"))
-            previousDataDirs = dirs;
-        setenv("XDG_DATA_DIRS", systemData.path().c_str(), 1);
+        CommandLineTest::SetUp();
         library = dir.makeDir("container/Documents");
         dir.writeFile("applications/com.example.Notes.desktop",
                       "[Desktop Entry]\nType=Application\nName=Notes\nExec=true\n"
                       "X-Tamber-Data-Container=" +
                           dir.path() + "/container\nX-Tamber-Supports-Document-Browser=true\n");
     }
-    void TearDown() override {
-        TremorService::resetForTesting();
-        if (previousDataDirs)
-            setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
-        else
-            unsetenv("XDG_DATA_DIRS");
-        AppLibraryTest::TearDown();
-    }
+    void TearDown() override { CommandLineTest::TearDown(); }
 
     json tamberJson(std::vector<std::string> args, int expectedStatus = 0) {
         args.insert(args.begin(), {"--storage", storage});
@@ -52,9 +38,6 @@ protected:
         return json::parse(run.out, nullptr, false);
     }
 
-    TempDir state, systemData;
-    std::optional<std::string> previousDataDirs;
-    std::string storage;
     std::string library;
 };
 

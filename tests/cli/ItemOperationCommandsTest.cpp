@@ -12,6 +12,7 @@
 #include "provider/TrashLocations.h"
 #include "tests/common/AppLibraryTest.h"
 #include "tests/common/CliRunner.h"
+#include "tests/common/CommandLineTest.h"
 #include "tests/common/TempDir.h"
 
 namespace tamber {
@@ -25,31 +26,17 @@ const char* const kLibrary = "#com.example.Notes";
 
 // A storage folder named Documents and one installed application (a real desktop entry with an
 // icon in the user's hicolor theme) whose library is <dir>/container/Documents.
-class ItemOperationCommandsTest : public testing::AppLibraryTest {
+class ItemOperationCommandsTest : public testing::CommandLineTest {
 protected:
     void SetUp() override {
-        AppLibraryTest::SetUp();
-        AppRegistry::setDefaultRegistry(nullptr);
-        TremorService::resetForTesting();
-        TremorService::configure(state.path());
-        storage = dir.makeDir("Documents");
-        if (const char* dirs = std::getenv("XDG_DATA_DIRS"))
-            previousDataDirs = dirs;
-        setenv("XDG_DATA_DIRS", systemData.path().c_str(), 1);
+        CommandLineTest::SetUp();
         library = dir.makeDir("container/Documents");
         dir.writeFile("applications/com.example.Notes.desktop",
                       "[Desktop Entry]\nType=Application\nName=Notes\nExec=true\n"
                       "Icon=tamber-notes-test\nX-Tamber-Data-Container=" +
                           dir.path() + "/container\nX-Tamber-Supports-Document-Browser=true\n");
     }
-    void TearDown() override {
-        TremorService::resetForTesting();
-        if (previousDataDirs)
-            setenv("XDG_DATA_DIRS", previousDataDirs->c_str(), 1);
-        else
-            unsetenv("XDG_DATA_DIRS");
-        AppLibraryTest::TearDown();
-    }
+    void TearDown() override { CommandLineTest::TearDown(); }
 
     json tamberJson(std::vector<std::string> args, int expectedStatus = 0) {
         // Verbs run in this one process, one right after the other: let the journal index what
@@ -70,9 +57,6 @@ protected:
         return printed["error"];
     }
 
-    TempDir state, systemData;
-    std::optional<std::string> previousDataDirs;
-    std::string storage;
     std::string library;
 };
 
