@@ -28,8 +28,11 @@ std::shared_ptr<HostPorterManager> HostPorterManager::installDefaultManager(
     return std::atomic_exchange(&slot(), std::move(manager));
 }
 
-StorageHostPorterManager::StorageHostPorterManager(Url documentStorage, SignalHandler onSignal)
-    : storage_(std::move(documentStorage)), onSignal_(std::move(onSignal)) {}
+StorageHostPorterManager::StorageHostPorterManager(Url documentStorage, SignalHandler onSignal,
+                                                   IndexDeletionHandler onDeleteIndex)
+    : storage_(std::move(documentStorage)),
+      onSignal_(std::move(onSignal)),
+      onDeleteIndex_(std::move(onDeleteIndex)) {}
 
 void StorageHostPorterManager::signalEnumeratorForContainerItemIdentifier(
     const HostPorterItemIdentifier& container, Completion completion) {
@@ -40,8 +43,10 @@ void StorageHostPorterManager::signalEnumeratorForContainerItemIdentifier(
 }
 
 void StorageHostPorterManager::deleteSearchableItemsWithDomainIdentifiers(
-    const std::vector<std::string>&, Completion completion) {
-    // Nothing on this system indexes published items, so there is nothing to delete.
+    const std::vector<std::string>& domainIdentifiers, Completion completion) {
+    if (onDeleteIndex_)
+        return onDeleteIndex_(domainIdentifiers, std::move(completion));
+    // Nothing indexes published items, so there is nothing to delete.
     if (completion)
         completion(std::nullopt);
 }

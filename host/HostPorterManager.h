@@ -34,13 +34,17 @@ public:
         const std::vector<std::string>& domainIdentifiers, Completion completion) = 0;
 };
 
-// The manager a host runtime installs: a fixed storage folder, and signals passed to a
-// handler of the host's (none: they are accepted and dropped).
+// The manager a host runtime installs: a fixed storage folder, signals passed to a handler of
+// the host's (none: they are accepted and dropped), and index deletions passed to another (none:
+// nothing is indexed, so they complete at once).
 class StorageHostPorterManager : public HostPorterManager {
 public:
     using SignalHandler = std::function<void(const HostPorterItemIdentifier&)>;
+    using IndexDeletionHandler =
+        std::function<void(const std::vector<std::string>& domainIdentifiers, Completion)>;
 
-    explicit StorageHostPorterManager(Url documentStorage, SignalHandler onSignal = {});
+    explicit StorageHostPorterManager(Url documentStorage, SignalHandler onSignal = {},
+                                      IndexDeletionHandler onDeleteIndex = {});
 
     Url documentStorageURL() const override { return storage_; }
     void signalEnumeratorForContainerItemIdentifier(const HostPorterItemIdentifier& container,
@@ -51,6 +55,7 @@ public:
 private:
     Url storage_;
     SignalHandler onSignal_;
+    IndexDeletionHandler onDeleteIndex_;
 };
 
 }  // namespace tamber

@@ -63,6 +63,8 @@ std::string_view FaultInjectingFileSystem::operationName(Operation op) {
             return "readlinkat";
         case Operation::Symlinkat:
             return "symlinkat";
+        case Operation::Chmod:
+            return "chmod";
         case Operation::OpenBeneath:
             return "openBeneath";
     }
@@ -217,6 +219,12 @@ int FaultInjectingFileSystem::mkdir(const std::string& path, mode_t mode) {
     if (shouldFail(Operation::Mkdir, {AT_FDCWD, path}))
         return -1;
     return inner_->mkdir(path, mode);
+}
+
+int FaultInjectingFileSystem::chmod(const std::string& path, mode_t mode) {
+    if (shouldFail(Operation::Chmod, {AT_FDCWD, path}))
+        return -1;
+    return inner_->chmod(path, mode);
 }
 
 ssize_t FaultInjectingFileSystem::read(int fd, void* buffer, size_t size) {

@@ -41,8 +41,9 @@ public:
         Readlinkat,
         Symlinkat,
         OpenBeneath,
+        Chmod,
     };
-    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::OpenBeneath) + 1;
+    static constexpr size_t kOperationCount = static_cast<size_t>(Operation::Chmod) + 1;
     static std::string_view operationName(Operation op);
 
     explicit FaultInjectingFileSystem(std::shared_ptr<FileSystem> inner);
@@ -84,6 +85,7 @@ public:
     int unlinkat(int dirfd, const std::string& path, int flags) override;
     int statvfs(const std::string& path, struct statvfs* out) override;
     int mkdirat(int dirfd, const std::string& name, mode_t mode) override;
+    int chmod(const std::string& path, mode_t mode) override;
     ssize_t copy_file_range(int fdIn, int fdOut, size_t length) override;
     ssize_t readlinkat(int dirfd, const std::string& name, char* buffer, size_t size) override;
     int symlinkat(const std::string& target, int newdirfd, const std::string& name) override;

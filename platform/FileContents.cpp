@@ -111,7 +111,7 @@ Status FileContents::createDirectory(const Url& url) {
     return Status::OK();
 }
 
-Status FileContents::writeAtomically(const Url& url, const Bytes& bytes) {
+Status FileContents::writeAtomically(const Url& url, const Bytes& bytes, mode_t mode) {
     FileSystem& fs = FileSystem::current();
     // Hidden, so that a directory listing never shows a half-written file.
     std::string prefix = url.deletingLastPathComponent().path();
@@ -123,7 +123,7 @@ Status FileContents::writeAtomically(const Url& url, const Bytes& bytes) {
     ScopedFd fd;
     for (int attempt = 0; attempt < kTemporaryNameAttempts && !fd.ok(); ++attempt) {
         temporary = prefix + temporarySuffix();
-        fd.reset(fs.open(temporary, O_WRONLY | O_CREAT | O_EXCL, 0666));
+        fd.reset(fs.open(temporary, O_WRONLY | O_CREAT | O_EXCL, mode));
         if (!fd.ok() && errno != EEXIST)
             return Error::errorWithPOSIXCode(errno);
     }

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include "platform/Url.h"
 #include "platform/objects/Data.h"
 #include "support/Result.h"
@@ -20,8 +22,8 @@ public:
     // Replaces the file with `bytes` so that a reader sees either the old or the new content,
     // never a mix: the bytes go to a temporary file in the same directory, are flushed to disk
     // and then renamed over the target. On failure the target is untouched and the temporary
-    // file removed.
-    static Status writeAtomically(const Url& url, const Bytes& bytes);
+    // file removed. `mode` is the new file's permissions (less the process's umask).
+    static Status writeAtomically(const Url& url, const Bytes& bytes, mode_t mode = 0666);
 };
 
 }  // namespace tamber

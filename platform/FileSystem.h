@@ -64,6 +64,8 @@ public:
     virtual bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) = 0;
 
     virtual int mkdir(const std::string& path, mode_t mode) = 0;
+    // fchmodat(2) on a path, following no symbolic link at its end.
+    virtual int chmod(const std::string& path, mode_t mode) = 0;
 
     virtual ssize_t read(int fd, void* buffer, size_t size) = 0;
     virtual ssize_t write(int fd, const void* buffer, size_t size) = 0;

@@ -302,6 +302,18 @@ int LinuxFileSystem::mkdirat(int dirfd, const std::string& name, mode_t mode) {
     return ::mkdirat(dirfd, name.c_str(), mode);
 }
 
+int LinuxFileSystem::chmod(const std::string& path, mode_t mode) {
+    // Linux refuses AT_SYMLINK_NOFOLLOW here; a link's own mode cannot be changed, so check.
+    struct stat st;
+    if (::lstat(path.c_str(), &st) != 0)
+        return -1;
+    if (S_ISLNK(st.st_mode)) {
+        errno = ELOOP;
+        return -1;
+    }
+    return ::fchmodat(AT_FDCWD, path.c_str(), mode, 0);
+}
+
 ssize_t LinuxFileSystem::copy_file_range(int fdIn, int fdOut, size_t length) {
     return ::copy_file_range(fdIn, nullptr, fdOut, nullptr, length, 0);
 }

@@ -70,7 +70,8 @@ Status ProviderRuntime::prepareStorage() {
             std::lock_guard lock(slot->mutex);
             if (slot->handler)
                 slot->handler(container);
-        });
+        },
+        options_.onDeleteIndex);
     previousManager_ = HostPorterManager::installDefaultManager(manager_);
     installedManager_ = true;
     storagePrepared_ = true;

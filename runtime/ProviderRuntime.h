@@ -8,6 +8,7 @@
 #include <string>
 
 #include "host/HostPorterItem.h"
+#include "host/HostPorterManager.h"
 #include "platform/Url.h"
 #include "platform/tremors/InotifyApi.h"
 #include "platform/tremors/TremorService.h"
@@ -19,7 +20,6 @@ namespace tamber {
 
 class AppLibraryLookup;
 class FileSystem;
-class HostPorterManager;
 
 // What a host hands a runtime. Empty or null members leave the process's current choice.
 struct ProviderRuntimeOptions {
@@ -47,6 +47,10 @@ struct ProviderRuntimeOptions {
 
     // Receives the container signals the provider sends to the host, on any thread.
     std::function<void(const HostPorterItemIdentifier&)> onSignal;
+    // Deletes the search index entries of app libraries the provider no longer publishes and
+    // calls the completion once that is committed; the provider's app-library upgrade waits for
+    // it. Empty: nothing is indexed, the deletion completes at once.
+    StorageHostPorterManager::IndexDeletionHandler onDeleteIndex;
 };
 
 // The one object a host creates to run the provider: it owns the file system, the event
