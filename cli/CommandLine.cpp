@@ -23,6 +23,7 @@
 #include "cli/PathCommand.h"
 #include "cli/PurgeTrashCommand.h"
 #include "cli/RemoveItemCommand.h"
+#include "cli/ServeCommand.h"
 #include "cli/ThumbnailCommand.h"
 #include "cli/TrashItemCommand.h"
 #include "cli/WatchCommand.h"
@@ -135,6 +136,7 @@ int runParsed(int argc, char** argv, CliContext& context, std::ostream& out, std
     commands.push_back(std::make_unique<ItemMetadataCommand>(ItemMetadataCommand::Verb::Touch));
     commands.push_back(std::make_unique<ThumbnailCommand>());
     commands.push_back(std::make_unique<PurgeTrashCommand>());
+    commands.push_back(std::make_unique<ServeCommand>());
     std::vector<std::pair<CLI::App*, Command*>> verbs;
     for (auto& c : commands) verbs.emplace_back(c->add(app), c.get());
 

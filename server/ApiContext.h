@@ -1,12 +1,16 @@
 #pragma once
 
+#include <functional>
 #include <memory>
+
+#include <httplib.h>
 
 #include "host/HostPorterExtension.h"
 #include "platform/Url.h"
 
 namespace tamber {
 
+class EventHub;
 class HostReplica;
 class TremorService;
 
@@ -14,9 +18,14 @@ class TremorService;
 // any route sees a request, so routes need not check it.
 struct ApiContext {
     std::shared_ptr<HostPorterExtension> provider;
-    HostReplica* replica = nullptr;  // null until the server has one (some tests)
-    Url storage;                     // the document storage folder
+    HostReplica* replica = nullptr;          // null until the server has one (some tests)
+    Url storage;                             // the document storage folder
     std::shared_ptr<TremorService> journal;  // the event journal the server owns
+    std::shared_ptr<EventHub> events;        // the server-sent events; null in some tests
+    // Takes a multipart upload to `POST containers/{id}/children` (the content routes set it
+    // when they are added); empty: such an upload is refused.
+    std::function<void(const httplib::Request&, httplib::Response&, const httplib::ContentReader&)>
+        multipartUpload;
 };
 
 // Route groups live in classes of their own, each with
