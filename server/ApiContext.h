@@ -14,8 +14,8 @@ class TremorService;
 // any route sees a request, so routes need not check it.
 struct ApiContext {
     std::shared_ptr<HostPorterExtension> provider;
-    HostReplica* replica = nullptr;  // null until the server has one (some tests)
-    Url storage;                     // the document storage folder
+    HostReplica* replica = nullptr;          // null until the server has one (some tests)
+    Url storage;                             // the document storage folder
     std::shared_ptr<TremorService> journal;  // the event journal the server owns
 };
 

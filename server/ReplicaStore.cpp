@@ -192,6 +192,13 @@ Result<uint64_t> ReplicaStore::itemCount() {
     return fromSqlite(count.value());
 }
 
+Result<bool> ReplicaStore::holds(const HostPorterItemIdentifier& identifier) {
+    auto stmt = db_->cached("SELECT 1 FROM items WHERE id = ?");
+    if (!stmt.ok())
+        return stmt.error();
+    return stmt->bind(1, identifier).step();
+}
+
 Status ReplicaStore::setMeta(const char* key, int64_t value) {
     auto stmt = db_->cached("INSERT OR REPLACE INTO meta(key, value) VALUES (?, ?)");
     if (!stmt.ok())

@@ -35,6 +35,7 @@ public:
     // The anchor the items stand at; nothing before the first full listing.
     Result<std::optional<HostPorterSyncAnchor>> anchor();
     Result<uint64_t> itemCount();
+    Result<bool> holds(const HostPorterItemIdentifier& identifier);
     // The last sequence number handed out (0 before the first batch).
     uint64_t sequence() const { return sequence_; }
 

@@ -189,7 +189,7 @@ Result<HostPorterSyncAnchor> ReplicaSync::currentAnchor(HostPorterEnumerator& wo
     }
 }
 
-Status ReplicaSync::listEverything(HostPorterEnumerator& working) {
+Status ReplicaSync::listEverything(HostPorterEnumerator& working, bool mayListAgain) {
     // The anchor comes first: what changes while the pages are read is caught up after.
     auto anchor = currentAnchor(working);
     if (!anchor.ok())
@@ -212,10 +212,12 @@ Status ReplicaSync::listEverything(HostPorterEnumerator& working) {
     if (Status s = sink_.replaceAll(items, anchor.value()); !s.ok())
         return s;
     logInfo("replica listed " + std::to_string(items.size()) + " items of the working set");
-    return changesSince(working, std::move(anchor).value());
+    return changesSince(working, std::move(anchor).value(), mayListAgain);
 }
 
-Status ReplicaSync::changesSince(HostPorterEnumerator& working, HostPorterSyncAnchor anchor) {
+Status ReplicaSync::changesSince(HostPorterEnumerator& working, HostPorterSyncAnchor anchor,
+                                 bool mayList) {
+    bool newLibrary = false;
     for (;;) {
         if (!shouldGoOn())
             return abandoned();
@@ -231,12 +233,18 @@ Status ReplicaSync::changesSince(HostPorterEnumerator& working, HostPorterSyncAn
             return *batch->error;
         if (!batch->anchor)
             return Error::syncAnchorExpired();
-        if (Status s = sink_.apply(*batch); !s.ok())
-            return s;
+        auto applied = sink_.apply(*batch);
+        if (!applied.ok())
+            return applied.error();
+        newLibrary = newLibrary || applied.value();
         if (!batch->moreComing)
-            return Status::OK();
+            break;
         anchor = *batch->anchor;
     }
+    if (!newLibrary || !mayList)
+        return Status::OK();
+    logInfo("an app library appeared; listing the working set again");
+    return listEverything(working, false);
 }
 
 }  // namespace tamber

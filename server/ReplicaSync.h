@@ -37,7 +37,9 @@ public:
         virtual Result<std::optional<HostPorterSyncAnchor>> storedAnchor() = 0;
         virtual Status replaceAll(const std::vector<HostPorterItemRef>& items,
                                   const HostPorterSyncAnchor& anchor) = 0;
-        virtual Status apply(const ChangeCollector::Batch& batch) = 0;
+        // True when the batch brought an app library the replica did not hold: its files
+        // predate the anchor, so no change will ever report them.
+        virtual Result<bool> apply(const ChangeCollector::Batch& batch) = 0;
         // The provider refused the stored anchor: the replica is listed again.
         virtual void anchorExpired() = 0;
     };
@@ -74,9 +76,11 @@ private:
     Result<HostPorterEnumeratorRef> enumerator();
     Result<HostPorterSyncAnchor> currentAnchor(HostPorterEnumerator& enumerator);
     // Lists the working set from its first page; nothing when abandoned.
-    Status listEverything(HostPorterEnumerator& enumerator);
-    // Catches up from `anchor` until no more are coming; the expired error when it is.
-    Status changesSince(HostPorterEnumerator& enumerator, HostPorterSyncAnchor anchor);
+    Status listEverything(HostPorterEnumerator& enumerator, bool mayListAgain = true);
+    // Catches up from `anchor` until no more are coming; the expired error when it is. Lists
+    // everything again (once) when an app library appeared, so that its files are held too.
+    Status changesSince(HostPorterEnumerator& enumerator, HostPorterSyncAnchor anchor,
+                        bool mayList = true);
     bool shouldGoOn();
 
     const std::shared_ptr<HostPorterExtension> provider_;

@@ -4,6 +4,7 @@
 #include <chrono>
 
 #include "fs/FSChangeToken.h"
+#include "host/ItemIdentifier.h"
 #include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/TremorService.h"
 #include "support/Log.h"
@@ -185,12 +186,22 @@ Status SqliteReplica::replaceAll(const std::vector<HostPorterItemRef>& items,
     return Status::OK();
 }
 
-Status SqliteReplica::apply(const ChangeCollector::Batch& batch) {
+Result<bool> SqliteReplica::apply(const ChangeCollector::Batch& batch) {
     std::optional<ReplicaBatch> applied;
+    bool newLibrary = false;
     {
         MutexLock lock(storeMutex_);
         if (!store_)
             return closed();
+        for (const auto& item : batch.updated) {
+            if (newLibrary || !item ||
+                !ItemIdentifier::parse(item->itemIdentifier()).isAppLibrary())
+                continue;
+            auto held = store_->holds(item->itemIdentifier());
+            if (!held.ok())
+                return held.error();
+            newLibrary = !held.value();
+        }
         auto result = store_->applyBatch(batch, options_.historyBatches);
         if (!result.ok())
             return result.error();
@@ -199,7 +210,7 @@ Status SqliteReplica::apply(const ChangeCollector::Batch& batch) {
     }
     if (applied)
         publish(*applied);
-    return Status::OK();
+    return newLibrary;
 }
 
 void SqliteReplica::anchorExpired() {

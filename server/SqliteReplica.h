@@ -48,7 +48,7 @@ private:
     Result<std::optional<HostPorterSyncAnchor>> storedAnchor() override;
     Status replaceAll(const std::vector<HostPorterItemRef>& items,
                       const HostPorterSyncAnchor& anchor) override;
-    Status apply(const ChangeCollector::Batch& batch) override;
+    Result<bool> apply(const ChangeCollector::Batch& batch) override;
     void anchorExpired() override;
 
     // After a commit: the counters the status reads.
