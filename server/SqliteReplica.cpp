@@ -50,6 +50,7 @@ Error SqliteReplica::closed() {
 }
 
 void SqliteReplica::start() {
+    MutexLock lock(journalMutex_);
     if (options_.journal && !journalListener_) {
         lastEventId_ = options_.journal->currentEventId();
         journalListener_ = options_.journal->addListener(
@@ -149,9 +150,12 @@ void SqliteReplica::unsubscribe(uint64_t handle) {
 void SqliteReplica::shutdown() {
     // The thread first: it may be between two batches, never inside one.
     sync_->stop();
-    if (journalListener_) {
-        options_.journal->removeListener(*journalListener_);
-        journalListener_.reset();
+    {
+        MutexLock lock(journalMutex_);
+        if (journalListener_) {
+            options_.journal->removeListener(*journalListener_);
+            journalListener_.reset();
+        }
     }
     MutexLock lock(storeMutex_);
     store_.reset();

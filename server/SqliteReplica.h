@@ -66,7 +66,8 @@ private:
     std::atomic<uint64_t> lastEventId_{0};    // the journal's last event
     std::atomic<double> lastEventTime_{0};    // 0: none seen since start
     std::atomic<bool> historyLost_{false};
-    std::optional<uint64_t> journalListener_;
+    Mutex journalMutex_;
+    std::optional<uint64_t> journalListener_ GUARDED_BY(journalMutex_);
 
     Mutex listenersMutex_;
     std::map<uint64_t, Listener> listeners_ GUARDED_BY(listenersMutex_);

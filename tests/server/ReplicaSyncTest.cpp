@@ -270,7 +270,12 @@ TEST_F(ReplicaSyncTest, ChangesOnDiskReachTheReplicaInOrder) {
         }
     }
 
+    // The journal's events are all reflected once caught up, and the last one was seen.
+    settle();
     ReplicaStatus status = replica->status();
+    EXPECT_EQ(status.journalLagEvents, 0u);
+    EXPECT_TRUE(status.lastEventTime);
+    EXPECT_FALSE(status.historyLost);
     EXPECT_GT(status.sequence, before);
     auto history = replica->batchesSince(before);
     ASSERT_TRUE(history.ok()) << history.error().description();
