@@ -43,7 +43,10 @@ struct ReplicaStatus {
 };
 
 // One batch the replica applied, as the `changes` server-sent event carries it:
-// {"updated": [items], "deleted": [identifiers], "changes": [in order]}.
+// {"updated": [items], "deleted": [identifiers], "changes": [in order]}. When the replica was
+// listed again from scratch (no anchor, or it expired), subscribers get one batch with
+// "reset": true and empty lists instead: everything may have changed, and batchesSince() for
+// any earlier sequence fails with -1002.
 struct ReplicaBatch {
     uint64_t sequence = 0;
     nlohmann::json changes;

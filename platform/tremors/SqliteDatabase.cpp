@@ -55,6 +55,11 @@ SqliteDatabase::Statement& SqliteDatabase::Statement::bind(int index, std::strin
     return *this;
 }
 
+SqliteDatabase::Statement& SqliteDatabase::Statement::bind(int index, double value) {
+    noteBind(sqlite3_bind_double(stmt_, index, value));
+    return *this;
+}
+
 SqliteDatabase::Statement& SqliteDatabase::Statement::bindNull(int index) {
     noteBind(sqlite3_bind_null(stmt_, index));
     return *this;
@@ -100,6 +105,10 @@ void SqliteDatabase::Statement::reset() {
 
 int64_t SqliteDatabase::Statement::columnInt64(int index) const {
     return sqlite3_column_int64(stmt_, index);
+}
+
+double SqliteDatabase::Statement::columnDouble(int index) const {
+    return sqlite3_column_double(stmt_, index);
 }
 
 std::string SqliteDatabase::Statement::columnText(int index) const {

@@ -46,6 +46,7 @@ public:
         // Indexes start at 1, as in SQL.
         Statement& bind(int index, int64_t value);
         Statement& bind(int index, std::string_view value);
+        Statement& bind(int index, double value);
         Statement& bindNull(int index);
         Statement& bindBlob(int index, std::span<const uint8_t> value);
 
@@ -57,6 +58,7 @@ public:
         void reset();
 
         int64_t columnInt64(int index) const;
+        double columnDouble(int index) const;
         // Empty for NULL.
         std::string columnText(int index) const;
         // Empty for NULL.
