@@ -137,6 +137,17 @@ std::optional<uint64_t> EventsCommand::parseEventID(const std::string& text) {
 }
 
 std::optional<int> EventsCommand::runBeforeProvider(CliContext& context) {
+    // The journal belongs to the server while it runs: reading it here would wait for its lock.
+    if (const auto& server = context.server()) {
+        const std::string pid = std::to_string(server->pid);
+        return context.fail(
+            Error(kPosixErrorDomain, EBUSY,
+                  {{"description", "the Tamber server (pid " + pid +
+                                       ") holds the event journal; stop it (kill " + pid +
+                                       ") to read the journal with events, or follow changes "
+                                       "through the server with tamber watch"}}),
+            json_);
+    }
     if (forget_.empty())
         return std::nullopt;
     return forget(context);

@@ -26,8 +26,13 @@ public:
     // A finished change batch: {"updated": [...], "deleted": [...], "changes": [in order],
     // "anchor": base64 or "", "moreComing": bool}.
     static nlohmann::json changeBatch(const ChangeCollector::Batch& batch);
-    // {"error": {"domain", "code", "message"}}.
+    // {"error": {"domain", "code", "message"}}, with "usage": true for an error made from bad
+    // command-line input and "outside": true for a refusal of something outside the published
+    // trees, so that a client can tell them apart as this host does.
     static nlohmann::json error(const Error& error);
+    // The error an error object describes, with the same domain, code, message and marks;
+    // nothing when `json` is not an error object.
+    static std::optional<Error> errorFromJson(const nlohmann::json& json);
 };
 
 }  // namespace tamber
