@@ -44,7 +44,7 @@ std::unique_ptr<httplib::Client> ServerClient::makeClient(int readTimeoutSeconds
     auto client = std::make_unique<httplib::Client>("127.0.0.1", server_.port);
     client->set_connection_timeout(kConnectTimeoutSeconds);
     client->set_read_timeout(readTimeoutSeconds);
-    client->set_write_timeout(kReadTimeoutSeconds);
+    client->set_write_timeout(kChangeTimeoutSeconds);
     // Paths arrive encoded; a second encoding would change the identifiers in them.
     client->set_url_encode(false);
     client->set_default_headers({{"Authorization", "Bearer " + server_.token}});
@@ -70,7 +70,7 @@ Error ServerClient::failure(const Reply& reply) const {
 
 Result<ServerClient::Reply> ServerClient::send(const std::string& method, const std::string& path,
                                                const std::string* body) {
-    auto client = makeClient(kReadTimeoutSeconds);
+    auto client = makeClient(method == "GET" ? kReadTimeoutSeconds : kChangeTimeoutSeconds);
     const std::string target = kApiPrefix + path;
     const std::string payload = body ? *body : std::string();
     httplib::Result result = [&] {

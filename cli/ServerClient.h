@@ -29,8 +29,10 @@ namespace tamber {
 class ServerClient {
 public:
     static constexpr int kConnectTimeoutSeconds = 3;
+    // A lookup or a page is quick: a server silent that long is stuck, and the verb says so.
+    static constexpr int kReadTimeoutSeconds = 30;
     // Generous: an import or a purge runs before the answer comes.
-    static constexpr int kReadTimeoutSeconds = 600;
+    static constexpr int kChangeTimeoutSeconds = 600;
     // A stream of events sends a comment every 15 s; four times that in silence is a lost
     // server.
     static constexpr int kStreamTimeoutSeconds = 60;
