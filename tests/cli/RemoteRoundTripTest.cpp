@@ -137,6 +137,48 @@ TEST_F(RemoteRoundTripTest, ErrorsKeepTheirExitStatusAndMessageThroughTheServer)
     expectSameRun(directVerbose, tamber({"--verbose", "item", missing}), "missing, verbose");
 }
 
+TEST_F(RemoteRoundTripTest, ChangesAnchorsAndAppsPrintTheSameThroughTheServer) {
+    dir.writeFile("Documents/old.txt", "old");
+    CliRun anchorText = tamber({"anchor", "root"});
+    ASSERT_EQ(anchorText.status, 0) << anchorText.err;
+    CliRun anchorJson = tamber({"anchor", "root", "--json"});
+    const std::string anchor = anchorText.out.substr(0, anchorText.out.find('\n'));
+    // Changes of both kinds after the anchor, in an order that matters.
+    dir.writeFile("Documents/new.txt", "new");
+    ASSERT_EQ(::unlink((storage + "/old.txt").c_str()), 0);
+    dir.writeFile("Documents/newer.txt", "newer");
+    CliRun changesText = tamber({"changes", "root", "--anchor", anchor});
+    CliRun changesJson = tamber({"changes", "root", "--anchor", anchor, "--json"});
+    ASSERT_EQ(changesJson.status, 0) << changesJson.err;
+    ASSERT_NE(changesText.out.find("updated\t"), std::string::npos) << changesText.out;
+    CliRun expiredText = tamber({"changes", "root", "--anchor", "AAAA"});
+    CliRun expiredJson = tamber({"changes", "root", "--anchor", "AAAA", "--json"});
+    ASSERT_NE(expiredText.status, 0);
+    CliRun appsText = tamber({"apps"});
+    CliRun appsJson = tamber({"apps", "--json"});
+    ASSERT_EQ(appsJson.status, 0) << appsJson.err;
+
+    RecordingApiServer server;
+    const std::string root = "/api/v1/containers/HostPorterRootContainerItemIdentifier";
+    server.answer("GET " + root + "/anchor", {200, json::parse(anchorJson.out)});
+    server.answer("GET /api/v1/apps", {200, json::parse(appsJson.out)});
+    serveFrom(server);
+    expectSameRun(anchorText, tamber({"anchor", "root"}), "anchor");
+    expectSameRun(anchorJson, tamber({"anchor", "root", "--json"}), "anchor --json");
+    expectSameRun(appsText, tamber({"apps"}), "apps");
+    expectSameRun(appsJson, tamber({"apps", "--json"}), "apps --json");
+    server.answer("GET " + root + "/changes", {200, json::parse(changesJson.out)});
+    expectSameRun(changesText, tamber({"changes", "root", "--anchor", anchor}), "changes");
+    expectSameRun(changesJson, tamber({"changes", "root", "--anchor", anchor, "--json"}),
+                  "changes --json");
+    server.answer("GET " + root + "/changes", {409, json::parse(expiredJson.out)});
+    expectSameRun(expiredText, tamber({"changes", "root", "--anchor", "AAAA"}), "expired");
+    expectSameRun(expiredJson, tamber({"changes", "root", "--anchor", "AAAA", "--json"}),
+                  "expired --json");
+    // The anchor travels as the same base64, percent-encoded.
+    EXPECT_EQ(server.requests().back().target, root + "/changes?anchor=AAAA");
+}
+
 // Each kind of error the command line tells apart by exit status survives the error object.
 TEST(RemoteErrorJsonTest, UsageOutsideMissingAndExpiredAnchorComeBackAsTheyLeft) {
     const std::vector<Error> errors = {
