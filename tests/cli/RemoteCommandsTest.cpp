@@ -161,6 +161,43 @@ TEST_F(RemoteCommandsTest, EveryMutationIsTheRouteWithTheRequestItNames) {
     EXPECT_TRUE(RemoteItem::parseDate(sent["lastUsedDate"].get<std::string>()));
 }
 
+TEST_F(RemoteCommandsTest, LookupsByPathAndIdentifierAndTransfersGoThroughTheServer) {
+    const std::string odd = storage + "/a b#?.txt";
+    const std::string source = dir.writeFile("outside.txt", "to import");
+    RecordingApiServer server;
+    server.answer("GET /api/v1/identifiers", {200, {{"identifier", "fid=5"}}});
+    server.answer("GET /api/v1/items/fid=5/path", {200, {{"path", odd}}});
+    server.answer("GET /api/v1/items/fid=5", {200, kItem});
+    server.answer("GET /api/v1/items/fid=7", {200, kItem});
+    server.answer("POST /api/v1/containers/fid=5/children", {200, kItem});
+    writeRunFile(::getpid(), server.port(), storage);
+
+    CliRun id = tamber({"id", odd});
+    EXPECT_EQ(id.status, 0) << id.err;
+    EXPECT_EQ(id.out, "fid=5\n");
+    EXPECT_EQ(server.requests().back().target,
+              "/api/v1/identifiers?path=" + ServerClient::encode(odd));
+    CliRun path = tamber({"path", "fid=5"});
+    EXPECT_EQ(path.status, 0) << path.err;
+    EXPECT_EQ(path.out, odd + "\n");
+
+    // A path outside the published trees is refused here, before the server is asked.
+    size_t asked = server.requests().size();
+    CliRun outside = tamber({"id", "/etc/passwd"});
+    EXPECT_EQ(outside.status, CliContext::kExitFailure);
+    EXPECT_EQ(server.requests().size(), asked);
+
+    CliRun imported = tamber({"import", source, "fid=5"});
+    EXPECT_EQ(imported.status, 0) << imported.err;
+    EXPECT_EQ(json::parse(server.requests().back().body), json({{"import", source}}));
+
+    // No thumbnail from the server is the verb's own "no thumbnail" failure.
+    CliRun thumbnail = tamber({"thumbnail", "fid=7", "-o", dir / "icon.png"});
+    EXPECT_EQ(thumbnail.status, CliContext::kExitFailure) << thumbnail.err;
+    EXPECT_NE(thumbnail.err.find("has no thumbnail"), std::string::npos) << thumbnail.err;
+    EXPECT_EQ(server.requests().back().target, "/api/v1/items/fid%3D7/thumbnail");
+}
+
 TEST_F(RemoteCommandsTest, RunFilesThatNameNoLiveServerOfThisStorageLeaveTheVerbDirect) {
     dir.writeFile("Documents/here.txt", "x");
     const CliRun alone = tamber({"ls", "root"});
