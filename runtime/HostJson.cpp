@@ -72,6 +72,41 @@ nlohmann::json HostJson::changeBatch(const ChangeCollector::Batch& batch) {
             {"moreComing", batch.moreComing}};
 }
 
+nlohmann::json HostJson::journalEvent(const JournalEvent& event) {
+    nlohmann::json json{
+        {"id", event.id},
+        {"flags", event.flags},
+        {"fileID", event.fileID ? nlohmann::json(event.fileID) : nlohmann::json(nullptr)}};
+    setTextWithBytes(json, "path", "pathBytes", event.path);
+    return json;
+}
+
+std::optional<JournalEvent> HostJson::journalEventFromJson(const nlohmann::json& json) {
+    if (!json.is_object())
+        return std::nullopt;
+    auto id = json.find("id");
+    auto flags = json.find("flags");
+    auto fileID = json.find("fileID");
+    auto path = json.find("path");
+    if (id == json.end() || !id->is_number_unsigned() || flags == json.end() ||
+        !flags->is_number_unsigned() || fileID == json.end() ||
+        !(fileID->is_null() || fileID->is_number_unsigned()) || path == json.end() ||
+        !path->is_string())
+        return std::nullopt;
+    JournalEvent event;
+    event.id = id->get<uint64_t>();
+    event.flags = flags->get<uint32_t>();
+    event.fileID = fileID->is_null() ? 0 : fileID->get<uint64_t>();
+    event.path = path->get<std::string>();
+    if (auto bytes = json.find("pathBytes"); bytes != json.end() && bytes->is_string()) {
+        auto decoded = base64Decode(bytes->get<std::string>());
+        if (!decoded)
+            return std::nullopt;
+        event.path.assign(decoded->begin(), decoded->end());
+    }
+    return event;
+}
+
 namespace {
 
 // The mark the command line puts on errors made from bad input (CliContext::usageError).
