@@ -52,10 +52,12 @@ std::unique_ptr<httplib::Client> ServerClient::makeClient(int readTimeoutSeconds
 }
 
 Error ServerClient::unreachable(const std::string& why) const {
-    return Error(
-        kPosixErrorDomain, ECONNREFUSED,
-        {{"description", "the Tamber server (pid " + std::to_string(server_.pid) + ", port " +
-                             std::to_string(server_.port) + ") did not answer: " + why}});
+    // A server that was killed leaves its run file behind, and its process ID may be reused.
+    return Error(kPosixErrorDomain, ECONNREFUSED,
+                 {{"description", "the Tamber server (pid " + std::to_string(server_.pid) +
+                                      ", port " + std::to_string(server_.port) +
+                                      ") did not answer: " + why + "; if it is not running, " +
+                                      "remove " + RunFile::defaultLocation().path()}});
 }
 
 Error ServerClient::failure(const Reply& reply) const {
