@@ -46,8 +46,9 @@ int SearchCommand::run(CliContext& context) {
     if (!context.server()) {
         return context.fail(Error(kPosixErrorDomain, ENOTCONN,
                                   {{"description",
-                                    "search needs the Tamber server, which keeps the index: "
-                                    "start it with tamber serve"}}),
+                                    "no Tamber server is running for this storage folder, and "
+                                    "the search index is the server's: start it with tamber "
+                                    "serve"}}),
                             json_);
     }
     auto remote = context.remoteProvider();
