@@ -1,9 +1,12 @@
 #include "cli/AppsCommand.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <ostream>
 
 #include "applibraries/LocalAppLibraryManager.h"
+#include "cli/RemotePorter.h"
+#include "cli/ServerClient.h"
 #include "items/LocalAppLibraryItem.h"
 #include "runtime/JsonValues.h"
 
@@ -19,18 +22,36 @@ CLI::App* AppsCommand::add(CLI::App& app) {
     return sub;
 }
 
-int AppsCommand::runWith(CliContext& context, HostPorterExtension&) {
+int AppsCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    bool rootChanged = false;
+    auto listing = dynamic_cast<RemotePorter*>(&provider)
+                       ? remoteListing(*dynamic_cast<RemotePorter*>(&provider), rootChanged)
+                       : localListing(context, rootChanged);
+    if (!listing.ok())
+        return fail(context, listing.error());
+    const nlohmann::json& answer = listing.value();
+    if (refresh_ && !json_)
+        context.err() << (rootChanged ? "app list changed" : "app list unchanged") << "\n";
+    if (json_) {
+        context.out() << jsonText(answer) << "\n";
+        return 0;
+    }
+    context.out() << "version token " << answer["versionToken"].get<uint64_t>() << "\n";
+    for (const auto& library : answer["libraries"])
+        context.out() << library["identifier"].get<std::string>() << "\t"
+                      << library["name"].get<std::string>() << "\t"
+                      << library["root"].get<std::string>() << "\n";
+    return 0;
+}
+
+Result<nlohmann::json> AppsCommand::localListing(CliContext& context, bool& rootChanged) const {
     // Preparing the provider already refreshes from the registry, as every verb does.
     auto manager = LocalAppLibraryManager::shared();
     auto items = manager->allItems();
     std::sort(items.begin(), items.end(), [](const auto& a, const auto& b) {
         return a->itemIdentifier() < b->itemIdentifier();
     });
-    if (refresh_ && !json_) {
-        context.err() << (context.appRefreshOutcome().rootChanged ? "app list changed"
-                                                                  : "app list unchanged")
-                      << "\n";
-    }
+    rootChanged = context.appRefreshOutcome().rootChanged;
     nlohmann::json libraries = nlohmann::json::array();
     for (const auto& item : items) {
         // The record's own bundle identifier: null when it has none, not "(null)".
@@ -40,18 +61,30 @@ int AppsCommand::runWith(CliContext& context, HostPorterExtension&) {
                              {"bundleIdentifier", bundle ? nlohmann::json(*bundle) : nullptr},
                              {"root", item->fileURL().path()}});
     }
-    uint64_t token = manager->versionToken();
-    if (json_) {
-        context.out() << jsonText(nlohmann::json{{"versionToken", token}, {"libraries", libraries}})
-                      << "\n";
-        return 0;
+    return nlohmann::json{{"versionToken", manager->versionToken()}, {"libraries", libraries}};
+}
+
+Result<nlohmann::json> AppsCommand::remoteListing(RemotePorter& provider, bool& rootChanged) const {
+    auto answer = refresh_ ? provider.client().post("apps/refresh", nlohmann::json::object())
+                           : provider.client().get("apps");
+    if (!answer.ok())
+        return answer.error();
+    const nlohmann::json& body = answer.value();
+    if (!body.is_object() || !body.contains("versionToken") ||
+        !body["versionToken"].is_number_unsigned() || !body.contains("libraries") ||
+        !body["libraries"].is_array())
+        return Error(kPosixErrorDomain, EPROTO,
+                     {{"description", "the Tamber server sent a malformed list of apps"}});
+    for (const auto& library : body["libraries"]) {
+        if (!library.is_object() || !library.value("identifier", nlohmann::json()).is_string() ||
+            !library.value("name", nlohmann::json()).is_string() ||
+            !library.value("root", nlohmann::json()).is_string())
+            return Error(kPosixErrorDomain, EPROTO,
+                         {{"description", "the Tamber server sent a malformed app library"}});
     }
-    context.out() << "version token " << token << "\n";
-    for (const auto& library : libraries)
-        context.out() << library["identifier"].get<std::string>() << "\t"
-                      << library["name"].get<std::string>() << "\t"
-                      << library["root"].get<std::string>() << "\n";
-    return 0;
+    // Whether the refresh changed the list, when the server says so.
+    rootChanged = body.value("rootChanged", false);
+    return nlohmann::json{{"versionToken", body["versionToken"]}, {"libraries", body["libraries"]}};
 }
 
 }  // namespace tamber

@@ -6,6 +6,8 @@
 #include <ostream>
 #include <utility>
 
+#include "cli/RemotePorter.h"
+#include "cli/ServerClient.h"
 #include "host/PublishedTrees.h"
 #include "provider/LocalPorterError.h"
 #include "runtime/HostJson.h"
@@ -97,6 +99,27 @@ Status CliContext::prepareJournal() {
 
 Result<std::shared_ptr<LocalPorter>> CliContext::prepareProvider() {
     return runtime().provider();
+}
+
+Status CliContext::discoverServer() {
+    server_ = RunFile::liveServerFor(runFile, storageURL().path());
+    if (!server_ || !direct)
+        return Status::OK();
+    const std::string pid = std::to_string(server_->pid);
+    return Error(
+        kPosixErrorDomain, EBUSY,
+        {{"description", "--direct: the Tamber server (pid " + pid +
+                             ") holds the event journal of " + storageURL().path() +
+                             "; stop it (kill " + pid + ") or run the verb without --direct"}});
+}
+
+Result<std::shared_ptr<RemotePorter>> CliContext::remoteProvider() {
+    if (remote_ || !server_)
+        return remote_;
+    if (auto published = publishFromCache(); !published.ok())
+        return published.error();
+    remote_ = std::make_shared<RemotePorter>(std::make_shared<ServerClient>(*server_));
+    return remote_;
 }
 
 void CliContext::setSignalHandler(SignalHandler handler) {

@@ -4,6 +4,7 @@
 #include <iosfwd>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -13,9 +14,12 @@
 #include "platform/tremors/TremorService.h"
 #include "provider/LocalPorter.h"
 #include "runtime/ProviderRuntime.h"
+#include "runtime/RunFile.h"
 #include "support/Error.h"
 
 namespace tamber {
+
+class RemotePorter;
 
 // What every verb shares: the global options, the output streams and the error convention.
 class CliContext {
@@ -32,6 +36,18 @@ public:
     bool debug = false;                        // --debug
     bool verbose = false;                      // --verbose
     double waitSeconds = kDefaultWaitSeconds;  // --wait: for another process using the journal
+    bool direct = false;                       // --direct: never through a running server
+    Url runFile = RunFile::defaultLocation();  // where a running server says where it is
+
+    // Looks for a live server of this storage folder (after prepareStorage()). Without --direct
+    // the verbs are then answered through it; with --direct a server refuses the run, since it
+    // holds the journal: the error names its process.
+    Status discoverServer();
+    // The server the verbs go through, if any.
+    const std::optional<RunFileRecord>& server() const { return server_; }
+    // The server's provider, as the verbs use one; null without a server. The app libraries
+    // last found are published here too, so that paths are checked as a direct run checks them.
+    Result<std::shared_ptr<RemotePorter>> remoteProvider();
 
     // Creates the run's runtime from the global options: resolves and creates the document
     // storage folder and installs the host manager for it. Fails when the folder cannot be
@@ -99,6 +115,8 @@ private:
     std::string verb_;
     std::vector<std::string> arguments_;
     std::unique_ptr<ProviderRuntime> runtime_;  // made by prepareStorage()
+    std::optional<RunFileRecord> server_;
+    std::shared_ptr<RemotePorter> remote_;
     // Where the notice of a wait for the journal goes; the journal may outlive this context.
     struct WaitNotice {
         std::mutex mutex;

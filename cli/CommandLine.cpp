@@ -23,6 +23,8 @@
 #include "cli/PathCommand.h"
 #include "cli/PurgeTrashCommand.h"
 #include "cli/RemoveItemCommand.h"
+#include "cli/SearchCommand.h"
+#include "cli/StatusCommand.h"
 #include "cli/ServeCommand.h"
 #include "cli/ThumbnailCommand.h"
 #include "cli/TrashItemCommand.h"
@@ -110,6 +112,9 @@ int runParsed(int argc, char** argv, CliContext& context, std::ostream& out, std
     app.add_flag("--verbose", context.verbose,
                  "Write information and error log lines to standard error (by default they go "
                  "to the system journal, if there is one)");
+    app.add_flag("--direct", context.direct,
+                 "Run the verb here even though a Tamber server may be running (fails while one "
+                 "holds the event journal); by default a running server answers");
     app.require_subcommand(1);
 
     std::vector<std::unique_ptr<Command>> commands;
@@ -137,6 +142,9 @@ int runParsed(int argc, char** argv, CliContext& context, std::ostream& out, std
     commands.push_back(std::make_unique<ThumbnailCommand>());
     commands.push_back(std::make_unique<PurgeTrashCommand>());
     commands.push_back(std::make_unique<ServeCommand>());
+    // Answered by a running server only.
+    commands.push_back(std::make_unique<StatusCommand>());
+    commands.push_back(std::make_unique<SearchCommand>());
     std::vector<std::pair<CLI::App*, Command*>> verbs;
     for (auto& c : commands) verbs.emplace_back(c->add(app), c.get());
 
@@ -155,6 +163,8 @@ int runParsed(int argc, char** argv, CliContext& context, std::ostream& out, std
             continue;
         context.setInvocation(sub->get_name(), positionalArguments(*sub));
         if (auto status = context.prepareStorage(); !status.ok())
+            return context.fail(status.error(), wantsJson(argc, argv));
+        if (auto status = context.discoverServer(); !status.ok())
             return context.fail(status.error(), wantsJson(argc, argv));
         return command->run(context);
     }

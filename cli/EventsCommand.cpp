@@ -1,12 +1,18 @@
 #include "cli/EventsCommand.h"
 
+#include <atomic>
 #include <cerrno>
 #include <charconv>
+#include <chrono>
 #include <cstdio>
 #include <ostream>
+#include <thread>
 
 #include "cli/Interrupt.h"
+#include "cli/RemotePorter.h"
+#include "cli/ServerClient.h"
 #include "cli/TextEscape.h"
+#include "runtime/HostJson.h"
 #include "runtime/JsonValues.h"
 
 #include "items/TBFileObjectIdentifier.h"
@@ -29,12 +35,7 @@ struct Printer {
 void printEvents(Printer& printer, const std::vector<JournalEvent>& events) {
     for (const auto& event : events) {
         if (printer.json) {
-            nlohmann::json j{
-                {"id", event.id},
-                {"flags", event.flags},
-                {"fileID", event.fileID ? nlohmann::json(event.fileID) : nlohmann::json(nullptr)}};
-            setTextWithBytes(j, "path", "pathBytes", event.path);
-            *printer.out << jsonText(j) << "\n";
+            *printer.out << jsonText(HostJson::journalEvent(event)) << "\n";
         } else {
             char hex[16];
             std::snprintf(hex, sizeof hex, "0x%05x", event.flags);
@@ -137,6 +138,16 @@ std::optional<uint64_t> EventsCommand::parseEventID(const std::string& text) {
 }
 
 std::optional<int> EventsCommand::runBeforeProvider(CliContext& context) {
+    // The journal belongs to the server while it runs: forgetting a tree here would wait for
+    // its lock.
+    if (const auto& server = context.server(); server && !forget_.empty()) {
+        const std::string pid = std::to_string(server->pid);
+        return context.fail(Error(kPosixErrorDomain, EBUSY,
+                                  {{"description", "the Tamber server (pid " + pid +
+                                                       ") holds the event journal; stop it (kill " +
+                                                       pid + ") to forget a tree"}}),
+                            json_);
+    }
     if (forget_.empty())
         return std::nullopt;
     return forget(context);
@@ -154,7 +165,9 @@ Status EventsCommand::checkArguments() {
 
 // The trees of this run are those it publishes (the provider is started for that), and the
 // paths asked for here.
-int EventsCommand::runWith(CliContext& context, HostPorterExtension&) {
+int EventsCommand::runWith(CliContext& context, HostPorterExtension& provider) {
+    if (auto* remote = dynamic_cast<RemotePorter*>(&provider))
+        return runThroughServer(context, *remote);
     // A replay from past the journal's end has nothing to show and never ends: an ID from
     // another journal, or mistyped.
     const uint64_t last = TremorsGetCurrentEventId();
@@ -207,6 +220,62 @@ int EventsCommand::runWith(CliContext& context, HostPorterExtension&) {
     queue->sync([] {});
     TremorStreamInvalidate(stream);
     TremorStreamRelease(stream);
+    return 0;
+}
+
+int EventsCommand::runThroughServer(CliContext& context, RemotePorter& provider) {
+    std::string path = "journal/events?since=" + std::to_string(sinceID_);
+    if (docid_)
+        path += "&docid=1";
+    if (noFollow_)
+        path += "&follow=0";
+    for (const auto& p : paths_)
+        path += "&path=" + ServerClient::encode(Url::fileURLWithPath(p).path());
+
+    Printer printer{&context.out(), &context.err(), json_, noFollow_, DispatchSemaphore(0)};
+    ServerClient client(provider.client().server());
+    std::string pending;  // the start of a line whose end has not arrived
+    std::optional<Error> malformed;
+    auto receive = [&](std::string_view piece) {
+        pending.append(piece);
+        size_t start = 0;
+        for (size_t end; (end = pending.find('\n', start)) != std::string::npos; start = end + 1) {
+            if (end == start)
+                continue;  // the server's sign of life
+            auto record =
+                nlohmann::json::parse(pending.begin() + static_cast<long>(start),
+                                      pending.begin() + static_cast<long>(end), nullptr, false);
+            auto event = HostJson::journalEventFromJson(record);
+            if (!event) {
+                malformed = Error(kPosixErrorDomain, EPROTO,
+                                  {{"description", "the Tamber server sent a malformed event"}});
+                return false;
+            }
+            printEvents(printer, {*event});
+        }
+        pending.erase(0, start);
+        return true;
+    };
+    catchInterrupts();
+    std::atomic<bool> ended = false;
+    Status streamed;
+    std::thread reader([&] {
+        streamed = client.stream(path, receive);
+        ended = true;
+    });
+    while (!interrupted() && !ended) std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    client.stop();
+    reader.join();
+    if (malformed)
+        return fail(context, *malformed);
+    if (!streamed.ok())
+        return fail(context, streamed.error());
+    if (!interrupted() && !noFollow_)
+        return fail(
+            context,
+            Error(kPosixErrorDomain, ECONNRESET,
+                  {{"description", "the Tamber server (pid " + std::to_string(client.server().pid) +
+                                       ") ended the stream of events"}}));
     return 0;
 }
 

@@ -10,6 +10,8 @@
 
 namespace tamber {
 
+class RemotePorter;
+
 // `tamber events [--since ID] [--docid] [--no-follow] [--json] PATH...`: replays the journal
 // for the given trees, then follows it live until interrupted (or stops after the
 // history-done event with --no-follow). A path outside every published tree is watched for
@@ -32,6 +34,8 @@ private:
     // Watches each of `paths` that no watched tree covers, with a warning on standard error.
     static Status watchUncovered(CliContext& context, const std::vector<std::string>& paths);
     int forget(CliContext& context);
+    // The journal as the running server reads it, printed the same way.
+    int runThroughServer(CliContext& context, RemotePorter& provider);
 
     // Nothing unless the text is a whole event ID in decimal.
     static std::optional<uint64_t> parseEventID(const std::string& text);

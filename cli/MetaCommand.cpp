@@ -132,7 +132,9 @@ int MetaCommand::run(CliContext& context) {
     }
     // A document saved while nothing watched gets its metadata back when the journal starts;
     // without one (held by another process, say) the attributes are still read and written.
-    context.prepareJournal();
+    // A running server's journal is live and sees the change itself.
+    if (!context.server())
+        context.prepareJournal();
     // Every value is checked before the first write, so that a bad one changes nothing.
     auto changes = parseChanges();
     if (!changes.ok())

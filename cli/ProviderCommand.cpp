@@ -3,6 +3,7 @@
 #include <ostream>
 
 #include "cli/ItemText.h"
+#include "cli/RemotePorter.h"
 #include "runtime/HostJson.h"
 #include "runtime/JsonValues.h"
 
@@ -13,6 +14,13 @@ int ProviderCommand::run(CliContext& context) {
         return *answered;
     if (auto refused = checkArguments(); !refused.ok())
         return fail(context, refused.error());
+    // A running server answers for its provider; the verb runs the same either way.
+    if (context.server()) {
+        auto remote = context.remoteProvider();
+        if (!remote.ok())
+            return fail(context, remote.error());
+        return runWith(context, *remote.value());
+    }
     auto provider = context.prepareProvider();
     if (!provider.ok())
         return fail(context, provider.error());

@@ -1,5 +1,7 @@
 #include "cli/PurgeTrashCommand.h"
 
+#include "cli/RemotePorter.h"
+
 #include <charconv>
 #include <ostream>
 
@@ -63,6 +65,9 @@ int PurgeTrashCommand::runWith(CliContext& context, HostPorterExtension& provide
     auto reference = Date::make(Date::now()->timeIntervalSince1970() - seconds_);
     size_t removed = ProviderCalls::waitForCount(
         [&](auto done) { provider.removeTrashedItemsOlderThanDate(reference, std::move(done)); });
+    // Through a server the count comes with a request that may have failed.
+    if (auto* remote = dynamic_cast<RemotePorter*>(&provider); remote && remote->lastError())
+        return fail(context, *remote->lastError());
     if (json_)
         context.out() << jsonText(nlohmann::json{{"removed", removed}}) << "\n";
     else

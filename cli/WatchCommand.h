@@ -14,6 +14,9 @@ public:
 
 private:
     int runWith(CliContext& context, HostPorterExtension& provider) override;
+    // Through a running server: its stream of events carries the signals.
+    int watchServer(CliContext& context, HostPorterExtension& provider);
+    void printSignal(CliContext& context, const std::string& container);
 
     std::string container_ = "root";
 };

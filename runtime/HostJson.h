@@ -7,6 +7,7 @@
 
 #include "host/HostPorterItem.h"
 #include "host/HostPorterPage.h"
+#include "platform/tremors/JournalEvent.h"
 #include "runtime/ChangeCollector.h"
 #include "support/Error.h"
 
@@ -26,8 +27,18 @@ public:
     // A finished change batch: {"updated": [...], "deleted": [...], "changes": [in order],
     // "anchor": base64 or "", "moreComing": bool}.
     static nlohmann::json changeBatch(const ChangeCollector::Batch& batch);
-    // {"error": {"domain", "code", "message"}}.
+    // One event of the journal: {"id", "flags", "path" (and "pathBytes" when it is not UTF-8),
+    // "fileID" or null}.
+    static nlohmann::json journalEvent(const JournalEvent& event);
+    // The event a journalEvent() record describes; nothing when it is not one.
+    static std::optional<JournalEvent> journalEventFromJson(const nlohmann::json& json);
+    // {"error": {"domain", "code", "message"}}, with "usage": true for an error made from bad
+    // command-line input and "outside": true for a refusal of something outside the published
+    // trees, so that a client can tell them apart as this host does.
     static nlohmann::json error(const Error& error);
+    // The error an error object describes, with the same domain, code, message and marks;
+    // nothing when `json` is not an error object.
+    static std::optional<Error> errorFromJson(const nlohmann::json& json);
 };
 
 }  // namespace tamber
