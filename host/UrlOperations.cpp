@@ -477,6 +477,11 @@ void pt_reparentUnderFolder(const Url& url, const Url& folder, bool allowBouncin
     finish(moveItem(url, folder, std::nullopt, allowBouncing), completion);
 }
 
+void pt_placeUnderFolder(const Url& url, const Url& folder, const std::string& name,
+                         const UrlCompletion& completion) {
+    finish(moveItem(url, folder, name, true), completion);
+}
+
 void pt_trashUnderFolder(const Url& url, const Url& trashFolder, const UrlCompletion& completion) {
     finish(moveItem(url, trashFolder, std::nullopt, true), completion);
 }

@@ -77,6 +77,11 @@ void pt_reparentUnderFolder(const Url& url, const Url& folder, const char* newNa
 void pt_reparentUnderFolder(const Url& url, const Url& folder, bool allowBouncing,
                             const UrlCompletion& completion);
 
+// Moves the item into `folder` under `name`, bouncing: how a file assembled under a staging
+// name (an upload) takes the name it was given.
+void pt_placeUnderFolder(const Url& url, const Url& folder, const std::string& name,
+                         const UrlCompletion& completion);
+
 // Moves the item into the (existing) trash folder, bouncing.
 void pt_trashUnderFolder(const Url& url, const Url& trashFolder, const UrlCompletion& completion);
 

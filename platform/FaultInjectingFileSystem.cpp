@@ -233,6 +233,12 @@ ssize_t FaultInjectingFileSystem::read(int fd, void* buffer, size_t size) {
     return inner_->read(fd, buffer, size);
 }
 
+ssize_t FaultInjectingFileSystem::pread(int fd, void* buffer, size_t size, off_t offset) {
+    if (shouldFail(Operation::Read, {fd, {}}))
+        return -1;
+    return inner_->pread(fd, buffer, size, offset);
+}
+
 ssize_t FaultInjectingFileSystem::write(int fd, const void* buffer, size_t size) {
     if (shouldFail(Operation::Write, {fd, {}}))
         return -1;

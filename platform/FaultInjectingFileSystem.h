@@ -78,6 +78,8 @@ public:
     bool readDirectory(int dirfd, std::vector<DirectoryEntry>& out) override;
     int mkdir(const std::string& path, mode_t mode) override;
     ssize_t read(int fd, void* buffer, size_t size) override;
+    // Fails with the injections of Read: both read a file's content.
+    ssize_t pread(int fd, void* buffer, size_t size, off_t offset) override;
     ssize_t write(int fd, const void* buffer, size_t size) override;
     int fsync(int fd) override;
     int renameat2(int olddirfd, const std::string& oldpath, int newdirfd,

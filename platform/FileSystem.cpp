@@ -1,6 +1,7 @@
 #include "platform/FileSystem.h"
 
 #include <atomic>
+#include <cerrno>
 
 #include "platform/LinuxFileSystem.h"
 #include "support/ProcessWide.h"
@@ -17,6 +18,11 @@ std::shared_ptr<FileSystem>& slot() {
 }
 
 }  // namespace
+
+ssize_t FileSystem::pread(int, void*, size_t, off_t) {
+    errno = ENOSYS;
+    return -1;
+}
 
 std::shared_ptr<FileSystem> FileSystem::currentShared() {
     return std::atomic_load(&slot());

@@ -69,6 +69,10 @@ public:
 
     virtual ssize_t read(int fd, void* buffer, size_t size) = 0;
     virtual ssize_t write(int fd, const void* buffer, size_t size) = 0;
+    // pread(2): reads at `offset` without moving the descriptor's offset, so that ranges of one
+    // open file can be served in any order. The base answers ENOSYS (file systems of tests that
+    // never serve content need not have it).
+    virtual ssize_t pread(int fd, void* buffer, size_t size, off_t offset);
     virtual int fsync(int fd) = 0;
     // renameat2(2); `flags` 0 or RENAME_NOREPLACE / RENAME_EXCHANGE.
     virtual int renameat2(int olddirfd, const std::string& oldpath, int newdirfd,

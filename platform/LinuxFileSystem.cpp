@@ -277,6 +277,10 @@ ssize_t LinuxFileSystem::read(int fd, void* buffer, size_t size) {
     return ::read(fd, buffer, size);
 }
 
+ssize_t LinuxFileSystem::pread(int fd, void* buffer, size_t size, off_t offset) {
+    return ::pread(fd, buffer, size, offset);
+}
+
 ssize_t LinuxFileSystem::write(int fd, const void* buffer, size_t size) {
     return ::write(fd, buffer, size);
 }
