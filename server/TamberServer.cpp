@@ -6,8 +6,10 @@
 #include "platform/tremors/TremorService.h"
 #include "runtime/RunFile.h"
 #include "server/ContainerRoutes.h"
+#include "server/ContentRoutes.h"
 #include "server/EventRoutes.h"
 #include "server/ItemRoutes.h"
+#include "server/JournalRoutes.h"
 #include "server/StatusRoutes.h"
 #include "support/Log.h"
 #include "support/RandomToken.h"
@@ -21,6 +23,17 @@ std::vector<HttpServer::RouteGroup> TamberServer::routeGroups() {
         ContainerRoutes::add,
         StatusRoutes::add,
         EventRoutes::add,
+        JournalRoutes::add,
+        [](httplib::Server& server, std::shared_ptr<ApiContext> context) {
+            ContentRoutes::add(server, context);
+            // The context outlives its routes; holding it from its own member would leak it.
+            ApiContext* raw = context.get();
+            context->multipartUpload = [raw](const httplib::Request& request,
+                                             httplib::Response& response,
+                                             const httplib::ContentReader& reader) {
+                ContentRoutes::handleUpload(request, response, reader, *raw);
+            };
+        },
         // The web page, until it has its own routes: a placeholder that says where the API is.
         [](httplib::Server& server, std::shared_ptr<ApiContext>) {
             server.Get("/", [](const httplib::Request&, httplib::Response& response) {
