@@ -56,6 +56,7 @@ int ServeCommand::run(CliContext& context) {
     TamberServerOptions options;
     options.storagePath = context.storageURL().path();
     options.port = port_;
+    options.replicaFactory = HostReplica::open;
     TamberServer server(std::move(options));
     if (auto started = server.start(); !started.ok()) {
         server.stop();

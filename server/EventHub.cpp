@@ -89,6 +89,10 @@ bool EventHub::closed() {
 }
 
 EventHub::Event EventHub::batchEvent(const ReplicaBatch& batch) {
+    // The replica listed everything again: what clients hold may be stale, they start over.
+    if (batch.changes.is_object() && batch.changes.value("reset", false))
+        return {batch.sequence,
+                "id: " + std::to_string(batch.sequence) + "\nevent: reset\ndata: {}\n\n"};
     return {batch.sequence, "id: " + std::to_string(batch.sequence) +
                                 "\nevent: changes\ndata: " + jsonText(batch.changes) + "\n\n"};
 }

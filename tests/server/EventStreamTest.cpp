@@ -238,5 +238,16 @@ TEST(EventHubTest, EventTextIsOneFrameEvenForHostileNames) {
     EXPECT_EQ(count(batch.text, "\n"), 4u);
 }
 
+TEST(EventHubTest, AReplicaThatListedAgainTellsClientsToStartOver) {
+    // After a full listing the replica's history starts afresh: a client must list again, and
+    // a reconnect from this event on must not ask for what came before it.
+    auto reset = EventHub::batchEvent({9,
+                                       {{"reset", true},
+                                        {"updated", nlohmann::json::array()},
+                                        {"deleted", nlohmann::json::array()}}});
+    EXPECT_EQ(reset.sequence, 9u);
+    EXPECT_EQ(reset.text, "id: 9\nevent: reset\ndata: {}\n\n");
+}
+
 }  // namespace
 }  // namespace tamber::testing
