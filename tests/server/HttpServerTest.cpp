@@ -101,3 +101,29 @@ TEST(HttpServerTest, StopFinishesTheRequestInFlightAndDoesNotWaitForIdleConnecti
 
 }  // namespace
 }  // namespace tamber
+
+namespace tamber {
+namespace {
+
+TEST(HttpServerTest, AnswersOnBothLoopbackAddressesOnTheSamePort) {
+    HttpServer server(std::make_shared<ApiContext>(), kToken, {});
+    ASSERT_TRUE(server.start(0).ok());
+    std::string port = std::to_string(server.port());
+    httplib::Client ipv4("127.0.0.1", server.port());
+    auto answered =
+        ipv4.Get("/api/v1/nothing", {{"Authorization", std::string("Bearer ") + kToken}});
+    ASSERT_TRUE(answered);
+    EXPECT_EQ(answered->status, 404);
+    if (!server.servesIPv6())
+        GTEST_SKIP() << "no IPv6 loopback on this machine";
+    httplib::Client ipv6("::1", server.port());
+    auto viaIpv6 =
+        ipv6.Get("/api/v1/nothing",
+                 {{"Host", "[::1]:" + port}, {"Authorization", std::string("Bearer ") + kToken}});
+    ASSERT_TRUE(viaIpv6);
+    EXPECT_EQ(viaIpv6->status, 404);
+    EXPECT_NE(viaIpv6->body.find("no such route"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace tamber
