@@ -2,13 +2,16 @@
 
 #include <sys/socket.h>
 
+#include <atomic>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <exception>
 
 #include "runtime/HostJson.h"
 #include "server/ApiReply.h"
 #include "server/EventHub.h"
+#include "server/LoopbackListener.h"
 #include "support/Log.h"
 
 namespace tamber {
@@ -47,12 +50,15 @@ HttpServer::~HttpServer() {
 }
 
 std::unique_ptr<httplib::Server> HttpServer::makeListener() {
-    auto server = std::make_unique<httplib::Server>();
+    auto server = std::make_unique<LoopbackListener>(stopping_);
     ConnectionPool* pool = pool_.get();
     server->new_task_queue = [pool] { return pool->queueForListener().release(); };
-    server->set_keep_alive_timeout(kIdleSeconds);
-    server->set_keep_alive_max_count(100000);
-    server->set_read_timeout(kIdleSeconds, 0);
+    // The library's default also sets SO_REUSEPORT, which would let a second server (ours or
+    // anyone's of the same user) share the port and take some of the connections.
+    server->set_socket_options([](socket_t sock) {
+        int yes = 1;
+        ::setsockopt(sock, SOL_SOCKET, SO_REUSEADDR, &yes, sizeof yes);
+    });
     auto access = access_;
     server->set_pre_routing_handler(
         [access](const httplib::Request& request, httplib::Response& response) {
@@ -117,7 +123,15 @@ Status HttpServer::start(int port) {
 
     for (auto& listener : listeners_) {
         httplib::Server* server = listener.get();
-        threads_.emplace_back([server] { server->listen_after_bind(); });
+        auto exited = std::make_shared<std::atomic<bool>>(false);
+        threads_.emplace_back([server, exited] {
+            server->listen_after_bind();
+            exited->store(true);
+        });
+        // A stop that comes before the loop runs would be lost (the library only stops a
+        // running loop) and leave it accepting for ever: wait until it runs.
+        while (!server->is_running() && !exited->load())
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
     return Status::OK();
 }
@@ -126,6 +140,7 @@ void HttpServer::stop() {
     if (stopped_)
         return;
     stopped_ = true;
+    stopping_->store(true);
     // Event streams would otherwise keep their connections, and so the stop, waiting.
     if (context_ && context_->events)
         context_->events->close();

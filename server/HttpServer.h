@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <functional>
 #include <memory>
 #include <string>
@@ -21,14 +22,13 @@ namespace tamber {
 // of their own.
 //
 // Limits: at most kMaxConnections connections served at once (more wait for a thread), idle
-// connections closed after kIdleSeconds, JSON bodies and headers as AccessControl says.
+// connections closed as LoopbackListener says, JSON bodies and headers as AccessControl says.
 //
 // stop(): no more connections are accepted, the event streams end, the requests in flight
 // finish, then the threads are joined. Harmless to call twice; the destructor calls it.
 class HttpServer {
 public:
     static constexpr size_t kMaxConnections = 64;
-    static constexpr int kIdleSeconds = 60;
 
     using RouteGroup = std::function<void(httplib::Server&, std::shared_ptr<ApiContext>)>;
 
@@ -58,6 +58,8 @@ private:
     std::vector<std::unique_ptr<httplib::Server>> listeners_;
     std::vector<std::thread> threads_;
     bool stopped_ = false;
+    // Tells the connections to leave once their request in flight is answered.
+    std::shared_ptr<std::atomic<bool>> stopping_ = std::make_shared<std::atomic<bool>>(false);
 };
 
 }  // namespace tamber

@@ -91,6 +91,9 @@ TEST_F(ItemRoutesTest, ItemsAreFoundByIdentifierPathAndContainerWord) {
             client()->Get("/api/v1/identifiers", httplib::Params{{"path", outside}}, {});
         EXPECT_TRUE(status(identifier) == 404 || status(identifier) == 400) << outside;
         EXPECT_FALSE(body(identifier).contains("identifier"));
+        // The refusal does not repeat a path outside the trees back.
+        EXPECT_EQ(refused->body.find(outside), std::string::npos) << refused->body;
+        EXPECT_EQ(identifier->body.find(outside), std::string::npos) << identifier->body;
     }
     EXPECT_EQ(status(client()->Get(item("fid=1") + "/path")), 404);
 }
@@ -227,8 +230,7 @@ TEST_F(ItemRoutesTest, ChangesSinceAnAnchorReportAFileWrittenAfterIt) {
                                      httplib::Params{{"anchor", anchor["anchor"]}}, {});
         ASSERT_EQ(status(changes), 200) << (changes ? changes->body : "");
         auto batch = body(changes);
-        for (const auto& updated : batch["updated"])
-            seen |= updated["filename"] == "new.txt";
+        for (const auto& updated : batch["updated"]) seen |= updated["filename"] == "new.txt";
         if (!seen)
             std::this_thread::sleep_for(std::chrono::milliseconds(100));
     }
