@@ -226,7 +226,8 @@ protected:
     // Waits until no catch-up runs nor is asked for by the signals sent so far.
     void settle() {
         journal->sync();
-        for (int quiet = 0; quiet < 10;) {
+        const auto deadline = std::chrono::steady_clock::now() + kPatience;
+        for (int quiet = 0; quiet < 10 && std::chrono::steady_clock::now() < deadline;) {
             std::this_thread::sleep_for(std::chrono::milliseconds(20));
             quiet = replica->status().catchingUp ? 0 : quiet + 1;
         }
