@@ -40,7 +40,11 @@ std::string ReplicaSearch::likePattern(const std::string& text) {
 }
 
 Result<std::vector<std::string>> ReplicaSearch::conformingTypes(const std::string& type) {
-    auto stmt = db_.prepare("SELECT DISTINCT type FROM items");
+    // One index step per distinct type rather than a pass over every item.
+    auto stmt = db_.cached(
+        "WITH RECURSIVE t(type) AS (SELECT min(type) FROM items UNION ALL "
+        "SELECT (SELECT min(type) FROM items WHERE type > t.type) FROM t WHERE t.type IS NOT NULL) "
+        "SELECT type FROM t WHERE type IS NOT NULL");
     if (!stmt.ok())
         return stmt.error();
     std::vector<std::string> types;
@@ -58,27 +62,13 @@ Result<std::vector<std::string>> ReplicaSearch::conformingTypes(const std::strin
 }
 
 Result<std::vector<nlohmann::json>> ReplicaSearch::run(const ReplicaSearchQuery& query) {
-    using Value = std::variant<int64_t, std::string>;
-    std::string sql = "SELECT items.json FROM items";
-    std::vector<std::string> where;
-    std::vector<Value> values;
-
     // A NUL cannot be in a filename; such a query matches nothing rather than being cut short.
     if (query.text.find('\0') != std::string::npos)
         return std::vector<nlohmann::json>();
-    if (!query.text.empty()) {
-        if (characterCount(query.text) >= 3) {
-            sql += " JOIN names ON names.rowid = items.row";
-            where.push_back("names MATCH ?");
-            values.emplace_back(phrase(query.text));
-        } else {
-            // LIKE folds ASCII case only, as short queries mostly are.
-            where.push_back("items.filename LIKE ? ESCAPE '\\'");
-            values.emplace_back(likePattern(query.text));
-        }
-    }
+    Values values;
+    std::string filters;
     if (query.tag) {
-        where.push_back("EXISTS (SELECT 1 FROM json_each(items.tags) WHERE json_each.value = ?)");
+        filters += " AND EXISTS (SELECT 1 FROM json_each(items.tags) WHERE json_each.value = ?)";
         values.emplace_back(*query.tag);
     }
     if (query.type) {
@@ -87,27 +77,66 @@ Result<std::vector<nlohmann::json>> ReplicaSearch::run(const ReplicaSearchQuery&
             return types.error();
         if (types->empty())
             return std::vector<nlohmann::json>();
-        std::string in = "items.type IN (";
+        // "+" keeps the planner walking the names in order instead of the type index.
+        filters += " AND +items.type IN (";
         for (size_t i = 0; i < types->size(); ++i) {
-            in += i ? ", ?" : "?";
+            filters += i ? ", ?" : "?";
             values.emplace_back(types.value()[i]);
         }
-        where.push_back(in + ")");
+        filters += ")";
     }
     if (query.favorites)
-        where.push_back("items.favorite IS NOT NULL");
-    if (query.recent)
-        where.push_back("items.lastUsed IS NOT NULL");
+        filters += " AND items.favorite IS NOT NULL";
     if (query.trashed) {
-        where.push_back("items.trashed = ?");
+        filters += " AND items.trashed = ?";
         values.emplace_back(int64_t{*query.trashed ? 1 : 0});
     }
-    for (size_t i = 0; i < where.size(); ++i) sql += (i ? " AND " : " WHERE ") + where[i];
-    sql += query.recent ? " ORDER BY items.lastUsed DESC, items.filename, items.id"
-                        : " ORDER BY items.filename, items.id";
+    const std::string recent = query.recent ? " AND items.lastUsed IS NOT NULL" : "";
+    const std::string order = query.recent
+                                  ? " ORDER BY items.lastUsed DESC, items.filename, items.id"
+                                  : " ORDER BY items.filename, items.id";
     const size_t limit = std::clamp<size_t>(query.limit, 1, ReplicaStore::kMaxLimit);
-    sql += " LIMIT " + std::to_string(limit);
+    const std::string tail = order + " LIMIT " + std::to_string(limit);
 
+    if (query.text.empty())
+        return read("SELECT items.json FROM items WHERE 1" + recent + filters + tail, values);
+    Values withText{likePattern(query.text)};
+    withText.insert(withText.end(), values.begin(), values.end());
+    const std::string like = " AND items.filename LIKE ? ESCAPE '\\'";
+    auto common = isCommon(query.text);
+    if (!common.ok())
+        return common.error();
+    if (common.value()) {
+        // Many names match (or the text is too short for a trigram): walking the names in
+        // order, each tested, reaches the limit sooner than sorting every match would.
+        return read("SELECT items.json FROM items WHERE 1" + recent + like + filters + tail,
+                    withText);
+    }
+    // Few names match: the trigram index finds them, in any case.
+    Values withPhrase{phrase(query.text)};
+    withPhrase.insert(withPhrase.end(), values.begin(), values.end());
+    return read(
+        "SELECT items.json FROM items JOIN names ON names.rowid = items.row WHERE names "
+        "MATCH ?" +
+            recent + filters + tail,
+        withPhrase);
+}
+
+Result<bool> ReplicaSearch::isCommon(const std::string& text) {
+    if (characterCount(text) < 3)
+        return true;
+    auto stmt = db_.cached("SELECT count(*) FROM (SELECT 1 FROM names WHERE names MATCH ? LIMIT " +
+                           std::to_string(kCommonMatches) + ")");
+    if (!stmt.ok())
+        return stmt.error();
+    auto row = stmt->bind(1, phrase(text)).step();
+    if (!row.ok())
+        return row.error();
+    return row.value() && static_cast<size_t>(stmt->columnInt64(0)) >= kCommonMatches;
+}
+
+Result<std::vector<nlohmann::json>> ReplicaSearch::read(const std::string& sql,
+                                                        const Values& values) {
     auto stmt = db_.prepare(sql);
     if (!stmt.ok())
         return stmt.error();

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <string>
+#include <variant>
 #include <vector>
 
 #include <nlohmann/json.hpp>
@@ -14,8 +15,10 @@ namespace tamber {
 // One search over the replica's items: builds the query from the filters and reads the
 // matching items' JSON.
 //
-// A name of three characters or more is looked up in the trigram index (any case, any
-// position); a shorter one has no trigram to look up and is matched with LIKE instead. A type
+// A text of three characters or more that few names match is looked up in the trigram index
+// (any case, any position); a shorter one, or one that thousands of names match, is matched
+// with LIKE while walking the names in order, which stops at the limit (LIKE folds ASCII case
+// only). A type
 // filter becomes the list of stored types that conform to it (few distinct types, and the
 // conformance graph lives in code), so that the row limit stays in SQL.
 class ReplicaSearch {
@@ -29,7 +32,15 @@ public:
     // `text` as a LIKE pattern for a substring, with \ as the escape character.
     static std::string likePattern(const std::string& text);
 
+    // From this many matches on, a text is looked for by walking the names in order.
+    static constexpr size_t kCommonMatches = 2000;
+
 private:
+    using Values = std::vector<std::variant<int64_t, std::string>>;
+    Result<std::vector<nlohmann::json>> read(const std::string& sql, const Values& values);
+    // Whether `text` matches so many names (or is too short for a trigram) that the names are
+    // better walked in order.
+    Result<bool> isCommon(const std::string& text);
     Result<std::vector<std::string>> conformingTypes(const std::string& type);
 
     SqliteDatabase& db_;

@@ -36,6 +36,7 @@ CREATE TABLE items(
 CREATE INDEX items_parent ON items(parent);
 CREATE INDEX items_path ON items(path);
 CREATE INDEX items_filename ON items(filename, id);
+CREATE INDEX items_type ON items(type);
 CREATE INDEX items_last_used ON items(lastUsed) WHERE lastUsed IS NOT NULL;
 CREATE VIRTUAL TABLE names USING fts5(filename, content='items', content_rowid='row',
                                       tokenize='trigram');

@@ -107,10 +107,6 @@ int64_t SqliteDatabase::Statement::columnInt64(int index) const {
     return sqlite3_column_int64(stmt_, index);
 }
 
-double SqliteDatabase::Statement::columnDouble(int index) const {
-    return sqlite3_column_double(stmt_, index);
-}
-
 std::string SqliteDatabase::Statement::columnText(int index) const {
     auto text = reinterpret_cast<const char*>(sqlite3_column_text(stmt_, index));
     if (!text)

@@ -58,7 +58,6 @@ public:
         void reset();
 
         int64_t columnInt64(int index) const;
-        double columnDouble(int index) const;
         // Empty for NULL.
         std::string columnText(int index) const;
         // Empty for NULL.

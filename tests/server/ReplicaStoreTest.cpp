@@ -331,5 +331,34 @@ TEST_F(ReplicaSearchTest, FiltersByTagTypeFavouriteRecentAndTrash) {
     EXPECT_EQ(found->front()["favoriteRank"], 1);
 }
 
+// A text that thousands of names match is found by walking the names in order: the answer is
+// the same first names, in the same order and case, as for a rare text found in the index.
+TEST_F(ReplicaStoreTest, ACommonTextAnswersTheFirstMatchesInNameOrder) {
+    std::vector<HostPorterItemRef> many;
+    for (int i = 0; i < 2500; ++i) {
+        char name[32];
+        std::snprintf(name, sizeof name, "Common %05d.txt", 2500 - i);
+        auto r = record("did=" + std::to_string(i + 10), name);
+        r->tags = {i % 2 ? "Odd" : "Even"};
+        many.push_back(r);
+    }
+    many.push_back(record("did=5", "uncommon.md"));
+    load(many);
+    ReplicaSearchQuery q = text("COMMON");
+    q.limit = 3;
+    auto found = store->search(q);
+    ASSERT_TRUE(found.ok());
+    std::vector<std::string> names;
+    for (const auto& item : found.value()) names.push_back(item["filename"]);
+    EXPECT_EQ(names, (std::vector<std::string>{"Common 00001.txt", "Common 00002.txt",
+                                               "Common 00003.txt"}));
+    q.tag = "Odd";
+    EXPECT_EQ(store->search(q).value().front()["filename"], "Common 00001.txt");
+    q.tag = "Even";
+    EXPECT_EQ(store->search(q).value().front()["filename"], "Common 00002.txt");
+    q = text("UNCOMMON");
+    EXPECT_EQ(ids(q), (std::set<std::string>{"did=5"}));
+}
+
 }  // namespace
 }  // namespace tamber

@@ -2,11 +2,15 @@
 
 #include <atomic>
 #include <condition_variable>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <set>
 #include <thread>
 
+#include <sys/inotify.h>
+
+#include "platform/tremors/InotifyApi.h"
 #include "platform/tremors/SqliteDatabase.h"
 #include "platform/tremors/TremorService.h"
 #include "runtime/ProviderRuntime.h"
@@ -24,6 +28,39 @@ const auto* const ledger = ::testing::AddGlobalTestEnvironment(new TempStagingLe
 
 // Only a hang gets near these.
 constexpr auto kPatience = std::chrono::seconds(60);
+
+// The system's inotify calls, except that the next read can be made to report a queue overflow
+// (the kernel dropped events) before what really happened.
+class OverflowingInotify : public InotifyApi {
+public:
+    std::atomic<bool> overflowNext{false};
+
+    int init(int flags) override { return real_->init(flags); }
+    int addWatch(int fd, const std::string& path, uint32_t mask) override {
+        return real_->addWatch(fd, path, mask);
+    }
+    int removeWatch(int fd, int wd) override { return real_->removeWatch(fd, wd); }
+    ssize_t read(int fd, void* buffer, size_t size) override {
+        if (size >= sizeof(inotify_event) && overflowNext.exchange(false)) {
+            inotify_event overflow{};
+            overflow.wd = -1;
+            overflow.mask = IN_Q_OVERFLOW;
+            std::memcpy(buffer, &overflow, sizeof overflow);
+            return sizeof overflow;
+        }
+        return real_->read(fd, buffer, size);
+    }
+    int queuedBytes(int fd) override { return real_->queuedBytes(fd); }
+    int eventfd(unsigned int initial, int flags) override { return real_->eventfd(initial, flags); }
+    int signal(int eventFd) override { return real_->signal(eventFd); }
+    int poll(struct pollfd* fds, nfds_t count, int timeoutMs) override {
+        return real_->poll(fds, count, timeoutMs);
+    }
+    int close(int fd) override { return real_->close(fd); }
+
+private:
+    std::shared_ptr<InotifyApi> real_ = InotifyApi::system();
+};
 
 // A real provider on a temporary storage and app library, with its own journal, and the
 // replica the server would run over it. Signals and index deletions reach the replica as the
@@ -47,6 +84,7 @@ protected:
         ProviderRuntimeOptions options;
         options.storagePath = storage;
         options.stateDir = state.path();
+        options.inotify = inotify;
         options.onSignal = [this](const HostPorterItemIdentifier& container) {
             if (!forwardSignals)
                 return;
@@ -188,7 +226,8 @@ protected:
     // Waits until no catch-up runs nor is asked for by the signals sent so far.
     void settle() {
         journal->sync();
-        for (int quiet = 0; quiet < 10;) {
+        const auto deadline = std::chrono::steady_clock::now() + kPatience;
+        for (int quiet = 0; quiet < 10 && std::chrono::steady_clock::now() < deadline;) {
             std::this_thread::sleep_for(std::chrono::milliseconds(20));
             quiet = replica->status().catchingUp ? 0 : quiet + 1;
         }
@@ -209,6 +248,7 @@ protected:
     std::string storage, library;
     std::string databasePath = state / "replica/replica.db";
     size_t historyBatches = 10000;
+    std::shared_ptr<OverflowingInotify> inotify = std::make_shared<OverflowingInotify>();
     std::atomic<bool> forwardSignals{true};
     bool libraryPublished = true;
     std::atomic<int> deletions{0};
@@ -286,6 +326,20 @@ TEST_F(ReplicaSyncTest, ChangesOnDiskReachTheReplicaInOrder) {
         EXPECT_EQ(heard[i].sequence, history.value()[i].sequence);
         EXPECT_EQ(heard[i].changes, history.value()[i].changes);
     }
+}
+
+// Events the kernel dropped are history lost: the status says so from then on (whether the
+// journal's mark or the provider's refusal of the anchor tells it first), and the replica
+// still ends up holding the disk.
+TEST_F(ReplicaSyncTest, DroppedEventsAreReportedAsLostHistory) {
+    write(storage + "/one.txt");
+    start();
+    EXPECT_FALSE(replica->status().historyLost);
+    inotify->overflowNext = true;
+    write(storage + "/two.txt");
+    EXPECT_CONVERGES();
+    EXPECT_FALSE(inotify->overflowNext);
+    EXPECT_TRUE(replica->status().historyLost);
 }
 
 // Signals that arrive during a catch-up cause one more, not one each.
