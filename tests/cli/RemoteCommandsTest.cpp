@@ -202,6 +202,7 @@ TEST_F(RemoteCommandsTest, RunFilesThatNameNoLiveServerOfThisStorageLeaveTheVerb
     dir.writeFile("Documents/here.txt", "x");
     const CliRun alone = tamber({"ls", "root"});
     ASSERT_EQ(alone.status, 0) << alone.err;
+    EXPECT_EQ(tamber({"--direct", "ls", "root"}).out, alone.out) << "no server: --direct runs";
     RecordingApiServer server;
 
     writeRunFile(deadPid(), server.port(), storage);
