@@ -12,7 +12,8 @@ namespace tamber {
 // A verb that works through the provider. It runs the shared preamble once for all of them: a
 // verb may first answer without the provider (the journal's --forget), then the arguments that
 // can be checked without the provider are checked (a usage error wins), then the provider is
-// prepared, then the verb runs against the host interface. Failures print in the form --json
+// prepared (or, when a server of the storage is running, the provider that answers through its
+// API), then the verb runs against the host interface. Failures print in the form --json
 // asked for.
 class ProviderCommand : public Command {
 public:

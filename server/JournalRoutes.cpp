@@ -1,10 +1,12 @@
 #include "server/JournalRoutes.h"
 
+#include <atomic>
 #include <cerrno>
 #include <charconv>
 #include <chrono>
 #include <condition_variable>
 #include <deque>
+#include <map>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -23,6 +25,21 @@ namespace tamber {
 namespace {
 
 constexpr auto kQuietInterval = std::chrono::seconds(15);
+// How often a quiet stream looks whether its server is stopping.
+constexpr auto kStopCheckInterval = std::chrono::milliseconds(200);
+
+using StopFlag = std::shared_ptr<std::atomic<bool>>;
+
+// The stop flag of each context the routes were added for.
+std::mutex& flagsMutex() {
+    static std::mutex mutex;
+    return mutex;
+}
+
+std::map<const ApiContext*, StopFlag>& stopFlags() {
+    static std::map<const ApiContext*, StopFlag> flags;
+    return flags;
+}
 
 // What the journal's stream hands over to the connection writing it out.
 struct Feed {
@@ -66,7 +83,7 @@ struct OpenStream {
 };
 
 void streamEvents(const httplib::Request& request, httplib::Response& response,
-                  const ApiContext& context) {
+                  const ApiContext& context, const StopFlag& stopping) {
     const std::string sinceText =
         request.has_param("since") ? request.get_param_value("since") : std::string("0");
     auto since = parseEventID(sinceText);
@@ -127,14 +144,20 @@ void streamEvents(const httplib::Request& request, httplib::Response& response,
     }
     response.set_chunked_content_provider(
         "application/x-ndjson",
-        [feed](size_t, httplib::DataSink& sink) {
+        [feed, stopping](size_t, httplib::DataSink& sink) {
             std::unique_lock lock(feed->mutex);
-            if (feed->lines.empty() && !feed->done &&
-                !feed->changed.wait_for(lock, kQuietInterval,
-                                        [&] { return !feed->lines.empty() || feed->done; })) {
-                lock.unlock();
-                // A blank line: the client's reader skips it; a gone client fails the write.
-                return sink.write("\n", 1);
+            auto quietUntil = std::chrono::steady_clock::now() + kQuietInterval;
+            while (feed->lines.empty() && !feed->done) {
+                if (*stopping) {
+                    sink.done();
+                    return true;
+                }
+                if (std::chrono::steady_clock::now() >= quietUntil) {
+                    lock.unlock();
+                    // A blank line: the client's reader skips it; a gone client fails the write.
+                    return sink.write("\n", 1);
+                }
+                feed->changed.wait_for(lock, kStopCheckInterval);
             }
             std::deque<std::string> lines;
             lines.swap(feed->lines);
@@ -153,10 +176,23 @@ void streamEvents(const httplib::Request& request, httplib::Response& response,
 }  // namespace
 
 void JournalRoutes::add(httplib::Server& server, std::shared_ptr<ApiContext> context) {
+    auto stopping = std::make_shared<std::atomic<bool>>(false);
+    {
+        std::lock_guard lock(flagsMutex());
+        stopFlags()[context.get()] = stopping;
+    }
     server.Get("/api/v1/journal/events",
-               [context](const httplib::Request& request, httplib::Response& response) {
-                   streamEvents(request, response, *context);
+               [context, stopping](const httplib::Request& request, httplib::Response& response) {
+                   streamEvents(request, response, *context, stopping);
                });
+}
+
+void JournalRoutes::stopStreams(const ApiContext& context) {
+    std::lock_guard lock(flagsMutex());
+    if (auto found = stopFlags().find(&context); found != stopFlags().end()) {
+        *found->second = true;
+        stopFlags().erase(found);
+    }
 }
 
 }  // namespace tamber

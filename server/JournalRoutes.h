@@ -19,6 +19,10 @@ namespace tamber {
 class JournalRoutes {
 public:
     static void add(httplib::Server& server, std::shared_ptr<ApiContext> context);
+    // Ends every stream the routes of `context` are serving (a followed journal never ends by
+    // itself), so that a server stopping can finish its requests in flight. Call it before
+    // httplib::Server::stop().
+    static void stopStreams(const ApiContext& context);
 };
 
 }  // namespace tamber

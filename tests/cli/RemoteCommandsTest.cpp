@@ -6,9 +6,12 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
+#include <csignal>
 #include <cstdlib>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <nlohmann/json.hpp>
@@ -202,6 +205,7 @@ TEST_F(RemoteCommandsTest, RunFilesThatNameNoLiveServerOfThisStorageLeaveTheVerb
     dir.writeFile("Documents/here.txt", "x");
     const CliRun alone = tamber({"ls", "root"});
     ASSERT_EQ(alone.status, 0) << alone.err;
+    EXPECT_EQ(tamber({"--direct", "ls", "root"}).out, alone.out) << "no server: --direct runs";
     RecordingApiServer server;
 
     writeRunFile(deadPid(), server.port(), storage);
@@ -299,6 +303,32 @@ TEST_F(RemoteCommandsTest, WatchPrintsTheSignalsOfTheServersStream) {
     // A container the server cannot list fails before any stream, as it does directly.
     CliRun missing = tamber({"watch", "fid=404"});
     EXPECT_EQ(missing.status, CliContext::kExitNotFound) << missing.err;
+}
+
+// Ctrl-C ends a watch through the server as it ends a direct one: status 0, whatever the
+// stream was doing.
+TEST_F(RemoteCommandsTest, AnInterruptEndsAWatchOfTheServersStream) {
+    RecordingApiServer server;
+    server.answerStream("/api/v1/events", [](httplib::DataSink& sink) {
+        const std::string signal = "event: signal\ndata: {\"container\": \"fid=9\"}\n\n";
+        if (!sink.write(signal.data(), signal.size()))
+            return;
+        // Open until the client goes (or the server stops): a comment now and then finds out.
+        const std::string comment = ": keep-alive\n\n";
+        while (sink.write(comment.data(), comment.size()))
+            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    });
+    writeRunFile(::getpid(), server.port(), storage);
+    testing::TamberProcess watch({"--storage", storage, "watch"},
+                                 {{"XDG_RUNTIME_DIR", runtimeDir.path()}});
+    // Once the stream is asked for, the watch is in its loop.
+    for (int i = 0; i < 600 && server.requests().empty(); ++i)
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    ASSERT_FALSE(server.requests().empty()) << "the watch never asked for the stream";
+    EXPECT_EQ(server.requests().front().target, "/api/v1/events");
+    ASSERT_EQ(::kill(watch.pid(), SIGINT), 0);
+    EXPECT_EQ(watch.finish(), 0) << watch.err();
+    EXPECT_TRUE(watch.err().empty()) << watch.err();
 }
 
 TEST(RemotePorterTest, DurationsUseTheLargestExactUnit) {

@@ -2,8 +2,10 @@
 
 #include <unistd.h>
 
+#include <chrono>
 #include <cstdlib>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <thread>
@@ -45,18 +47,20 @@ protected:
     }
 
     void startServer() {
-        auto context = std::make_shared<ApiContext>();
+        context = std::make_shared<ApiContext>();
         context->storage = Url::fileURLWithPath(storage);
         context->journal = TremorService::sharedIfRunning();
         ASSERT_TRUE(context->journal) << "a direct run started the journal";
         JournalRoutes::add(server_, context);
-        int port = server_.bind_to_any_port("127.0.0.1");
+        port = server_.bind_to_any_port("127.0.0.1");
         thread_ = std::thread([this] { server_.listen_after_bind(); });
         ASSERT_TRUE(
             RunFile::write(RunFile::defaultLocation(), {::getpid(), port, "k", storage}).ok());
     }
 
     testing::TempDir runtimeDir;
+    std::shared_ptr<ApiContext> context;
+    int port = 0;
 
 private:
     httplib::Server server_;
@@ -98,6 +102,46 @@ TEST_F(RemoteEventsTest, TheJournalReplaysTheSameThroughTheServer) {
     EXPECT_EQ(forget.status, CliContext::kExitFailure);
     EXPECT_NE(forget.err.find("pid " + std::to_string(::getpid())), std::string::npos)
         << forget.err;
+}
+
+TEST_F(RemoteEventsTest, TheRouteRefusesBadRequestsAndEndsFollowedStreamsWhenTheServerStops) {
+    ASSERT_EQ(tamber({"events", "--no-follow"}).status, 0);
+    startServer();
+    httplib::Client client("127.0.0.1", port);
+    auto bad = client.Get("/api/v1/journal/events?since=12x");
+    ASSERT_TRUE(bad);
+    EXPECT_EQ(bad->status, 400);
+    EXPECT_NE(bad->body.find("\"error\""), std::string::npos) << bad->body;
+    auto outside = client.Get("/api/v1/journal/events?follow=0&path=%2Fetc");
+    ASSERT_TRUE(outside);
+    EXPECT_NE(outside->status, 200);
+    EXPECT_EQ(outside->body.find("passwd"), std::string::npos);
+
+    // A followed stream never ends by itself: the server stopping ends it.
+    std::mutex mutex;
+    std::string received;
+    std::thread follower([&] {
+        httplib::Client streaming("127.0.0.1", port);
+        // Longer than the route's quiet interval: only the stream's end ends the request.
+        streaming.set_read_timeout(60);
+        streaming.Get("/api/v1/journal/events", [&](const char* data, size_t length) {
+            std::lock_guard lock(mutex);
+            received.append(data, length);
+            return true;
+        });
+    });
+    // The history-done event (flag 16) says the replay is over and the stream is live.
+    for (int i = 0; i < 600; ++i) {
+        {
+            std::lock_guard lock(mutex);
+            if (received.find("\"flags\":16") != std::string::npos)
+                break;
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    JournalRoutes::stopStreams(*context);
+    follower.join();
+    EXPECT_NE(received.find("\"flags\":16"), std::string::npos) << received;
 }
 
 }  // namespace
