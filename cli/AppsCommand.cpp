@@ -1,13 +1,12 @@
 #include "cli/AppsCommand.h"
 
-#include <algorithm>
 #include <cerrno>
 #include <ostream>
 
-#include "applibraries/LocalAppLibraryManager.h"
 #include "cli/RemotePorter.h"
 #include "cli/ServerClient.h"
 #include "items/LocalAppLibraryItem.h"
+#include "runtime/HostJson.h"
 #include "runtime/JsonValues.h"
 
 namespace tamber {
@@ -46,22 +45,8 @@ int AppsCommand::runWith(CliContext& context, HostPorterExtension& provider) {
 
 Result<nlohmann::json> AppsCommand::localListing(CliContext& context, bool& rootChanged) const {
     // Preparing the provider already refreshes from the registry, as every verb does.
-    auto manager = LocalAppLibraryManager::shared();
-    auto items = manager->allItems();
-    std::sort(items.begin(), items.end(), [](const auto& a, const auto& b) {
-        return a->itemIdentifier() < b->itemIdentifier();
-    });
     rootChanged = context.appRefreshOutcome().rootChanged;
-    nlohmann::json libraries = nlohmann::json::array();
-    for (const auto& item : items) {
-        // The record's own bundle identifier: null when it has none, not "(null)".
-        const auto& bundle = item->pt_appContainerBundleIdentifier();
-        libraries.push_back({{"identifier", item->itemIdentifier()},
-                             {"name", item->filename()},
-                             {"bundleIdentifier", bundle ? nlohmann::json(*bundle) : nullptr},
-                             {"root", item->fileURL().path()}});
-    }
-    return nlohmann::json{{"versionToken", manager->versionToken()}, {"libraries", libraries}};
+    return HostJson::appLibraries();
 }
 
 Result<nlohmann::json> AppsCommand::remoteListing(RemotePorter& provider, bool& rootChanged) const {

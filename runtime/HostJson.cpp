@@ -1,6 +1,10 @@
 #include "runtime/HostJson.h"
 
+#include <algorithm>
+
+#include "applibraries/LocalAppLibraryManager.h"
 #include "host/PublishedTrees.h"
+#include "items/LocalAppLibraryItem.h"
 #include "items/LocalItem.h"
 #include "platform/Tag.h"
 #include "runtime/Base64.h"
@@ -113,6 +117,24 @@ namespace {
 constexpr const char* kUsageKey = "usage";
 
 }  // namespace
+
+nlohmann::json HostJson::appLibraries() {
+    auto manager = LocalAppLibraryManager::shared();
+    auto items = manager->allItems();
+    std::sort(items.begin(), items.end(), [](const auto& a, const auto& b) {
+        return a->itemIdentifier() < b->itemIdentifier();
+    });
+    nlohmann::json libraries = nlohmann::json::array();
+    for (const auto& item : items) {
+        // The record's own bundle identifier: null when it has none, not "(null)".
+        const auto& bundle = item->pt_appContainerBundleIdentifier();
+        libraries.push_back({{"identifier", item->itemIdentifier()},
+                             {"name", item->filename()},
+                             {"bundleIdentifier", bundle ? nlohmann::json(*bundle) : nullptr},
+                             {"root", item->fileURL().path()}});
+    }
+    return {{"versionToken", manager->versionToken()}, {"libraries", libraries}};
+}
 
 nlohmann::json HostJson::error(const Error& error) {
     nlohmann::json body{

@@ -27,6 +27,9 @@ public:
     // A finished change batch: {"updated": [...], "deleted": [...], "changes": [in order],
     // "anchor": base64 or "", "moreComing": bool}.
     static nlohmann::json changeBatch(const ChangeCollector::Batch& batch);
+    // The app libraries the process publishes, by identifier: {"versionToken": N, "libraries":
+    // [{"identifier", "name", "bundleIdentifier", "root"}]}.
+    static nlohmann::json appLibraries();
     // One event of the journal: {"id", "flags", "path" (and "pathBytes" when it is not UTF-8),
     // "fileID" or null}.
     static nlohmann::json journalEvent(const JournalEvent& event);

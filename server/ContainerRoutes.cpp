@@ -1,9 +1,7 @@
 #include "server/ContainerRoutes.h"
 
-#include <algorithm>
 #include <chrono>
 
-#include "applibraries/LocalAppLibraryManager.h"
 #include "host/HostPorterEnumerator.h"
 #include "host/HostPorterPage.h"
 #include "items/LocalAppLibraryItem.h"
@@ -45,23 +43,6 @@ bool openEnumerator(ApiContext& context, const httplib::Request& request,
     }
     out.enumerator = made.value();
     return true;
-}
-
-nlohmann::json appsJson() {
-    auto manager = LocalAppLibraryManager::shared();
-    auto items = manager->allItems();
-    std::sort(items.begin(), items.end(), [](const auto& a, const auto& b) {
-        return a->itemIdentifier() < b->itemIdentifier();
-    });
-    nlohmann::json libraries = nlohmann::json::array();
-    for (const auto& item : items) {
-        const auto& bundle = item->pt_appContainerBundleIdentifier();
-        libraries.push_back({{"identifier", item->itemIdentifier()},
-                             {"name", item->filename()},
-                             {"bundleIdentifier", bundle ? nlohmann::json(*bundle) : nullptr},
-                             {"root", item->fileURL().path()}});
-    }
-    return {{"versionToken", manager->versionToken()}, {"libraries", libraries}};
 }
 
 void createChild(ApiContext& context, const httplib::Request& request, httplib::Response& response,
@@ -176,15 +157,19 @@ void ContainerRoutes::add(httplib::Server& server, std::shared_ptr<ApiContext> c
     });
 
     server.Get("/api/v1/apps", [](const httplib::Request&, httplib::Response& response) {
-        ApiReply::json(response, appsJson());
+        ApiReply::json(response, HostJson::appLibraries());
     });
 
     server.Post(
         "/api/v1/apps/refresh", [context](const httplib::Request&, httplib::Response& response) {
+            const auto before = HostJson::appLibraries()["versionToken"];
             ProviderCalls::waitFor([&](auto done) {
                 context->provider->refreshInstalledAppsWithCompletionHandler(std::move(done));
             });
-            ApiReply::json(response, appsJson());
+            // The command line says whether the refresh changed the list.
+            auto answer = HostJson::appLibraries();
+            answer["rootChanged"] = answer["versionToken"] != before;
+            ApiReply::json(response, answer);
         });
 
     server.Post("/api/v1/trash/purge", [context](const httplib::Request& request,

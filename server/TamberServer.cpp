@@ -170,6 +170,8 @@ void TamberServer::stop() {
         return;
     stopped_ = true;
     sd_notify(0, "STOPPING=1");
+    // A followed journal stream only ends when told; the listeners wait for every request.
+    JournalRoutes::stopStreams(*context_);
     if (http_)
         http_->stop();
     {
