@@ -11,7 +11,7 @@ namespace tamber {
 
 namespace {
 
-std::string describePaths(const std::vector<Url>& urls) {
+std::string describeRootPaths(const std::vector<Url>& urls) {
     std::string text = "[";
     for (size_t i = 0; i < urls.size(); ++i) {
         if (i > 0)
@@ -107,7 +107,7 @@ void LocalRootEnumerator::updateMonitoredURLs() {
         LocalFileEnumeratorRef enumerator =
             LocalFileEnumerator::initWithContainer(container_, urls);
         setLocalFileEnumerator(enumerator);
-        logDebug([&] { return "updated root enumerator to monitor " + describePaths(urls); });
+        logDebug([&] { return "updated root enumerator to monitor " + describeRootPaths(urls); });
         if (running)
             enumerator->start();
     });

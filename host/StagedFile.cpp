@@ -15,7 +15,7 @@ namespace tamber {
 
 namespace {
 
-Error lastError() {
+Error errnoError() {
     return Error::posix(errno);
 }
 
@@ -66,7 +66,7 @@ Status StagedFile::write(const void* data, size_t size) {
             continue;
         if (n <= 0) {
             failed_ = true;
-            return n < 0 ? lastError() : Error::posix(EIO);
+            return n < 0 ? errnoError() : Error::posix(EIO);
         }
         bytes += n;
         size -= static_cast<size_t>(n);
@@ -82,13 +82,13 @@ Status StagedFile::flush() {
     // The rename that follows must never publish a name whose bytes are not on disk yet.
     if (fs.fsync(fd_) != 0) {
         failed_ = true;
-        return lastError();
+        return errnoError();
     }
     int fd = fd_;
     fd_ = -1;
     if (fs.close(fd) != 0) {
         failed_ = true;
-        return lastError();
+        return errnoError();
     }
     return Status::OK();
 }
@@ -117,7 +117,7 @@ Status StagedFile::copyAttributesFrom(const std::string& name) {
     FileSystem& fs = FileSystem::current();
     struct statx st {};
     if (fs.statx(folderFd_, name, AT_SYMLINK_NOFOLLOW, STATX_TYPE | STATX_MODE, &st) != 0)
-        return lastError();
+        return errnoError();
     if (S_ISDIR(st.stx_mode))
         return Error::posix(EISDIR);
     if (!S_ISREG(st.stx_mode))
@@ -125,21 +125,21 @@ Status StagedFile::copyAttributesFrom(const std::string& name) {
     const std::string from = folder_.appendingPathComponent(name).path();
     const std::string to = folder_.appendingPathComponent(name_).path();
     if (fs.chmod(to, st.stx_mode & 07777) != 0)
-        return lastError();
+        return errnoError();
 
     // Tags, ranks, last-used dates and the rest live in extended attributes: the new content
     // must carry them, or the save would look like a new document.
     ssize_t listSize = fs.llistxattr(from, nullptr, 0);
     if (listSize < 0)
-        return errno == ENOTSUP ? Status::OK() : Status(lastError());
+        return errno == ENOTSUP ? Status::OK() : Status(errnoError());
     std::vector<char> list(static_cast<size_t>(listSize) + 1);
     listSize = fs.llistxattr(from, list.data(), list.size());
     if (listSize < 0)
-        return lastError();
+        return errnoError();
     // Opened for the attribute writes only: the content was flushed and closed before.
     int fd = fs.openat(folderFd_, name_, O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
     if (fd < 0)
-        return lastError();
+        return errnoError();
     Status status;
     for (size_t start = 0; start < static_cast<size_t>(listSize) && status.ok();) {
         std::string attribute(list.data() + start);
@@ -149,14 +149,14 @@ Status StagedFile::copyAttributesFrom(const std::string& name) {
         ssize_t valueSize = fs.lgetxattr(from, attribute, nullptr, 0);
         if (valueSize < 0) {
             if (errno != ENODATA)  // removed meanwhile
-                status = lastError();
+                status = errnoError();
             continue;
         }
         std::vector<char> value(static_cast<size_t>(valueSize));
         valueSize = fs.lgetxattr(from, attribute, value.data(), value.size());
         if (valueSize < 0 ||
             fs.fsetxattr(fd, attribute, value.data(), static_cast<size_t>(valueSize), 0) != 0)
-            status = lastError();
+            status = errnoError();
     }
     fs.close(fd);
     return status;
@@ -171,7 +171,7 @@ Result<Url> StagedFile::replace(const std::string& name) {
     if (ready.ok())
         ready = copyAttributesFrom(name);
     if (ready.ok() && FileSystem::current().renameat2(folderFd_, name_, folderFd_, name, 0) != 0)
-        ready = lastError();
+        ready = errnoError();
     if (!ready.ok()) {
         discard();
         return ready.error();

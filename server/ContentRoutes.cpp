@@ -25,12 +25,12 @@ namespace tamber {
 
 namespace {
 
-constexpr const char* kItemContent = R"(/api/v1/items/([^/]+)/content)";
-constexpr const char* kItemThumbnail = R"(/api/v1/items/([^/]+)/thumbnail)";
-constexpr const char* kContainerChildren = R"(/api/v1/containers/([^/]+)/children)";
+constexpr const char* kContentPath = R"(/api/v1/items/([^/]+)/content)";
+constexpr const char* kThumbnailPath = R"(/api/v1/items/([^/]+)/thumbnail)";
+constexpr const char* kChildrenUploadPath = R"(/api/v1/containers/([^/]+)/children)";
 
-constexpr size_t kChunk = 64 * 1024;
-constexpr size_t kMaxNameBytes = 255;
+constexpr size_t kReadChunk = 64 * 1024;
+constexpr size_t kMaxUploadNameBytes = 255;
 constexpr int kMinThumbnail = 16;
 constexpr int kMaxThumbnail = 1024;
 constexpr int kDefaultThumbnail = 256;
@@ -42,7 +42,7 @@ Error notAFile() {
 }
 
 // The item's path, for an identifier the provider knows.
-Result<Url> urlOfItem(ApiContext& context, const std::string& identifier) {
+Result<Url> contentItemURL(ApiContext& context, const std::string& identifier) {
     auto url = context.provider->URLForItemWithPersistentIdentifier(identifier);
     if (!url)
         return Error::porterErrorForNonExistentItemWithIdentifier(identifier);
@@ -90,7 +90,7 @@ void takeOverRanges(const httplib::Request& request) {
     const_cast<httplib::Request&>(request).ranges.clear();
 }
 
-void answerItem(httplib::Response& response, ApiContext& context, const Url& url) {
+void answerWithItem(httplib::Response& response, ApiContext& context, const Url& url) {
     auto item = context.provider->itemAtURL(url);
     if (!item.ok())
         return ApiReply::error(response, item.error());
@@ -98,7 +98,7 @@ void answerItem(httplib::Response& response, ApiContext& context, const Url& url
 }
 
 Status checkUploadName(const std::string& name) {
-    if (name.size() > kMaxNameBytes)
+    if (name.size() > kMaxUploadNameBytes)
         return ApiReply::badRequest("name must not be longer than 255 bytes");
     return checkItemName(name);
 }
@@ -112,15 +112,15 @@ struct Upload {
 }  // namespace
 
 void ContentRoutes::add(httplib::Server& server, std::shared_ptr<ApiContext> context) {
-    server.Get(kItemContent,
+    server.Get(kContentPath,
                [context](const httplib::Request& request, httplib::Response& response) {
                    handleDownload(request, response, *context);
                });
-    server.Put(kItemContent, [context](const httplib::Request& request, httplib::Response& response,
+    server.Put(kContentPath, [context](const httplib::Request& request, httplib::Response& response,
                                        const httplib::ContentReader& reader) {
         handleSave(request, response, reader, *context);
     });
-    server.Get(kItemThumbnail,
+    server.Get(kThumbnailPath,
                [context](const httplib::Request& request, httplib::Response& response) {
                    handleThumbnail(request, response, *context);
                });
@@ -129,9 +129,9 @@ void ContentRoutes::add(httplib::Server& server, std::shared_ptr<ApiContext> con
 void ContentRoutes::addChildrenPost(httplib::Server& server, std::shared_ptr<ApiContext> context,
                                     OtherPost otherwise, size_t jsonLimit) {
     server.Post(
-        kContainerChildren, [context, otherwise, jsonLimit](const httplib::Request& request,
-                                                            httplib::Response& response,
-                                                            const httplib::ContentReader& reader) {
+        kChildrenUploadPath, [context, otherwise, jsonLimit](const httplib::Request& request,
+                                                             httplib::Response& response,
+                                                             const httplib::ContentReader& reader) {
             if (handleUpload(request, response, reader, *context))
                 return;
             std::string body;
@@ -168,7 +168,7 @@ bool ContentRoutes::handleUpload(const httplib::Request& request, httplib::Respo
     if (identifier == HostPorterRootContainerItemIdentifier) {
         // The root holds only the app libraries and the shared area.
         refused = Error::errorFileWriteNoPermission();
-    } else if (auto url = urlOfItem(context, identifier); url.ok()) {
+    } else if (auto url = contentItemURL(context, identifier); url.ok()) {
         folder = url.value();
     } else {
         refused = url.error();
@@ -243,7 +243,7 @@ void ContentRoutes::handleDownload(const httplib::Request& request, httplib::Res
         return ApiReply::error(response, item.error());
     if (TypeConforms(item.value()->typeIdentifier(), TypeIdentifiers::kDirectory))
         return ApiReply::error(response, notAFile());
-    auto url = urlOfItem(context, identifier);
+    auto url = contentItemURL(context, identifier);
     if (!url.ok())
         return ApiReply::error(response, url.error());
     auto opened = openRegularFile(url.value(), O_RDONLY);
@@ -288,7 +288,7 @@ void ContentRoutes::handleDownload(const httplib::Request& request, httplib::Res
     auto fd = std::make_shared<ScopedFd>(std::move(opened.value().fd));
     response.set_content_provider(
         length, mediaType, [fd, first](size_t offset, size_t wanted, httplib::DataSink& sink) {
-            std::vector<char> buffer(std::min(wanted, kChunk));
+            std::vector<char> buffer(std::min(wanted, kReadChunk));
             ssize_t n;
             do {
                 n = FileSystem::current().pread(fd->get(), buffer.data(), buffer.size(),
@@ -305,7 +305,7 @@ void ContentRoutes::handleDownload(const httplib::Request& request, httplib::Res
 void ContentRoutes::handleSave(const httplib::Request& request, httplib::Response& response,
                                const httplib::ContentReader& reader, ApiContext& context) {
     const std::string identifier = request.matches[1];
-    auto url = urlOfItem(context, identifier);
+    auto url = contentItemURL(context, identifier);
     std::optional<Error> refused;
     std::unique_ptr<StagedFile> staged;
     if (!url.ok()) {
@@ -335,7 +335,7 @@ void ContentRoutes::handleSave(const httplib::Request& request, httplib::Respons
     auto replaced = staged->replace(url.value().lastPathComponent());
     if (!replaced.ok())
         return ApiReply::error(response, replaced.error());
-    answerItem(response, context, replaced.value());
+    answerWithItem(response, context, replaced.value());
 }
 
 void ContentRoutes::handleThumbnail(const httplib::Request& request, httplib::Response& response,

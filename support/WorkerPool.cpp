@@ -12,7 +12,7 @@ namespace tamber {
 
 namespace {
 
-constexpr auto kIdleLifetime = std::chrono::seconds(5);
+constexpr auto kWorkerIdleLifetime = std::chrono::seconds(5);
 
 }  // namespace
 
@@ -88,7 +88,8 @@ void WorkerPool::run() {
         ++idle_;
         if (idle_ == threads_ && tasks_.empty())
             quiet_.notify_all();
-        bool woken = wake_.wait_for(lock, kIdleLifetime, [&] { return !tasks_.empty() || leave_; });
+        bool woken =
+            wake_.wait_for(lock, kWorkerIdleLifetime, [&] { return !tasks_.empty() || leave_; });
         --idle_;
         if (tasks_.empty()) {
             if (woken && !leave_)

@@ -11,7 +11,7 @@ namespace tamber {
 
 namespace {
 
-constexpr const char* kDefaultDataDirs = "/usr/local/share:/usr/share";
+constexpr const char* kDefaultIconDataDirs = "/usr/local/share:/usr/share";
 constexpr std::string_view kHicolor = "icons/hicolor";
 constexpr uint32_t kLargestSize = 4096;
 
@@ -51,7 +51,7 @@ std::vector<std::string> IconTheme::hicolorFolders() {
     else if (home && home[0] == '/')
         folders.push_back(under(std::string(home) + "/.local/share"));
     const char* dataDirs = std::getenv("XDG_DATA_DIRS");
-    std::string_view list = dataDirs && *dataDirs ? dataDirs : kDefaultDataDirs;
+    std::string_view list = dataDirs && *dataDirs ? dataDirs : kDefaultIconDataDirs;
     while (!list.empty()) {
         size_t colon = list.find(':');
         std::string_view dir = list.substr(0, colon);

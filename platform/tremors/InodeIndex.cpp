@@ -10,7 +10,7 @@ namespace tamber {
 
 namespace {
 
-constexpr const char* kSchema = R"sql(
+constexpr const char* kInodeIndexSchema = R"sql(
 CREATE TABLE inodes(
     inode INTEGER PRIMARY KEY,
     parent INTEGER NOT NULL,
@@ -82,7 +82,7 @@ InodeRecord readInode(const SqliteDatabase::Statement& stmt) {
 }  // namespace
 
 const char* InodeIndex::schema() {
-    return kSchema;
+    return kInodeIndexSchema;
 }
 
 const char* InodeIndex::upgradeFrom(int64_t version) {

@@ -17,7 +17,7 @@ namespace {
 
 using Kind = FileChange::Kind;
 
-std::string join(const std::string& dir, const std::string& name) {
+std::string joinPath(const std::string& dir, const std::string& name) {
     return dir == "/" ? dir + name : dir + "/" + name;
 }
 
@@ -276,7 +276,7 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
                 fs.statx(fd.get(), entry.name, AT_SYMLINK_NOFOLLOW, STATX_TYPE, &st) == 0 &&
                 S_ISDIR(st.stx_mode);
         }
-        std::string child = join(path, entry.name);
+        std::string child = joinPath(path, entry.name);
         if (reportContents)
             out.push_back(created(child, isDirectory));
         if (isDirectory)

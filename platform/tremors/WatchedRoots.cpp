@@ -9,7 +9,7 @@ namespace tamber {
 
 namespace {
 
-constexpr const char* kSchema = R"sql(
+constexpr const char* kWatchedRootsSchema = R"sql(
 CREATE TABLE roots(
     id INTEGER PRIMARY KEY,
     path TEXT NOT NULL UNIQUE,
@@ -21,7 +21,7 @@ CREATE TABLE roots(
 }  // namespace
 
 const char* WatchedRoots::schema() {
-    return kSchema;
+    return kWatchedRootsSchema;
 }
 
 bool WatchedRoots::isAtOrBelow(std::string_view path, std::string_view base) {

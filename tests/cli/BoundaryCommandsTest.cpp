@@ -24,7 +24,7 @@ using nlohmann::json;
 using testing::CliRun;
 using testing::TempDir;
 
-const char* const kLibrary = "#com.example.Notes";
+const char* const kNotesLibrary = "#com.example.Notes";
 const char* const kOutside = "not inside the document storage or an app library";
 
 // A storage folder with a folder "Shelf", one app library, and a folder "elsewhere" outside
@@ -194,7 +194,7 @@ TEST_F(BoundaryCommandsTest, PathAnswersTheContainersAndRefusesOutside) {
     EXPECT_EQ(tamberJson({"path", "root"})["path"], storage);
     EXPECT_EQ(tamberJson({"path", "working-set"})["path"], storage);
     tamberJson({"apps"});
-    EXPECT_EQ(tamberJson({"path", kLibrary})["path"], library);
+    EXPECT_EQ(tamberJson({"path", kNotesLibrary})["path"], library);
     std::string file = dir.writeFile("Documents/Shelf/p.txt", "p");
     EXPECT_EQ(tamberJson({"path", file})["path"], file);
     EXPECT_EQ(errorOf({"path", dir.path() + "/outside"})["message"], kOutside);

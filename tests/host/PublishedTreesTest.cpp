@@ -24,18 +24,18 @@ namespace {
 namespace fs = std::filesystem;
 using testing::TempDir;
 
-Url at(const std::string& path) {
+Url urlAt(const std::string& path) {
     return Url::fileURLWithPath(path);
 }
 
-struct Outcome {
+struct BoundaryOutcome {
     std::optional<Url> url;
     std::optional<Error> error;
 };
 
 template <class Operation>
-Outcome run(Operation operation) {
-    Outcome outcome;
+BoundaryOutcome runOperation(Operation operation) {
+    BoundaryOutcome outcome;
     operation([&](Result<Url> result) {
         if (result.ok())
             outcome.url = std::move(result).value();
@@ -67,9 +67,9 @@ protected:
         dir.makeDir("storage/Work");
         fs::create_directory_symlink(outside, storage + "/away");
         previous_ = HostPorterManager::installDefaultManager(
-            std::make_shared<RecordingHostPorterManager>(at(storage)));
+            std::make_shared<RecordingHostPorterManager>(urlAt(storage)));
         previousRoots_ = PublishedTrees::setAppLibraryRootsSource(
-            [this] { return std::vector<Url>{at(library)}; });
+            [this] { return std::vector<Url>{urlAt(library)}; });
         previousLedger_ = StagingCopies::setLedgerDirectoryForTesting(dir / "ledger");
     }
     void TearDown() override {
@@ -83,7 +83,7 @@ protected:
     static bool refused(const std::optional<Error>& error) {
         return error && PublishedTrees::isOutsideError(*error);
     }
-    static bool refused(const Outcome& outcome) { return refused(outcome.error); }
+    static bool refused(const BoundaryOutcome& outcome) { return refused(outcome.error); }
 
     TempDir dir;
     std::string storage, library, outside;
@@ -97,7 +97,7 @@ private:
 // A refusal is known by its mark, never by its words: another "no such item" that happens to
 // say the same, or one that wraps a refusal under a description of its own, is not one.
 TEST_F(PublishedTreesTest, ARefusalIsKnownByItsMarkNotItsText) {
-    Error refusal = PublishedTrees::outsideError(at(outside + "/f"));
+    Error refusal = PublishedTrees::outsideError(urlAt(outside + "/f"));
     EXPECT_TRUE(PublishedTrees::isOutsideError(refusal));
     Error sameWords(kHostPorterErrorDomain, kHostPorterNoSuchItem,
                     {{"description", PublishedTrees::kOutsideMessage}});
@@ -111,16 +111,16 @@ TEST_F(PublishedTreesTest, ARefusalIsKnownByItsMarkNotItsText) {
 }
 
 TEST_F(PublishedTreesTest, InsideMeansAtOrBelowARootWithoutALinkOnTheWay) {
-    EXPECT_TRUE(PublishedTrees::check(at(storage)).ok());
-    EXPECT_TRUE(PublishedTrees::check(at(storage + "/Work/new.txt")).ok());
-    EXPECT_TRUE(PublishedTrees::check(at(library + "/a/b")).ok());
-    EXPECT_TRUE(PublishedTrees::check(at(storage + "/away")).ok()) << "a link is an item";
-    EXPECT_EQ(PublishedTrees::rootOf(at(library + "/x"))->path(), library);
+    EXPECT_TRUE(PublishedTrees::check(urlAt(storage)).ok());
+    EXPECT_TRUE(PublishedTrees::check(urlAt(storage + "/Work/new.txt")).ok());
+    EXPECT_TRUE(PublishedTrees::check(urlAt(library + "/a/b")).ok());
+    EXPECT_TRUE(PublishedTrees::check(urlAt(storage + "/away")).ok()) << "a link is an item";
+    EXPECT_EQ(PublishedTrees::rootOf(urlAt(library + "/x"))->path(), library);
 
     for (const std::string& path :
          {outside + "/f", storage + "2", dir / "apps/lib", storage + "/away/f",
           storage + "/away/sub/f", std::string("/")}) {
-        Status status = PublishedTrees::check(at(path));
+        Status status = PublishedTrees::check(urlAt(path));
         ASSERT_TRUE(refused(status)) << path;
         EXPECT_EQ(status.error().domain(), kHostPorterErrorDomain);
         EXPECT_EQ(status.error().code(), kHostPorterNoSuchItem);
@@ -128,35 +128,39 @@ TEST_F(PublishedTreesTest, InsideMeansAtOrBelowARootWithoutALinkOnTheWay) {
     }
     // Without the library hook only the storage is published.
     PublishedTrees::setAppLibraryRootsSource(nullptr);
-    EXPECT_TRUE(refused(PublishedTrees::check(at(library + "/a"))));
+    EXPECT_TRUE(refused(PublishedTrees::check(urlAt(library + "/a"))));
 }
 
 TEST_F(PublishedTreesTest, OperationsRefuseOutsideBeforeTouchingAnything) {
     std::string file = dir.writeFile("storage/Work/a.txt", "a");
     std::string source = dir.writeFile("elsewhere/b.txt", "b");
 
+    EXPECT_TRUE(refused(runOperation(
+        [&](auto done) { pt_createSubFolder(urlAt(storage + "/away"), "N", false, done); })));
+    EXPECT_TRUE(refused(runOperation([&](auto done) {
+        pt_reparentUnderFolder(urlAt(file), urlAt(storage + "/away"), false, done);
+    })));
+    EXPECT_TRUE(refused(runOperation(
+        [&](auto done) { pt_reparentUnderFolder(urlAt(file), urlAt(outside), false, done); })));
+    EXPECT_TRUE(refused(runOperation(
+        [&](auto done) { pt_importUnderFolder(urlAt(source), urlAt(storage + "/away"), done); })));
     EXPECT_TRUE(refused(
-        run([&](auto done) { pt_createSubFolder(at(storage + "/away"), "N", false, done); })));
-    EXPECT_TRUE(refused(run(
-        [&](auto done) { pt_reparentUnderFolder(at(file), at(storage + "/away"), false, done); })));
-    EXPECT_TRUE(refused(
-        run([&](auto done) { pt_reparentUnderFolder(at(file), at(outside), false, done); })));
-    EXPECT_TRUE(refused(
-        run([&](auto done) { pt_importUnderFolder(at(source), at(storage + "/away"), done); })));
-    EXPECT_TRUE(refused(run([&](auto done) { pt_renameWithNewName(at(source), "c.txt", done); })));
-    EXPECT_TRUE(refused(run(
-        [&](auto done) { pt_trashUnderFolder(at(file), at(storage + "/away/.Trash"), done); })));
+        runOperation([&](auto done) { pt_renameWithNewName(urlAt(source), "c.txt", done); })));
+    EXPECT_TRUE(refused(runOperation([&](auto done) {
+        pt_trashUnderFolder(urlAt(file), urlAt(storage + "/away/.Trash"), done);
+    })));
     Status deleted;
-    pt_deleteWithCompletionHandler(at(outside + "/x"), [&](Status status) { deleted = status; });
+    pt_deleteWithCompletionHandler(urlAt(outside + "/x"), [&](Status status) { deleted = status; });
     EXPECT_TRUE(refused(deleted));
 
     bool ran = false;
-    EXPECT_FALSE(pt_withReadWriteAccess(at(source), [&](int) { return ran = true; }));
+    EXPECT_FALSE(pt_withReadWriteAccess(urlAt(source), [&](int) { return ran = true; }));
     EXPECT_EQ(errno, EACCES);
-    EXPECT_FALSE(pt_withReadWriteAccess(at(storage + "/away/x"), [&](int) { return ran = true; }));
+    EXPECT_FALSE(
+        pt_withReadWriteAccess(urlAt(storage + "/away/x"), [&](int) { return ran = true; }));
     EXPECT_FALSE(ran);
-    EXPECT_TRUE(pt_withReadWriteAccess(at(file), [&](int fd) { return fd >= 0; }));
-    EXPECT_TRUE(refused(pt_directorySizeWithError(at(outside)).status()));
+    EXPECT_TRUE(pt_withReadWriteAccess(urlAt(file), [&](int fd) { return fd >= 0; }));
+    EXPECT_TRUE(refused(pt_directorySizeWithError(urlAt(outside)).status()));
 
     EXPECT_TRUE(fs::exists(file));
     EXPECT_TRUE(fs::exists(source));
@@ -165,21 +169,22 @@ TEST_F(PublishedTreesTest, OperationsRefuseOutsideBeforeTouchingAnything) {
 
 TEST_F(PublishedTreesTest, ALinkInsideIsMovedRenamedAndDeletedAsALink) {
     dir.writeFile("outside/keep.txt", "k");
-    Outcome renamed =
-        run([&](auto done) { pt_renameWithNewName(at(storage + "/away"), "gone", done); });
+    BoundaryOutcome renamed = runOperation(
+        [&](auto done) { pt_renameWithNewName(urlAt(storage + "/away"), "gone", done); });
     ASSERT_TRUE(renamed.url) << descriptionOf(renamed.error);
-    Outcome moved = run([&](auto done) {
-        pt_reparentUnderFolder(at(storage + "/gone"), at(library), false, done);
+    BoundaryOutcome moved = runOperation([&](auto done) {
+        pt_reparentUnderFolder(urlAt(storage + "/gone"), urlAt(library), false, done);
     });
     ASSERT_TRUE(moved.url) << descriptionOf(moved.error);
     EXPECT_TRUE(fs::is_symlink(library + "/gone"));
-    Outcome imported = run([&](auto done) {
-        pt_importUnderFolder(at(library + "/gone"), at(storage + "/Work"), done);
+    BoundaryOutcome imported = runOperation([&](auto done) {
+        pt_importUnderFolder(urlAt(library + "/gone"), urlAt(storage + "/Work"), done);
     });
     ASSERT_TRUE(imported.url) << descriptionOf(imported.error);
     EXPECT_TRUE(fs::is_symlink(storage + "/Work/gone"));
     Status deleted = Error::posix(EIO);
-    pt_deleteWithCompletionHandler(at(library + "/gone"), [&](Status status) { deleted = status; });
+    pt_deleteWithCompletionHandler(urlAt(library + "/gone"),
+                                   [&](Status status) { deleted = status; });
     EXPECT_TRUE(deleted.ok());
     EXPECT_FALSE(fs::exists(fs::symlink_status(library + "/gone")));
     EXPECT_TRUE(fs::exists(outside + "/keep.txt"));
@@ -210,12 +215,12 @@ private:
 TEST_F(PublishedTreesTest, AFolderSwappedForALinkAfterTheLookupIsRefused) {
     std::string file = dir.writeFile("storage/a.txt", "a");
     dir.makeDir("storage/Work/Sub");
-    ASSERT_TRUE(PublishedTrees::check(at(storage + "/Work/Sub")).ok());
+    ASSERT_TRUE(PublishedTrees::check(urlAt(storage + "/Work/Sub")).ok());
     auto swapping = std::make_shared<SwappingFileSystem>(storage + "/Work", outside);
     {
         testing::ScopedFileSystem scoped(swapping);
-        Outcome moved = run([&](auto done) {
-            pt_reparentUnderFolder(at(file), at(storage + "/Work/Sub"), false, done);
+        BoundaryOutcome moved = runOperation([&](auto done) {
+            pt_reparentUnderFolder(urlAt(file), urlAt(storage + "/Work/Sub"), false, done);
         });
         EXPECT_TRUE(refused(moved)) << descriptionOf(moved.error);
     }
@@ -224,24 +229,28 @@ TEST_F(PublishedTreesTest, AFolderSwappedForALinkAfterTheLookupIsRefused) {
 }
 
 TEST_F(PublishedTreesTest, ALinkedTrashIsRefusedAndAMissingOneMade) {
-    EXPECT_TRUE(pt_ensureTrashFolder(at(library + "/.Trash")).ok());
+    EXPECT_TRUE(pt_ensureTrashFolder(urlAt(library + "/.Trash")).ok());
     EXPECT_TRUE(fs::is_directory(library + "/.Trash"));
-    EXPECT_TRUE(pt_ensureTrashFolder(at(library + "/.Trash")).ok()) << "an existing one is fine";
+    EXPECT_TRUE(pt_ensureTrashFolder(urlAt(library + "/.Trash")).ok()) << "an existing one is fine";
     fs::create_directory_symlink(outside, storage + "/.Trash");
-    EXPECT_TRUE(refused(pt_ensureTrashFolder(at(storage + "/.Trash"))));
+    EXPECT_TRUE(refused(pt_ensureTrashFolder(urlAt(storage + "/.Trash"))));
     dir.writeFile("storage/Work/.Trash", "not a folder");
-    Status file = pt_ensureTrashFolder(at(storage + "/Work/.Trash"));
+    Status file = pt_ensureTrashFolder(urlAt(storage + "/Work/.Trash"));
     ASSERT_FALSE(file.ok());
     EXPECT_TRUE(file.error().is(kPosixErrorDomain, ENOTDIR));
 }
 
 TEST_F(PublishedTreesTest, CreateFailsOnATakenNameUnlessItBounces) {
     std::string work = storage + "/Work";
-    ASSERT_TRUE(run([&](auto done) { pt_createSubFolder(at(work), "Drafts", false, done); }).url);
-    Outcome taken = run([&](auto done) { pt_createSubFolder(at(work), "Drafts", false, done); });
+    ASSERT_TRUE(runOperation([&](auto done) {
+                    pt_createSubFolder(urlAt(work), "Drafts", false, done);
+                }).url);
+    BoundaryOutcome taken =
+        runOperation([&](auto done) { pt_createSubFolder(urlAt(work), "Drafts", false, done); });
     ASSERT_TRUE(taken.error);
     EXPECT_TRUE(taken.error->is(kPosixErrorDomain, EEXIST));
-    Outcome bounced = run([&](auto done) { pt_createSubFolder(at(work), "Drafts", true, done); });
+    BoundaryOutcome bounced =
+        runOperation([&](auto done) { pt_createSubFolder(urlAt(work), "Drafts", true, done); });
     ASSERT_TRUE(bounced.url);
     EXPECT_EQ(bounced.url->path(), work + "/Drafts 2");
 
@@ -252,8 +261,8 @@ TEST_F(PublishedTreesTest, CreateFailsOnATakenNameUnlessItBounces) {
              {"a/b", "name must not contain '/'"},
              {".Trash", "name '.Trash' is reserved"}}) {
         // By an init-capture: clang before 16 cannot capture a structured binding.
-        Outcome o =
-            run([&, &name = name](auto done) { pt_createSubFolder(at(work), name, true, done); });
+        BoundaryOutcome o = runOperation(
+            [&, &name = name](auto done) { pt_createSubFolder(urlAt(work), name, true, done); });
         ASSERT_TRUE(o.error) << name;
         EXPECT_TRUE(o.error->is(kHostPorterErrorDomain, kHostPorterInvalidParameter)) << name;
         EXPECT_EQ(descriptionOf(o.error), message);
@@ -265,18 +274,21 @@ TEST_F(PublishedTreesTest, ImportRefusesAFolderIntoItselfAndSpecialFiles) {
     std::string work = storage + "/Work";
     dir.makeDir("storage/Work/Sub");
     for (const std::string& into : {work, work + "/Sub", storage + "/Work/./Sub"}) {
-        Outcome o = run([&](auto done) { pt_importUnderFolder(at(work), at(into), done); });
+        BoundaryOutcome o =
+            runOperation([&](auto done) { pt_importUnderFolder(urlAt(work), urlAt(into), done); });
         EXPECT_EQ(descriptionOf(o.error), "can't import a folder into itself") << into;
     }
     // The same folder under another path is still itself.
     fs::create_directory_symlink(work, dir / "alias");
-    Outcome aliased = run(
-        [&](auto done) { pt_importUnderFolder(at(dir / "alias/Sub"), at(work + "/Sub"), done); });
+    BoundaryOutcome aliased = runOperation([&](auto done) {
+        pt_importUnderFolder(urlAt(dir / "alias/Sub"), urlAt(work + "/Sub"), done);
+    });
     EXPECT_EQ(descriptionOf(aliased.error), "can't import a folder into itself");
 
     std::string fifo = dir / "pipe";
     ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
-    Outcome piped = run([&](auto done) { pt_importUnderFolder(at(fifo), at(work), done); });
+    BoundaryOutcome piped =
+        runOperation([&](auto done) { pt_importUnderFolder(urlAt(fifo), urlAt(work), done); });
     EXPECT_EQ(descriptionOf(piped.error), "can only import a file, a folder or a symbolic link");
     EXPECT_EQ(fs::directory_iterator(work + "/Sub"), fs::directory_iterator());
 }
@@ -316,8 +328,9 @@ TEST_F(PublishedTreesTest, StaleStagingCopiesOfDeadProcessesAreSwept) {
 
     // A finished import leaves neither a staging copy nor a record.
     std::string source = dir.writeFile("elsewhere/c.txt", "c");
-    ASSERT_TRUE(
-        run([&](auto done) { pt_importUnderFolder(at(source), at(storage + "/Work"), done); }).url);
+    ASSERT_TRUE(runOperation([&](auto done) {
+                    pt_importUnderFolder(urlAt(source), urlAt(storage + "/Work"), done);
+                }).url);
     EXPECT_TRUE(fs::is_empty(dir / "ledger"));
     for (const auto& entry : fs::directory_iterator(storage + "/Work"))
         EXPECT_FALSE(entry.path().filename().string().starts_with(".tamber-import-"))

@@ -15,7 +15,7 @@ namespace {
 
 using testing::TempDir;
 
-Url at(const std::string& path) {
+Url fileAt(const std::string& path) {
     return Url::fileURLWithPath(path);
 }
 
@@ -48,16 +48,17 @@ TEST(UrlRelationshipTest, SameContainsAndOther) {
         {symLink, sub, Other},
     };
     for (const auto& c : cases) {
-        EXPECT_EQ(pt_relationshipToItemAtURL(at(c.a), at(c.b)), c.expected) << c.a << " " << c.b;
+        EXPECT_EQ(pt_relationshipToItemAtURL(fileAt(c.a), fileAt(c.b)), c.expected)
+            << c.a << " " << c.b;
     }
 }
 
 TEST(FolderTest, FoldersArePackagesAndFilesAreNot) {
     TempDir dir;
-    EXPECT_TRUE(pt_isFolder(at(dir.makeDir("plain"))));
-    EXPECT_FALSE(pt_isFolder(at(dir.makeDir("Talk.lumen"))));
-    EXPECT_FALSE(pt_isFolder(at(dir.writeFile("f.txt"))));
-    EXPECT_FALSE(pt_isFolder(at(dir / "missing")));
+    EXPECT_TRUE(pt_isFolder(fileAt(dir.makeDir("plain"))));
+    EXPECT_FALSE(pt_isFolder(fileAt(dir.makeDir("Talk.lumen"))));
+    EXPECT_FALSE(pt_isFolder(fileAt(dir.writeFile("f.txt"))));
+    EXPECT_FALSE(pt_isFolder(fileAt(dir / "missing")));
 }
 
 TEST(DirectorySizeTest, SumsRegularFilesAtEveryDepthWithoutFollowingLinksOrFails) {
@@ -70,18 +71,18 @@ TEST(DirectorySizeTest, SumsRegularFilesAtEveryDepthWithoutFollowingLinksOrFails
     ASSERT_EQ(::symlink(outside.c_str(), (root + "/link").c_str()), 0);
     ASSERT_EQ(::symlink(dir.path().c_str(), (root + "/loop").c_str()), 0);
 
-    auto size = pt_directorySizeWithError(at(root));
+    auto size = pt_directorySizeWithError(fileAt(root));
     ASSERT_TRUE(size.ok()) << size.error().description();
     EXPECT_EQ(size.value(), 123u);
 
     // Failures are errors, and every descriptor opened on the way is closed.
-    EXPECT_EQ(pt_directorySizeWithError(at(dir / "missing")).error(), Error::posix(ENOENT));
+    EXPECT_EQ(pt_directorySizeWithError(fileAt(dir / "missing")).error(), Error::posix(ENOENT));
     dir.writeFile("Deck.lumen/x/y/z/c/file", "1");
     auto fs = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
     testing::ScopedFileSystem scoped(fs);
     using Op = FaultInjectingFileSystem::Operation;
     fs->inject(Op::Statx, EIO, 1, "/z/c");
-    size = pt_directorySizeWithError(at(root));
+    size = pt_directorySizeWithError(fileAt(root));
     ASSERT_FALSE(size.ok());
     EXPECT_EQ(size.error(), Error::posix(EIO));
     EXPECT_EQ(fs->calls(Op::Open) + fs->calls(Op::Openat) + fs->calls(Op::OpenBeneath),
@@ -94,15 +95,15 @@ TEST(ReadWriteAccessTest, RunsOnTheItemAndReportsFailures) {
     std::string link = dir / "link";
     ASSERT_EQ(::symlink(file.c_str(), link.c_str()), 0);
     int seen = -1;
-    EXPECT_TRUE(pt_withReadWriteAccess(at(file), [&](int fd) { return (seen = fd) >= 0; }));
+    EXPECT_TRUE(pt_withReadWriteAccess(fileAt(file), [&](int fd) { return (seen = fd) >= 0; }));
     EXPECT_GE(seen, 0);
-    EXPECT_TRUE(pt_withReadWriteAccess(at(dir.makeDir("d")), [](int) { return true; }));
+    EXPECT_TRUE(pt_withReadWriteAccess(fileAt(dir.makeDir("d")), [](int) { return true; }));
     // The body's errno survives the close.
-    EXPECT_FALSE(pt_withReadWriteAccess(at(file), [](int) { return (errno = ENOSPC) == 0; }));
+    EXPECT_FALSE(pt_withReadWriteAccess(fileAt(file), [](int) { return (errno = ENOSPC) == 0; }));
     EXPECT_EQ(errno, ENOSPC);
     bool ran = false;
     for (auto [path, error] : {std::pair{dir / "missing", ENOENT}, std::pair{link, ELOOP}}) {
-        EXPECT_FALSE(pt_withReadWriteAccess(at(path), [&](int) { return ran = true; }));
+        EXPECT_FALSE(pt_withReadWriteAccess(fileAt(path), [&](int) { return ran = true; }));
         EXPECT_EQ(errno, error) << path;
     }
     EXPECT_FALSE(ran);

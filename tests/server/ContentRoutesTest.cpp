@@ -42,24 +42,24 @@ using namespace testing;
 using nlohmann::json;
 namespace fs = std::filesystem;
 
-const auto* const ledger = ::testing::AddGlobalTestEnvironment(new TempStagingLedger);
+const auto* const contentLedger = ::testing::AddGlobalTestEnvironment(new TempStagingLedger);
 
-constexpr double kPatience = 20;  // seconds: only a hang gets near it
+constexpr double kRoutePatience = 20;  // seconds: only a hang gets near it
 constexpr const char* kIconApp = "com.example.icon";
 
-std::string readFile(const std::string& path) {
+std::string fileText(const std::string& path) {
     std::ifstream in(path, std::ios::binary);
     std::stringstream text;
     text << in.rdbuf();
     return text.str();
 }
 
-void writeFile(const std::string& path, const std::string& contents) {
+void writeText(const std::string& path, const std::string& contents) {
     std::ofstream(path, std::ios::binary) << contents;
 }
 
 // Bytes that differ at every offset in a short cycle, so a slice from the wrong place shows.
-std::string pattern(size_t size) {
+std::string patternBytes(size_t size) {
     std::string text(size, '\0');
     for (size_t i = 0; i < size; ++i) text[i] = static_cast<char>('a' + (i * 7 + i / 26) % 26);
     return text;
@@ -72,7 +72,7 @@ bool hasStagingFile(const std::string& folder) {
     return false;
 }
 
-std::vector<std::string> namesIn(const std::string& folder) {
+std::vector<std::string> namesInFolder(const std::string& folder) {
     std::vector<std::string> names;
     for (const auto& entry : fs::directory_iterator(folder))
         names.push_back(entry.path().filename().string());
@@ -81,8 +81,9 @@ std::vector<std::string> namesIn(const std::string& folder) {
 }
 
 template <class Condition>
-bool eventually(Condition condition) {
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(kPatience);
+bool becomesTrueInTime(Condition condition) {
+    auto deadline =
+        std::chrono::steady_clock::now() + std::chrono::duration<double>(kRoutePatience);
     while (!condition()) {
         if (std::chrono::steady_clock::now() > deadline)
             return false;
@@ -126,7 +127,7 @@ protected:
         port = server.bind_to_any_port("127.0.0.1");
         ASSERT_GT(port, 0);
         listener = std::thread([this] { server.listen_after_bind(); });
-        ASSERT_TRUE(eventually([this] { return server.is_running(); }));
+        ASSERT_TRUE(becomesTrueInTime([this] { return server.is_running(); }));
     }
 
     void TearDown() override {
@@ -154,7 +155,7 @@ protected:
         ASSERT_TRUE(encoder->finalize());
         std::string folder = dir / "icons/hicolor/48x48/apps";
         fs::create_directories(folder);
-        writeFile(folder + "/tamber-test-icon.png", std::string(png->begin(), png->end()));
+        writeText(folder + "/tamber-test-icon.png", std::string(png->begin(), png->end()));
         auto fields = app(kIconApp)->fields();
         fields.iconName = "tamber-test-icon";
         auto plain = app(kIconApp);
@@ -178,7 +179,7 @@ protected:
 
     httplib::Client client() {
         httplib::Client c("127.0.0.1", port);
-        c.set_read_timeout(static_cast<time_t>(kPatience), 0);
+        c.set_read_timeout(static_cast<time_t>(kRoutePatience), 0);
         return c;
     }
 
@@ -202,8 +203,8 @@ protected:
 // Downloads: the whole file and its ranges, byte-exact, labelled by type; ranges past the end
 // refused with the size; an end past the size cut to it.
 TEST_F(ContentRoutesTest, DownloadServesTheWholeFileAndSingleRanges) {
-    const std::string body = pattern(300 * 1024);  // several chunks
-    writeFile(storage + "/notes \"draft\".txt", body);
+    const std::string body = patternBytes(300 * 1024);  // several chunks
+    writeText(storage + "/notes \"draft\".txt", body);
     const std::string id = identifierOf(storage + "/notes \"draft\".txt");
     auto c = client();
 
@@ -241,11 +242,11 @@ TEST_F(ContentRoutesTest, DownloadServesTheWholeFileAndSingleRanges) {
     EXPECT_EQ(past->get_header_value("Content-Range"), "bytes */307200");
     EXPECT_TRUE(json::parse(past->body).contains("error"));
 
-    writeFile(storage + "/photo.PNG", "\x89PNG");
+    writeText(storage + "/photo.PNG", "\x89PNG");
     auto png = c.Get(contentPath(identifierOf(storage + "/photo.PNG")));
     ASSERT_TRUE(png);
     EXPECT_EQ(png->get_header_value("Content-Type"), "image/png");
-    writeFile(storage + "/empty.bin", "");
+    writeText(storage + "/empty.bin", "");
     auto empty = c.Get(contentPath(identifierOf(storage + "/empty.bin")));
     ASSERT_TRUE(empty);
     EXPECT_EQ(empty->status, 200);
@@ -289,7 +290,7 @@ TEST_F(ContentRoutesTest, DownloadRefusesFoldersUnknownItemsAndLinksOutOfTheTree
 // identifier and every extended attribute (the tags, the rank), and no staging file is left.
 TEST_F(ContentRoutesTest, SafeSaveKeepsTheIdentifierAndTheMetadata) {
     const std::string path = storage + "/report.txt";
-    writeFile(path, "first version");
+    writeText(path, "first version");
     const std::string id = identifierOf(path);
     ASSERT_TRUE(id.starts_with("did=")) << id;
     ASSERT_EQ(::setxattr(path.c_str(), "user.tamber.test", "kept", 4, 0), 0);
@@ -298,12 +299,12 @@ TEST_F(ContentRoutesTest, SafeSaveKeepsTheIdentifierAndTheMetadata) {
         EXPECT_TRUE(item.ok());
         ranked.signal();
     });
-    ASSERT_TRUE(ranked.wait(kPatience));
+    ASSERT_TRUE(ranked.wait(kRoutePatience));
     ::chmod(path.c_str(), 0640);
     struct stat before {};
     ASSERT_EQ(::stat(path.c_str(), &before), 0);
 
-    const std::string second = pattern(200 * 1024);
+    const std::string second = patternBytes(200 * 1024);
     auto c = client();
     auto saved = c.Put(contentPath(id), second, "application/octet-stream");
     ASSERT_TRUE(saved);
@@ -316,7 +317,7 @@ TEST_F(ContentRoutesTest, SafeSaveKeepsTheIdentifierAndTheMetadata) {
     ASSERT_EQ(::stat(path.c_str(), &after), 0);
     EXPECT_NE(after.st_ino, before.st_ino) << "written in place, not saved beside and renamed";
     EXPECT_EQ(after.st_mode & 07777, 0640u);
-    EXPECT_TRUE(readFile(path) == second);
+    EXPECT_TRUE(fileText(path) == second);
     char value[16] = {};
     EXPECT_EQ(::getxattr(path.c_str(), "user.tamber.test", value, sizeof value), 4);
     EXPECT_STREQ(value, "kept");
@@ -338,7 +339,7 @@ TEST_F(ContentRoutesTest, SafeSaveKeepsTheIdentifierAndTheMetadata) {
 // still resolves, and the staging file is gone. Saves over a folder or an unknown item too.
 TEST_F(ContentRoutesTest, FailedSaveLeavesTheFileAsItWas) {
     const std::string path = storage + "/keep.txt";
-    writeFile(path, "the content to keep");
+    writeText(path, "the content to keep");
     const std::string id = identifierOf(path);
     auto c = client();
 
@@ -347,7 +348,7 @@ TEST_F(ContentRoutesTest, FailedSaveLeavesTheFileAsItWas) {
     ASSERT_TRUE(failed);
     EXPECT_EQ(failed->status, 500);
     EXPECT_TRUE(json::parse(failed->body).contains("error"));
-    EXPECT_EQ(readFile(path), "the content to keep");
+    EXPECT_EQ(fileText(path), "the content to keep");
     EXPECT_FALSE(hasStagingFile(storage));
 
     fs::create_directory(storage + "/box");
@@ -358,7 +359,7 @@ TEST_F(ContentRoutesTest, FailedSaveLeavesTheFileAsItWas) {
     ASSERT_TRUE(missing);
     EXPECT_EQ(missing->status, 404);
     EXPECT_FALSE(hasStagingFile(storage));
-    EXPECT_EQ(namesIn(storage), (std::vector<std::string>{"box", "keep.txt"}));
+    EXPECT_EQ(namesInFolder(storage), (std::vector<std::string>{"box", "keep.txt"}));
 }
 
 httplib::MultipartFormData filePart(const std::string& name, const std::string& content) {
@@ -369,9 +370,9 @@ httplib::MultipartFormData filePart(const std::string& name, const std::string& 
 // lists the items in the order sent.
 TEST_F(ContentRoutesTest, UploadImportsEveryPartAndBouncesTakenNames) {
     fs::create_directory(storage + "/inbox");
-    writeFile(storage + "/inbox/a.txt", "already here");
+    writeText(storage + "/inbox/a.txt", "already here");
     const std::string folder = identifierOf(storage + "/inbox");
-    const std::string big = pattern(512 * 1024);
+    const std::string big = patternBytes(512 * 1024);
     auto c = client();
     auto answer = c.Post(
         "/api/v1/containers/" + folder + "/children",
@@ -383,9 +384,9 @@ TEST_F(ContentRoutesTest, UploadImportsEveryPartAndBouncesTakenNames) {
     EXPECT_EQ(items[0].value("filename", ""), "a 2.txt");
     EXPECT_EQ(items[1].value("filename", ""), "big.bin");
     EXPECT_EQ(items[0].value("parentIdentifier", ""), folder);
-    EXPECT_EQ(readFile(storage + "/inbox/a.txt"), "already here");
-    EXPECT_EQ(readFile(storage + "/inbox/a 2.txt"), "new a");
-    EXPECT_TRUE(readFile(storage + "/inbox/big.bin") == big);
+    EXPECT_EQ(fileText(storage + "/inbox/a.txt"), "already here");
+    EXPECT_EQ(fileText(storage + "/inbox/a 2.txt"), "new a");
+    EXPECT_TRUE(fileText(storage + "/inbox/big.bin") == big);
     EXPECT_FALSE(hasStagingFile(storage + "/inbox"));
 
     // Into an app library too; never into the root, which holds only the libraries.
@@ -412,9 +413,9 @@ TEST_F(ContentRoutesTest, UploadRefusesBadNamesAndPlacesNothing) {
                    httplib::MultipartFormDataItems{filePart("fine.txt", "ok"), filePart(bad, "x")});
         ASSERT_TRUE(answer);
         EXPECT_EQ(answer->status, 400) << bad.size() << " " << answer->body;
-        EXPECT_TRUE(namesIn(storage + "/inbox").empty()) << bad.size();
+        EXPECT_TRUE(namesInFolder(storage + "/inbox").empty()) << bad.size();
     }
-    EXPECT_EQ(namesIn(storage), (std::vector<std::string>{"inbox"}));
+    EXPECT_EQ(namesInFolder(storage), (std::vector<std::string>{"inbox"}));
 
     auto none = c.Post("/api/v1/containers/" + folder + "/children",
                        httplib::MultipartFormDataItems{filePart("", "x")});
@@ -444,12 +445,12 @@ TEST_F(ContentRoutesTest, UploadCutShortLeavesNoFile) {
         "Content-Type: multipart/form-data; boundary=cut\r\nContent-Length: 10000000\r\n\r\n"
         "--cut\r\nContent-Disposition: form-data; name=\"file\"; filename=\"half.txt\"\r\n"
         "Content-Type: text/plain\r\n\r\n";
-    const std::string half = head + pattern(256 * 1024);
+    const std::string half = head + patternBytes(256 * 1024);
     ASSERT_EQ(::send(sock, half.data(), half.size(), MSG_NOSIGNAL), ssize_t(half.size()));
-    EXPECT_TRUE(eventually([&] { return hasStagingFile(storage + "/inbox"); }))
+    EXPECT_TRUE(becomesTrueInTime([&] { return hasStagingFile(storage + "/inbox"); }))
         << "the upload never started";
     ::close(sock);
-    EXPECT_TRUE(eventually([&] { return namesIn(storage + "/inbox").empty(); }))
+    EXPECT_TRUE(becomesTrueInTime([&] { return namesInFolder(storage + "/inbox").empty(); }))
         << "left behind after the client went away";
 }
 
@@ -478,7 +479,7 @@ TEST_F(ContentRoutesTest, ThumbnailsOfAppLibrariesAndNoneForFiles) {
     EXPECT_EQ(icon->get_header_value("Content-Type"), "image/png");
     EXPECT_TRUE(icon->body.starts_with("\x89PNG\r\n\x1a\n"));
 
-    writeFile(storage + "/plain.txt", "x");
+    writeText(storage + "/plain.txt", "x");
     auto file = c.Get("/api/v1/items/" + identifierOf(storage + "/plain.txt") + "/thumbnail");
     ASSERT_TRUE(file);
     EXPECT_EQ(file->status, 404);

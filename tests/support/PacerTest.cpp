@@ -16,11 +16,11 @@
 namespace tamber {
 namespace {
 
-using Clock = std::chrono::steady_clock;
+using PacerClock = std::chrono::steady_clock;
 using namespace std::chrono_literals;
 
 constexpr double kInterval = 0.2;
-constexpr double kPatience = 10.0;
+constexpr double kPacerPatience = 10.0;
 
 template <class D>
 double seconds(D d) {
@@ -35,20 +35,20 @@ struct Runs {
             EXPECT_TRUE(queue->isCurrent());
             {
                 std::lock_guard lock(mutex);
-                starts.push_back(Clock::now());
+                starts.push_back(PacerClock::now());
             }
             started.signal();
             if (during)
                 during();
         };
     }
-    bool wait(double timeout = kPatience) { return started.wait(timeout); }
-    std::vector<Clock::time_point> all() {
+    bool wait(double timeout = kPacerPatience) { return started.wait(timeout); }
+    std::vector<PacerClock::time_point> all() {
         std::lock_guard lock(mutex);
         return starts;
     }
     std::mutex mutex;
-    std::vector<Clock::time_point> starts;
+    std::vector<PacerClock::time_point> starts;
     DispatchSemaphore started;
 };
 
@@ -60,10 +60,10 @@ TEST(PacerTest, BurstGivesOneRunAfterTheIntervalAndASignalDuringARunExactlyOneMo
     Pacer pacer("burst", queue, kInterval);
     pacer.setEventHandler(runs.handler(queue, [&] {
         if (hold.exchange(false))
-            release.wait(kPatience);
+            release.wait(kPacerPatience);
     }));
 
-    auto firstSignal = Clock::now();
+    auto firstSignal = PacerClock::now();
     for (int i = 0; i < 10; ++i) {
         pacer.signal();
         std::this_thread::sleep_for(5ms);
@@ -76,7 +76,7 @@ TEST(PacerTest, BurstGivesOneRunAfterTheIntervalAndASignalDuringARunExactlyOneMo
     hold = true;
     pacer.signal();
     ASSERT_TRUE(runs.wait());
-    auto signalledDuringRun = Clock::now();
+    auto signalledDuringRun = PacerClock::now();
     for (int i = 0; i < 3; ++i) pacer.signal();
     release.signal();
     ASSERT_TRUE(runs.wait()) << "the signal during the run was lost";
@@ -95,12 +95,12 @@ TEST(PacerTest, SteadySignalsFromManyThreadsRunAtMostOncePerIntervalAndLoseNone)
     pacer.setEventHandler(runs.handler(queue));
 
     std::atomic<bool> stop{false};
-    std::vector<Clock::time_point> lastSignal(3);
+    std::vector<PacerClock::time_point> lastSignal(3);
     std::vector<std::thread> signallers;
     for (size_t t = 0; t < lastSignal.size(); ++t) {
         signallers.emplace_back([&, t] {
             while (!stop) {
-                lastSignal[t] = Clock::now();  // taken before the signal it stands for
+                lastSignal[t] = PacerClock::now();  // taken before the signal it stands for
                 pacer.signal();
                 std::this_thread::sleep_for(1ms);
             }
@@ -109,13 +109,13 @@ TEST(PacerTest, SteadySignalsFromManyThreadsRunAtMostOncePerIntervalAndLoseNone)
     std::this_thread::sleep_for(1s);
     stop = true;
     for (auto& s : signallers) s.join();
-    auto stormEnd = Clock::now();
+    auto stormEnd = PacerClock::now();
     auto last = *std::max_element(lastSignal.begin(), lastSignal.end());
 
     // Wait for the run that serves the last signal.
-    auto deadline = Clock::now() + std::chrono::duration<double>(kPatience);
+    auto deadline = PacerClock::now() + std::chrono::duration<double>(kPacerPatience);
     while ((runs.all().empty() || runs.all().back() <= last) &&
-           runs.wait(std::max(0.0, seconds(deadline - Clock::now())))) {
+           runs.wait(std::max(0.0, seconds(deadline - PacerClock::now())))) {
     }
     auto starts = runs.all();
     ASSERT_FALSE(starts.empty());

@@ -17,7 +17,7 @@ namespace {
 
 using testing::liveThreadCount;
 
-constexpr double kPatience = 20;  // seconds: only a hang gets near it
+constexpr double kPoolPatience = 20;  // seconds: only a hang gets near it
 
 // Leaves the pool and the timer without threads, whatever earlier tests left running.
 void settle() {
@@ -42,16 +42,16 @@ TEST(WorkerPoolTest, TasksBeyondTheBoundWaitForAFreeWorkerAndAllRun) {
             }
             if (++started == WorkerPool::kMaxThreads)
                 allStarted.signal();
-            gate.wait(kPatience);
+            gate.wait(kPoolPatience);
             if (++done == tasks)
                 allDone.signal();
         });
     }
-    ASSERT_TRUE(allStarted.wait(kPatience));
+    ASSERT_TRUE(allStarted.wait(kPoolPatience));
     EXPECT_EQ(started.load(), WorkerPool::kMaxThreads);  // the rest are queued, not running
     EXPECT_LE(pool.threadCount(), WorkerPool::kMaxThreads);
     for (size_t i = 0; i < tasks; ++i) gate.signal();
-    ASSERT_TRUE(allDone.wait(kPatience));
+    ASSERT_TRUE(allDone.wait(kPoolPatience));
     EXPECT_EQ(started.load(), tasks);
     EXPECT_LE(mostAlive.load(), WorkerPool::kMaxThreads);
     settle();
@@ -78,7 +78,7 @@ TEST(WorkerPoolTest, ShutdownDrainsChainedTasksJoinsEveryWorkerAndThePoolServesA
 
     DispatchSemaphore again;
     pool.submit([&] { again.signal(); });
-    EXPECT_TRUE(again.wait(kPatience));
+    EXPECT_TRUE(again.wait(kPoolPatience));
     pool.shutdown();
     EXPECT_LE(liveThreadCount(), before + testing::kSanitizerThreads);
 }
@@ -112,7 +112,7 @@ TEST(DispatchTimerTest, ShutdownDropsPendingWorkReleasesItsCapturesAndTheTimerSt
 
     DispatchSemaphore soon;
     DispatchTimer::shared().schedule(DispatchTimer::deadlineAfter(0.01), [&] { soon.signal(); });
-    EXPECT_TRUE(soon.wait(kPatience));
+    EXPECT_TRUE(soon.wait(kPoolPatience));
     DispatchTimer::shared().shutdown();
     EXPECT_LE(liveThreadCount(), before + testing::kSanitizerThreads);
 }

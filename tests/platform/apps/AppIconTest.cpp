@@ -18,13 +18,13 @@ namespace {
 using testing::TempDir;
 
 // Sets (or unsets, with nullopt) an environment variable for a scope.
-struct ScopedEnv {
-    ScopedEnv(const char* name, std::optional<std::string> value) : name(name) {
+struct ScopedIconEnv {
+    ScopedIconEnv(const char* name, std::optional<std::string> value) : name(name) {
         if (const char* old = std::getenv(name))
             previous = old;
         set(value);
     }
-    ~ScopedEnv() { set(previous); }
+    ~ScopedIconEnv() { set(previous); }
     void set(const std::optional<std::string>& v) {
         v ? ::setenv(name, v->c_str(), 1) : ::unsetenv(name);
     }
@@ -53,8 +53,8 @@ protected:
     }
 
     TempDir dir_;
-    ScopedEnv home_;
-    ScopedEnv dirs_;
+    ScopedIconEnv home_;
+    ScopedIconEnv dirs_;
 };
 
 TEST_F(AppIconTest, PicksTheNearestSizeWithUserIconsFirst) {
@@ -102,8 +102,8 @@ TEST_F(AppIconTest, AbsolutePathsAreReadAndBadNamesFindNothing) {
 
 TEST_F(AppIconTest, DefaultsToTheHomeFolderAndReportsUnreadableIconsAsNone) {
     icon("home/.local/share", "48x48", "app.png");
-    ScopedEnv unset("XDG_DATA_HOME", std::nullopt);
-    ScopedEnv home("HOME", dir_ / "home");
+    ScopedIconEnv unset("XDG_DATA_HOME", std::nullopt);
+    ScopedIconEnv home("HOME", dir_ / "home");
     EXPECT_EQ(IconTheme::hicolorFolders().front(), dir_ / "home/.local/share/icons/hicolor");
     EXPECT_EQ(text(appWithIcon("app")->iconDataForVariant(1)), "home/.local/share:48x48");
 

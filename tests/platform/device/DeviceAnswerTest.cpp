@@ -12,13 +12,13 @@ namespace tamber {
 namespace {
 
 // Sets (or unsets, with nullopt) an environment variable for a scope.
-struct ScopedEnv {
-    ScopedEnv(const char* name, std::optional<std::string> value) : name(name) {
+struct ScopedDeviceEnv {
+    ScopedDeviceEnv(const char* name, std::optional<std::string> value) : name(name) {
         if (const char* old = std::getenv(name))
             previous = old;
         set(value);
     }
-    ~ScopedEnv() { set(previous); }
+    ~ScopedDeviceEnv() { set(previous); }
     void set(const std::optional<std::string>& v) {
         v ? ::setenv(name, v->c_str(), 1) : ::unsetenv(name);
     }
@@ -53,8 +53,8 @@ TEST(DeviceClassTest, TabletsAndHandsetsComeFromTheChassis) {
 }
 
 TEST(ScreenScaleTest, ReadsTheSessionScaleAndIgnoresNonsense) {
-    ScopedEnv gdk("GDK_SCALE", std::nullopt);
-    ScopedEnv qt("QT_SCALE_FACTOR", std::nullopt);
+    ScopedDeviceEnv gdk("GDK_SCALE", std::nullopt);
+    ScopedDeviceEnv qt("QT_SCALE_FACTOR", std::nullopt);
     EXPECT_EQ(ScreenScaleFromEnvironment(), 1.0f);
     qt.set("1.5");
     EXPECT_EQ(ScreenScaleFromEnvironment(), 1.5f);
@@ -67,7 +67,7 @@ TEST(ScreenScaleTest, ReadsTheSessionScaleAndIgnoresNonsense) {
 }
 
 TEST(CopyDeviceAnswerTest, AnswersNumbersAndHonoursOverrides) {
-    ScopedEnv gdk("GDK_SCALE", "3");
+    ScopedDeviceEnv gdk("GDK_SCALE", "3");
     auto scale = objectCast<Number>(CopyDeviceAnswer(DeviceAnswerKeys::kMainScreenScale));
     ASSERT_TRUE(scale);
     EXPECT_EQ(scale->doubleValue(), 3.0);

@@ -34,10 +34,10 @@ namespace {
 
 namespace fs = std::filesystem;
 
-const std::string kTags = "com.velk.metadata:_kHostItemUserTags";
-const std::string kRank = "com.velk.favorite-rank.number#PS";
+const std::string kTagsAttribute = "com.velk.metadata:_kHostItemUserTags";
+const std::string kRankAttribute = "com.velk.favorite-rank.number#PS";
 
-uint64_t inodeOf(const std::string& path) {
+uint64_t documentInodeOf(const std::string& path) {
     struct statx st {};
     EXPECT_EQ(FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, STATX_INO, &st), 0)
         << path;
@@ -191,9 +191,9 @@ protected:
         service_->sync();
         for (auto& doc : docs) {
             doc.id = documentIdOf(doc.path);
-            doc.inode = inodeOf(doc.path);
+            doc.inode = documentInodeOf(doc.path);
             EXPECT_NE(doc.id, 0u);
-            setAttribute(doc.path, kTags, doc.tags);
+            setAttribute(doc.path, kTagsAttribute, doc.tags);
         }
         return docs;
     }
@@ -220,10 +220,10 @@ protected:
     void expectKept(const std::vector<Document>& docs, uint64_t since) {
         auto events = documentIdEvents(since);
         for (const auto& doc : docs) {
-            uint64_t now = inodeOf(doc.path);
+            uint64_t now = documentInodeOf(doc.path);
             EXPECT_EQ(strata_->documentIdForInode(device_, now), doc.id) << doc.path;
             EXPECT_EQ(strata_->resolveDocumentId(device_, doc.id), now) << doc.path;
-            EXPECT_EQ(attribute(doc.path, kTags), doc.tags) << doc.path;
+            EXPECT_EQ(attribute(doc.path, kTagsAttribute), doc.tags) << doc.path;
             // The moves of this ID chain from the inode it had to the one it has.
             std::string prefix = JournalWriter::documentIdPath(device_, doc.id, 0, 0);
             prefix.resize(prefix.find("src="));
@@ -282,7 +282,7 @@ TEST_F(DocumentIdentityTest, RoundsOfSafeSavesWhileWatchedKeepEveryIdAndItsTags)
     }
     expectKept(docs, since);
     // And across a restart that has nothing new to see.
-    for (auto& doc : docs) doc.inode = inodeOf(doc.path);
+    for (auto& doc : docs) doc.inode = documentInodeOf(doc.path);
     stop();
     ASSERT_NO_FATAL_FAILURE(start());
     expectKept(docs, service_->currentEventId());
@@ -298,9 +298,9 @@ TEST_F(DocumentIdentityTest, AnInodeNumberGivenToAnotherDocumentsNewFileIsThatFi
     stop();
     safeSave(docs[0].path, "new a");
     safeSave(docs[1].path, "new b");
-    renumbering->renumber(inodeOf(docs[0].path), docs[1].inode);
-    renumbering->renumber(inodeOf(docs[1].path), docs[0].inode);
-    ASSERT_EQ(inodeOf(docs[0].path), docs[1].inode);
+    renumbering->renumber(documentInodeOf(docs[0].path), docs[1].inode);
+    renumbering->renumber(documentInodeOf(docs[1].path), docs[0].inode);
+    ASSERT_EQ(documentInodeOf(docs[0].path), docs[1].inode);
 
     ASSERT_NO_FATAL_FAILURE(start());
     EXPECT_EQ(strata_->documentIdForInode(device_, docs[1].inode), docs[0].id);
@@ -310,8 +310,8 @@ TEST_F(DocumentIdentityTest, AnInodeNumberGivenToAnotherDocumentsNewFileIsThatFi
         << joined(events);
     EXPECT_TRUE(contains(events, eventPath(docs[1].id, docs[1].inode, docs[0].inode)))
         << joined(events);
-    EXPECT_EQ(attribute(docs[0].path, kTags), docs[0].tags);
-    EXPECT_EQ(attribute(docs[1].path, kTags), docs[1].tags);
+    EXPECT_EQ(attribute(docs[0].path, kTagsAttribute), docs[0].tags);
+    EXPECT_EQ(attribute(docs[1].path, kTagsAttribute), docs[1].tags);
 }
 
 // A batch is applied after the fact: when a file was saved twice, the second new file may have
@@ -330,19 +330,19 @@ TEST(DocumentIdentityWriterTest, ABatchThatFindsTheOldInodeNumberBornAgainIsASaf
     JournalWriter writer(store, 7);
     ASSERT_TRUE(store.addRoot(tree, 0).ok());
     ASSERT_TRUE(writer.reconcile(tree, false).ok());
-    uint64_t inode = inodeOf(path);
+    uint64_t inode = documentInodeOf(path);
     uint32_t docID = store.allocateDocumentId(inode).value();
     Bytes tags{'t', 'a', 'g', 's', 0, 1};
-    ASSERT_TRUE(store.setDocumentAttribute(docID, kTags, tags).ok());
+    ASSERT_TRUE(store.setDocumentAttribute(docID, kTagsAttribute, tags).ok());
 
     safeSave(path, "v1");
-    renumbering->renumber(inodeOf(path), inode);
-    ASSERT_EQ(inodeOf(path), inode);
+    renumbering->renumber(documentInodeOf(path), inode);
+    ASSERT_EQ(documentInodeOf(path), inode);
     auto events = writer.apply({{FileChange::Kind::Created, path + ".saving", {}, false, 0},
                                 {FileChange::Kind::Renamed, path, path + ".saving", false, 0}});
     ASSERT_TRUE(events.ok());
     EXPECT_EQ(store.documentIdForInode(inode).value(), docID);
-    EXPECT_EQ(attribute(path, kTags), std::string(tags.begin(), tags.end()));
+    EXPECT_EQ(attribute(path, kTagsAttribute), std::string(tags.begin(), tags.end()));
     bool journaled = false;
     for (const auto& event : events.value())
         journaled |= event.path == JournalWriter::documentIdPath(7, docID, inode, inode);
@@ -350,7 +350,8 @@ TEST(DocumentIdentityWriterTest, ABatchThatFindsTheOldInodeNumberBornAgainIsASaf
     // The index now knows the new file: an event on it changes nothing more.
     EXPECT_TRUE(writer.apply({{FileChange::Kind::Modified, path, {}, false, 0}}).ok());
     EXPECT_EQ(store.documentIdForInode(inode).value(), docID);
-    EXPECT_EQ(store.documentAttributes(docID).value(), (TremorStore::Attributes{{kTags, tags}}));
+    EXPECT_EQ(store.documentAttributes(docID).value(),
+              (TremorStore::Attributes{{kTagsAttribute, tags}}));
 }
 
 TEST_F(DocumentIdentityTest, AKnownFileMovedOntoADocumentIsAMoveNotASave) {
@@ -358,7 +359,7 @@ TEST_F(DocumentIdentityTest, AKnownFileMovedOntoADocumentIsAMoveNotASave) {
     auto docs = makeDocuments(4);  // 0 and 2 are replaced by moves, 1 and 3 move
     std::string known = root_.writeFile("tree/known.txt", "k");
     service_->sync();
-    uint64_t knownInode = inodeOf(known);
+    uint64_t knownInode = documentInodeOf(known);
     uint64_t since = service_->currentEventId();
 
     // Live: a document moved onto another one keeps its own ID, and the other's tags stay away.
@@ -366,7 +367,7 @@ TEST_F(DocumentIdentityTest, AKnownFileMovedOntoADocumentIsAMoveNotASave) {
     service_->sync();
     EXPECT_EQ(strata_->documentIdForInode(device_, docs[1].inode), docs[1].id);
     EXPECT_EQ(strata_->resolveDocumentId(device_, docs[0].id), 0u);
-    EXPECT_EQ(attribute(docs[0].path, kTags), docs[1].tags);
+    EXPECT_EQ(attribute(docs[0].path, kTagsAttribute), docs[1].tags);
 
     // While stopped: the same, and a known file without an ID does not take one either.
     stop();
@@ -375,9 +376,9 @@ TEST_F(DocumentIdentityTest, AKnownFileMovedOntoADocumentIsAMoveNotASave) {
     ASSERT_NO_FATAL_FAILURE(start());
     EXPECT_EQ(strata_->documentIdForInode(device_, docs[3].inode), docs[3].id);
     EXPECT_EQ(strata_->resolveDocumentId(device_, docs[2].id), 0u);
-    EXPECT_EQ(attribute(docs[2].path, kTags), docs[3].tags);
+    EXPECT_EQ(attribute(docs[2].path, kTagsAttribute), docs[3].tags);
     EXPECT_EQ(strata_->documentIdForInode(device_, knownInode), 0u);
-    EXPECT_EQ(attribute(docs[1].path, kTags), std::nullopt);
+    EXPECT_EQ(attribute(docs[1].path, kTagsAttribute), std::nullopt);
     auto events = documentIdEvents(since);
     for (const auto& doc : {docs[0], docs[2]})
         EXPECT_TRUE(contains(events, eventPath(doc.id, doc.inode, 0))) << joined(events);
@@ -398,37 +399,37 @@ TEST_F(DocumentIdentityTest, AttributeEventsOfDocumentsUpdateTheCopyAndOthersCos
     for (int i = 0; i < 30; ++i)
         plain.push_back(root_.writeFile("tree/plain" + std::to_string(i), "p"));
     service_->sync();
-    for (const auto& file : plain) setAttributeBehindTheBack(file, kRank, "9");
+    for (const auto& file : plain) setAttributeBehindTheBack(file, kRankAttribute, "9");
     service_->sync();
     EXPECT_EQ(counting->calls(FaultInjectingFileSystem::Operation::Llistxattr), 0u);
     EXPECT_EQ(counting->calls(FaultInjectingFileSystem::Operation::Lgetxattr), 0u);
 
     // Set by another program on the document: the copy learns it from the event.
-    setAttributeBehindTheBack(path, kRank, "rank 3");
+    setAttributeBehindTheBack(path, kRankAttribute, "rank 3");
     service_->sync();
     safeSave(path, "v1");
     service_->sync();
-    EXPECT_EQ(attribute(path, kRank), "rank 3");
-    EXPECT_EQ(attribute(path, kTags), docs[0].tags);
+    EXPECT_EQ(attribute(path, kRankAttribute), "rank 3");
+    EXPECT_EQ(attribute(path, kTagsAttribute), docs[0].tags);
 
     // Removed on the same file: the user's removal stands after the next save.
-    setAttributeBehindTheBack(path, kRank, std::nullopt);
+    setAttributeBehindTheBack(path, kRankAttribute, std::nullopt);
     service_->sync();
     safeSave(path, "v2");
     service_->sync();
-    EXPECT_EQ(attribute(path, kRank), std::nullopt);
-    EXPECT_EQ(attribute(path, kTags), docs[0].tags);
+    EXPECT_EQ(attribute(path, kRankAttribute), std::nullopt);
+    EXPECT_EQ(attribute(path, kTagsAttribute), docs[0].tags);
 
     // A new file that comes with a value of its own keeps it, and the copy takes it.
     writeText(path + ".saving", "v3");
-    setAttributeBehindTheBack(path + ".saving", kTags, "the editor's tags");
+    setAttributeBehindTheBack(path + ".saving", kTagsAttribute, "the editor's tags");
     fs::rename(path + ".saving", path);
     service_->sync();
-    EXPECT_EQ(attribute(path, kTags), "the editor's tags");
+    EXPECT_EQ(attribute(path, kTagsAttribute), "the editor's tags");
     safeSave(path, "v4");
     service_->sync();
-    EXPECT_EQ(attribute(path, kTags), "the editor's tags");
-    EXPECT_EQ(strata_->documentIdForInode(device_, inodeOf(path)), docs[0].id);
+    EXPECT_EQ(attribute(path, kTagsAttribute), "the editor's tags");
+    EXPECT_EQ(strata_->documentIdForInode(device_, documentInodeOf(path)), docs[0].id);
 }
 
 // Metadata the file had before it became a document follows it too; a write through Tamber to
@@ -437,7 +438,7 @@ TEST_F(DocumentIdentityTest, AnIdGivenToATaggedFileKeepsItsTags) {
     ASSERT_NO_FATAL_FAILURE(start());
     std::string path = root_.writeFile("tree/tagged.txt", "t");
     service_->sync();
-    setAttribute(path, kTags, "before");  // no ID yet: nothing kept
+    setAttribute(path, kTagsAttribute, "before");  // no ID yet: nothing kept
     setAttributeBehindTheBack(path, "com.example.other", "not ours");
     uint32_t docID = documentIdOf(path);
     ASSERT_NE(docID, 0u);
@@ -445,7 +446,7 @@ TEST_F(DocumentIdentityTest, AnIdGivenToATaggedFileKeepsItsTags) {
     safeSave(path, "v1");
     ASSERT_NO_FATAL_FAILURE(start());
     EXPECT_EQ(documentIdOf(path), docID);
-    EXPECT_EQ(attribute(path, kTags), "before");
+    EXPECT_EQ(attribute(path, kTagsAttribute), "before");
     EXPECT_EQ(attribute(path, "com.example.other"), std::nullopt);
 }
 

@@ -29,7 +29,7 @@ struct statx statPath(const std::string& path) {
         << path;
     return st;
 }
-uint64_t inodeOf(const std::string& path) {
+uint64_t rootInodeOf(const std::string& path) {
     return statPath(path).stx_ino;
 }
 
@@ -69,7 +69,7 @@ protected:
     }
     bool resolves(const std::string& path) {
         std::string found;
-        return strata_->pathForFileId(device_, inodeOf(path), found) && found == path;
+        return strata_->pathForFileId(device_, rootInodeOf(path), found) && found == path;
     }
 
     testing::TempDir state_;
@@ -160,7 +160,7 @@ TEST_F(TremorServiceRootsTest, AForgottenTreeNoLongerAnswersNorJournalsAndIsForg
     EXPECT_FALSE(resolves(file));
     errno = 0;
     EXPECT_EQ(strata_->resolveDocumentId(device_, docID), 0u);
-    EXPECT_EQ(strata_->documentIdForInode(device_, inodeOf(file)), 0u);
+    EXPECT_EQ(strata_->documentIdForInode(device_, rootInodeOf(file)), 0u);
     uint64_t last = service_->currentEventId();
     root_.writeFile("other/after.txt", "y");
     EXPECT_EQ(service_->currentEventId(), last) << "a forgotten tree is still journaled";

@@ -26,10 +26,11 @@ namespace {
 
 using Paths = std::vector<std::string>;
 using Ids = std::vector<uint64_t>;
-constexpr uint64_t kFsid = 0x1234abcd;
+constexpr uint64_t kStoreFsid = 0x1234abcd;
 const std::string kVolumeDir = "000000001234abcd";
 
-std::unique_ptr<TremorStore> openStore(const std::string& stateDir, uint64_t fsid = kFsid) {
+std::unique_ptr<TremorStore> openTestStore(const std::string& stateDir,
+                                           uint64_t fsid = kStoreFsid) {
     auto store = TremorStore::open(stateDir, fsid);
     EXPECT_TRUE(store.ok()) << (store.ok() ? "" : store.error().description());
     return store.ok() ? std::move(store).value() : nullptr;
@@ -50,7 +51,7 @@ size_t errorLinesMentioning(const CaptureLogSink& sink, const std::string& text)
     return n;
 }
 
-void runSql(const std::string& database, const std::string& sql) {
+void runStoreSql(const std::string& database, const std::string& sql) {
     auto db = SqliteDatabase::open(database, SQLITE_OPEN_READWRITE);
     ASSERT_TRUE(db.ok());
     ASSERT_TRUE(db.value()->exec(sql).ok());
@@ -76,7 +77,7 @@ protected:
     void SetUp() override { reopen(); }
     void reopen() {
         store_.reset();
-        store_ = openStore(state_.path());
+        store_ = openTestStore(state_.path());
         ASSERT_TRUE(store_);
     }
     std::string database() const { return state_ / (kVolumeDir + "/journal.sqlite"); }
@@ -122,7 +123,7 @@ TEST_F(TremorStoreTest, AStoreKeepsItsUuidAndStateAndHasOneUserAtATime) {
     append({"/watched/x"});
     {
         testing::ScopedLogCapture log;
-        auto second = TremorStore::open(state_.path(), kFsid);
+        auto second = TremorStore::open(state_.path(), kStoreFsid);
         ASSERT_FALSE(second.ok());
         EXPECT_EQ(second.error().userInfo().at("description"),
                   "the state directory " + (state_ / kVolumeDir) + " is held by Tamber process " +
@@ -139,7 +140,7 @@ TEST_F(TremorStoreTest, AStoreKeepsItsUuidAndStateAndHasOneUserAtATime) {
     EXPECT_EQ(roots[0].path, "/watched");
     EXPECT_EQ(roots[0].inode, 42u);
 
-    auto other = openStore(state_.path(), 7);  // another volume is another store
+    auto other = openTestStore(state_.path(), 7);  // another volume is another store
     ASSERT_TRUE(other);
     EXPECT_NE(other->uuid(), uuid);
     EXPECT_EQ(other->directory(), state_ / "0000000000000007");
@@ -160,7 +161,7 @@ TEST_F(TremorStoreTest, AHeldStoreIsWaitedForWithOneNoticeNamingItsHolder) {
                                                 where = dir;
                                                 told.set_value();
                                             }};
-        auto second = TremorStore::open(state_.path(), kFsid, wait);
+        auto second = TremorStore::open(state_.path(), kStoreFsid, wait);
         if (second.ok())
             openedUuid = second.value()->uuid();
     });
@@ -196,21 +197,23 @@ TEST(TremorStoreOpenTest, UnusableDatabasesAreMovedAsideAndReplacedWithANewUuid)
              overwrite(db, (page - 1) * pageSize, static_cast<size_t>(pageSize));
          }},
         {"wrong schema version",
-         [](const std::string& db) { runSql(db, "PRAGMA user_version = 9"); }},
-        {"missing meta row", [](const std::string& db) { runSql(db, "DELETE FROM meta"); }},
+         [](const std::string& db) { runStoreSql(db, "PRAGMA user_version = 9"); }},
+        {"missing meta row", [](const std::string& db) { runStoreSql(db, "DELETE FROM meta"); }},
         {"event counter behind the rows",
-         [](const std::string& db) { runSql(db, "UPDATE meta SET next_event_id = 5"); }},
+         [](const std::string& db) { runStoreSql(db, "UPDATE meta SET next_event_id = 5"); }},
         {"document counter behind the rows",
-         [](const std::string& db) { runSql(db, "UPDATE meta SET next_document_id = 1"); }},
+         [](const std::string& db) { runStoreSql(db, "UPDATE meta SET next_document_id = 1"); }},
         {"tables without a version",
-         [](const std::string& db) { runSql(db, "DROP TABLE meta; PRAGMA user_version = 0"); }},
+         [](const std::string& db) {
+             runStoreSql(db, "DROP TABLE meta; PRAGMA user_version = 0");
+         }},
     };
     for (const auto& [what, damage] : damages) {
         SCOPED_TRACE(what);
         testing::TempDir state;
         std::string oldUuid;
         {
-            auto store = openStore(state.path());
+            auto store = openTestStore(state.path());
             ASSERT_TRUE(store);
             oldUuid = store->uuid();
             std::vector<JournalEvent> events;
@@ -225,7 +228,7 @@ TEST(TremorStoreOpenTest, UnusableDatabasesAreMovedAsideAndReplacedWithANewUuid)
         damage(database);
 
         testing::ScopedLogCapture log;
-        auto store = openStore(state.path());
+        auto store = openTestStore(state.path());
         ASSERT_TRUE(store);
         EXPECT_NE(store->uuid(), oldUuid);
         EXPECT_TRUE(isRandomUuid(store->uuid()));
@@ -245,7 +248,7 @@ TEST_F(TremorStoreTest, StateThatCannotBeCreatedOrWrittenIsAnErrorValue) {
     store_.reset();
     testing::ScopedLogCapture log;
     std::string plain = state_.writeFile("plain-file", "x");
-    auto store = TremorStore::open(plain + "/state", kFsid);
+    auto store = TremorStore::open(plain + "/state", kStoreFsid);
     ASSERT_FALSE(store.ok());
     EXPECT_NE(store.error().description().find(plain + "/state"), std::string::npos)
         << store.error().description();
@@ -255,7 +258,7 @@ TEST_F(TremorStoreTest, StateThatCannotBeCreatedOrWrittenIsAnErrorValue) {
     auto faulty = std::make_shared<FaultInjectingFileSystem>(FileSystem::currentShared());
     testing::ScopedFileSystem scoped(faulty);
     faulty->inject(FaultInjectingFileSystem::Operation::Faccessat, EACCES, 1, kVolumeDir);
-    auto unwritable = TremorStore::open(state_.path(), kFsid);
+    auto unwritable = TremorStore::open(state_.path(), kStoreFsid);
     ASSERT_FALSE(unwritable.ok());
     EXPECT_EQ(unwritable.error().code(), EACCES);
     EXPECT_EQ(errorLinesMentioning(log.sink(), (state_ / kVolumeDir) + " is not writable"), 1u);
@@ -263,9 +266,9 @@ TEST_F(TremorStoreTest, StateThatCannotBeCreatedOrWrittenIsAnErrorValue) {
     // A bad journal that cannot be moved aside stays where it is, and the open fails.
     overwrite(database(), 0, 8192);
     faulty->inject(FaultInjectingFileSystem::Operation::Renameat2, EACCES, 1);
-    EXPECT_FALSE(TremorStore::open(state_.path(), kFsid).ok());
+    EXPECT_FALSE(TremorStore::open(state_.path(), kStoreFsid).ok());
     EXPECT_TRUE(std::filesystem::exists(database()));
-    EXPECT_TRUE(openStore(state_.path()));  // once it can be, it is
+    EXPECT_TRUE(openTestStore(state_.path()));  // once it can be, it is
 }
 
 TEST_F(TremorStoreTest, EventIdsAreConsecutiveAndNeverReusedAcrossReopenAndTrim) {
@@ -414,9 +417,10 @@ TEST_F(TremorStoreTest, ADamagedIndexNeverNamesAPathOutsideItsRoot) {
 
     // Should a bad name reach the file anyway, it still never resolves.
     store_.reset();
-    runSql(database(),
-           "INSERT INTO inodes(inode, parent, name, kind) VALUES(7, 1, '..', 2), (8, 7, 'etc', 2),"
-           "(9, 1, 'fine', 2)");
+    runStoreSql(
+        database(),
+        "INSERT INTO inodes(inode, parent, name, kind) VALUES(7, 1, '..', 2), (8, 7, 'etc', 2),"
+        "(9, 1, 'fine', 2)");
     reopen();
     EXPECT_EQ(store_->pathForInode(9).value(), std::nullopt) << "a root nobody watches in this run";
     ASSERT_TRUE(store_->resumeRoot("/r"));
@@ -450,13 +454,13 @@ TEST_F(TremorStoreTest, DocumentIdsMoveToOneInodeAtATimeAndAreNeverReused) {
 
 using Kind = FileChange::Kind;
 
-uint64_t inodeOf(const std::string& path) {
+uint64_t storeInodeOf(const std::string& path) {
     struct stat st {};
     EXPECT_EQ(::stat(path.c_str(), &st), 0) << path;
     return st.st_ino;
 }
-FileChange change(FileChange::Kind kind, std::string path, bool isDirectory = false,
-                  std::string fromPath = {}) {
+FileChange storeChange(FileChange::Kind kind, std::string path, bool isDirectory = false,
+                       std::string fromPath = {}) {
     return {kind, std::move(path), std::move(fromPath), isDirectory, 0};
 }
 
@@ -497,18 +501,18 @@ TEST_F(JournalWriterTest, PastTheLastEventIdNothingIsJournaledNorIndexed) {
     }
     ASSERT_NO_FATAL_FAILURE(open());
     std::string last = root_.writeFile("tree/last", "x");
-    auto events = writer_->apply({change(Kind::Created, last)});
+    auto events = writer_->apply({storeChange(Kind::Created, last)});
     ASSERT_TRUE(events.ok());
     EXPECT_EQ(events.value().at(0).id, TremorStore::kLastEventId);
 
     testing::ScopedLogCapture log;
     std::string refused = root_.writeFile("tree/refused", "x");
-    auto failed = writer_->apply({change(Kind::Created, refused)});
+    auto failed = writer_->apply({storeChange(Kind::Created, refused)});
     ASSERT_FALSE(failed.ok());
     EXPECT_EQ(failed.error().code(), EOVERFLOW);
-    EXPECT_EQ(store_->inode(inodeOf(refused)).value(),
+    EXPECT_EQ(store_->inode(storeInodeOf(refused)).value(),
               std::nullopt);  // the index went with the rows
-    EXPECT_TRUE(store_->inode(inodeOf(last)).value());
+    EXPECT_TRUE(store_->inode(storeInodeOf(last)).value());
     size_t errors = 0;
     for (const auto& line : log.sink().lines())
         errors +=
@@ -516,7 +520,7 @@ TEST_F(JournalWriterTest, PastTheLastEventIdNothingIsJournaledNorIndexed) {
     EXPECT_EQ(errors, 1u);
     ASSERT_NO_FATAL_FAILURE(open());  // and the store still opens, with nothing repeated
     EXPECT_EQ(store_->lastEventId(), TremorStore::kLastEventId);
-    EXPECT_FALSE(writer_->apply({change(Kind::Created, refused)}).ok());
+    EXPECT_FALSE(writer_->apply({storeChange(Kind::Created, refused)}).ok());
 }
 
 }  // namespace
