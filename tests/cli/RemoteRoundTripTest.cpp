@@ -25,7 +25,7 @@ using nlohmann::json;
 using testing::CliRun;
 using testing::RecordingApiServer;
 
-constexpr const char* kToken = "t0ken-for-tests";
+constexpr const char* kRoundTripToken = "t0ken-for-tests";
 
 // Items made and described by direct runs, then the same verbs answered by a server that sends
 // back exactly what the direct runs printed as JSON: the verbs must print the same bytes and
@@ -54,7 +54,7 @@ protected:
 
     // From here on the verbs find `server` as the live server of the storage.
     void serveFrom(const RecordingApiServer& server) {
-        RunFileRecord record{::getpid(), server.port(), kToken, storage};
+        RunFileRecord record{::getpid(), server.port(), kRoundTripToken, storage};
         ASSERT_TRUE(RunFile::write(RunFile::defaultLocation(), record).ok());
     }
 
@@ -118,7 +118,7 @@ TEST_F(RemoteRoundTripTest, ItemsAndListingsPrintTheSameBytesThroughTheServer) {
     auto requests = server.requests();
     ASSERT_EQ(requests.size(), 2 * ids.size() + 2);
     for (const auto& request : requests)
-        EXPECT_EQ(request.authorization, std::string("Bearer ") + kToken);
+        EXPECT_EQ(request.authorization, std::string("Bearer ") + kRoundTripToken);
 }
 
 TEST_F(RemoteRoundTripTest, ErrorsKeepTheirExitStatusAndMessageThroughTheServer) {
