@@ -32,14 +32,14 @@ ByteRange ByteRange::parse(std::string_view header, uint64_t size) {
     constexpr std::string_view kUnit = "bytes=";
     if (!header.starts_with(kUnit))
         return {};  // a unit we do not know: the header is ignored
-    std::string_view spec = trimmed(header.substr(kUnit.size()));
-    if (spec.find(',') != std::string_view::npos)
+    std::string_view rangeText = trimmed(header.substr(kUnit.size()));
+    if (rangeText.find(',') != std::string_view::npos)
         return {};  // several ranges: served whole rather than as a multipart body
-    size_t dash = spec.find('-');
+    size_t dash = rangeText.find('-');
     if (dash == std::string_view::npos)
         return {Outcome::Malformed};
-    std::string_view from = trimmed(spec.substr(0, dash));
-    std::string_view to = trimmed(spec.substr(dash + 1));
+    std::string_view from = trimmed(rangeText.substr(0, dash));
+    std::string_view to = trimmed(rangeText.substr(dash + 1));
     if (from.empty()) {
         auto suffix = number(to);
         if (!suffix)
