@@ -1,8 +1,8 @@
 #include "cli/PurgeTrashCommand.h"
+#include "runtime/Duration.h"
 
 #include "cli/RemotePorter.h"
 
-#include <charconv>
 #include <ostream>
 
 #include "platform/objects/Date.h"
@@ -10,34 +10,6 @@
 #include "runtime/ProviderCalls.h"
 
 namespace tamber {
-
-std::optional<double> PurgeTrashCommand::parseDuration(const std::string& text) {
-    if (text.size() < 2)
-        return std::nullopt;
-    double unit = 0;
-    switch (text.back()) {
-        case 's':
-            unit = 1;
-            break;
-        case 'm':
-            unit = 60;
-            break;
-        case 'h':
-            unit = 3600;
-            break;
-        case 'd':
-            unit = 86400;
-            break;
-        default:
-            return std::nullopt;
-    }
-    uint64_t amount = 0;
-    const char* end = text.data() + text.size() - 1;
-    auto [stop, ec] = std::from_chars(text.data(), end, amount);
-    if (ec != std::errc() || stop != end)
-        return std::nullopt;
-    return static_cast<double>(amount) * unit;
-}
 
 CLI::App* PurgeTrashCommand::add(CLI::App& app) {
     auto* sub = app.add_subcommand(
@@ -51,7 +23,7 @@ CLI::App* PurgeTrashCommand::add(CLI::App& app) {
 }
 
 Status PurgeTrashCommand::checkArguments() {
-    auto seconds = parseDuration(olderThan_);
+    auto seconds = Duration::parse(olderThan_);
     if (!seconds)
         return CliContext::usageError(
             "--older-than takes a duration such as 30d, 12h, 90m or "

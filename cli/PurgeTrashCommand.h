@@ -13,9 +13,6 @@ class PurgeTrashCommand : public ProviderCommand {
 public:
     CLI::App* add(CLI::App& app) override;
 
-    // Seconds in a duration such as "30d", "12h", "90m" or "45s"; nothing when malformed.
-    static std::optional<double> parseDuration(const std::string& text);
-
 private:
     Status checkArguments() override;
     int runWith(CliContext& context, HostPorterExtension& provider) override;

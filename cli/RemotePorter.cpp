@@ -1,4 +1,5 @@
 #include "cli/RemotePorter.h"
+#include "runtime/Duration.h"
 
 #include <cerrno>
 #include <cmath>
@@ -144,16 +145,6 @@ void RemotePorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& ide
     patch(identifier, changes, completion);
 }
 
-std::string RemotePorter::durationText(uint64_t seconds) {
-    if (seconds != 0 && seconds % 86400 == 0)
-        return std::to_string(seconds / 86400) + "d";
-    if (seconds != 0 && seconds % 3600 == 0)
-        return std::to_string(seconds / 3600) + "h";
-    if (seconds != 0 && seconds % 60 == 0)
-        return std::to_string(seconds / 60) + "m";
-    return std::to_string(seconds) + "s";
-}
-
 void RemotePorter::removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> referenceDate,
                                                    std::function<void(size_t removed)> completion) {
     double age = referenceDate
@@ -161,7 +152,7 @@ void RemotePorter::removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> r
                      : 0;
     auto seconds = static_cast<uint64_t>(std::llround(std::max(0.0, age)));
     auto answer =
-        client_->post("trash/purge?olderThan=" + durationText(seconds), nlohmann::json::object());
+        client_->post("trash/purge?olderThan=" + Duration::text(seconds), nlohmann::json::object());
     size_t removed = 0;
     if (!answer.ok())
         lastError_ = answer.error();

@@ -73,10 +73,6 @@ public:
     // failed with, if it did; the verb reports it.
     std::optional<Error> lastError() const { return lastError_; }
 
-    // The purge's "olderThan" for a number of seconds: in the largest unit that states it
-    // exactly (30d, 12h, 90m, 45s).
-    static std::string durationText(uint64_t seconds);
-
 private:
     static std::string itemPath(const HostPorterItemIdentifier& identifier);
     Result<HostPorterItemRef> itemFrom(const Result<nlohmann::json>& answer);

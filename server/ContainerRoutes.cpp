@@ -1,4 +1,5 @@
 #include "server/ContainerRoutes.h"
+#include "runtime/Duration.h"
 
 #include <chrono>
 
@@ -174,7 +175,7 @@ void ContainerRoutes::add(httplib::Server& server, std::shared_ptr<ApiContext> c
 
     server.Post("/api/v1/trash/purge", [context](const httplib::Request& request,
                                                  httplib::Response& response) {
-        auto seconds = RouteSupport::parseDuration(request.get_param_value("olderThan"));
+        auto seconds = Duration::parse(request.get_param_value("olderThan"));
         if (!seconds)
             return RouteSupport::replyBadRequest(
                 response, "olderThan takes a duration such as 30d, 12h, 90m or 45s");

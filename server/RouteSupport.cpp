@@ -1,6 +1,5 @@
 #include "server/RouteSupport.h"
 
-#include <charconv>
 #include <cmath>
 #include <cstdint>
 #include <ctime>
@@ -64,34 +63,6 @@ std::optional<Bytes> RouteSupport::base64Parameter(const std::string& text) {
         if (c == ' ')
             c = '+';
     return base64Decode(repaired);
-}
-
-std::optional<double> RouteSupport::parseDuration(const std::string& text) {
-    if (text.size() < 2)
-        return std::nullopt;
-    double unit = 0;
-    switch (text.back()) {
-        case 's':
-            unit = 1;
-            break;
-        case 'm':
-            unit = 60;
-            break;
-        case 'h':
-            unit = 3600;
-            break;
-        case 'd':
-            unit = 86400;
-            break;
-        default:
-            return std::nullopt;
-    }
-    uint64_t amount = 0;
-    const char* end = text.data() + text.size() - 1;
-    auto [stop, ec] = std::from_chars(text.data(), end, amount);
-    if (ec != std::errc() || stop != end)
-        return std::nullopt;
-    return static_cast<double>(amount) * unit;
 }
 
 namespace {

@@ -32,8 +32,6 @@ public:
     // into a space is taken back.
     static std::optional<Bytes> base64Parameter(const std::string& text);
 
-    // "30d", "12h", "90m", "45s" as seconds.
-    static std::optional<double> parseDuration(const std::string& text);
     // "2026-11-23T05:10:12Z" or with fractional seconds or a "+hh:mm" offset, as seconds since
     // the epoch.
     static std::optional<double> parseIso8601(const std::string& text);

@@ -331,14 +331,5 @@ TEST_F(RemoteCommandsTest, AnInterruptEndsAWatchOfTheServersStream) {
     EXPECT_TRUE(watch.err().empty()) << watch.err();
 }
 
-TEST(RemotePorterTest, DurationsUseTheLargestExactUnit) {
-    EXPECT_EQ(RemotePorter::durationText(30 * 86400), "30d");
-    EXPECT_EQ(RemotePorter::durationText(36 * 3600), "36h");
-    EXPECT_EQ(RemotePorter::durationText(90 * 60), "90m");
-    EXPECT_EQ(RemotePorter::durationText(86401), "86401s");
-    EXPECT_EQ(RemotePorter::durationText(0), "0s");
-    EXPECT_EQ(ServerClient::encode("#a b/é%="), "%23a%20b%2F%C3%A9%25%3D");
-}
-
 }  // namespace
 }  // namespace tamber
