@@ -45,20 +45,6 @@ const json kItem = {
 // run file in a private runtime folder.
 class RemoteCommandsTest : public testing::CommandLineTest {
 protected:
-    void SetUp() override {
-        CommandLineTest::SetUp();
-        if (const char* old = std::getenv("XDG_RUNTIME_DIR"))
-            previousRuntimeDir_ = old;
-        ::setenv("XDG_RUNTIME_DIR", runtimeDir.path().c_str(), 1);
-    }
-    void TearDown() override {
-        if (previousRuntimeDir_)
-            ::setenv("XDG_RUNTIME_DIR", previousRuntimeDir_->c_str(), 1);
-        else
-            ::unsetenv("XDG_RUNTIME_DIR");
-        CommandLineTest::TearDown();
-    }
-
     void writeRunFile(pid_t pid, int port, const std::string& forStorage) {
         ASSERT_TRUE(
             RunFile::write(RunFile::defaultLocation(), {pid, port, kToken, forStorage}).ok());
@@ -86,10 +72,7 @@ protected:
         return ntohs(address.sin_port);
     }
 
-    testing::TempDir runtimeDir;
-
 private:
-    std::optional<std::string> previousRuntimeDir_;
 };
 
 TEST_F(RemoteCommandsTest, EveryMutationIsTheRouteWithTheRequestItNames) {

@@ -28,21 +28,11 @@ using testing::CliRun;
 // journal the direct runs started: both must print the same.
 class RemoteEventsTest : public testing::CommandLineTest {
 protected:
-    void SetUp() override {
-        CommandLineTest::SetUp();
-        if (const char* old = std::getenv("XDG_RUNTIME_DIR"))
-            previousRuntimeDir_ = old;
-        ::setenv("XDG_RUNTIME_DIR", runtimeDir.path().c_str(), 1);
-    }
     void TearDown() override {
         if (thread_.joinable()) {
             server_.stop();
             thread_.join();
         }
-        if (previousRuntimeDir_)
-            ::setenv("XDG_RUNTIME_DIR", previousRuntimeDir_->c_str(), 1);
-        else
-            ::unsetenv("XDG_RUNTIME_DIR");
         CommandLineTest::TearDown();
     }
 
@@ -58,14 +48,12 @@ protected:
             RunFile::write(RunFile::defaultLocation(), {::getpid(), port, "k", storage}).ok());
     }
 
-    testing::TempDir runtimeDir;
     std::shared_ptr<ApiContext> context;
     int port = 0;
 
 private:
     httplib::Server server_;
     std::thread thread_;
-    std::optional<std::string> previousRuntimeDir_;
 };
 
 TEST_F(RemoteEventsTest, TheJournalReplaysTheSameThroughTheServer) {

@@ -32,20 +32,6 @@ constexpr const char* kRoundTripToken = "t0ken-for-tests";
 // exit with the same status either way.
 class RemoteRoundTripTest : public testing::CommandLineTest {
 protected:
-    void SetUp() override {
-        CommandLineTest::SetUp();
-        if (const char* old = std::getenv("XDG_RUNTIME_DIR"))
-            previousRuntimeDir_ = old;
-        ::setenv("XDG_RUNTIME_DIR", runtimeDir.path().c_str(), 1);
-    }
-    void TearDown() override {
-        if (previousRuntimeDir_)
-            ::setenv("XDG_RUNTIME_DIR", previousRuntimeDir_->c_str(), 1);
-        else
-            ::unsetenv("XDG_RUNTIME_DIR");
-        CommandLineTest::TearDown();
-    }
-
     std::string identifierOf(const std::string& path) {
         CliRun run = tamber({"id", path});
         EXPECT_EQ(run.status, 0) << run.err;
@@ -64,10 +50,7 @@ protected:
         EXPECT_EQ(remote.err, direct.err) << what;
     }
 
-    testing::TempDir runtimeDir;
-
 private:
-    std::optional<std::string> previousRuntimeDir_;
 };
 
 TEST_F(RemoteRoundTripTest, ItemsAndListingsPrintTheSameBytesThroughTheServer) {

@@ -7,12 +7,30 @@
 
 namespace tamber::testing {
 
+namespace {
+
+void restore(const char* name, const std::optional<std::string>& value) {
+    if (value)
+        setenv(name, value->c_str(), 1);
+    else
+        unsetenv(name);
+}
+
+std::optional<std::string> replace(const char* name, const std::string& value) {
+    std::optional<std::string> previous;
+    if (const char* old = std::getenv(name))
+        previous = old;
+    setenv(name, value.c_str(), 1);
+    return previous;
+}
+
+}  // namespace
+
 void CommandLineTest::SetUp() {
     AppLibraryTest::SetUp();
     AppRegistry::setDefaultRegistry(nullptr);
-    if (const char* dirs = std::getenv("XDG_DATA_DIRS"))
-        previousDataDirs_ = dirs;
-    setenv("XDG_DATA_DIRS", systemData.path().c_str(), 1);
+    previousDataDirs_ = replace("XDG_DATA_DIRS", systemData.path());
+    previousRuntimeDir_ = replace("XDG_RUNTIME_DIR", runtimeDir.path());
     TremorService::resetForTesting();
     TremorService::configure(state.path());
     storage = dir.makeDir("Documents");
@@ -20,10 +38,8 @@ void CommandLineTest::SetUp() {
 
 void CommandLineTest::TearDown() {
     TremorService::resetForTesting();
-    if (previousDataDirs_)
-        setenv("XDG_DATA_DIRS", previousDataDirs_->c_str(), 1);
-    else
-        unsetenv("XDG_DATA_DIRS");
+    restore("XDG_DATA_DIRS", previousDataDirs_);
+    restore("XDG_RUNTIME_DIR", previousRuntimeDir_);
     AppLibraryTest::TearDown();
 }
 
