@@ -76,6 +76,7 @@ Result<std::vector<JournalEvent>> JournalWriter::commit(Settle settle,
     Status status = store_.transact([&]() -> Status {
         work();
         flushStaged();
+        settleMovedAway();
         settleVanished(settle);
         if (!failure_.ok())
             return failure_;  // rolls back what the batch wrote before it failed
@@ -87,6 +88,7 @@ Result<std::vector<JournalEvent>> JournalWriter::commit(Settle settle,
     });
     pending_.clear();
     vanished_.clear();
+    movedAway_.clear();
     staged_.clear();
     stagedNames_.clear();
     failure_ = Status::OK();
@@ -281,6 +283,25 @@ void JournalWriter::refreshAttributes(uint32_t docID, const std::string& path, u
     }
 }
 
+void JournalWriter::settleMovedAway() {
+    // The entry stays where it is until the batch ends: a later rename in it may find the file
+    // at its next name, or a new file at the old name may be a safe save that claims the
+    // document.
+    for (const auto& [path, inode] : movedAway_) {
+        auto record = orFail(store_.inode(inode), std::optional<InodeRecord>());
+        if (!record)
+            continue;  // forgotten already: replaced or claimed
+        auto indexedAt = orFail(store_.pathForInode(inode), std::optional<std::string>());
+        if (indexedAt != path)
+            continue;  // found again at another name
+        struct statx st {};
+        if (FileStamp::read(path, st) && FileStamp::isIndexedFile(*record, st))
+            continue;  // renamed back
+        forgetSubtree(*record, path);
+    }
+    movedAway_.clear();
+}
+
 void JournalWriter::settleVanished(Settle settle) {
     if (settle == Settle::ClaimByPath) {
         // Events are applied after the fact: the file that took a document's place may be at its
@@ -379,6 +400,8 @@ void JournalWriter::renamed(const FileChange& change) {
         kind = FileStamp::kindFlag(record.kind);
         stage(std::move(record));
     }
+    if (!present && from)
+        movedAway_.emplace_back(change.fromPath, from->inode);
     if (!change.fromPath.empty())
         pending_.push_back({0, change.fromPath, inode, kTremorItemRenamed | kind});
     pending_.push_back({0, change.path, inode, kTremorItemRenamed | kind});

@@ -88,6 +88,11 @@ private:
     void restoreAttributes(uint32_t docID, const std::string& path, uint64_t inode);
     // The document's metadata changed on its own inode: its copy becomes what the file holds.
     void refreshAttributes(uint32_t docID, const std::string& path, uint64_t inode);
+    // Entries whose rename found the new name empty and that nothing in the batch placed
+    // elsewhere: the file was renamed and then removed (or renamed out of sight) before the batch
+    // was applied. Left in place they would name a file that is gone, and its document's
+    // deletion would never be journaled.
+    void settleMovedAway();
     // Clears the document IDs of files that vanished for good and journals their deletion.
     void settleVanished(Settle settle);
 
@@ -103,6 +108,7 @@ private:
     std::vector<JournalEvent> pending_;
     Status failure_;                               // of the batch being applied
     std::map<std::string, InodeRecord> vanished_;  // by path, only those with a document ID
+    std::vector<std::pair<std::string, uint64_t>> movedAway_;  // (old path, inode)
     std::unordered_map<uint64_t, InodeRecord> staged_;
     std::map<std::pair<uint64_t, std::string>, uint64_t> stagedNames_;  // (parent, name) -> inode
 };

@@ -354,6 +354,82 @@ TEST(DocumentIdentityWriterTest, ABatchThatFindsTheOldInodeNumberBornAgainIsASaf
               (TremorStore::Attributes{{kTagsAttribute, tags}}));
 }
 
+// Batches are applied after the fact, so a rename's new name may be empty already. Where the
+// document went decides: gone for good is reported gone (a browser that listed it must hear of
+// it), moved on in the same batch keeps its ID, and a new file at its old name is a safe save.
+class WriterAfterTheFactTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        tree = root.makeDir("tree");
+        auto opened = TremorStore::open(state.path(), 1);
+        ASSERT_TRUE(opened.ok());
+        store = std::move(opened).value();
+        writer.emplace(*store, 7);
+        ASSERT_TRUE(store->addRoot(tree, 0).ok());
+    }
+    // A document at `name`, known to the index before anything happens.
+    std::pair<uint64_t, uint32_t> document(const std::string& name) {
+        std::string path = root.writeFile("tree/" + name, name);
+        EXPECT_TRUE(writer->reconcile(tree, false).ok());
+        uint64_t inode = documentInodeOf(path);
+        return {inode, store->allocateDocumentId(inode).value()};
+    }
+    std::vector<JournalEvent> apply(const std::vector<FileChange>& changes) {
+        auto events = writer->apply(changes);
+        EXPECT_TRUE(events.ok());
+        return events.ok() ? events.value() : std::vector<JournalEvent>{};
+    }
+    static bool journaled(const std::vector<JournalEvent>& events, const std::string& path) {
+        for (const auto& event : events)
+            if (event.path == path)
+                return true;
+        return false;
+    }
+    std::string at(const std::string& name) { return tree + "/" + name; }
+
+    testing::TempDir state, root;
+    std::string tree;
+    std::unique_ptr<TremorStore> store;
+    std::optional<JournalWriter> writer;
+};
+
+TEST_F(WriterAfterTheFactTest, ADocumentRenamedThenRemovedIsReportedGoneAndLeavesNoEntry) {
+    auto [inode, docID] = document("doomed.txt");
+    fs::rename(at("doomed.txt"), at("renamed.txt"));
+    fs::remove(at("renamed.txt"));
+    auto events = apply({{FileChange::Kind::Renamed, at("renamed.txt"), at("doomed.txt"), false, 0},
+                         {FileChange::Kind::Removed, at("renamed.txt"), {}, false, 0}});
+    EXPECT_TRUE(journaled(events, JournalWriter::documentIdPath(7, docID, inode, 0)));
+    EXPECT_EQ(store->inodeForDocumentId(docID).value(), std::nullopt);
+    EXPECT_EQ(store->pathForInode(inode).value(), std::nullopt);
+}
+
+TEST_F(WriterAfterTheFactTest, ADocumentRenamedTwiceKeepsItsIdAtItsLastName) {
+    auto [inode, docID] = document("a.txt");
+    fs::rename(at("a.txt"), at("b.txt"));
+    fs::rename(at("b.txt"), at("c.txt"));
+    auto events = apply({{FileChange::Kind::Renamed, at("b.txt"), at("a.txt"), false, 0},
+                         {FileChange::Kind::Renamed, at("c.txt"), at("b.txt"), false, 0}});
+    EXPECT_FALSE(journaled(events, JournalWriter::documentIdPath(7, docID, inode, 0)));
+    EXPECT_EQ(store->documentIdForInode(inode).value(), docID);
+    EXPECT_EQ(store->pathForInode(inode).value(), at("c.txt"));
+}
+
+TEST_F(WriterAfterTheFactTest, ABackupRenameThenANewFileAtTheNameIsASafeSave) {
+    auto [inode, docID] = document("doc.txt");
+    fs::rename(at("doc.txt"), at("doc.txt~"));
+    writeText(at("doc.txt.new"), "v1");
+    fs::rename(at("doc.txt.new"), at("doc.txt"));
+    fs::remove(at("doc.txt~"));
+    uint64_t saved = documentInodeOf(at("doc.txt"));
+    auto events = apply({{FileChange::Kind::Renamed, at("doc.txt~"), at("doc.txt"), false, 0},
+                         {FileChange::Kind::Created, at("doc.txt.new"), {}, false, 0},
+                         {FileChange::Kind::Renamed, at("doc.txt"), at("doc.txt.new"), false, 0},
+                         {FileChange::Kind::Removed, at("doc.txt~"), {}, false, 0}});
+    EXPECT_EQ(store->documentIdForInode(saved).value(), docID);
+    EXPECT_FALSE(journaled(events, JournalWriter::documentIdPath(7, docID, inode, 0)));
+}
+
 TEST_F(DocumentIdentityTest, AKnownFileMovedOntoADocumentIsAMoveNotASave) {
     ASSERT_NO_FATAL_FAILURE(start());
     auto docs = makeDocuments(4);  // 0 and 2 are replaced by moves, 1 and 3 move
