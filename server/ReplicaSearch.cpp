@@ -48,16 +48,14 @@ Result<std::vector<std::string>> ReplicaSearch::conformingTypes(const std::strin
     if (!stmt.ok())
         return stmt.error();
     std::vector<std::string> types;
-    for (;;) {
-        auto row = stmt->step();
-        if (!row.ok())
-            return row.error();
-        if (!row.value())
-            break;
+    Status read = stmt->eachRow([&] {
         std::string stored = stmt->columnText(0);
         if (TypeConforms(stored, type))
             types.push_back(std::move(stored));
-    }
+        return Status::OK();
+    });
+    if (!read.ok())
+        return read.error();
     return types;
 }
 
@@ -148,16 +146,14 @@ Result<std::vector<nlohmann::json>> ReplicaSearch::read(const std::string& sql,
             stmt->bind(index, std::string_view(std::get<std::string>(values[i])));
     }
     std::vector<nlohmann::json> items;
-    for (;;) {
-        auto row = stmt->step();
-        if (!row.ok())
-            return row.error();
-        if (!row.value())
-            break;
+    Status read = stmt->eachRow([&] {
         auto json = nlohmann::json::parse(stmt->columnText(0), nullptr, false);
         if (!json.is_discarded())
             items.push_back(std::move(json));
-    }
+        return Status::OK();
+    });
+    if (!read.ok())
+        return read.error();
     return items;
 }
 

@@ -159,19 +159,14 @@ Status ReplicaStore::loadCounters() {
     auto stmt = db_->prepare("SELECT key, value FROM meta WHERE key IN ('sequence', 'floor')");
     if (!stmt.ok())
         return stmt.error();
-    for (;;) {
-        auto row = stmt->step();
-        if (!row.ok())
-            return row.error();
-        if (!row.value())
-            break;
+    return stmt->eachRow([&] {
         uint64_t value = fromSqlite(stmt->columnInt64(1));
         if (stmt->columnText(0) == "sequence")
             sequence_ = value;
         else
             floor_ = value;
-    }
-    return Status::OK();
+        return Status::OK();
+    });
 }
 
 Result<std::optional<HostPorterSyncAnchor>> ReplicaStore::anchor() {
@@ -394,18 +389,16 @@ Result<std::vector<ReplicaBatch>> ReplicaStore::batchesSince(uint64_t sequence) 
         return stmt.error();
     stmt->bind(1, toSqlite(sequence));
     std::vector<ReplicaBatch> batches;
-    for (;;) {
-        auto row = stmt->step();
-        if (!row.ok())
-            return row.error();
-        if (!row.value())
-            break;
+    Status read = stmt->eachRow([&]() -> Status {
         auto json = nlohmann::json::parse(stmt->columnText(1), nullptr, false);
         if (json.is_discarded())
             return SqliteDatabase::makeError(SQLITE_CORRUPT, "reading the batch history",
                                              "a batch that is not JSON");
         batches.push_back({fromSqlite(stmt->columnInt64(0)), std::move(json)});
-    }
+        return Status::OK();
+    });
+    if (!read.ok())
+        return read.error();
     return batches;
 }
 

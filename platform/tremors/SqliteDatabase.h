@@ -54,6 +54,20 @@ public:
         Result<bool> step();
         // Steps to the end, for statements that return no rows, then resets.
         Status run();
+        // Calls `visit` (returning a Status) on each row in turn; stops at the first failure of
+        // a step or of `visit` and returns it.
+        template <class Visit>
+        Status eachRow(Visit&& visit) {
+            for (;;) {
+                Result<bool> row = step();
+                if (!row.ok())
+                    return row.error();
+                if (!row.value())
+                    return Status::OK();
+                if (Status visited = visit(); !visited.ok())
+                    return visited;
+            }
+        }
         // Ready to run again, with no bindings.
         void reset();
 
