@@ -104,9 +104,12 @@ void createStorage(const Options& o, const std::string& storage) {
 
 // The environment every tamber process of the run gets: its own home and state.
 std::vector<std::string> environment(const std::string& home) {
-    return {"HOME=" + home, "XDG_STATE_HOME=" + home + "/state",
-            "XDG_RUNTIME_DIR=" + home + "/run", "XDG_DATA_HOME=" + home + "/data",
-            "XDG_DATA_DIRS=" + home + "/data", "PATH=/usr/bin:/bin"};
+    return {"HOME=" + home,
+            "XDG_STATE_HOME=" + home + "/state",
+            "XDG_RUNTIME_DIR=" + home + "/run",
+            "XDG_DATA_HOME=" + home + "/data",
+            "XDG_DATA_DIRS=" + home + "/data",
+            "PATH=/usr/bin:/bin"};
 }
 
 pid_t spawn(const std::vector<std::string>& args, const std::vector<std::string>& env,
@@ -120,11 +123,9 @@ pid_t spawn(const std::vector<std::string>& args, const std::vector<std::string>
         if (stdoutFd < 0)
             ::dup2(null, 1);
         std::vector<char*> argv, envp;
-        for (auto& a : args)
-            argv.push_back(const_cast<char*>(a.c_str()));
+        for (auto& a : args) argv.push_back(const_cast<char*>(a.c_str()));
         argv.push_back(nullptr);
-        for (auto& e : env)
-            envp.push_back(const_cast<char*>(e.c_str()));
+        for (auto& e : env) envp.push_back(const_cast<char*>(e.c_str()));
         envp.push_back(nullptr);
         ::execve(argv[0], argv.data(), envp.data());
         ::_exit(127);
@@ -155,13 +156,12 @@ Server startServer(const std::string& binary, const std::string& storage,
     if (::pipe(pipeFds) != 0)
         std::exit(1);
     auto start = Clock::now();
-    gServer = spawn({binary, "--storage", storage, "serve", "--port", "0", "--no-open"}, env,
-                    pipeFds[1]);
+    gServer =
+        spawn({binary, "--storage", storage, "serve", "--port", "0", "--no-open"}, env, pipeFds[1]);
     ::close(pipeFds[1]);
     std::string line;
     char c;
-    while (::read(pipeFds[0], &c, 1) == 1 && c != '\n')
-        line += c;
+    while (::read(pipeFds[0], &c, 1) == 1 && c != '\n') line += c;
     ::close(pipeFds[0]);
     // http://127.0.0.1:PORT/#token=TOKEN
     auto colon = line.find(':', 7);
@@ -220,7 +220,13 @@ json getJson(httplib::Client& client, const std::string& path) {
 }
 
 std::string identifierAt(httplib::Client& client, const std::string& path) {
-    return getJson(client, "/api/v1/lookup?path=" + encode(path))["itemIdentifier"];
+    json item = getJson(client, "/api/v1/lookup?path=" + encode(path));
+    if (!item.contains("identifier") || !item["identifier"].is_string()) {
+        std::fprintf(stderr, "bench_server: no identifier for %s\n", path.c_str());
+        cleanUp();
+        std::exit(1);
+    }
+    return item["identifier"];
 }
 
 double medianOf(const std::vector<std::string>& args, const std::vector<std::string>& env,
@@ -237,12 +243,26 @@ double medianOf(const std::vector<std::string>& args, const std::vector<std::str
     return percentile(times, 0.5);
 }
 
+const char* const kUsage =
+    "usage: bench_server [--files 100000] [--folders 1000] [--flat 100000] [--changed 1000]\n"
+    "                    [--clients 32] [--seconds 30] [--writes 50] [--dir D]\n";
+
+int run(const Options& o);
+
 }  // namespace
 
 int main(int argc, char** argv) {
     Options o;
-    for (int i = 1; i + 1 < argc; i += 2) {
+    for (int i = 1; i < argc; i += 2) {
         std::string flag = argv[i];
+        if (flag == "--help" || flag == "-h") {
+            std::fputs(kUsage, stdout);
+            return 0;
+        }
+        if (i + 1 >= argc) {
+            std::fprintf(stderr, "bench_server: %s needs a value\n%s", flag.c_str(), kUsage);
+            return 2;
+        }
         std::string value = argv[i + 1];
         if (flag == "--files")
             o.files = std::stoul(value);
@@ -260,7 +280,24 @@ int main(int argc, char** argv) {
             o.writes = std::stoul(value);
         else if (flag == "--dir")
             o.dir = value;
+        else {
+            std::fprintf(stderr, "bench_server: unknown option %s\n%s", flag.c_str(), kUsage);
+            return 2;
+        }
     }
+    try {
+        return run(o);
+    } catch (const std::exception& e) {
+        // The server and the files made so far do not outlive the run.
+        std::fprintf(stderr, "bench_server: %s\n", e.what());
+        cleanUp();
+        return 1;
+    }
+}
+
+namespace {
+
+int run(const Options& o) {
     const std::string binary = TAMBER_BINARY;
     char pattern[] = "/tmp/bench-server-XXXXXX";
     gRoot = o.dir.empty() ? std::string(::mkdtemp(pattern)) : o.dir + "/bench-server";
@@ -295,8 +332,7 @@ int main(int argc, char** argv) {
         {"id", {binary, "--storage", storage, "id", sample}},
     };
     std::map<std::string, double> throughServer;
-    for (auto& verb : verbs)
-        throughServer[verb.name] = medianOf(verb.args, env, runs);
+    for (auto& verb : verbs) throughServer[verb.name] = medianOf(verb.args, env, runs);
 
     // Search: substrings of names, over the whole replica.
     std::vector<double> searches, statuses;
@@ -327,9 +363,8 @@ int main(int argc, char** argv) {
             break;
         page = listed["nextPage"];
     }
-    std::printf("children of a %zu-entry folder: %zu pages, median %.2f ms, p99 %.2f ms\n",
-                o.flat, pages.size(), percentile(pages, 0.5) * 1e3,
-                percentile(pages, 0.99) * 1e3);
+    std::printf("children of a %zu-entry folder: %zu pages, median %.2f ms, p99 %.2f ms\n", o.flat,
+                pages.size(), percentile(pages, 0.5) * 1e3, percentile(pages, 0.99) * 1e3);
 
     // From a write to the `changes` event that carries it.
     {
@@ -353,9 +388,8 @@ int main(int argc, char** argv) {
             auto start = Clock::now();
             writeFile(storage + "/tree/folder-1/" + name);
             std::unique_lock lock(mutex);
-            bool seen = arrived.wait_for(lock, std::chrono::seconds(10), [&] {
-                return received.find(name) != std::string::npos;
-            });
+            bool seen = arrived.wait_for(lock, std::chrono::seconds(10),
+                                         [&] { return received.find(name) != std::string::npos; });
             if (!seen) {
                 std::fprintf(stderr, "bench_server: no event for %s\n", name.c_str());
                 break;
@@ -401,11 +435,10 @@ int main(int argc, char** argv) {
         }
         std::this_thread::sleep_for(std::chrono::duration<double>(o.seconds));
         stop = true;
-        for (auto& t : threads)
-            t.join();
+        for (auto& t : threads) t.join();
         double elapsed = since(start);
-        std::printf("%zu clients for %.0f s: %.0f requests/s, p99 %.2f ms, %zu errors\n",
-                    o.clients, elapsed, static_cast<double>(latencies.size()) / elapsed,
+        std::printf("%zu clients for %.0f s: %.0f requests/s, p99 %.2f ms, %zu errors\n", o.clients,
+                    elapsed, static_cast<double>(latencies.size()) / elapsed,
                     percentile(latencies, 0.99) * 1e3, errors.load());
     }
 
@@ -415,9 +448,10 @@ int main(int argc, char** argv) {
         writeFile(storage + "/tree/folder-" + std::to_string(i % o.folders) + "/changed-" +
                   std::to_string(i) + ".txt");
     server = startServer(binary, storage, env);
-    std::printf("start (warm, %zu files changed while stopped): %.2f s until ready; ratio to "
-                "cold %.2f\n",
-                o.changed, server.readySeconds, server.readySeconds / cold);
+    std::printf(
+        "start (warm, %zu files changed while stopped): %.2f s until ready; ratio to "
+        "cold %.2f\n",
+        o.changed, server.readySeconds, server.readySeconds / cold);
     stopServer();
 
     // The same verbs run directly: each starts the journal itself.
@@ -430,3 +464,5 @@ int main(int argc, char** argv) {
     cleanUp();
     return 0;
 }
+
+}  // namespace
