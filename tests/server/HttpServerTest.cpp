@@ -1,9 +1,14 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
+#include <condition_variable>
+#include <functional>
 #include <future>
 #include <memory>
+#include <mutex>
 #include <thread>
+#include <vector>
 
 #include <httplib.h>
 
@@ -123,6 +128,76 @@ TEST(HttpServerTest, AnswersOnBothLoopbackAddressesOnTheSamePort) {
     ASSERT_TRUE(viaIpv6);
     EXPECT_EQ(viaIpv6->status, 404);
     EXPECT_NE(viaIpv6->body.find("no such route"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace tamber
+
+namespace tamber {
+namespace {
+
+// Connections beyond the bound wait for a thread instead of getting one each: with every
+// thread held, one more request is not served until a held one is let go, and all of them are
+// answered in the end.
+TEST(HttpServerTest, ConnectionsBeyondTheBoundWaitAndAreServedLater) {
+    constexpr size_t kBound = HttpServer::kMaxConnections;
+    std::mutex mutex;
+    std::condition_variable changed;
+    size_t inside = 0, most = 0, served = 0;
+    bool released = false;
+    HttpServer::RouteGroup group = [&](httplib::Server& server, std::shared_ptr<ApiContext>) {
+        server.Get("/api/v1/slow", [&](const httplib::Request&, httplib::Response& response) {
+            std::unique_lock lock(mutex);
+            most = std::max(most, ++inside);
+            changed.notify_all();
+            changed.wait(lock, [&] { return released; });
+            --inside;
+            ++served;
+            response.set_content("{}", "application/json");
+        });
+    };
+    auto releaseAll = [&] {
+        {
+            std::lock_guard lock(mutex);
+            released = true;
+        }
+        changed.notify_all();
+    };
+    HttpServer server(std::make_shared<ApiContext>(), kToken, {group});
+    ASSERT_TRUE(server.start(0).ok());
+    const int port = server.port();
+
+    std::vector<std::future<int>> answers;
+    // Whatever fails below, the held requests are let go before the answers are waited for
+    // and the server stops.
+    struct Release {
+        std::function<void()> run;
+        ~Release() { run(); }
+    } releaseAtEnd{releaseAll};
+    for (size_t i = 0; i < kBound + 1; ++i) {
+        answers.push_back(std::async(std::launch::async, [port] {
+            auto client = clientFor(port);
+            client->set_read_timeout(60, 0);
+            auto result = client->Get("/api/v1/slow");
+            return result ? result->status : -1;
+        }));
+    }
+    {
+        std::unique_lock lock(mutex);
+        ASSERT_TRUE(
+            changed.wait_for(lock, std::chrono::seconds(60), [&] { return inside >= kBound; }));
+    }
+    // Time for the extra connection to be served, if the bound let it.
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    {
+        std::lock_guard lock(mutex);
+        EXPECT_EQ(most, kBound);
+    }
+    releaseAll();
+    for (auto& answer : answers) EXPECT_EQ(answer.get(), 200);
+    std::lock_guard lock(mutex);
+    EXPECT_EQ(served, kBound + 1);
+    EXPECT_EQ(most, kBound);
 }
 
 }  // namespace

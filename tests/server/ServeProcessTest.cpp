@@ -6,9 +6,12 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdio>
 #include <filesystem>
+#include <fstream>
 #include <map>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <httplib.h>
@@ -135,6 +138,103 @@ private:
     std::string out_;
     std::string err_;
 };
+
+// The port and token of the URL a server printed; port 0 when the line is not one.
+struct Printed {
+    int port = 0;
+    std::string token;
+};
+Printed parsePrinted(const std::string& line) {
+    Printed printed;
+    const std::string marker = "/#token=";
+    size_t colon = line.find(':', 5);
+    size_t at = line.find(marker);
+    if (!line.starts_with("http://127.0.0.1:") || at == std::string::npos)
+        return printed;
+    printed.port = std::stoi(line.substr(colon + 1, at - colon - 1));
+    printed.token = line.substr(at + marker.size());
+    return printed;
+}
+
+nlohmann::json getJson(const Printed& server, const std::string& path) {
+    httplib::Client client("127.0.0.1", server.port);
+    client.set_bearer_token_auth(server.token);
+    auto response = client.Get(path);
+    if (!response || response->status != 200)
+        return nullptr;
+    return nlohmann::json::parse(response->body, nullptr, false);
+}
+
+// Waits until the server says it is ready; its last status either way.
+nlohmann::json waitUntilReady(const Printed& server) {
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(120);
+    nlohmann::json status;
+    while (std::chrono::steady_clock::now() < deadline) {
+        status = getJson(server, "/api/v1/status");
+        if (status.is_object() && status["state"] == "ready")
+            break;
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    return status;
+}
+
+size_t found(const Printed& server, const std::string& query) {
+    auto answer = getJson(server, "/api/v1/search?q=" + query + "&limit=1000");
+    return answer.is_object() ? answer["items"].size() : 0;
+}
+
+// A server killed in the middle of a catch-up keeps what it committed: the next one catches up
+// from the stored anchor and ends up holding exactly what is on disk.
+TEST(ServeProcessTest, AServerKilledDuringACatchUpIsCaughtUpByTheNextOne) {
+    TempDir root;
+    std::string storage = root.makeDir("Documents");
+    auto write = [&](const std::string& name) { std::ofstream(storage + "/" + name) << "x"; };
+    for (int i = 0; i < 400; ++i) write("old-" + std::to_string(i) + ".txt");
+    uint64_t itemsBefore = 0;
+    {
+        ServeProcess serve(root, storage);
+        Printed first = parsePrinted(serve.firstLine());
+        ASSERT_NE(first.port, 0) << serve.err();
+        auto status = waitUntilReady(first);
+        ASSERT_EQ(status["state"], "ready") << status.dump();
+        itemsBefore = status["items"];
+        ASSERT_EQ(serve.finish(SIGTERM), 0) << serve.err();
+    }
+
+    // While nothing runs: enough changes for many pages of changes.
+    for (int i = 0; i < 200; ++i)
+        std::filesystem::remove(storage + "/old-" + std::to_string(i) + ".txt");
+    for (int i = 0; i < 900; ++i) write("new-" + std::to_string(i) + ".txt");
+    {
+        ServeProcess serve(root, storage);
+        Printed second = parsePrinted(serve.firstLine());
+        ASSERT_NE(second.port, 0) << serve.err();
+        // Killed as soon as it is seen catching up, or at once if it never is.
+        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+        while (std::chrono::steady_clock::now() < deadline) {
+            auto status = getJson(second, "/api/v1/status");
+            if (status.is_object() && status["state"] == "catching-up")
+                break;
+            if (status.is_object() && status["state"] == "ready") {
+                std::printf("note: the catch-up ended before it could be interrupted\n");
+                break;
+            }
+        }
+        ::kill(serve.pid(), SIGKILL);
+        EXPECT_EQ(serve.finish(), -1);
+    }
+
+    // Its run file is left behind; the next server takes its place all the same.
+    ServeProcess serve(root, storage);
+    Printed third = parsePrinted(serve.firstLine());
+    ASSERT_NE(third.port, 0) << serve.err();
+    auto status = waitUntilReady(third);
+    ASSERT_EQ(status["state"], "ready") << status.dump();
+    EXPECT_EQ(status["items"].get<uint64_t>(), itemsBefore - 200 + 900);
+    EXPECT_EQ(found(third, "new-"), 900u);
+    EXPECT_EQ(found(third, "old-"), 200u);
+    EXPECT_EQ(serve.finish(SIGTERM), 0) << serve.err();
+}
 
 TEST(ServeProcessTest, PrintsTheUrlAnswersAndStopsCleanlyOnSigterm) {
     TempDir root;
