@@ -11,6 +11,7 @@
 
 #include "items/ItemMetadata.h"
 #include "items/LocalItem.h"
+#include "items/XdgTagList.h"
 #include "platform/FaultInjectingFileSystem.h"
 #include "platform/LinuxFileSystem.h"
 #include "platform/Tag.h"
@@ -201,10 +202,11 @@ TEST_F(ExtendedAttributesTest, TheDocumentIdServiceHearsOfEveryWriteThatHappened
 }
 
 // The journal keeps copies of exactly the attributes that items keep their metadata in.
-TEST(DocumentAttributeNamesTest, AreTheFiveMetadataAttributes) {
+TEST(DocumentAttributeNamesTest, AreTheFiveMetadataAttributesAndTheDesktopTagList) {
     std::set<std::string> items{LocalItem::xattrLastUsedDateName(), LocalItem::xattrTagDataName(),
                                 LocalItem::xattrFavoriteRankName(), LocalItem::xattrTrashDateName(),
-                                LocalItem::xattrTrashPutBackName()};
+                                LocalItem::xattrTrashPutBackName(), XdgTagList::attributeName(),
+                                XdgTagList::syncedAttributeName()};
     const auto& kept = DocumentAttributes::names();
     EXPECT_EQ(std::set<std::string>(kept.begin(), kept.end()), items);
     EXPECT_EQ(kept.size(), items.size());
