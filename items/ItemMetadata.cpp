@@ -157,14 +157,25 @@ Status writeTags(const Url& url, const Tags& tags, const std::function<void(int)
 // it: Tamber's tags become that list (colours kept, tags the list cannot hold kept too) and the
 // list is noted as taken in. Our own write of the list leaves the note matching, so it is never
 // read back as a change. Returns the tags to show, or nothing when Tamber's stand.
-std::optional<Tags> takeInDesktopList(const Url& url) {
-    MutexLock lock(tagsMutex());
+std::optional<Bytes> desktopListIfChanged(const Url& url, bool& changed) {
     auto theirs = ReadXattrData(XdgTagList::attributeName(), url);
     auto note = ReadXattrData(XdgTagList::syncedAttributeName(), url);
     std::optional<Bytes> expected;
     if (theirs)
         expected = XdgTagList::fingerprint(*theirs);
-    if (note == expected)
+    changed = note != expected;
+    return theirs;
+}
+
+std::optional<Tags> takeInDesktopList(const Url& url) {
+    bool changed = false;
+    // The common case, a list in step, looks without waiting for writers elsewhere.
+    (void)desktopListIfChanged(url, changed);
+    if (!changed)
+        return std::nullopt;
+    MutexLock lock(tagsMutex());
+    auto theirs = desktopListIfChanged(url, changed);
+    if (!changed)
         return std::nullopt;
     Tags ours = ItemMetadata::readTags(url).value_or(Tags{});
     std::vector<std::string> listed;

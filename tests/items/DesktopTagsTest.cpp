@@ -237,20 +237,19 @@ TEST_F(DesktopTagsTest, AFailedDesktopWriteIsLoggedOnceAndTheTagsStand) {
     EXPECT_EQ(attribute("xdg.tags"), "After,More");
 }
 
-// Another program rewrites the list while Tamber is taking in the previous one.
+// Another program rewrites the list while Tamber is taking in the previous one: after Tamber read
+// it, before Tamber notes it as taken in.
 class RewritesDuringTakeIn : public FaultInjectingFileSystem {
 public:
     using FaultInjectingFileSystem::FaultInjectingFileSystem;
-    ssize_t lgetxattr(const std::string& path, const std::string& name, void* value,
-                      size_t size) override {
+    int fsetxattr(int fd, const std::string& name, const void* value, size_t size,
+                  int flags) override {
         if (name == XdgTagList::syncedAttributeName() && !rewritten) {
             rewritten = true;
-            int fd = open(path, O_RDONLY | O_CLOEXEC, 0);
             std::string later = "Later";
             FaultInjectingFileSystem::fsetxattr(fd, "xdg.tags", later.data(), later.size(), 0);
-            close(fd);
         }
-        return FaultInjectingFileSystem::lgetxattr(path, name, value, size);
+        return FaultInjectingFileSystem::fsetxattr(fd, name, value, size, flags);
     }
     bool rewritten = false;
 };
