@@ -33,7 +33,7 @@ Coloured colouredOf(const XdgTagList::Tags& tags) {
     return out;
 }
 
-Bytes tagData(const Coloured& tags) {
+Bytes tagDataOf(const Coloured& tags) {
     XdgTagList::Tags list;
     for (const auto& [label, colour] : tags) list.push_back(Tag::make(label, colour));
     return GetTagsDataForTags(list);
@@ -142,7 +142,7 @@ protected:
 
 TEST_F(DesktopTagsTest, SettingTagsWritesTheDesktopListAndClearingRemovesIt) {
     ASSERT_TRUE(
-        ItemMetadata::writeTagData(file, tagData({{"Work", 4}, {"a,b", 0}, {"Home", 0}})).ok());
+        ItemMetadata::writeTagData(file, tagDataOf({{"Work", 4}, {"a,b", 0}, {"Home", 0}})).ok());
     EXPECT_EQ(attribute("xdg.tags"), "Work,Home");
     // Colours stay in Tamber's own attribute; the comma label too.
     EXPECT_EQ(storedTags(), (Coloured{{"Work", 4}, {"a,b", 0}, {"Home", 0}}));
@@ -155,7 +155,7 @@ TEST_F(DesktopTagsTest, SettingTagsWritesTheDesktopListAndClearingRemovesIt) {
 
 TEST_F(DesktopTagsTest, AnotherProgramsListBecomesTheTagsKeepingColours) {
     ASSERT_TRUE(
-        ItemMetadata::writeTagData(file, tagData({{"Red", 6}, {"Old", 2}, {"x,y", 5}})).ok());
+        ItemMetadata::writeTagData(file, tagDataOf({{"Red", 6}, {"Old", 2}, {"x,y", 5}})).ok());
     setByAnotherProgram("Red, Fresh ,,Red");
     EXPECT_EQ(recordTags(), (Coloured{{"Red", 6}, {"Fresh", 0}, {"x,y", 5}}));
     // Written to Tamber's attribute, not just shown; the foreign list keeps its own spelling.
@@ -175,7 +175,7 @@ TEST_F(DesktopTagsTest, AListSetBeforeTamberEverTaggedIsTakenIn) {
 
 TEST_F(DesktopTagsTest, TagsFromBeforeTheDesktopListAreNotTakenForARemoval) {
     // Tamber's attribute alone, as files tagged by earlier versions have it.
-    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagData({{"Kept", 0}})).ok());
+    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagDataOf({{"Kept", 0}})).ok());
     int fd = fs->open(path, O_RDONLY | O_CLOEXEC, 0);
     ASSERT_GE(fd, 0);
     ASSERT_EQ(fs->fremovexattr(fd, "xdg.tags"), 0);
@@ -186,7 +186,7 @@ TEST_F(DesktopTagsTest, TagsFromBeforeTheDesktopListAreNotTakenForARemoval) {
 }
 
 TEST_F(DesktopTagsTest, OurOwnWritesAreNeverReadBackAsChanges) {
-    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagData({{"One", 1}, {"Two", 0}})).ok());
+    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagDataOf({{"One", 1}, {"Two", 0}})).ok());
     fs->resetCalls();
     for (int i = 0; i < 3; ++i) EXPECT_EQ(recordTags(), (Coloured{{"One", 1}, {"Two", 0}}));
     EXPECT_EQ(fs->calls(Op::Fsetxattr) + fs->calls(Op::Fremovexattr), 0u);
@@ -216,12 +216,12 @@ public:
 };
 
 TEST_F(DesktopTagsTest, AFailedDesktopWriteIsLoggedOnceAndTheTagsStand) {
-    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagData({{"Before", 0}})).ok());
+    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagDataOf({{"Before", 0}})).ok());
     auto refusing = std::make_shared<RefusingDesktopList>(std::make_shared<LinuxFileSystem>());
     {
         testing::ScopedFileSystem refused(refusing);
         testing::ScopedLogCapture log;
-        EXPECT_TRUE(ItemMetadata::writeTagData(file, tagData({{"After", 3}})).ok());
+        EXPECT_TRUE(ItemMetadata::writeTagData(file, tagDataOf({{"After", 3}})).ok());
         std::vector<std::string> errors;
         for (const auto& line : log->texts())
             if (line.find("xdg.tags") != std::string::npos)
@@ -233,7 +233,7 @@ TEST_F(DesktopTagsTest, AFailedDesktopWriteIsLoggedOnceAndTheTagsStand) {
     EXPECT_EQ(recordTags(), (Coloured{{"After", 3}}));
     EXPECT_EQ(storedTags(), (Coloured{{"After", 3}}));
     // The next write that works brings the list back in step.
-    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagData({{"After", 3}, {"More", 0}})).ok());
+    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagDataOf({{"After", 3}, {"More", 0}})).ok());
     EXPECT_EQ(attribute("xdg.tags"), "After,More");
 }
 
@@ -267,7 +267,7 @@ TEST_F(DesktopTagsTest, AChangeMadeWhileTakingInIsNotLost) {
 }
 
 TEST_F(DesktopTagsTest, HostileListsNeverBreakTheRecord) {
-    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagData({{"Blue", 4}})).ok());
+    ASSERT_TRUE(ItemMetadata::writeTagData(file, tagDataOf({{"Blue", 4}})).ok());
     std::string hostile =
         "\xff\xfe,,  ,Blue,\xe2\x80\xae"
         "rtl";
