@@ -1,12 +1,14 @@
 #include "items/ItemMetadata.h"
 
 #include <cerrno>
+#include <functional>
 #include <set>
 
 #include "host/UrlOperations.h"
 #include "items/ExtendedAttributes.h"
 #include "items/LocalItem.h"
 #include "items/UnarchiveLogged.h"
+#include "items/XdgTagList.h"
 #include "platform/FileSystem.h"
 #include "platform/Tag.h"
 #include "platform/archive/KeyedArchiver.h"
@@ -14,6 +16,8 @@
 #include "platform/objects/Array.h"
 #include "platform/strata/StrataService.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
+#include "support/ProcessWide.h"
 
 namespace tamber {
 
@@ -28,23 +32,69 @@ std::shared_ptr<const T> decodeAttribute(const std::string& name, const Url& url
     return value.ok() ? value.value() : nullptr;
 }
 
-std::optional<std::vector<std::string>> labelsFromArchive(const Bytes& data) {
+using Tags = XdgTagList::Tags;
+
+// Tamber's tags attribute: an archived array whose elements are bare labels (no colour) or tags
+// (a label with a colour).
+std::optional<Tags> tagsFromArchive(const Bytes& data) {
     auto root = KeyedUnarchiver::unarchivedObjectOfClasses(
-        {std::string(Array::kClassName), std::string(String::kClassName)}, data);
+        {std::string(Array::kClassName), std::string(String::kClassName),
+         std::string(Tag::kClassName)},
+        data);
     if (!root.ok())
         return std::nullopt;
     auto array = objectCast<Array>(root.value());
     if (!array)
         return std::nullopt;
-    std::vector<std::string> labels;
-    labels.reserve(array->count());
+    Tags tags;
+    tags.reserve(array->count());
     for (const auto& element : array->objects()) {
-        auto label = objectCast<String>(element);
-        if (!label)
+        if (auto label = objectCast<String>(element)) {
+            tags.push_back(Tag::make(label->value(), 0));
+        } else if (auto tag = objectCast<Tag>(element)) {
+            tags.push_back(std::move(tag));
+        } else {
             return std::nullopt;
-        labels.push_back(label->value());
+        }
     }
+    return tags;
+}
+
+// A tag without colour is stored as its bare label, so that such lists stay what they always
+// were; only a coloured tag is stored whole.
+ObjectRef archiveRootForTags(const Tags& tags) {
+    std::vector<ObjectRef> elements;
+    elements.reserve(tags.size());
+    for (const auto& tag : tags) {
+        if (tag->colour() == 0)
+            elements.push_back(String::make(tag->label()));
+        else
+            elements.push_back(tag);
+    }
+    return Array::make(std::move(elements));
+}
+
+std::vector<std::string> labelsOf(const Tags& tags) {
+    std::vector<std::string> labels;
+    labels.reserve(tags.size());
+    for (const auto& tag : tags) labels.push_back(tag->label());
     return labels;
+}
+
+bool sameTags(const Tags& a, const Tags& b) {
+    if (a.size() != b.size())
+        return false;
+    for (size_t i = 0; i < a.size(); ++i)
+        if (!a[i]->isEqual(*b[i]))
+            return false;
+    return true;
+}
+
+// Tag writes and the taking in of the desktop list run one at a time in the process, so that
+// neither writes back tags it read before the other changed them.
+Mutex& tagsMutex() {
+    static ProcessWide<Mutex> mutex;
+    return *mutex;
 }
 
 // Archives `object`, or nothing for a null object (which removes the attribute).
@@ -57,13 +107,17 @@ Result<std::optional<Bytes>> archiveOrNothing(const ObjectRef& object) {
     return std::optional<Bytes>(std::move(data.value()));
 }
 
-Status writeObject(const Url& url, const std::string& name, const ObjectRef& object) {
+Status writeAttributeThen(const Url& url, const std::string& name, const std::optional<Bytes>& data,
+                          const std::function<void(int)>& then);
+
+Status writeObject(const Url& url, const std::string& name, const ObjectRef& object,
+                   const std::function<void(int)>& then = {}) {
     auto data = archiveOrNothing(object);
     if (!data.ok()) {
         logError("can't archive value for xattr " + name + "; " + data.error().description());
         return data.error();
     }
-    return ItemMetadata::writeAttributeData(url, name, data.value());
+    return writeAttributeThen(url, name, data.value(), then);
 }
 
 // The document's copy of its metadata follows what Tamber writes at once, so that a save right
@@ -71,6 +125,76 @@ Status writeObject(const Url& url, const std::string& name, const ObjectRef& obj
 void noteWritten(int fd, const std::optional<Bytes>& data, const std::string& name) {
     if (auto strata = StrataService::current())
         strata->metadataAttributeWritten(fd, name, data);
+}
+
+// Notes on the item that the desktop list now is `list` (nothing: no list), as Tamber wrote or
+// took it in.
+void noteDesktopListSynced(int fd, const std::optional<Bytes>& list) {
+    std::optional<Bytes> note;
+    if (list)
+        note = XdgTagList::fingerprint(*list);
+    if (SetOrRemoveXattr(fd, note, XdgTagList::syncedAttributeName()).ok())
+        noteWritten(fd, note, XdgTagList::syncedAttributeName());
+}
+
+// After Tamber's own attribute took `tags`: the desktop list follows. Tamber's attribute is the
+// record, so a desktop list that cannot be written fails nothing: SetOrRemoveXattr has logged it
+// once, and the list and its note stay as they were, so the stale list is not later taken for
+// another program's change.
+void mirrorToDesktopList(int fd, const Tags& tags) {
+    std::optional<Bytes> list = XdgTagList::format(labelsOf(tags));
+    if (!SetOrRemoveXattr(fd, list, XdgTagList::attributeName()).ok())
+        return;
+    noteWritten(fd, list, XdgTagList::attributeName());
+    noteDesktopListSynced(fd, list);
+}
+
+Status writeTags(const Url& url, const Tags& tags, const std::function<void(int)>& then) {
+    return writeObject(url, LocalItem::xattrTagDataName(), archiveRootForTags(tags), then);
+}
+
+// When the desktop list is not the one Tamber last wrote or took in, another program changed
+// it: Tamber's tags become that list (colours kept, tags the list cannot hold kept too) and the
+// list is noted as taken in. Our own write of the list leaves the note matching, so it is never
+// read back as a change. Returns the tags to show, or nothing when Tamber's stand.
+std::optional<Bytes> desktopListIfChanged(const Url& url, bool& changed) {
+    auto theirs = ReadXattrData(XdgTagList::attributeName(), url);
+    auto note = ReadXattrData(XdgTagList::syncedAttributeName(), url);
+    std::optional<Bytes> expected;
+    if (theirs)
+        expected = XdgTagList::fingerprint(*theirs);
+    changed = note != expected;
+    return theirs;
+}
+
+std::optional<Tags> takeInDesktopList(const Url& url) {
+    bool changed = false;
+    // The common case, a list in step, looks without waiting for writers elsewhere.
+    (void)desktopListIfChanged(url, changed);
+    if (!changed)
+        return std::nullopt;
+    MutexLock lock(tagsMutex());
+    auto theirs = desktopListIfChanged(url, changed);
+    if (!changed)
+        return std::nullopt;
+    Tags ours = ItemMetadata::readTags(url).value_or(Tags{});
+    std::vector<std::string> listed;
+    if (theirs)
+        listed = XdgTagList::parse(
+            std::string_view(reinterpret_cast<const char*>(theirs->data()), theirs->size()));
+    Tags merged = XdgTagList::merged(ours, listed);
+    logDebug([&] { return "taking in the desktop tags of " + url.absoluteString(); });
+    auto noteIt = [&](int fd) { noteDesktopListSynced(fd, theirs); };
+    if (sameTags(merged, ours)) {
+        pt_withReadWriteAccess(url, [&](int fd) {
+            noteIt(fd);
+            return true;
+        });
+    } else {
+        // Should the write fail (logged), the record still shows what the desktop holds.
+        (void)writeTags(url, merged, noteIt);
+    }
+    return merged;
 }
 
 // The names of the attributes present, or nothing when the listing failed (then every
@@ -108,11 +232,18 @@ std::shared_ptr<const Date> ItemMetadata::readLastUsedDate(const Url& url) {
     return decodeAttribute<Date>(LocalItem::xattrLastUsedDateName(), url);
 }
 
-std::optional<std::vector<std::string>> ItemMetadata::readTagLabels(const Url& url) {
+std::optional<std::vector<std::shared_ptr<const Tag>>> ItemMetadata::readTags(const Url& url) {
     auto data = ReadXattrData(LocalItem::xattrTagDataName(), url);
     if (!data)
         return std::nullopt;
-    return labelsFromArchive(*data);
+    return tagsFromArchive(*data);
+}
+
+std::optional<std::vector<std::string>> ItemMetadata::readTagLabels(const Url& url) {
+    auto tags = readTags(url);
+    if (!tags)
+        return std::nullopt;
+    return labelsOf(*tags);
 }
 
 std::shared_ptr<const Number> ItemMetadata::readFavoriteRank(const Url& url) {
@@ -138,10 +269,14 @@ ItemMetadata ItemMetadata::read(const Url& url) {
         return m;
     if (has(LocalItem::xattrLastUsedDateName()))
         m.lastUsedDate = readLastUsedDate(url);
-    if (has(LocalItem::xattrTagDataName())) {
-        m.tagLabels = readTagLabels(url);
-        if (m.tagLabels)
-            m.tagData = tagDataForLabels(*m.tagLabels);
+    std::optional<Tags> tags;
+    if (has(XdgTagList::attributeName()) || has(XdgTagList::syncedAttributeName()))
+        tags = takeInDesktopList(url);
+    if (!tags && has(LocalItem::xattrTagDataName()))
+        tags = readTags(url);
+    if (tags) {
+        m.tagLabels = labelsOf(*tags);
+        m.tagData = GetTagsDataForTags(*tags);
     }
     if (has(LocalItem::xattrFavoriteRankName()))
         m.favoriteRank = readFavoriteRank(url);
@@ -164,13 +299,13 @@ Status ItemMetadata::writeLastUsedDate(const Url& url, const std::shared_ptr<con
 }
 
 Status ItemMetadata::writeTagData(const Url& url, const std::optional<Bytes>& tagData) {
-    std::vector<ObjectRef> labels;
+    Tags tags;
     if (tagData) {
-        if (auto tags = GetTagsFromTagsData(*tagData)) {
-            for (const auto& tag : *tags) labels.push_back(String::make(tag->label()));
-        }
+        if (auto decoded = GetTagsFromTagsData(*tagData))
+            tags = std::move(*decoded);
     }
-    return writeObject(url, LocalItem::xattrTagDataName(), Array::make(std::move(labels)));
+    MutexLock lock(tagsMutex());
+    return writeTags(url, tags, [&](int fd) { mirrorToDesktopList(fd, tags); });
 }
 
 Status ItemMetadata::writeFavoriteRank(const Url& url, const std::shared_ptr<const Number>& rank) {
@@ -183,12 +318,22 @@ Status ItemMetadata::writeTrashDate(const Url& url, const std::shared_ptr<const 
 
 Status ItemMetadata::writeAttributeData(const Url& url, const std::string& name,
                                         const std::optional<Bytes>& data) {
+    return writeAttributeThen(url, name, data, {});
+}
+
+namespace {
+
+// Writes `name`, then runs `then` on the same descriptor when that worked.
+Status writeAttributeThen(const Url& url, const std::string& name, const std::optional<Bytes>& data,
+                          const std::function<void(int)>& then) {
     Status written;
     bool ok = pt_withReadWriteAccess(url, [&](int fd) {
         written = SetOrRemoveXattr(fd, data, name);
         if (!written.ok())
             return false;
         noteWritten(fd, data, name);
+        if (then)
+            then(fd);
         return true;
     });
     if (ok)
@@ -199,6 +344,8 @@ Status ItemMetadata::writeAttributeData(const Url& url, const std::string& name,
              error.description());
     return error;
 }
+
+}  // namespace
 
 Status ItemMetadata::writePutBack(const Url& url, const std::shared_ptr<const String>& path) {
     return writeObject(url, LocalItem::xattrTrashPutBackName(), path);

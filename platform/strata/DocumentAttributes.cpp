@@ -67,9 +67,15 @@ std::optional<Bytes> readValue(FileSystem& fs, const std::string& path, const st
 
 const std::vector<std::string>& DocumentAttributes::names() {
     static const std::vector<std::string> kNames{
-        "com.velk.lastuseddate#PS",         "com.velk.metadata:_kHostItemUserTags",
-        "com.velk.favorite-rank.number#PS", "com.velk.trash.time#PS",
+        "com.velk.lastuseddate#PS",
+        "com.velk.metadata:_kHostItemUserTags",
+        "com.velk.favorite-rank.number#PS",
+        "com.velk.trash.time#PS",
         "com.velk.trash.putback#PS",
+        // The desktop's tag list and Tamber's note of the list it last wrote or took in: were
+        // they left behind while Tamber's tags moved on, the stale list would read as a change.
+        "xdg.tags",
+        "com.velk.xdg-tags.synced#PS",
     };
     return kNames;
 }

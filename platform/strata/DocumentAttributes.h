@@ -12,7 +12,8 @@
 namespace tamber {
 
 // The metadata attributes that follow a document from inode to inode (tags, last-used date,
-// favourite rank, trash date and put-back path), read and written as raw bytes through
+// favourite rank, trash date and put-back path, plus the desktop's tag list "xdg.tags" and
+// Tamber's note of it, which must move with the tags), read and written as raw bytes through
 // FileSystem. Names are without the "user." prefix. What they mean is the item layer's business.
 class DocumentAttributes {
 public:

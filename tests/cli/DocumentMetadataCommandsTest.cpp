@@ -95,6 +95,29 @@ TEST_F(DocumentMetadataCommandsTest, TagsAndRankSurviveAReplaceWhileTheJournalRu
     EXPECT_EQ(json::parse(tamber({"meta", file, "--json"}).out)["favoriteRank"], 4);
 }
 
+// Tags are shared with desktop programs through user.xdg.tags: the verbs show a list another
+// program wrote, and the list and the tags stay together through a replace.
+TEST_F(DocumentMetadataCommandsTest, ADesktopTagListShowsInMetaAndSurvivesAReplace) {
+    auto desktopList = [&]() -> std::string {
+        char buffer[256];
+        ssize_t n = ::getxattr(file.c_str(), "user.xdg.tags", buffer, sizeof buffer);
+        return n < 0 ? std::string("(none)") : std::string(buffer, static_cast<size_t>(n));
+    };
+    tamber({"tag", file, "Home", "Work"});
+    EXPECT_EQ(desktopList(), "Home,Work");
+
+    const std::string theirs = "Work, Desk";
+    ASSERT_EQ(::setxattr(file.c_str(), "user.xdg.tags", theirs.data(), theirs.size(), 0), 0);
+    EXPECT_EQ(tags(), json({"Work", "Desk"}));
+    replaceLikeSed(file);
+    EXPECT_EQ(tags(), json({"Work", "Desk"}));
+    EXPECT_EQ(desktopList(), theirs);
+
+    tamber({"tag", file});
+    EXPECT_EQ(tags(), json::array());
+    EXPECT_EQ(desktopList(), "(none)");
+}
+
 // Removed by the user on the file itself (not through Tamber): the removal is the user's word,
 // and the next replacement must not bring the value back; what was not removed still comes back.
 TEST_F(DocumentMetadataCommandsTest, AnAttributeRemovedOnTheFileStaysRemovedAfterAReplace) {

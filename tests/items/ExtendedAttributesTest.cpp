@@ -11,6 +11,7 @@
 
 #include "items/ItemMetadata.h"
 #include "items/LocalItem.h"
+#include "items/XdgTagList.h"
 #include "platform/FaultInjectingFileSystem.h"
 #include "platform/LinuxFileSystem.h"
 #include "platform/Tag.h"
@@ -120,11 +121,12 @@ TEST_F(ExtendedAttributesTest, MetadataReadsBackAndOnlyNothingRemovesIt) {
     ASSERT_TRUE(m.lastUsedDate && m.favoriteRank && m.tagData);
     EXPECT_EQ(m.lastUsedDate->timeIntervalSince1970(), 1700000000.25);
     EXPECT_EQ(m.favoriteRank->int64Value(), -3);
-    // Tags are stored as labels: colours are dropped, order is kept.
+    // Tags keep their order and their colours.
     EXPECT_EQ(m.tagLabels, (std::vector<std::string>{"Red", "Home"}));
     auto tags = GetTagsFromTagsData(*m.tagData);
     ASSERT_TRUE(tags && tags->size() == 2);
-    EXPECT_EQ((*tags)[0]->colour(), 0);
+    EXPECT_EQ((*tags)[0]->colour(), 6);
+    EXPECT_EQ((*tags)[1]->colour(), 0);
 
     ASSERT_TRUE(ItemMetadata::writeLastUsedDate(file, nullptr).ok());
     ASSERT_TRUE(ItemMetadata::writeFavoriteRank(file, nullptr).ok());
@@ -200,10 +202,11 @@ TEST_F(ExtendedAttributesTest, TheDocumentIdServiceHearsOfEveryWriteThatHappened
 }
 
 // The journal keeps copies of exactly the attributes that items keep their metadata in.
-TEST(DocumentAttributeNamesTest, AreTheFiveMetadataAttributes) {
+TEST(DocumentAttributeNamesTest, AreTheFiveMetadataAttributesAndTheDesktopTagList) {
     std::set<std::string> items{LocalItem::xattrLastUsedDateName(), LocalItem::xattrTagDataName(),
                                 LocalItem::xattrFavoriteRankName(), LocalItem::xattrTrashDateName(),
-                                LocalItem::xattrTrashPutBackName()};
+                                LocalItem::xattrTrashPutBackName(), XdgTagList::attributeName(),
+                                XdgTagList::syncedAttributeName()};
     const auto& kept = DocumentAttributes::names();
     EXPECT_EQ(std::set<std::string>(kept.begin(), kept.end()), items);
     EXPECT_EQ(kept.size(), items.size());

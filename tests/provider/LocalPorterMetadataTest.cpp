@@ -3,6 +3,7 @@
 
 #include "items/ExtendedAttributes.h"
 #include "items/ItemMetadata.h"
+#include "items/XdgTagList.h"
 #include "platform/FaultInjectingFileSystem.h"
 #include "platform/LinuxFileSystem.h"
 #include "platform/Tag.h"
@@ -79,7 +80,7 @@ TEST_F(MetadataTest, LastUsedDateAndRankAreWrittenAndCleared) {
     EXPECT_EQ(log->countStartingWith("[ERROR]"), 0u);
 }
 
-TEST_F(MetadataTest, TagsKeepOnlyLabelsAndClearingStoresAnEmptyList) {
+TEST_F(MetadataTest, TagsKeepTheirColoursMirrorTheDesktopListAndClearingStoresAnEmptyList) {
     std::string file = writeFile(storage + "/Projects/a.txt");
     HostPorterItemIdentifier identifier = identifierOf(file);
     Url url = Url::fileURLWithPath(file);
@@ -94,8 +95,12 @@ TEST_F(MetadataTest, TagsKeepOnlyLabelsAndClearingStoresAnEmptyList) {
     ASSERT_TRUE(tags);
     ASSERT_EQ(tags->size(), 2u);
     EXPECT_EQ((*tags)[0]->label(), "Work");
-    EXPECT_EQ((*tags)[0]->colour(), 0);
-    EXPECT_EQ((*tags)[1]->colour(), 0);
+    EXPECT_EQ((*tags)[0]->colour(), 4);
+    EXPECT_EQ((*tags)[1]->colour(), 6);
+    // The desktop's list holds the names, in order.
+    auto desktop = ReadXattrData("xdg.tags", url);
+    ASSERT_TRUE(desktop);
+    EXPECT_EQ(std::string(desktop->begin(), desktop->end()), "Work,Travel");
 
     for (const std::optional<Bytes>& cleared :
          {std::optional<Bytes>(), std::optional<Bytes>(Bytes{1, 2, 3})}) {
@@ -106,6 +111,7 @@ TEST_F(MetadataTest, TagsKeepOnlyLabelsAndClearingStoresAnEmptyList) {
         // Still there, holding an archived empty list.
         ASSERT_TRUE(ReadXattrData(LocalItem::xattrTagDataName(), url));
         EXPECT_EQ(ItemMetadata::readTagLabels(url), std::vector<std::string>{});
+        EXPECT_FALSE(ReadXattrData("xdg.tags", url));
         // Put something back so that the next round clears again.
         porter->setTagData(tagData, identifier, ItemOutcome().handler());
     }
@@ -215,10 +221,14 @@ TEST_F(MetadataJournalTest, EveryProviderMetadataWriteIsToldToTheJournal) {
     ASSERT_TRUE(LocalPorter::changeMetadataAtURL(Url::fileURLWithPath(file), changes).ok());
     EXPECT_EQ(recorder->writes,
               (std::vector<Write>{{inode, LocalItem::xattrTagDataName(), true},
+                                  {inode, XdgTagList::attributeName(), true},
+                                  {inode, XdgTagList::syncedAttributeName(), true},
                                   {inode, LocalItem::xattrFavoriteRankName(), true},
                                   {inode, LocalItem::xattrLastUsedDateName(), true},
                                   {inode, LocalItem::xattrFavoriteRankName(), false},
-                                  {inode, LocalItem::xattrTagDataName(), true}}));
+                                  {inode, LocalItem::xattrTagDataName(), true},
+                                  {inode, XdgTagList::attributeName(), false},
+                                  {inode, XdgTagList::syncedAttributeName(), false}}));
     auto after = LocalPorter::metadataAtURL(Url::fileURLWithPath(file));
     EXPECT_FALSE(after.favoriteRank);
     ASSERT_TRUE(after.tagLabels);

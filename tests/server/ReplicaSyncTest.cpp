@@ -8,8 +8,11 @@
 #include <set>
 #include <thread>
 
+#include <fcntl.h>
 #include <sys/inotify.h>
 
+#include "items/ItemMetadata.h"
+#include "platform/FileSystem.h"
 #include "platform/tremors/InotifyApi.h"
 #include "platform/tremors/SqliteDatabase.h"
 #include "platform/tremors/TremorService.h"
@@ -326,6 +329,61 @@ TEST_F(ReplicaSyncTest, ChangesOnDiskReachTheReplicaInOrder) {
         EXPECT_EQ(heard[i].sequence, history.value()[i].sequence);
         EXPECT_EQ(heard[i].changes, history.value()[i].changes);
     }
+}
+
+// A tag list that a desktop program writes to a file reaches the replica and its search through
+// the journal alone, and becomes the item's own tags; taking it in writes once, not forever.
+TEST_F(ReplicaSyncTest, ADesktopTagListWrittenByAnotherProgramReachesTheSearch) {
+    const std::string path = storage + "/tagged.txt";
+    write(path);
+    start();
+    auto taggedWith = [&](const std::string& tag) {
+        ReplicaSearchQuery query;
+        query.tag = tag;
+        query.limit = 10;
+        auto found = replica->search(query);
+        std::set<std::string> paths;
+        if (found.ok())
+            for (const auto& item : found.value()) paths.insert(item.value("path", ""));
+        return paths;
+    };
+    auto setDesktopList = [&](const std::optional<std::string>& list) {
+        FileSystem& fs = FileSystem::current();
+        int fd = fs.open(path, O_RDONLY | O_CLOEXEC, 0);
+        ASSERT_GE(fd, 0);
+        int rc = list ? fs.fsetxattr(fd, "xdg.tags", list->data(), list->size(), 0)
+                      : fs.fremovexattr(fd, "xdg.tags");
+        fs.close(fd);
+        if (rc != 0 && errno == ENOTSUP)
+            GTEST_SKIP() << "no user attributes on this file system";
+        ASSERT_EQ(rc, 0);
+    };
+    auto waitFor = [&](const std::string& tag, const std::set<std::string>& expected) {
+        journal->sync();
+        const auto deadline = std::chrono::steady_clock::now() + kPatience;
+        while (taggedWith(tag) != expected && std::chrono::steady_clock::now() < deadline)
+            std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        return taggedWith(tag) == expected;
+    };
+    const Url url = Url::fileURLWithPath(path);
+
+    ASSERT_NO_FATAL_FAILURE(setDesktopList("Desk,Work"));
+    if (IsSkipped())
+        return;
+    ASSERT_TRUE(waitFor("Desk", {path}));
+    EXPECT_EQ(taggedWith("Work"), std::set<std::string>{path});
+    EXPECT_EQ(ItemMetadata::readTagLabels(url), (std::vector<std::string>{"Desk", "Work"}));
+
+    // Taking it in changed Tamber's attribute, whose event is heard once and then all is quiet.
+    settle();
+    const uint64_t settled = replica->status().sequence;
+    settle();
+    EXPECT_EQ(replica->status().sequence, settled);
+
+    ASSERT_NO_FATAL_FAILURE(setDesktopList(std::nullopt));
+    ASSERT_TRUE(waitFor("Work", {}));
+    EXPECT_EQ(taggedWith("Desk"), std::set<std::string>{});
+    EXPECT_EQ(ItemMetadata::readTagLabels(url), std::vector<std::string>{});
 }
 
 // Events the kernel dropped are history lost: the status says so from then on (whether the

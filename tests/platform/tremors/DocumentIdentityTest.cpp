@@ -36,6 +36,9 @@ namespace fs = std::filesystem;
 
 const std::string kTagsAttribute = "com.velk.metadata:_kHostItemUserTags";
 const std::string kRankAttribute = "com.velk.favorite-rank.number#PS";
+// The desktop's tag list and Tamber's note of the list it last wrote or took in.
+const std::string kDesktopTags = "xdg.tags";
+const std::string kDesktopTagsNote = "com.velk.xdg-tags.synced#PS";
 
 uint64_t documentInodeOf(const std::string& path) {
     struct statx st {};
@@ -505,6 +508,38 @@ TEST_F(DocumentIdentityTest, AttributeEventsOfDocumentsUpdateTheCopyAndOthersCos
     safeSave(path, "v4");
     service_->sync();
     EXPECT_EQ(attribute(path, kTagsAttribute), "the editor's tags");
+    EXPECT_EQ(strata_->documentIdForInode(device_, documentInodeOf(path)), docs[0].id);
+}
+
+// Tamber's tags and the desktop's list must not part at a save, or the list left behind would
+// later be taken for a removal of every tag by another program.
+TEST_F(DocumentIdentityTest, TheDesktopTagListAndItsNoteFollowSafeSaves) {
+    ASSERT_NO_FATAL_FAILURE(start());
+    auto docs = makeDocuments(1);
+    const std::string& path = docs[0].path;
+    setAttribute(path, kDesktopTags, "Work,Home");
+    setAttribute(path, kDesktopTagsNote, "note of Work,Home");
+    safeSave(path, "v1");
+    service_->sync();
+    EXPECT_EQ(attribute(path, kTagsAttribute), docs[0].tags);
+    EXPECT_EQ(attribute(path, kDesktopTags), "Work,Home");
+    EXPECT_EQ(attribute(path, kDesktopTagsNote), "note of Work,Home");
+
+    // Changed by another program: the copy learns the new list from the event.
+    setAttributeBehindTheBack(path, kDesktopTags, "Desk");
+    service_->sync();
+    safeSave(path, "v2");
+    service_->sync();
+    EXPECT_EQ(attribute(path, kDesktopTags), "Desk");
+    EXPECT_EQ(attribute(path, kDesktopTagsNote), "note of Work,Home");
+
+    // And saved while nothing watches.
+    stop();
+    safeSave(path, "v3");
+    ASSERT_NO_FATAL_FAILURE(start());
+    EXPECT_EQ(attribute(path, kTagsAttribute), docs[0].tags);
+    EXPECT_EQ(attribute(path, kDesktopTags), "Desk");
+    EXPECT_EQ(attribute(path, kDesktopTagsNote), "note of Work,Home");
     EXPECT_EQ(strata_->documentIdForInode(device_, documentInodeOf(path)), docs[0].id);
 }
 
