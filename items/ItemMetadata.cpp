@@ -34,13 +34,11 @@ std::shared_ptr<const T> decodeAttribute(const std::string& name, const Url& url
 
 using Tags = XdgTagList::Tags;
 
-// Tamber's tags attribute: an archived array whose elements are bare labels (no colour) or tags
-// (a label with a colour).
+// Tamber's tags attribute: an archived array of labels. Colours are not stored: every tag
+// read back has colour 0.
 std::optional<Tags> tagsFromArchive(const Bytes& data) {
     auto root = KeyedUnarchiver::unarchivedObjectOfClasses(
-        {std::string(Array::kClassName), std::string(String::kClassName),
-         std::string(Tag::kClassName)},
-        data);
+        {std::string(Array::kClassName), std::string(String::kClassName)}, data);
     if (!root.ok())
         return std::nullopt;
     auto array = objectCast<Array>(root.value());
@@ -49,29 +47,19 @@ std::optional<Tags> tagsFromArchive(const Bytes& data) {
     Tags tags;
     tags.reserve(array->count());
     for (const auto& element : array->objects()) {
-        if (auto label = objectCast<String>(element)) {
-            tags.push_back(Tag::make(label->value(), 0));
-        } else if (auto tag = objectCast<Tag>(element)) {
-            tags.push_back(std::move(tag));
-        } else {
+        auto label = objectCast<String>(element);
+        if (!label)
             return std::nullopt;
-        }
+        tags.push_back(Tag::make(label->value(), 0));
     }
     return tags;
 }
 
-// A tag without colour is stored as its bare label, so that such lists stay what they always
-// were; only a coloured tag is stored whole.
 ObjectRef archiveRootForTags(const Tags& tags) {
-    std::vector<ObjectRef> elements;
-    elements.reserve(tags.size());
-    for (const auto& tag : tags) {
-        if (tag->colour() == 0)
-            elements.push_back(String::make(tag->label()));
-        else
-            elements.push_back(tag);
-    }
-    return Array::make(std::move(elements));
+    std::vector<ObjectRef> labels;
+    labels.reserve(tags.size());
+    for (const auto& tag : tags) labels.push_back(String::make(tag->label()));
+    return Array::make(std::move(labels));
 }
 
 std::vector<std::string> labelsOf(const Tags& tags) {
@@ -154,7 +142,7 @@ Status writeTags(const Url& url, const Tags& tags, const std::function<void(int)
 }
 
 // When the desktop list is not the one Tamber last wrote or took in, another program changed
-// it: Tamber's tags become that list (colours kept, tags the list cannot hold kept too) and the
+// it: Tamber's tags become that list (tags the list cannot hold are kept) and the
 // list is noted as taken in. Our own write of the list leaves the note matching, so it is never
 // read back as a change. Returns the tags to show, or nothing when Tamber's stand.
 std::optional<Bytes> desktopListIfChanged(const Url& url, bool& changed) {

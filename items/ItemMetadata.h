@@ -19,7 +19,7 @@ namespace tamber {
 // archive; a missing or undecodable attribute leaves its field empty.
 struct ItemMetadata {
     std::shared_ptr<const Date> lastUsedDate;
-    // The tag labels, and the same tags with their colours as platform tag data. When the
+    // The tag labels as stored, and the same tags (no colour) as platform tag data. When the
     // desktop's tag list ("xdg.tags", see XdgTagList) was changed by another program, reading
     // takes it in first: Tamber's tags are rewritten to match it.
     std::optional<std::vector<std::string>> tagLabels;
@@ -35,7 +35,7 @@ struct ItemMetadata {
     static ItemMetadata read(const Url& url);
 
     static std::shared_ptr<const Date> readLastUsedDate(const Url& url);
-    // Tamber's own tags with their colours (the desktop list is not consulted).
+    // Tamber's own tags, each without colour (the desktop list is not consulted).
     static std::optional<std::vector<std::shared_ptr<const Tag>>> readTags(const Url& url);
     static std::optional<std::vector<std::string>> readTagLabels(const Url& url);
     static std::shared_ptr<const Number> readFavoriteRank(const Url& url);
@@ -47,9 +47,10 @@ struct ItemMetadata {
     // hears of each write that happened. A null value removes the attribute (removing one
     // that is not there succeeds), except for tags: absent or undecodable tag data is written
     // as an empty list, so that clearing the tags is a change too and the attribute stays. A
-    // failure is logged ("can't set xattr NAME on URL; ERROR") and returned. Tags keep their
-    // colours, and the desktop list "xdg.tags" is written to match (removed when no tag is
-    // left); a failure there is logged once and fails nothing (XdgTagList has the rules).
+    // failure is logged ("can't set xattr NAME on URL; ERROR") and returned. Tags are stored as
+    // labels (colours are dropped), and the desktop list "xdg.tags" is written to match (removed
+    // when no tag is left); a failure there is logged once and fails nothing (XdgTagList has the
+    // rules).
     static Status writeLastUsedDate(const Url& url, const std::shared_ptr<const Date>& date);
     static Status writeTagData(const Url& url, const std::optional<Bytes>& tagData);
     static Status writeFavoriteRank(const Url& url, const std::shared_ptr<const Number>& rank);

@@ -22,8 +22,8 @@ namespace tamber {
 // - Writing lists only the labels that reading gives back unchanged ("representable"). A label
 //   with a comma, surrounding spaces or control characters stays Tamber's alone: it is left out
 //   of the desktop list and is kept when that list changes.
-// - Colours are Tamber's: the desktop list holds names only, so a kept name keeps its colour and
-//   a name the desktop adds gets none (0).
+// - The desktop list holds names only: a name it adds gets no colour (0), and a kept name keeps
+//   the tag it had.
 class XdgTagList {
 public:
     using Tags = std::vector<std::shared_ptr<const Tag>>;

@@ -106,7 +106,7 @@ TEST_F(OperationsEndToEndTest, EveryOperationShowsOnDiskAndInTheChangesThatFollo
     ASSERT_TRUE(labels);
     ASSERT_EQ(labels->size(), 2u);
     EXPECT_EQ((*labels)[0]->label(), "Work");
-    EXPECT_EQ((*labels)[1]->colour(), 5);  // colours are kept
+    EXPECT_EQ((*labels)[1]->colour(), 0);  // colours are not kept
 
     // Trash and put back, then trash for good and let the sweep take it.
     auto trashed =

