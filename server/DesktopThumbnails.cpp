@@ -51,6 +51,44 @@ uint32_t bigEndian32(const uint8_t* p) {
     return uint32_t(p[0]) << 24 | uint32_t(p[1]) << 16 | uint32_t(p[2]) << 8 | uint32_t(p[3]);
 }
 
+void appendBigEndian32(Bytes& out, uint32_t value) {
+    for (int shift = 24; shift >= 0; shift -= 8) out.push_back(uint8_t(value >> shift));
+}
+
+uint32_t crc32(const uint8_t* data, size_t length) {
+    uint32_t crc = 0xffffffffu;
+    for (size_t i = 0; i < length; ++i) {
+        crc ^= data[i];
+        for (int bit = 0; bit < 8; ++bit) crc = (crc >> 1) ^ (0xedb88320u & (0u - (crc & 1)));
+    }
+    return ~crc;
+}
+
+void appendChunk(Bytes& png, const std::string& type, const Bytes& data) {
+    appendBigEndian32(png, uint32_t(data.size()));
+    const size_t start = png.size();
+    png.insert(png.end(), type.begin(), type.end());
+    png.insert(png.end(), data.begin(), data.end());
+    appendBigEndian32(png, crc32(&png[start], png.size() - start));
+}
+
+// The failure marker: a 1-pixel grey PNG carrying the text chunks.
+Bytes failureMarker(const std::map<std::string, std::string>& text) {
+    Bytes png = {0x89, 'P', 'N', 'G', '\r', '\n', 0x1a, '\n'};
+    appendChunk(png, "IHDR", {0, 0, 0, 1, 0, 0, 0, 1, 8, 0, 0, 0, 0});
+    for (const auto& [key, value] : text) {
+        Bytes chunk(key.begin(), key.end());
+        chunk.push_back(0);
+        chunk.insert(chunk.end(), value.begin(), value.end());
+        appendChunk(png, "tEXt", chunk);
+    }
+    // A zlib stream of one stored block holding the row: filter 0, pixel 0.
+    appendChunk(png, "IDAT",
+                {0x78, 0x01, 0x01, 0x02, 0x00, 0xfd, 0xff, 0x00, 0x00, 0x00, 0x02, 0x00, 0x01});
+    appendChunk(png, "IEND", {});
+    return png;
+}
+
 // Creates each missing folder of `path` (absolute), private to the user.
 Status makeFolders(const std::string& path) {
     FileSystem& fs = FileSystem::current();
@@ -64,6 +102,8 @@ Status makeFolders(const std::string& path) {
 }
 
 }  // namespace
+
+const char* const DesktopThumbnails::kFailureFolder = TAMBER_THUMBNAILER;
 
 struct DesktopThumbnails::Job {
     std::string folder;  // normal/ or large/ of the cache
@@ -146,6 +186,10 @@ DesktopThumbnails::~DesktopThumbnails() {
     for (auto& thread : threads_) thread.join();
 }
 
+std::string DesktopThumbnails::failureFolder() const {
+    return options_.cacheFolder + "/fail/" + kFailureFolder;
+}
+
 size_t DesktopThumbnails::queuedForTesting() const {
     std::lock_guard lock(mutex_);
     return queue_.size();
@@ -176,6 +220,9 @@ Result<Bytes> DesktopThumbnails::thumbnail(const std::string& path, ScopedFd fil
 
     if (auto hit = cached(job->folder + "/" + job->name, uri, job->mtime); hit.ok())
         return hit;
+    if (cached(failureFolder() + "/" + job->name, uri, job->mtime).ok())
+        return Error(kPosixErrorDomain, EBADMSG,
+                     {{"description", "the file is not an image that can be read"}});
     if (st.stx_size > kMaxSourceBytes)
         return tooLarge();
     job->file = std::move(file);
@@ -249,8 +296,12 @@ Result<Bytes> DesktopThumbnails::renderAndStore(const Job& job) const {
     auto png = options_.renderer->render(
         source.value(), job.edge,
         {{kUriKey, job.uri}, {kMTimeKey, std::to_string(job.mtime)}, {"Software", "Tamber"}});
-    if (!png.ok())
+    if (!png.ok()) {
+        if (png.error().is(kPosixErrorDomain, EBADMSG))
+            store(failureFolder(), job.name,
+                  failureMarker({{kUriKey, job.uri}, {kMTimeKey, std::to_string(job.mtime)}}));
         return png.error();
+    }
     store(job.folder, job.name, png.value());
     return png;
 }

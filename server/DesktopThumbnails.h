@@ -34,6 +34,10 @@ public:
     static constexpr uint64_t kMaxSourceBytes = 64ull << 20;
     static constexpr int kNormalEdge = 128;
     static constexpr int kLargeEdge = 256;
+    // Under <cache>/fail/: a file that could not be rendered is marked there, by the same name,
+    // with a 1-pixel PNG carrying its Thumb::URI and Thumb::MTime, and not tried again while
+    // its mtime stays the same.
+    static const char* const kFailureFolder;
 
     struct Options {
         std::string cacheFolder;  // the "thumbnails" folder; see defaultCacheFolder()
@@ -69,6 +73,7 @@ public:
 private:
     struct Job;
 
+    std::string failureFolder() const;
     Result<Bytes> cached(const std::string& file, const std::string& uri, int64_t mtime) const;
     void work();
     Result<Bytes> renderAndStore(const Job& job) const;

@@ -248,17 +248,45 @@ TEST_F(DesktopThumbnailsTest, RefusesHugeFilesAndUndecodableBytes) {
     const std::string whole = encodedImage(64, 64, "png");
     for (std::string bad : {std::string("not an image at all"), whole.substr(0, 20), std::string(),
                             std::string("\x89PNG\r\n\x1a\n\xff\xff\xff\xff", 12)}) {
-        const std::string path = files.writeFile("bad.png", bad);
+        // Each its own file: a failure is remembered by name and mtime.
+        const std::string path = files.writeFile("bad" + std::to_string(bad.size()) + ".png", bad);
+        const int before = renderer->calls;
         auto failed = thumbnails->thumbnail(path, openForReading(path), 128);
         ASSERT_FALSE(failed.ok()) << bad.size();
         EXPECT_TRUE(failed.error().is(kPosixErrorDomain, EBADMSG)) << failed.error().description();
         EXPECT_FALSE(fs::exists(cacheFile("normal", path)));
+        EXPECT_EQ(renderer->calls, before + 1);
     }
+
+    // A failure is remembered as the desktop remembers its own, so the file is not decoded
+    // again until it changes.
+    const std::string broken = files.writeFile("broken.jpg", "JFIF? no.");
+    setMtime(broken, 1600000000);
+    ASSERT_FALSE(thumbnails->thumbnail(broken, openForReading(broken), 128).ok());
+    const int tried = renderer->calls;
+    const std::string marker =
+        cache.path() + "/thumbnails/fail/" + DesktopThumbnails::kFailureFolder + "/" +
+        DesktopThumbnails::cacheNameForUri(DesktopThumbnails::uriForPath(broken));
+    auto markerText = DesktopThumbnails::pngText(toBytes(fileBytes(marker)));
+    EXPECT_EQ(markerText["Thumb::URI"], DesktopThumbnails::uriForPath(broken));
+    EXPECT_EQ(markerText["Thumb::MTime"], "1600000000");
+    EXPECT_EQ(decodedSize(fileBytes(marker)), std::make_pair(1, 1));
+    auto again = thumbnails->thumbnail(broken, openForReading(broken), 256);
+    ASSERT_FALSE(again.ok());
+    EXPECT_TRUE(again.error().is(kPosixErrorDomain, EBADMSG)) << again.error().description();
+    EXPECT_EQ(renderer->calls, tried);
+    // Once it is a real image, it gets its thumbnail.
+    files.writeFile("broken.jpg", encodedImage(30, 30, "jpeg"));
+    setMtime(broken, 1600000001);
+    auto mended = thumbnails->thumbnail(broken, openForReading(broken), 128);
+    ASSERT_TRUE(mended.ok()) << mended.error().description();
+    EXPECT_EQ(renderer->calls, tried + 1);
 
     // A file cut short in its pixel data may give a partial picture, but never a crash nor
     // anything other than a valid thumbnail or that error.
     for (size_t cut = 33; cut < whole.size(); cut += 9) {
-        const std::string path = files.writeFile("cut.png", whole.substr(0, cut));
+        const std::string path =
+            files.writeFile("cut" + std::to_string(cut) + ".png", whole.substr(0, cut));
         auto partial = thumbnails->thumbnail(path, openForReading(path), 128);
         if (partial.ok())
             EXPECT_EQ(decodedSize(partial.value()), std::make_pair(64, 64)) << cut;
