@@ -23,13 +23,13 @@ constexpr const char* kMTimeKey = "Thumb::MTime";
 // A cached thumbnail larger than this is not one of ours, nor any file manager's.
 constexpr size_t kMaxCachedBytes = 16 << 20;
 
-Error tooLarge() {
+Error sourceTooLarge() {
     return Error(kPosixErrorDomain, EFBIG,
                  {{"description", "the file is too large to make a thumbnail of (over 64 MiB)"}});
 }
 
 // Reads up to `limit` bytes of `fd` from its start; more than that is EFBIG.
-Result<Bytes> readAll(int fd, size_t limit) {
+Result<Bytes> readUpTo(int fd, size_t limit) {
     FileSystem& fs = FileSystem::current();
     Bytes bytes;
     char buffer[64 * 1024];
@@ -55,7 +55,7 @@ void appendBigEndian32(Bytes& out, uint32_t value) {
     for (int shift = 24; shift >= 0; shift -= 8) out.push_back(uint8_t(value >> shift));
 }
 
-uint32_t crc32(const uint8_t* data, size_t length) {
+uint32_t pngChunkCrc(const uint8_t* data, size_t length) {
     uint32_t crc = 0xffffffffu;
     for (size_t i = 0; i < length; ++i) {
         crc ^= data[i];
@@ -69,7 +69,7 @@ void appendChunk(Bytes& png, const std::string& type, const Bytes& data) {
     const size_t start = png.size();
     png.insert(png.end(), type.begin(), type.end());
     png.insert(png.end(), data.begin(), data.end());
-    appendBigEndian32(png, crc32(&png[start], png.size() - start));
+    appendBigEndian32(png, pngChunkCrc(&png[start], png.size() - start));
 }
 
 // The failure marker: a 1-pixel grey PNG carrying the text chunks.
@@ -224,7 +224,7 @@ Result<Bytes> DesktopThumbnails::thumbnail(const std::string& path, ScopedFd fil
         return Error(kPosixErrorDomain, EBADMSG,
                      {{"description", "the file is not an image that can be read"}});
     if (st.stx_size > kMaxSourceBytes)
-        return tooLarge();
+        return sourceTooLarge();
     job->file = std::move(file);
 
     std::unique_lock lock(mutex_);
@@ -258,7 +258,7 @@ Result<Bytes> DesktopThumbnails::cached(const std::string& file, const std::stri
     ScopedFd fd(fs.open(file, O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
     if (!fd.ok())
         return Error::posix(errno);
-    auto png = readAll(fd.get(), kMaxCachedBytes);
+    auto png = readUpTo(fd.get(), kMaxCachedBytes);
     if (!png.ok())
         return png.error();
     auto text = pngText(png.value());
@@ -290,9 +290,9 @@ void DesktopThumbnails::work() {
 }
 
 Result<Bytes> DesktopThumbnails::renderAndStore(const Job& job) const {
-    auto source = readAll(job.file.get(), kMaxSourceBytes);
+    auto source = readUpTo(job.file.get(), kMaxSourceBytes);
     if (!source.ok())
-        return source.error().is(kPosixErrorDomain, EFBIG) ? tooLarge() : source.error();
+        return source.error().is(kPosixErrorDomain, EFBIG) ? sourceTooLarge() : source.error();
     auto png = options_.renderer->render(
         source.value(), job.edge,
         {{kUriKey, job.uri}, {kMTimeKey, std::to_string(job.mtime)}, {"Software", "Tamber"}});

@@ -26,7 +26,7 @@ using testing::encodedImage;
 using testing::TempDir;
 namespace fs = std::filesystem;
 
-constexpr double kPatience = 20;  // seconds: only a hang gets near it
+constexpr double kThumbnailTestPatience = 20;  // seconds: only a hang gets near it
 
 std::string fileBytes(const std::string& path) {
     std::ifstream in(path, std::ios::binary);
@@ -55,8 +55,9 @@ void setMtime(const std::string& path, int64_t seconds) {
 }
 
 template <class Condition>
-bool becomesTrueInTime(Condition condition) {
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(kPatience);
+bool settlesInTime(Condition condition) {
+    auto deadline =
+        std::chrono::steady_clock::now() + std::chrono::duration<double>(kThumbnailTestPatience);
     while (!condition()) {
         if (std::chrono::steady_clock::now() > deadline)
             return false;
@@ -111,7 +112,7 @@ public:
 class DesktopThumbnailsTest : public ::testing::Test {
 protected:
     std::unique_ptr<DesktopThumbnails> make(std::shared_ptr<ThumbnailRenderer> renderer,
-                                            double patience = kPatience) {
+                                            double patience = kThumbnailTestPatience) {
         DesktopThumbnails::Options options;
         options.cacheFolder = cache.path() + "/thumbnails";
         options.renderer = std::move(renderer);
@@ -310,7 +311,7 @@ TEST_F(DesktopThumbnailsTest, RendersAtMostTwoAtOnce) {
         callers.emplace_back([&, i] {
             results[i] = thumbnails->thumbnail(paths[i], openForReading(paths[i]), 128);
         });
-    const bool allWaiting = becomesTrueInTime(
+    const bool allWaiting = settlesInTime(
         [&] { return gate->activeNow() == 2 && thumbnails->queuedForTesting() == kRequests - 2; });
     EXPECT_TRUE(allWaiting);
     gate->release();
@@ -331,7 +332,7 @@ TEST_F(DesktopThumbnailsTest, ImpatientCallerGetsTimeoutAndTheThumbnailIsStillMa
     ASSERT_FALSE(late.ok());
     EXPECT_TRUE(late.error().is(kPosixErrorDomain, ETIMEDOUT)) << late.error().description();
     gate->release();
-    EXPECT_TRUE(becomesTrueInTime([&] { return fs::exists(cacheFile("normal", path)); }));
+    EXPECT_TRUE(settlesInTime([&] { return fs::exists(cacheFile("normal", path)); }));
 }
 
 // Two callers asking for the same thumbnail share one rendering.
@@ -341,9 +342,9 @@ TEST_F(DesktopThumbnailsTest, SimultaneousRequestsShareOneRendering) {
     const std::string path = files.writeFile("same.png", "x");
     std::optional<Result<Bytes>> a, b;
     std::thread first([&] { a = thumbnails->thumbnail(path, openForReading(path), 128); });
-    ASSERT_TRUE(becomesTrueInTime([&] { return gate->activeNow() == 1; }));
+    ASSERT_TRUE(settlesInTime([&] { return gate->activeNow() == 1; }));
     std::thread second([&] { b = thumbnails->thumbnail(path, openForReading(path), 128); });
-    ASSERT_TRUE(becomesTrueInTime([&] { return thumbnails->waitingForTesting() == 2; }));
+    ASSERT_TRUE(settlesInTime([&] { return thumbnails->waitingForTesting() == 2; }));
     gate->release();
     first.join();
     second.join();
