@@ -13,8 +13,11 @@
 #include <sstream>
 #include <thread>
 
+#include "platform/FaultInjectingFileSystem.h"
+#include "platform/LinuxFileSystem.h"
 #include "platform/imaging/PixbufThumbnailRenderer.h"
 #include "server/DesktopThumbnails.h"
+#include "tests/common/ScopedFileSystem.h"
 #include "tests/common/TempDir.h"
 #include "tests/server/TestImages.h"
 
@@ -23,7 +26,9 @@ namespace {
 
 using testing::decodedSize;
 using testing::encodedImage;
+using testing::ScopedFileSystem;
 using testing::TempDir;
+using Operation = FaultInjectingFileSystem::Operation;
 namespace fs = std::filesystem;
 
 constexpr double kThumbnailTestPatience = 20;  // seconds: only a hang gets near it
@@ -370,6 +375,50 @@ TEST_F(DesktopThumbnailsTest, PngTextSurvivesDamagedFiles) {
     Bytes lying = png.value();
     lying[8] = 0xff;  // the first chunk claims to be enormous
     EXPECT_TRUE(DesktopThumbnails::pngText(lying).empty());
+}
+
+// The cache is best-effort: a thumbnail that cannot be stored is still served, and nothing
+// half-written is left behind. A source that cannot be read is an error, not a broken image.
+TEST_F(DesktopThumbnailsTest, FileSystemFaultsNeitherLoseThumbnailsNorLeaveDebris) {
+    auto faults = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    ScopedFileSystem installed(faults);
+    auto renderer = std::make_shared<CountingRenderer>();
+    auto thumbnails = make(renderer);
+    const std::string normal = cache.path() + "/thumbnails/normal";
+
+    struct Fault {
+        Operation operation;
+        int error;
+    };
+    int served = 0;
+    for (Fault fault : {Fault{Operation::Mkdir, EACCES}, Fault{Operation::Write, ENOSPC},
+                        Fault{Operation::Renameat2, EIO}}) {
+        const std::string path =
+            files.writeFile("f" + std::to_string(served) + ".png", encodedImage(90, 30, "png"));
+        faults->inject(fault.operation, fault.error, -1, "/thumbnails");
+        auto thumb = thumbnails->thumbnail(path, openForReading(path), 128);
+        faults->clearInjections();
+        ASSERT_TRUE(thumb.ok()) << FaultInjectingFileSystem::operationName(fault.operation) << ": "
+                                << thumb.error().description();
+        EXPECT_EQ(decodedSize(thumb.value()), std::make_pair(90, 30));
+        EXPECT_FALSE(fs::exists(cacheFile("normal", path)));
+        if (fs::exists(normal)) {
+            EXPECT_TRUE(fs::is_empty(normal))
+                << FaultInjectingFileSystem::operationName(fault.operation);
+        }
+        ++served;
+    }
+
+    const std::string unreadable = files.writeFile("unreadable.png", encodedImage(10, 10, "png"));
+    faults->inject(Operation::Read, EIO, -1, "unreadable.png");
+    auto failed = thumbnails->thumbnail(unreadable, openForReading(unreadable), 128);
+    faults->clearInjections();
+    ASSERT_FALSE(failed.ok());
+    EXPECT_TRUE(failed.error().is(kPosixErrorDomain, EIO)) << failed.error().description();
+    EXPECT_FALSE(fs::exists(cache.path() + "/thumbnails/fail"));
+    // Readable again, it gets its thumbnail at once.
+    auto later = thumbnails->thumbnail(unreadable, openForReading(unreadable), 128);
+    ASSERT_TRUE(later.ok()) << later.error().description();
 }
 
 }  // namespace
