@@ -61,9 +61,10 @@ public:
 
     // The PNG thumbnail of the regular file open as `file` whose absolute path is `path`, for a
     // requested `size` (up to 128 gives the normal size, anything larger the large one).
-    // Errors: EFBIG for a file over kMaxSourceBytes, EBADMSG for one that is not a readable
-    // image, ETIMEDOUT when rendering took longer than the patience, ECANCELED when the object
-    // is being destroyed; file-system errors as they come.
+    // A file over kMaxSourceBytes is never rendered (a valid thumbnail another program made
+    // for it is still served). Errors: EFBIG for such a file without one, EBADMSG for one that is
+    // not a readable image, ETIMEDOUT when rendering took longer than the patience, ECANCELED when
+    // the object is being destroyed; file-system errors as they come.
     Result<Bytes> thumbnail(const std::string& path, ScopedFd file, int size);
 
     // Renderings waiting for a worker, and callers waiting for a rendering. Tests only.

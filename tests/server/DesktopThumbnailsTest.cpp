@@ -250,6 +250,20 @@ TEST_F(DesktopThumbnailsTest, RefusesHugeFilesAndUndecodableBytes) {
     ASSERT_FALSE(refused.ok());
     EXPECT_TRUE(refused.error().is(kPosixErrorDomain, EFBIG)) << refused.error().description();
     EXPECT_EQ(renderer->calls, 0);
+    // One another program made for it is still served.
+    PixbufThumbnailRenderer real;
+    auto made = real.render(toBytes(encodedImage(8, 8, "png")), 128,
+                            {{"Thumb::URI", DesktopThumbnails::uriForPath(huge)},
+                             {"Thumb::MTime", std::to_string(mtimeOf(huge))}});
+    ASSERT_TRUE(made.ok());
+    fs::create_directories(cache.path() + "/thumbnails/normal");
+    std::ofstream(cacheFile("normal", huge), std::ios::binary)
+        .write(reinterpret_cast<const char*>(made.value().data()),
+               std::streamsize(made.value().size()));
+    auto foreign = thumbnails->thumbnail(huge, openForReading(huge), 128);
+    ASSERT_TRUE(foreign.ok()) << foreign.error().description();
+    EXPECT_EQ(foreign.value(), made.value());
+    EXPECT_EQ(renderer->calls, 0);
 
     const std::string whole = encodedImage(64, 64, "png");
     for (std::string bad : {std::string("not an image at all"), whole.substr(0, 20), std::string(),
