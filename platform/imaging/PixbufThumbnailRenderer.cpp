@@ -19,6 +19,32 @@ struct ObjectUnref {
 template <class T>
 using GObjectPtr = std::unique_ptr<T, ObjectUnref>;
 
+// What the size-prepared handler learns and decides, before any pixel is allocated.
+struct Sizing {
+    int edge = 0;
+    bool tooLarge = false;
+    int64_t width = 0;
+    int64_t height = 0;
+};
+
+void onSizePrepared(GdkPixbufLoader* loader, int width, int height, gpointer data) {
+    auto& sizing = *static_cast<Sizing*>(data);
+    sizing.width = width;
+    sizing.height = height;
+    if (int64_t(width) * height > PixbufThumbnailRenderer::kMaxPixels) {
+        // Zero asks the loader to allocate nothing more; the rest of the file is not fed.
+        sizing.tooLarge = true;
+        gdk_pixbuf_loader_set_size(loader, 0, 0);
+        return;
+    }
+    // Loaders that can (JPEG) decode straight at the smaller size; the others are scaled after.
+    if (width > sizing.edge || height > sizing.edge) {
+        const double scale = std::min(double(sizing.edge) / width, double(sizing.edge) / height);
+        gdk_pixbuf_loader_set_size(loader, std::max(1, int(width * scale + 0.5)),
+                                   std::max(1, int(height * scale + 0.5)));
+    }
+}
+
 Error undecodable(GError* error) {
     std::string reason = "the file is not an image that can be read";
     if (error) {
@@ -35,14 +61,31 @@ Result<Bytes> PixbufThumbnailRenderer::render(const Bytes& source, int edge,
     if (edge < 1)
         return Error::posix(EINVAL);
     GObjectPtr<GdkPixbufLoader> loader(gdk_pixbuf_loader_new());
+    Sizing sizing;
+    sizing.edge = edge;
+    g_signal_connect(loader.get(), "size-prepared", G_CALLBACK(onSizePrepared), &sizing);
     GError* error = nullptr;
-    const bool written = source.empty() || gdk_pixbuf_loader_write(loader.get(), source.data(),
-                                                                   source.size(), &error);
+    // Fed in pieces, so that an image found too large stops being read at its header.
+    constexpr size_t kPiece = 64 * 1024;
+    bool written = true;
+    for (size_t at = 0; written && !sizing.tooLarge && at < source.size(); at += kPiece)
+        written = gdk_pixbuf_loader_write(loader.get(), source.data() + at,
+                                          std::min(kPiece, source.size() - at), &error);
     // A loader is always closed, also after a failed write, or it complains when finalized.
     GError* closeError = nullptr;
-    const bool closed = gdk_pixbuf_loader_close(loader.get(), written ? &closeError : nullptr);
-    if (!written)
+    const bool closed = gdk_pixbuf_loader_close(loader.get(), &closeError);
+    if (sizing.tooLarge) {
+        g_clear_error(&error);
+        g_clear_error(&closeError);
+        return Error(kPosixErrorDomain, EFBIG,
+                     {{"description", "the image is too large to make a thumbnail of (" +
+                                          std::to_string(sizing.width) + " x " +
+                                          std::to_string(sizing.height) + " pixels)"}});
+    }
+    if (!written) {
+        g_clear_error(&closeError);
         return undecodable(error);
+    }
     if (!closed || source.empty())
         return undecodable(closeError);
     GdkPixbuf* decoded = gdk_pixbuf_loader_get_pixbuf(loader.get());  // the loader's

@@ -265,6 +265,12 @@ TEST_F(DesktopThumbnailsTest, RefusesHugeFilesAndUndecodableBytes) {
     EXPECT_EQ(foreign.value(), made.value());
     EXPECT_EQ(renderer->calls, 0);
 
+    // So is an image that would take too much memory to decode, however small its file.
+    const std::string bomb = files.writeFile("bomb.png", testing::pngHeaderClaiming(30000, 30000));
+    auto defused = thumbnails->thumbnail(bomb, openForReading(bomb), 128);
+    ASSERT_FALSE(defused.ok());
+    EXPECT_TRUE(defused.error().is(kPosixErrorDomain, EFBIG)) << defused.error().description();
+
     const std::string whole = encodedImage(64, 64, "png");
     for (std::string bad : {std::string("not an image at all"), whole.substr(0, 20), std::string(),
                             std::string("\x89PNG\r\n\x1a\n\xff\xff\xff\xff", 12)}) {

@@ -2,6 +2,7 @@
 
 #include <gdk-pixbuf/gdk-pixbuf.h>
 
+#include <cstdint>
 #include <string>
 #include <utility>
 
@@ -45,6 +46,28 @@ inline std::pair<int, int> decodedSize(const std::string& bytes) {
         size = {gdk_pixbuf_get_width(pixbuf), gdk_pixbuf_get_height(pixbuf)};
     g_object_unref(loader);
     return size;
+}
+
+// The start of a PNG file that claims `width` x `height` RGB pixels: a valid header, then a
+// pixel stream cut short. Tiny on disk, enormous once decoded.
+inline std::string pngHeaderClaiming(uint32_t width, uint32_t height) {
+    auto crc = [](const std::string& bytes) {
+        uint32_t c = 0xffffffffu;
+        for (unsigned char byte : bytes) {
+            c ^= byte;
+            for (int bit = 0; bit < 8; ++bit) c = (c >> 1) ^ (0xedb88320u & (0u - (c & 1)));
+        }
+        return ~c;
+    };
+    auto be32 = [](uint32_t v) {
+        return std::string{char(v >> 24), char(v >> 16), char(v >> 8), char(v)};
+    };
+    auto chunk = [&](const std::string& type, const std::string& data) {
+        return be32(uint32_t(data.size())) + type + data + be32(crc(type + data));
+    };
+    std::string ihdr = be32(width) + be32(height) + std::string("\x08\x02\x00\x00\x00", 5);
+    return std::string("\x89PNG\r\n\x1a\n", 8) + chunk("IHDR", ihdr) +
+           chunk("IDAT", std::string("\x78\x01", 2));
 }
 
 inline std::pair<int, int> decodedSize(const Bytes& bytes) {
