@@ -4,6 +4,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
@@ -18,6 +19,7 @@
 #include "platform/imaging/PixbufThumbnailRenderer.h"
 #include "server/DesktopThumbnails.h"
 #include "tests/common/ScopedFileSystem.h"
+#include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
 #include "tests/server/TestImages.h"
 
@@ -27,6 +29,7 @@ namespace {
 using testing::decodedSize;
 using testing::encodedImage;
 using testing::ScopedFileSystem;
+using testing::ScopedLogCapture;
 using testing::TempDir;
 using Operation = FaultInjectingFileSystem::Operation;
 namespace fs = std::filesystem;
@@ -402,6 +405,7 @@ TEST_F(DesktopThumbnailsTest, PngTextSurvivesDamagedFiles) {
 TEST_F(DesktopThumbnailsTest, FileSystemFaultsNeitherLoseThumbnailsNorLeaveDebris) {
     auto faults = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
     ScopedFileSystem installed(faults);
+    ScopedLogCapture log;
     auto renderer = std::make_shared<CountingRenderer>();
     auto thumbnails = make(renderer);
     const std::string normal = cache.path() + "/thumbnails/normal";
@@ -428,6 +432,14 @@ TEST_F(DesktopThumbnailsTest, FileSystemFaultsNeitherLoseThumbnailsNorLeaveDebri
         }
         ++served;
     }
+    // Each lost write is said in the log, for whoever wonders why the cache stays empty.
+    const auto texts = log->texts();
+    EXPECT_EQ(std::count_if(texts.begin(), texts.end(),
+                            [](const std::string& line) {
+                                return line.find("thumbnail cache ") != std::string::npos;
+                            }),
+              3)
+        << ::testing::PrintToString(texts);
 
     const std::string unreadable = files.writeFile("unreadable.png", encodedImage(10, 10, "png"));
     faults->inject(Operation::Read, EIO, -1, "unreadable.png");
