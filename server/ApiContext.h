@@ -10,6 +10,7 @@
 
 namespace tamber {
 
+class DesktopThumbnails;
 class EventHub;
 class HostReplica;
 class TremorService;
@@ -22,6 +23,8 @@ struct ApiContext {
     Url storage;                             // the document storage folder
     std::shared_ptr<TremorService> journal;  // the event journal the server owns
     std::shared_ptr<EventHub> events;        // the server-sent events; null in some tests
+    // Thumbnails of image files, shared with the desktop; null: images get none (some tests).
+    std::shared_ptr<DesktopThumbnails> thumbnails;
     // Takes a multipart upload to `POST containers/{id}/children` (the content routes set it
     // when they are added); empty: such an upload is refused.
     std::function<void(const httplib::Request&, httplib::Response&, const httplib::ContentReader&)>

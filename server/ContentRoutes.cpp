@@ -19,6 +19,7 @@
 #include "server/ApiReply.h"
 #include "server/ByteRange.h"
 #include "server/ContentTypes.h"
+#include "server/DesktopThumbnails.h"
 #include "support/DispatchSemaphore.h"
 
 namespace tamber {
@@ -36,6 +37,7 @@ constexpr int kMaxThumbnail = 1024;
 constexpr int kDefaultThumbnail = 256;
 // Thumbnails are made on the provider's threads; a request never waits longer than this.
 constexpr double kThumbnailPatience = 30;
+constexpr std::string_view kImageType = "public.image";
 
 Error notAFile() {
     return ApiReply::badRequest("only a file has content");
@@ -101,6 +103,38 @@ Status checkUploadName(const std::string& name) {
     if (name.size() > kMaxUploadNameBytes)
         return ApiReply::badRequest("name must not be longer than 255 bytes");
     return checkItemName(name);
+}
+
+// The thumbnail of an image file of the published trees, from the desktop's cache.
+void answerWithImageThumbnail(httplib::Response& response, ApiContext& context, const Url& url,
+                              int size) {
+    auto opened = openRegularFile(url, O_RDONLY);
+    if (!opened.ok())
+        return ApiReply::error(response, opened.error());
+    auto png = context.thumbnails->thumbnail(url.path(), std::move(opened.value().fd), size);
+    if (!png.ok()) {
+        const Error& error = png.error();
+        int status = 0;
+        if (error.domain() == kPosixErrorDomain) {
+            switch (error.code()) {
+                case EFBIG:
+                    status = 413;
+                    break;
+                case EBADMSG:
+                    status = 415;
+                    break;
+                case ETIMEDOUT:
+                case ECANCELED:
+                    status = 503;
+                    break;
+            }
+        }
+        if (status)
+            return ApiReply::json(response, HostJson::error(error), status);
+        return ApiReply::error(response, error);
+    }
+    response.set_content(reinterpret_cast<const char*>(png.value().data()), png.value().size(),
+                         "image/png");
 }
 
 struct Upload {
@@ -349,6 +383,17 @@ void ContentRoutes::handleThumbnail(const httplib::Request& request, httplib::Re
             size > kMaxThumbnail)
             return ApiReply::error(response,
                                    ApiReply::badRequest("size must be a number from 16 to 1024"));
+    }
+    if (context.thumbnails) {
+        auto item = context.provider->itemForIdentifier(identifier);
+        if (!item.ok())
+            return ApiReply::error(response, item.error());
+        if (TypeConforms(item.value()->typeIdentifier(), kImageType)) {
+            auto url = contentItemURL(context, identifier);
+            if (!url.ok())
+                return ApiReply::error(response, url.error());
+            return answerWithImageThumbnail(response, context, url.value(), size);
+        }
     }
     struct Answer {
         std::mutex mutex;

@@ -14,7 +14,8 @@ namespace tamber {
 //   GET  /api/v1/items/{id}/content      the bytes, streamed; one `Range` served as 206
 //   PUT  /api/v1/items/{id}/content      a safe save over a file: same identifier, same tags
 //   POST /api/v1/containers/{id}/children  with multipart/form-data: each file part imported
-//   GET  /api/v1/items/{id}/thumbnail?size=N  a PNG from the provider, or 404
+//   GET  /api/v1/items/{id}/thumbnail?size=N  a PNG: an image file's from the desktop's
+//        thumbnail cache (made when missing), anything else's from the provider; or 404
 // Identifiers are resolved through the provider; files are opened beneath their published root
 // without following a symbolic link, so a link never serves or replaces anything outside.
 class ContentRoutes {

@@ -16,6 +16,8 @@ constexpr std::pair<std::string_view, std::string_view> kMediaTypes[] = {
     {"public.tiff", "image/tiff"},
     {"public.heic", "image/heic"},
     {"public.svg-image", "image/svg+xml"},
+    {"org.webmproject.webp", "image/webp"},
+    {"com.microsoft.bmp", "image/bmp"},
     {"public.pdf", "application/pdf"},
     {"public.json", "application/json"},
     {"public.xml", "application/xml"},

@@ -3,10 +3,12 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include "platform/imaging/PixbufThumbnailRenderer.h"
 #include "platform/tremors/TremorService.h"
 #include "runtime/RunFile.h"
 #include "server/ContainerRoutes.h"
 #include "server/ContentRoutes.h"
+#include "server/DesktopThumbnails.h"
 #include "server/EventRoutes.h"
 #include "server/ItemRoutes.h"
 #include "server/JournalRoutes.h"
@@ -114,6 +116,10 @@ Status TamberServer::start() {
     if (!provider.ok())
         return provider.error();
     context_->provider = provider.value();
+    DesktopThumbnails::Options thumbnailOptions;
+    thumbnailOptions.cacheFolder = DesktopThumbnails::defaultCacheFolder();
+    thumbnailOptions.renderer = std::make_shared<PixbufThumbnailRenderer>();
+    context_->thumbnails = std::make_shared<DesktopThumbnails>(std::move(thumbnailOptions));
     auto journal = runtime_->startJournal();
     if (journal.ok())
         context_->journal = journal.value();

@@ -21,15 +21,18 @@
 #include "platform/device/DeviceAnswer.h"
 #include "platform/imaging/Image.h"
 #include "platform/imaging/ImageEncoder.h"
+#include "platform/imaging/PixbufThumbnailRenderer.h"
 #include "platform/objects/Number.h"
 #include "platform/tremors/TremorService.h"
 #include "runtime/ProviderRuntime.h"
 #include "server/ContentRoutes.h"
+#include "server/DesktopThumbnails.h"
 #include "support/DispatchSemaphore.h"
 #include "support/DispatchTimer.h"
 #include "support/WorkerPool.h"
 #include "tests/common/AppLibraryTest.h"
 #include "tests/common/TempStagingLedger.h"
+#include "tests/server/TestImages.h"
 
 namespace tamber {
 
@@ -115,6 +118,10 @@ protected:
         context = std::make_shared<ApiContext>();
         context->provider = porter.value();
         context->storage = runtime->storageURL();
+        DesktopThumbnails::Options thumbnailOptions;
+        thumbnailOptions.cacheFolder = thumbnailCache.path() + "/thumbnails";
+        thumbnailOptions.renderer = std::make_shared<PixbufThumbnailRenderer>();
+        context->thumbnails = std::make_shared<DesktopThumbnails>(std::move(thumbnailOptions));
 
         ContentRoutes::add(server, context);
         ContentRoutes::addChildrenPost(
@@ -190,6 +197,7 @@ protected:
     }
 
     TempDir state;
+    TempDir thumbnailCache;
     std::string storage;
     std::shared_ptr<FaultInjectingFileSystem> faults;
     std::unique_ptr<ProviderRuntime> runtime;
@@ -490,6 +498,64 @@ TEST_F(ContentRoutesTest, ThumbnailsOfAppLibrariesAndNoneForFiles) {
         ASSERT_TRUE(bad);
         EXPECT_EQ(bad->status, 400) << size;
     }
+}
+
+// Image files: a thumbnail from the desktop's cache, made there when missing; bad or huge
+// images refused with an error object; links out of the tree never followed.
+TEST_F(ContentRoutesTest, ThumbnailsOfImageFilesComeFromTheDesktopCache) {
+    auto c = client();
+    const std::string photo = storage + "/Photo 1.jpg";
+    writeText(photo, testing::encodedImage(640, 480, "jpeg"));
+    auto thumb = c.Get("/api/v1/items/" + identifierOf(photo) + "/thumbnail?size=128");
+    ASSERT_TRUE(thumb);
+    ASSERT_EQ(thumb->status, 200) << thumb->body;
+    EXPECT_EQ(thumb->get_header_value("Content-Type"), "image/png");
+    EXPECT_EQ(testing::decodedSize(thumb->body), std::make_pair(128, 96));
+    const std::string stored =
+        thumbnailCache.path() + "/thumbnails/normal/" +
+        DesktopThumbnails::cacheNameForUri(DesktopThumbnails::uriForPath(photo));
+    EXPECT_EQ(fileText(stored), thumb->body);
+
+    auto large = c.Get("/api/v1/items/" + identifierOf(photo) + "/thumbnail?size=512");
+    ASSERT_TRUE(large);
+    ASSERT_EQ(large->status, 200) << large->body;
+    EXPECT_EQ(testing::decodedSize(large->body), std::make_pair(256, 192));
+
+    // Any format the loaders read, not only the common two.
+    writeText(storage + "/scan.bmp", testing::encodedImage(100, 400, "bmp"));
+    auto bitmap = c.Get("/api/v1/items/" + identifierOf(storage + "/scan.bmp") + "/thumbnail");
+    ASSERT_TRUE(bitmap);
+    ASSERT_EQ(bitmap->status, 200) << bitmap->body;
+    EXPECT_EQ(testing::decodedSize(bitmap->body), std::make_pair(64, 256));
+
+    writeText(storage + "/broken.png", "<img src=x onerror=alert(1)>");
+    auto broken = c.Get("/api/v1/items/" + identifierOf(storage + "/broken.png") + "/thumbnail");
+    ASSERT_TRUE(broken);
+    EXPECT_EQ(broken->status, 415);
+    EXPECT_TRUE(json::parse(broken->body).contains("error"));
+
+    writeText(storage + "/huge.png", testing::encodedImage(8, 8, "png"));
+    fs::resize_file(storage + "/huge.png", DesktopThumbnails::kMaxSourceBytes + 1);
+    auto huge = c.Get("/api/v1/items/" + identifierOf(storage + "/huge.png") + "/thumbnail");
+    ASSERT_TRUE(huge);
+    EXPECT_EQ(huge->status, 413);
+    EXPECT_TRUE(json::parse(huge->body).contains("error"));
+
+    TempDir outside;
+    const std::string secret =
+        outside.writeFile("secret.png", testing::encodedImage(32, 32, "png"));
+    fs::create_symlink(secret, storage + "/secret.png");
+    auto linked = c.Get("/api/v1/items/" + identifierOf(storage + "/secret.png") + "/thumbnail");
+    ASSERT_TRUE(linked);
+    EXPECT_NE(linked->status, 200);
+    EXPECT_EQ(testing::decodedSize(linked->body), std::make_pair(0, 0));
+    EXPECT_FALSE(fs::exists(thumbnailCache.path() + "/thumbnails/large/" +
+                            DesktopThumbnails::cacheNameForUri(
+                                DesktopThumbnails::uriForPath(storage + "/secret.png"))));
+
+    auto unknown = c.Get("/api/v1/items/fid=987654321/thumbnail");
+    ASSERT_TRUE(unknown);
+    EXPECT_EQ(unknown->status, 404);
 }
 
 }  // namespace
