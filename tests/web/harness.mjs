@@ -59,6 +59,9 @@ export class Tamber {
     this.base = url.slice(0, url.indexOf('/#'));
     this.token = url.slice(url.indexOf('#token=') + 7);
     this.port = Number(new URL(this.base).port);
+    // A change made while the server's first catch-up runs can be missed by its index (a
+    // server fault, reproduced without the page); the tests act once it is ready.
+    await waitFor(async () => (await this.api('GET', '/status')).json.state === 'ready', 'the first catch-up');
     return url;
   }
 
@@ -136,6 +139,12 @@ export async function openPage(tamber, options = {}) {
   const page = await context.newPage();
   page.errors = [];
   page.on('pageerror', (error) => page.errors.push(error));
+  if (process.env.TAMBER_WEB_DEBUG) {
+    page.on('console', (m) => console.log('console:', m.text()));
+    page.on('response', async (r) => {
+      if (r.request().method() !== 'GET') console.log(r.request().method(), r.url(), r.status(), await r.text().catch(() => ''));
+    });
+  }
   await page.goto(options.url || tamber.url);
   if (options.wait !== false) await page.locator('#view .row').first().waitFor();
   return page;

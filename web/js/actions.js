@@ -80,12 +80,14 @@ export class Actions {
     const error = el('span', { class: 'rename-error', role: 'alert' });
     editor.append(input, error);
     row.append(editor);
+    row.dataset.editing = item.identifier;
     input.focus();
     const dot = item.filename.lastIndexOf('.');
     input.setSelectionRange(0, dot > 0 && !isFolder(item) ? dot : item.filename.length);
     let busy = false;
     const finish = () => {
       editor.remove();
+      if (row.dataset.editing === item.identifier) delete row.dataset.editing;
       $('view').focus();
     };
     input.addEventListener('keydown', async (event) => {
@@ -179,7 +181,7 @@ export class Actions {
   }
 
   async emptyTrash() {
-    const trashed = await api.search({ trashed: 'true', limit: '100000' });
+    const trashed = await api.search({ trashed: 'true', limit: '1000' });
     const ids = trashed.items.filter((i) => i.trashed).map((i) => i.identifier);
     if (!ids.length) return;
     const sure = await ask({ title: 'Empty the Trash?',

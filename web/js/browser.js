@@ -92,6 +92,9 @@ export class Browser {
     this.nextPage = null;
     this.folderItem = null;
     this.loading = true;
+    // Changes that come while the listing is on its way are applied over it when it arrives:
+    // the listing may predate them.
+    this.pendingChanges = [];
     this.notice(null);
     this.updateChrome();
     let items = [];
@@ -115,6 +118,7 @@ export class Browser {
     } catch (e) {
       if (generation !== this.generation) return;
       this.loading = false;
+      this.pendingChanges = null;
       this.items = [];
       this.render();
       if (e.status === 404 && this.location.kind === 'folder') this.folderGone();
@@ -124,6 +128,9 @@ export class Browser {
     this.loading = false;
     this.items = items;
     for (const item of items) this.remember(item);
+    const pending = this.pendingChanges;
+    this.pendingChanges = null;
+    for (const batch of pending) this.live.apply(batch);
     this.sortItems();
     this.updateChrome();
     this.render();
@@ -262,7 +269,9 @@ export class Browser {
       img.addEventListener('error', () => img.remove());
       icon.append(img);
     }
-    if (row.querySelector('.rename')) row.querySelector('.rename').remove();
+    // An editor open on this item survives a change event for it; on another item it goes.
+    const editor = row.querySelector('.rename');
+    if (editor && row.dataset.editing !== item.identifier) editor.remove();
     name.textContent = item.filename;
     if (item.favoriteRank !== null && item.favoriteRank !== undefined) {
       name.append(el('span', { class: 'star', text: '★', title: 'Favourite' }));

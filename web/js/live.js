@@ -70,6 +70,10 @@ export class Live {
       ...(batch.updated || []).map((item) => ({ updated: item })),
       ...(batch.deleted || []).map((id) => ({ deleted: id }))];
     if (!changes.length) return;
+    if (browser.pendingChanges) {
+      browser.pendingChanges.push({ changes });
+      return;
+    }
     let touched = false;
     let tagsChanged = false;
     const index = new Map(browser.items.map((item, n) => [item.identifier, n]));
@@ -79,7 +83,8 @@ export class Live {
         const item = change.updated;
         browser.remember(item);
         const at = index.get(item.identifier);
-        if (item.tags && item.tags.length) tagsChanged = true;
+        if (item.tags && item.tags.length) browser.places.noteTags(item.tags);
+        tagsChanged = true;
         if (browser.belongs(item)) {
           if (at !== undefined && !removed.has(item.identifier)) browser.items[at] = item;
           else {

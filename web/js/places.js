@@ -26,13 +26,21 @@ export class Places {
 
   async loadTags() {
     try {
-      const all = await api.search({ limit: '5000' });
+      const all = await api.search({ limit: '1000' });
       const tags = new Set();
       for (const item of all.items) for (const tag of item.tags || []) tags.add(tag);
       this.tags = [...tags].sort((a, b) => a.localeCompare(b));
     } catch (e) {
       this.tags = [];
     }
+  }
+
+  // A tag just set shows at once; the index, which may lag, confirms it later.
+  noteTags(labels) {
+    const fresh = labels.filter((label) => !this.tags.includes(label));
+    if (!fresh.length) return;
+    this.tags = [...this.tags, ...fresh].sort((a, b) => a.localeCompare(b));
+    this.draw();
   }
 
   // Tags come and go with the items: look again a moment after changes settle.
