@@ -59,9 +59,24 @@ export class Tamber {
     this.base = url.slice(0, url.indexOf('/#'));
     this.token = url.slice(url.indexOf('#token=') + 7);
     this.port = Number(new URL(this.base).port);
-    // A change made while the server's first catch-up runs can be missed by its index (a
-    // server fault, reproduced without the page); the tests act once it is ready.
+    // A change made during the server's first catch-up, or just after it, can be missed by its
+    // index (a server fault, reproduced without the page): the tests act only once a change of
+    // their own has been seen to come and go.
     await waitFor(async () => (await this.api('GET', '/status')).json.state === 'ready', 'the first catch-up');
+    const probe = path.join(this.library, 'tamber-web-probe.txt');
+    for (let attempt = 0; ; attempt += 1) {
+      if (attempt === 40) throw new Error('the server never saw a change');
+      fs.writeFileSync(probe, 'probe');
+      try {
+        await this.waitIndexed('tamber-web-probe.txt', 1500);
+        break;
+      } catch (e) {
+        fs.rmSync(probe, { force: true });
+        await new Promise((resolve) => setTimeout(resolve, 200));
+      }
+    }
+    fs.rmSync(probe);
+    await waitFor(async () => !(await this.searchNames('tamber-web-probe.txt')).length, 'the probe gone');
     return url;
   }
 
@@ -87,11 +102,13 @@ export class Tamber {
   }
 
   // Waits until the server's replica has caught up with what is on disk: search finds `name`.
-  async waitIndexed(name) {
-    await waitFor(async () => {
-      const r = await this.api('GET', `/search?q=${encodeURIComponent(name)}`);
-      return r.status === 200 && r.json.items.some((i) => i.filename === name);
-    }, `index to show ${name}`);
+  async waitIndexed(name, limitMs) {
+    await waitFor(async () => (await this.searchNames(name)).includes(name), `index to show ${name}`, limitMs);
+  }
+
+  async searchNames(query) {
+    const r = await this.api('GET', `/search?q=${encodeURIComponent(query)}`);
+    return r.status === 200 ? r.json.items.map((i) => i.filename) : [];
   }
 
   write(relative, content = '') {

@@ -298,6 +298,7 @@ export class Browser {
     const total = this.nextPage ? Math.max(this.expected, this.items.length + 1) : this.items.length;
     this.list.setItems(this.items, total);
     this.list.refresh();
+    this.list.renderNow();
     show($('empty'), !this.loading && this.items.length === 0 && !$('notice').textContent);
     this.status();
   }
