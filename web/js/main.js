@@ -49,3 +49,9 @@ async function start() {
 }
 
 start();
+
+// A new address pasted into this tab (a restarted server's) only changes the fragment: start
+// again with its token.
+window.addEventListener('hashchange', () => {
+  if (new URLSearchParams(location.hash.slice(1)).has('token')) location.reload();
+});
