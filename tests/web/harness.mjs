@@ -62,7 +62,7 @@ export class Tamber {
     // A change made during the server's first catch-up, or just after it, can be missed by its
     // index (a server fault, reproduced without the page): the tests act only once a change of
     // their own has been seen to come and go.
-    await waitFor(async () => (await this.api('GET', '/status')).json.state === 'ready', 'the first catch-up');
+    await waitFor(async () => (await this.api('GET', '/status')).json.state === 'ready', 'the first catch-up', 180000);
     const probe = path.join(this.library, 'tamber-web-probe.txt');
     for (let attempt = 0; ; attempt += 1) {
       if (attempt === 40) throw new Error('the server never saw a change');
