@@ -163,7 +163,10 @@ export async function openPage(tamber, options = {}) {
     });
   }
   await page.goto(options.url || tamber.url);
-  if (options.wait !== false) await page.locator('#view .row').first().waitFor();
+  if (options.wait !== false) {
+    await page.locator('#view .row').first().waitFor();
+    await page.locator('#places .place-trash').waitFor({ state: 'attached' });
+  }
   return page;
 }
 

@@ -28,7 +28,8 @@ export function formatSize(item) {
   const units = ['bytes', 'KB', 'MB', 'GB', 'TB'];
   let unit = 0;
   while (size >= 1000 && unit < units.length - 1) { size /= 1000; unit += 1; }
-  return unit === 0 ? `${size} bytes` : `${size.toFixed(size < 10 ? 1 : 0)} ${units[unit]}`;
+  if (unit === 0) return `${size} byte${size === 1 ? "" : "s"}`;
+  return `${size.toFixed(size < 10 ? 1 : 0)} ${units[unit]}`;
 }
 
 const dateFormat = new Intl.DateTimeFormat(undefined, { dateStyle: 'medium', timeStyle: 'short' });

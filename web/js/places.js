@@ -20,6 +20,7 @@ export class Places {
     } catch (e) {
       this.libraries = [];
     }
+    this.draw();
     await this.loadTags();
     this.draw();
   }
