@@ -314,6 +314,9 @@ export class Browser {
   status() {
     const count = this.nextPage ? `${this.items.length} of ${this.expected || 'many'}` : `${this.items.length}`;
     const selected = this.selection.size ? `, ${this.selection.size} selected` : '';
+    for (const id of ['download', 'rename', 'tags', 'star', 'to-trash']) {
+      $(id).disabled = this.selection.size === 0 || this.location.kind === 'trash';
+    }
     $('status').textContent = `${count} item${this.items.length === 1 ? '' : 's'}${selected}`;
   }
 
