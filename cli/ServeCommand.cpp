@@ -48,6 +48,10 @@ CLI::App* ServeCommand::add(CLI::App& app) {
     sub->add_option("--port", port_, "The port to listen on (default 8177; 0 picks a free one)")
         ->check(CLI::Range(0, 65535));
     sub->add_flag("--no-open", noOpen_, "Do not open the URL in a browser");
+    sub->add_option("--web-root", webRoot_,
+                    "Serve the web page's files from this folder instead of the built-in ones "
+                    "(for working on the page)")
+        ->check(CLI::ExistingDirectory);
     return sub;
 }
 
@@ -56,6 +60,7 @@ int ServeCommand::run(CliContext& context) {
     TamberServerOptions options;
     options.storagePath = context.storageURL().path();
     options.port = port_;
+    options.webRoot = webRoot_;
     options.replicaFactory = HostReplica::open;
     TamberServer server(std::move(options));
     if (auto started = server.start(); !started.ok()) {

@@ -19,6 +19,7 @@ public:
 private:
     int port_ = kDefaultPort;
     bool noOpen_ = false;
+    std::string webRoot_;
 };
 
 }  // namespace tamber

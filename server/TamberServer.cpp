@@ -13,12 +13,13 @@
 #include "server/ItemRoutes.h"
 #include "server/JournalRoutes.h"
 #include "server/StatusRoutes.h"
+#include "server/WebRoutes.h"
 #include "support/Log.h"
 #include "support/RandomToken.h"
 
 namespace tamber {
 
-std::vector<HttpServer::RouteGroup> TamberServer::routeGroups() {
+std::vector<HttpServer::RouteGroup> TamberServer::routeGroups(const std::string& webRoot) {
     // Every route group of the API, added to each listening socket.
     return {
         ItemRoutes::add,
@@ -36,14 +37,8 @@ std::vector<HttpServer::RouteGroup> TamberServer::routeGroups() {
                 ContentRoutes::handleUpload(request, response, reader, *raw);
             };
         },
-        // The web page, until it has its own routes: a placeholder that says where the API is.
-        [](httplib::Server& server, std::shared_ptr<ApiContext>) {
-            server.Get("/", [](const httplib::Request&, httplib::Response& response) {
-                response.set_content(
-                    "<!doctype html><meta charset=utf-8><title>Tamber</title>"
-                    "<p>Tamber is running. Its API is under <code>/api/v1/</code>.</p>",
-                    "text/html; charset=utf-8");
-            });
+        [webRoot](httplib::Server& server, std::shared_ptr<ApiContext> context) {
+            WebRoutes::add(server, std::move(context), webRoot);
         },
     };
 }
@@ -143,7 +138,7 @@ Status TamberServer::start() {
         callbacks_->replica = replica_.get();
     }
 
-    http_ = std::make_unique<HttpServer>(context_, token_, routeGroups());
+    http_ = std::make_unique<HttpServer>(context_, token_, routeGroups(options_.webRoot));
     if (auto listening = http_->start(options_.port); !listening.ok())
         return listening;
 

@@ -25,6 +25,7 @@ struct TamberServerOptions {
     int port = 8177;          // 0: any free port
     std::string runFile;      // empty: RunFile::defaultLocation()
     std::string token;        // empty: a new random one
+    std::string webRoot;      // the web page's files from this folder; empty: the embedded ones
     // Makes the replica; empty: the server runs without one (no search, no change events).
     using ReplicaFactory =
         std::function<Result<std::unique_ptr<HostReplica>>(HostReplica::Options options)>;
@@ -50,8 +51,9 @@ public:
     TamberServer(const TamberServer&) = delete;
     TamberServer& operator=(const TamberServer&) = delete;
 
-    // The route groups every server answers, in the order they are added.
-    static std::vector<HttpServer::RouteGroup> routeGroups();
+    // The route groups every server answers, in the order they are added; `webRoot` as in
+    // TamberServerOptions.
+    static std::vector<HttpServer::RouteGroup> routeGroups(const std::string& webRoot = {});
 
     Status start();
     int port() const;
