@@ -352,11 +352,26 @@ void JournalWriter::created(const FileChange& change) {
             forgetSubtree(existing, change.path);
     }
     forgetReusedNumber(st);
+    // A file the index knows at another place was moved here: the kernel reports such a move as
+    // a removal and, through the listing of the new folder, a creation when the folder it went
+    // to was not watched yet. Journaled as the move it is, so that it can be followed.
+    std::optional<std::string> movedFrom;
+    if (auto indexed = stagedOrIndexed(st.stx_ino);
+        indexed && FileStamp::isIndexedFile(*indexed, st) &&
+        (indexed->parent != parent.stx_ino || indexed->name != name)) {
+        flushStaged();
+        movedFrom = orFail(store_.pathForInode(st.stx_ino), std::optional<std::string>());
+    }
     InodeRecord record = FileStamp::recordOf(st, parent.stx_ino, std::move(name));
     uint8_t recordKind = record.kind;
     stage(std::move(record));
-    pending_.push_back(
-        {0, change.path, st.stx_ino, kTremorItemCreated | FileStamp::kindFlag(recordKind)});
+    const uint32_t kindFlag = FileStamp::kindFlag(recordKind);
+    if (movedFrom) {
+        pending_.push_back({0, *movedFrom, st.stx_ino, kTremorItemRenamed | kindFlag});
+        pending_.push_back({0, change.path, st.stx_ino, kTremorItemRenamed | kindFlag});
+    } else {
+        pending_.push_back({0, change.path, st.stx_ino, kTremorItemCreated | kindFlag});
+    }
     claimDocumentId(change.path, st.stx_ino, recordKind);
 }
 

@@ -21,6 +21,7 @@
 #include "platform/strata/StrataService.h"
 #include "platform/strata/TremorStrataService.h"
 #include "platform/tremors/JournalWriter.h"
+#include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/TremorService.h"
 #include "platform/tremors/TremorStore.h"
 #include "tests/common/ScopedFileSystem.h"
@@ -405,6 +406,28 @@ TEST_F(WriterAfterTheFactTest, ADocumentRenamedThenRemovedIsReportedGoneAndLeave
     EXPECT_TRUE(journaled(events, JournalWriter::documentIdPath(7, docID, inode, 0)));
     EXPECT_EQ(store->inodeForDocumentId(docID).value(), std::nullopt);
     EXPECT_EQ(store->pathForInode(inode).value(), std::nullopt);
+}
+
+// A file moved into a folder made just before is not seen as a move: the new folder was not
+// watched yet, so the kernel reports the old name as removed and the folder's listing finds the
+// file. The index knows the file, so the journal reports a move, which a browser can follow.
+TEST_F(WriterAfterTheFactTest, AKnownFileFoundInANewFolderIsJournaledAsAMove) {
+    auto [inode, docID] = document("a.txt");
+    fs::create_directory(at(".Trash"));
+    fs::rename(at("a.txt"), at(".Trash/a.txt"));
+    auto events = apply({{FileChange::Kind::Created, at(".Trash"), {}, true, 0},
+                         {FileChange::Kind::Created, at(".Trash/a.txt"), {}, false, 0},
+                         {FileChange::Kind::Removed, at("a.txt"), {}, false, 0}});
+    bool movedAway = false;
+    for (const auto& event : events) {
+        if (event.path == at("a.txt") && event.fileID == inode &&
+            (event.flags & kTremorItemRenamed))
+            movedAway = true;
+    }
+    EXPECT_TRUE(movedAway) << "the old name's event must carry the file's number as a move";
+    EXPECT_EQ(store->documentIdForInode(inode).value(), docID);
+    EXPECT_EQ(store->pathForInode(inode).value(), at(".Trash/a.txt"));
+    EXPECT_FALSE(journaled(events, JournalWriter::documentIdPath(7, docID, inode, 0)));
 }
 
 TEST_F(WriterAfterTheFactTest, ADocumentRenamedTwiceKeepsItsIdAtItsLastName) {
