@@ -59,9 +59,8 @@ export class Tamber {
     this.base = url.slice(0, url.indexOf('/#'));
     this.token = url.slice(url.indexOf('#token=') + 7);
     this.port = Number(new URL(this.base).port);
-    // A change made during the server's first catch-up, or just after it, can be missed by its
-    // index (a server fault, reproduced without the page): the tests act only once a change of
-    // their own has been seen to come and go.
+    // The tests act only once a change of their own has been seen to come and go, so that what
+    // they check is the page and not the server's start.
     await waitFor(async () => (await this.api('GET', '/status')).json.state === 'ready', 'the first catch-up', 180000);
     const probe = path.join(this.library, 'tamber-web-probe.txt');
     for (let attempt = 0; ; attempt += 1) {
