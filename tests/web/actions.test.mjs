@@ -5,20 +5,9 @@ import assert from 'node:assert/strict';
 import fs from 'node:fs';
 import path from 'node:path';
 import crypto from 'node:crypto';
-import { Tamber, openPage, closeBrowser, names, row, screenshot, waitFor } from './harness.mjs';
+import { withServer, openPage, closeBrowser, names, row, screenshot, waitFor } from './harness.mjs';
 
 after(closeBrowser);
-
-async function withServer(prepare, body) {
-  const tamber = new Tamber();
-  prepare(tamber);
-  await tamber.start();
-  try {
-    await body(tamber);
-  } finally {
-    await tamber.cleanup();
-  }
-}
 
 async function openWork(tamber) {
   const page = await openPage(tamber);

@@ -1,20 +1,9 @@
 // Listing, opening, sorting and the views, with the mouse and with the keyboard alone.
 import { test, after } from 'node:test';
 import assert from 'node:assert/strict';
-import { Tamber, openPage, closeBrowser, names, row, screenshot, waitFor } from './harness.mjs';
+import { withServer, openPage, closeBrowser, names, row, screenshot, waitFor } from './harness.mjs';
 
 after(closeBrowser);
-
-async function withServer(prepare, body) {
-  const tamber = new Tamber();
-  prepare(tamber);
-  await tamber.start();
-  try {
-    await body(tamber);
-  } finally {
-    await tamber.cleanup();
-  }
-}
 
 test('folders come first, columns sort, breadcrumbs lead back', async () => {
   await withServer((t) => {

@@ -123,6 +123,18 @@ export class Tamber {
   }
 }
 
+// A server prepared by `prepare` (files written before it starts) for the length of `body`.
+export async function withServer(prepare, body) {
+  const tamber = new Tamber();
+  prepare(tamber);
+  await tamber.start();
+  try {
+    await body(tamber);
+  } finally {
+    await tamber.cleanup();
+  }
+}
+
 export async function waitFor(check, what, limitMs = 20000) {
   const start = Date.now();
   for (;;) {
