@@ -8,6 +8,7 @@
 #include <string>
 
 #include "enumeration/DirectoryListingCache.h"
+#include "host/PublishedTrees.h"
 #include "items/LocalItem.h"
 #include "platform/FileSystem.h"
 #include "platform/TypeIdentifiers.h"
@@ -49,6 +50,20 @@ struct Frame {
     std::string path;
     DirectoryListingCache::Listing listing;
     size_t position = 0;
+    // Opened when the walk first delivers one of its entries; never kept in a cursor.
+    OpenFolderRef folder{};
+    bool opened = false;
+
+    // The open folder, or null when it can't be opened (its entries are then read by path).
+    const OpenFolderRef& openFolder(std::vector<OpenFolderRef>* keepOpen) {
+        if (!opened) {
+            opened = true;
+            folder = PublishedTrees::openListedFolder(path);
+            if (folder && keepOpen)
+                keepOpen->push_back(folder);
+        }
+        return folder;
+    }
 
     size_t size(bool skipsHidden) const {
         return skipsHidden ? listing->visible.size() : listing->all.size();
@@ -66,6 +81,7 @@ struct Pager {
     bool keepGoing;
     const std::function<void(const Url&)>& deliver;
     const ErrorHandler& handleError;
+    std::vector<OpenFolderRef>* keepOpen;
 };
 
 // The listing of a root to start its walk with; nothing (after logging or handing the error
@@ -88,7 +104,7 @@ std::optional<std::vector<Frame>> openRoot(const Url& root, Pager& pager) {
         return std::nullopt;
     }
     std::vector<Frame> stack;
-    stack.push_back(Frame{root.path(), std::move(*listing)});
+    stack.push_back(Frame{root.path(), std::move(*listing), 0, nullptr, false});
     return stack;
 }
 
@@ -131,7 +147,9 @@ void walkFrames(std::vector<Frame>& stack, DirectoryEnumerationOptions options, 
 
         ++pager.counter;
         if (pager.counter > pager.offset) {
-            Url url = Url::fileURLWithPath(path);
+            const OpenFolderRef& folder = frame.openFolder(pager.keepOpen);
+            Url url =
+                folder ? Url::fileURLInFolder(folder, entry.name) : Url::fileURLWithPath(path);
             if (Status prefetched = url.prefetchResourceValues(LocalItem::urlKeys());
                 !prefetched.ok()) {
                 if (!pager.handleError(url, prefetched.error()))
@@ -149,7 +167,7 @@ void walkFrames(std::vector<Frame>& stack, DirectoryEnumerationOptions options, 
                 continue;
             }
             // `frame` may move: it is not used after this.
-            stack.push_back(Frame{std::move(path), std::move(*listing)});
+            stack.push_back(Frame{std::move(path), std::move(*listing), 0, nullptr, false});
         }
     }
 }
@@ -237,11 +255,11 @@ DirectoryEnumerationOptions FSDirectoryEnumerator::defaultOptions(bool recursive
     return options;
 }
 
-uint64_t FSDirectoryEnumerator::enumerate(
-    const std::function<void(const Url& url)>& deliver) const {
+uint64_t FSDirectoryEnumerator::enumerate(const std::function<void(const Url& url)>& deliver,
+                                          std::vector<OpenFolderRef>* keepOpen) const {
     const ErrorHandler& handleError =
         errorHandler ? errorHandler : ErrorHandler(&FSDirectoryEnumerator::logEnumerationError);
-    Pager pager{offset, limit, 0, limit != 0, deliver, handleError};
+    Pager pager{offset, limit, 0, limit != 0, deliver, handleError, keepOpen};
 
     std::vector<DirectoryEnumerationOptions> options;
     std::string key;
@@ -273,8 +291,14 @@ uint64_t FSDirectoryEnumerator::enumerate(
         if (!stack)
             continue;
         walkFrames(*stack, options[i], pager);
-        if (!pager.keepGoing)
+        if (!pager.keepGoing) {
+            // A cursor keeps no descriptors: the next page opens what it reads.
+            for (Frame& frame : *stack) {
+                frame.folder.reset();
+                frame.opened = false;
+            }
             CursorCache::shared().keep(Cursor{key, i, std::move(*stack), pager.counter});
+        }
     }
     return pager.counter;
 }

@@ -5,6 +5,7 @@
 #include <optional>
 #include <vector>
 
+#include "platform/OpenFolder.h"
 #include "platform/Url.h"
 #include "support/Error.h"
 
@@ -35,8 +36,11 @@ struct FSDirectoryEnumerator {
 
     // Walks and hands each delivered URL (its resource values for the item record prefetched)
     // to `deliver`; returns the counter: `offset` plus the entries delivered, or less when the
-    // walk ran out before `offset`.
-    uint64_t enumerate(const std::function<void(const Url& url)>& deliver) const;
+    // walk ran out before `offset`. Delivered URLs are made in their open folder (read relative
+    // to it) while the walk runs; with `keepOpen`, those folders are added to it, so that the
+    // caller can go on reading the URLs that way after the walk.
+    uint64_t enumerate(const std::function<void(const Url& url)>& deliver,
+                       std::vector<OpenFolderRef>* keepOpen = nullptr) const;
 
     // The usual error handler: "can't enumerate <path>; <error>", a debug line for a file that
     // vanished and an error line otherwise; always goes on.

@@ -185,13 +185,14 @@ void LocalFileEnumerator::gatherPhase(HostPorterEnumerationObserver& observer,
         return FSDirectoryEnumerator::logEnumerationError(url, error);
     };
     walk.directoryEnumerationOptionsFor = &trashOverride;
-    std::vector<HostPorterItemRef> items;
-    items.reserve(kPageSize);
-    uint64_t newOffset = walk.enumerate([&](const Url& url) {
-        // A file that can't become a record (vanished, no identifier) was logged by make().
-        if (LocalItemRef item = LocalItem::make(url))
-            items.push_back(std::move(item));
-    });
+    // The page's folders stay open while its records are built: their entries are read
+    // relative to them.
+    std::vector<OpenFolderRef> openFolders;
+    std::vector<Url> urls;
+    urls.reserve(kPageSize);
+    uint64_t newOffset = walk.enumerate([&](const Url& url) { urls.push_back(url); }, &openFolders);
+    std::vector<HostPorterItemRef> items = makeItems(urls);
+    openFolders.clear();
 
     if (unreadable) {
         std::map<std::string, std::string> info = unreadable->userInfo();
@@ -215,6 +216,28 @@ void LocalFileEnumerator::gatherPhase(HostPorterEnumerationObserver& observer,
     } else {
         observer.finishEnumeratingUpToPage(next.encode());
     }
+}
+
+std::vector<HostPorterItemRef> LocalFileEnumerator::makeItems(const std::vector<Url>& urls) {
+    std::vector<HostPorterItemRef> items;
+    items.reserve(urls.size());
+    // A page's entries mostly share a few folders: each folder's identifier is found once.
+    std::string parentPath;
+    std::optional<HostPorterItemIdentifier> parentID;
+    for (const Url& url : urls) {
+        std::string_view path = url.path();
+        std::string_view parent = path.substr(0, path.rfind('/'));
+        if (parentPath.empty() || parent != parentPath) {
+            parentPath = parent;
+            parentID = LocalItem::parentItemIdentifierOf(url);
+        }
+        LocalItemOptions options;
+        options.customParentItemID = parentID;
+        // A file that can't become a record (vanished, no identifier) was logged by make().
+        if (LocalItemRef item = LocalItem::make(url, options))
+            items.push_back(std::move(item));
+    }
+    return items;
 }
 
 void LocalFileEnumerator::enumerateChangesForObserver(

@@ -57,6 +57,8 @@ public:
     size_t runningEnumeratorCount() const;
 
 private:
+    // The records of a page's URLs, in order; those that can't be built are left out.
+    static std::vector<HostPorterItemRef> makeItems(const std::vector<Url>& urls);
     void gatherPhase(HostPorterEnumerationObserver& observer,
                      const std::optional<FSChangeToken>& token);
     // The roots a page walks, in order, and whether it walks them whole.

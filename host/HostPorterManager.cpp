@@ -23,6 +23,10 @@ std::shared_ptr<HostPorterManager> HostPorterManager::defaultManager() {
     return manager;
 }
 
+std::shared_ptr<HostPorterManager> HostPorterManager::installedManager() {
+    return std::atomic_load(&slot());
+}
+
 std::shared_ptr<HostPorterManager> HostPorterManager::installDefaultManager(
     std::shared_ptr<HostPorterManager> manager) {
     return std::atomic_exchange(&slot(), std::move(manager));

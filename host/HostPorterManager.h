@@ -23,6 +23,8 @@ public:
 
     // Stops the process (a programming error) when no manager was installed.
     static std::shared_ptr<HostPorterManager> defaultManager();
+    // The installed manager, or null: for code that also serves walks where no provider runs.
+    static std::shared_ptr<HostPorterManager> installedManager();
     // Returns the previous manager.
     static std::shared_ptr<HostPorterManager> installDefaultManager(
         std::shared_ptr<HostPorterManager> manager);

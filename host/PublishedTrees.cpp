@@ -16,6 +16,15 @@ namespace tamber {
 
 namespace {
 
+// Whether `path` names an entry directly inside the folder `folder`.
+bool isChildPath(const std::string& folder, const std::string& path) {
+    std::string_view prefix(folder);
+    if (prefix.ends_with('/'))
+        prefix.remove_suffix(1);
+    return path.size() > prefix.size() + 1 && path.starts_with(prefix) &&
+           path[prefix.size()] == '/' && path.find('/', prefix.size() + 1) == std::string::npos;
+}
+
 std::mutex& sourceMutex() {
     static ProcessWide<std::mutex> mutex;
     return *mutex;
@@ -122,6 +131,22 @@ Result<int> PublishedTrees::openFolder(const Url& folder, int flags) {
     return fd;
 }
 
+OpenFolderRef PublishedTrees::openListedFolder(const std::string& folder) {
+    constexpr int kFlags = O_PATH | O_CLOEXEC;
+    Url url = Url::fileURLWithPath(folder);
+    // Without a host there are no published trees, only a folder to walk.
+    if (HostPorterManager::installedManager() && rootOf(url)) {
+        auto fd = openFolder(url, kFlags);
+        if (!fd.ok())
+            return nullptr;
+        return std::make_shared<const OpenFolder>(url.path(), ScopedFd(fd.value()), true);
+    }
+    ScopedFd fd(FileSystem::current().open(url.path(), kFlags | O_DIRECTORY));
+    if (!fd.ok())
+        return nullptr;
+    return std::make_shared<const OpenFolder>(url.path(), std::move(fd), false);
+}
+
 Result<PublishedTrees::Parent> PublishedTrees::openParent(const Url& url, int flags) {
     auto root = rootOf(url);
     if (!root)
@@ -139,6 +164,10 @@ Status PublishedTrees::check(const Url& url) {
     if (!root)
         return outsideError(url);
     if (root->path() == url.path())
+        return Status::OK();
+    // A listing that opened the folder beneath its root has checked it already.
+    if (OpenFolderRef folder = url.openFolder();
+        folder && folder->linkFree() && isChildPath(folder->path(), url.path()))
         return Status::OK();
     auto parent = openParent(url, O_PATH);
     if (!parent.ok()) {

@@ -5,6 +5,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/OpenFolder.h"
 #include "platform/Url.h"
 #include "support/Result.h"
 
@@ -41,7 +42,13 @@ public:
 
     // Nothing when `url` is inside: at or below a root, and the folder holding it reachable
     // from that root without a symbolic link. The item itself may be a link, or missing.
+    // A URL made in a folder opened by openListedFolder is inside while that folder is open.
     static Status check(const Url& url);
+
+    // The folder `folder`, held open for reading its children (O_PATH): opened beneath its root
+    // when it is inside (and then marked link-free), else as named. Nothing when it can't be
+    // opened; reads then go by path.
+    static OpenFolderRef openListedFolder(const std::string& folder);
 
     // Opens the folder `folder` (a root, or a folder below one reached without any link, the
     // folder itself included) with `flags` (O_DIRECTORY is added). The caller closes it.

@@ -10,6 +10,7 @@
 #include "items/UnarchiveLogged.h"
 #include "items/XdgTagList.h"
 #include "platform/FileSystem.h"
+#include "platform/OpenFolder.h"
 #include "platform/Tag.h"
 #include "platform/archive/KeyedArchiver.h"
 #include "platform/archive/KeyedUnarchiver.h"
@@ -189,9 +190,16 @@ std::optional<Tags> takeInDesktopList(const Url& url) {
 // attribute is read one by one, which reports the failure the usual way).
 std::optional<std::set<std::string>> listAttributes(const Url& url) {
     FileSystem& fs = FileSystem::current();
+    // A URL made in a folder a listing holds open is read relative to it.
+    const OpenFolderRef folder = url.openFolder();
+    const std::string name = folder ? url.lastPathComponent() : std::string();
+    auto list = [&](char* into, size_t size) {
+        return folder ? fs.llistxattrAt(folder->fd(), name, url.path(), into, size)
+                      : fs.llistxattr(url.path(), into, size);
+    };
     std::string buffer(256, '\0');
     for (int attempt = 0; attempt < 4; ++attempt) {
-        ssize_t n = fs.llistxattr(url.path(), buffer.data(), buffer.size());
+        ssize_t n = list(buffer.data(), buffer.size());
         if (n >= 0) {
             std::set<std::string> names;
             for (size_t start = 0; start < static_cast<size_t>(n);) {
@@ -206,7 +214,7 @@ std::optional<std::set<std::string>> listAttributes(const Url& url) {
         }
         if (errno != ERANGE)
             return std::nullopt;
-        ssize_t needed = fs.llistxattr(url.path(), nullptr, 0);
+        ssize_t needed = list(nullptr, 0);
         if (needed < 0)
             return std::nullopt;
         buffer.assign(static_cast<size_t>(needed) + 64, '\0');

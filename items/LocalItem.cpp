@@ -14,6 +14,7 @@
 #include "items/ResourceValueGetter.h"
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/FileSystem.h"
+#include "platform/OpenFolder.h"
 #include "platform/ScopedFd.h"
 #include "platform/TypeIdentifiers.h"
 #include "platform/objects/String.h"
@@ -70,10 +71,15 @@ bool isSizedPackageType(std::string_view type) {
 // first "Documents" component of its path. Decided by the path alone, so that an item trashed
 // without its trash date (the date is written after the move, and may fail) still counts.
 bool isInTrashFolder(const Url& url) {
-    const std::vector<std::string> components = url.pathComponents();
-    for (size_t i = 0; i < components.size(); ++i) {
-        if (components[i] == "Documents")
-            return i + 2 < components.size() && components[i + 1] == ".Trash";
+    std::string_view path = url.path();
+    for (size_t start = 1; start < path.size();) {
+        size_t end = std::min(path.find('/', start), path.size());
+        if (path.substr(start, end - start) == "Documents") {
+            // ".Trash" next, and something inside it.
+            std::string_view rest = path.substr(std::min(end + 1, path.size()));
+            return rest.starts_with(".Trash/") && rest.size() > 7;
+        }
+        start = end + 1;
     }
     return false;
 }
@@ -141,11 +147,17 @@ std::shared_ptr<const Number> countEntries(const Url& url) {
     return Number::fromUInt64(std::min<uint64_t>(entries.size(), UINT16_MAX));
 }
 
-// The status query: the inode number, and for folders the number of children.
+// The status query: the inode number, and for folders the number of children. A URL made in a
+// folder that a listing holds open is asked relative to it.
 StatusFields readStatus(const Url& url, const std::string& type) {
+    FileSystem& fs = FileSystem::current();
+    const OpenFolderRef folder = url.openFolder();
     struct statx st {};
-    if (FileSystem::current().statx(AT_FDCWD, url.path(), AT_SYMLINK_NOFOLLOW,
-                                    STATX_TYPE | STATX_INO, &st) != 0) {
+    const int failed =
+        folder ? fs.statx(folder->fd(), url.lastPathComponent(), AT_SYMLINK_NOFOLLOW,
+                          STATX_TYPE | STATX_INO, &st)
+               : fs.statx(AT_FDCWD, url.path(), AT_SYMLINK_NOFOLLOW, STATX_TYPE | STATX_INO, &st);
+    if (failed != 0) {
         Error error = Error::errorWithPOSIXCode(errno);
         auto message = [&] {
             return "can't find fileID for item \"" + url.path() + "\"; " + error.description();
@@ -197,12 +209,26 @@ const std::string& LocalItem::xattrTrashPutBackName() {
 }
 
 const std::vector<ResourceKey>& LocalItem::urlKeys() {
+    // With the identity keys, the record's own prefetch then finds everything cached.
     static const std::vector<ResourceKey> keys = {
-        K::kParentDirectoryURL,      K::kName,       K::kLocalizedName,
-        K::kTypeIdentifier,          K::kFileSize,   K::kCreationDate,
-        K::kContentModificationDate, K::kIsReadable, K::kIsWritable,
+        K::kParentDirectoryURL,
+        K::kName,
+        K::kLocalizedName,
+        K::kTypeIdentifier,
+        K::kFileSize,
+        K::kCreationDate,
+        K::kContentModificationDate,
+        K::kIsReadable,
+        K::kIsWritable,
+        K::kIsDirectory,
+        K::kIsPackage,
+        K::kFileID,
     };
     return keys;
+}
+
+std::optional<HostPorterItemIdentifier> LocalItem::parentItemIdentifierOf(const Url& url) {
+    return parentIdentifierOf(url);
 }
 
 LocalItem::LocalItem(Fields fields) : fields_(std::move(fields)) {}

@@ -43,8 +43,13 @@ public:
 
     // The resource keys enumerators prefetch so that building a record reads no value twice:
     // parent directory URL, name, localized name, type identifier, file size, creation date,
-    // content modification date, is readable, is writable.
+    // content modification date, is readable, is writable, and the identity keys (is
+    // directory, is package, file ID).
     static const std::vector<ResourceKey>& urlKeys();
+
+    // The identifier of the folder that holds `url`, as make() finds it: a listing that builds
+    // many records in one folder asks once and passes it as customParentItemID.
+    static std::optional<HostPorterItemIdentifier> parentItemIdentifierOf(const Url& url);
 
     // The record of the item at `url`, or null (after one log line) when it has no identifier,
     // parent, name or type, or is a hidden "Inbox" folder.

@@ -196,6 +196,14 @@ ssize_t FaultInjectingFileSystem::llistxattr(const std::string& path, char* list
     return inner_->llistxattr(path, list, size);
 }
 
+ssize_t FaultInjectingFileSystem::llistxattrAt(int dirfd, const std::string& name,
+                                               const std::string& path, char* list, size_t size) {
+    // Faults are aimed by path, whichever way the file is reached.
+    if (shouldFail(Operation::Llistxattr, {AT_FDCWD, path}))
+        return -1;
+    return inner_->llistxattrAt(dirfd, name, path, list, size);
+}
+
 int FaultInjectingFileSystem::fsetxattr(int fd, const std::string& name, const void* value,
                                         size_t size, int flags) {
     if (shouldFail(Operation::Fsetxattr, {fd, {}}))

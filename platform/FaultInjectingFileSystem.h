@@ -72,6 +72,8 @@ public:
     ssize_t lgetxattr(const std::string& path, const std::string& name, void* value,
                       size_t size) override;
     ssize_t llistxattr(const std::string& path, char* list, size_t size) override;
+    ssize_t llistxattrAt(int dirfd, const std::string& name, const std::string& path, char* list,
+                         size_t size) override;
     int fsetxattr(int fd, const std::string& name, const void* value, size_t size,
                   int flags) override;
     int fremovexattr(int fd, const std::string& name) override;

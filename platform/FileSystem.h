@@ -50,6 +50,11 @@ public:
     // llistxattr(2); the names returned are without the "user." prefix, and names of other
     // namespaces are left out.
     virtual ssize_t llistxattr(const std::string& path, char* list, size_t size) = 0;
+    // The same for the entry `name` of the open folder `dirfd`, which is the file at `path`:
+    // one name lookup instead of a walk of the path (the path serves kernels that have no such
+    // call).
+    virtual ssize_t llistxattrAt(int dirfd, const std::string& name, const std::string& path,
+                                 char* list, size_t size) = 0;
     virtual int fsetxattr(int fd, const std::string& name, const void* value, size_t size,
                           int flags) = 0;
     virtual int fremovexattr(int fd, const std::string& name) = 0;

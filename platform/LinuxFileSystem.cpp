@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstddef>
 #include <cstdint>
@@ -192,32 +193,41 @@ ssize_t LinuxFileSystem::lgetxattr(const std::string& path, const std::string& n
     return ::lgetxattr(path.c_str(), userName(name).c_str(), value, size);
 }
 
-ssize_t LinuxFileSystem::llistxattr(const std::string& path, char* list, size_t size) {
-    // The kernel's list has every namespace; read it whole, then keep the user names without
-    // their prefix. The list may grow between the two calls, hence the loop.
-    std::vector<char> raw;
-    for (;;) {
-        ssize_t needed = ::llistxattr(path.c_str(), nullptr, 0);
+namespace {
+
+// listxattrat(2), Linux 6.13 and later; the number is the same on every architecture.
+constexpr long kListxattrat = 465;
+std::atomic<bool> gNoListxattrat{false};
+
+// The kernel's attribute list of one file through `list(buffer, size)`, then only the user
+// names, without their prefix, into the caller's buffer. Most files have no attributes or a
+// few short ones: the first read goes into a buffer on the stack, and only a longer list costs
+// the call that asks for its size.
+template <class ListCall>
+ssize_t userNames(const ListCall& listRaw, char* list, size_t size) {
+    char small[1024];
+    std::vector<char> large;
+    const char* raw = small;
+    ssize_t got = listRaw(small, sizeof small);
+    // The list may grow between asking its size and reading it, hence the loop.
+    while (got < 0 && errno == ERANGE) {
+        ssize_t needed = listRaw(nullptr, 0);
         if (needed < 0)
             return -1;
-        if (needed == 0)
-            return 0;
-        raw.resize(static_cast<size_t>(needed));
-        ssize_t got = ::llistxattr(path.c_str(), raw.data(), raw.size());
-        if (got >= 0) {
-            raw.resize(static_cast<size_t>(got));
-            break;
-        }
-        if (errno != ERANGE)
-            return -1;
+        large.resize(static_cast<size_t>(needed) + 1);
+        got = listRaw(large.data(), large.size());
+        raw = large.data();
     }
+    if (got < 0)
+        return -1;
 
     std::string names;
-    for (size_t pos = 0; pos < raw.size();) {
-        const char* start = raw.data() + pos;
-        size_t length = ::strnlen(start, raw.size() - pos);
-        std::string_view name(start, length);
-        pos += length + 1;
+    const size_t length = static_cast<size_t>(got);
+    for (size_t pos = 0; pos < length;) {
+        const char* start = raw + pos;
+        size_t nameLength = ::strnlen(start, length - pos);
+        std::string_view name(start, nameLength);
+        pos += nameLength + 1;
         if (name.size() > kUserPrefix.size() && name.starts_with(kUserPrefix)) {
             names.append(name.substr(kUserPrefix.size()));
             names.push_back('\0');
@@ -231,6 +241,30 @@ ssize_t LinuxFileSystem::llistxattr(const std::string& path, char* list, size_t 
     }
     std::memcpy(list, names.data(), names.size());
     return static_cast<ssize_t>(names.size());
+}
+
+}  // namespace
+
+ssize_t LinuxFileSystem::llistxattr(const std::string& path, char* list, size_t size) {
+    return userNames(
+        [&](char* buffer, size_t length) { return ::llistxattr(path.c_str(), buffer, length); },
+        list, size);
+}
+
+ssize_t LinuxFileSystem::llistxattrAt(int dirfd, const std::string& name, const std::string& path,
+                                      char* list, size_t size) {
+    if (!gNoListxattrat.load(std::memory_order_relaxed)) {
+        ssize_t got = userNames(
+            [&](char* buffer, size_t length) {
+                return static_cast<ssize_t>(::syscall(kListxattrat, dirfd, name.c_str(),
+                                                      AT_SYMLINK_NOFOLLOW, buffer, length));
+            },
+            list, size);
+        if (got >= 0 || errno != ENOSYS)
+            return got;
+        gNoListxattrat.store(true, std::memory_order_relaxed);
+    }
+    return llistxattr(path, list, size);
 }
 
 int LinuxFileSystem::fsetxattr(int fd, const std::string& name, const void* value, size_t size,

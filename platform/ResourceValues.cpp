@@ -1,6 +1,7 @@
 #include "platform/ResourceValues.h"
 
 #include <cerrno>
+#include <iterator>
 #include <optional>
 
 #include "platform/FileSystem.h"
@@ -60,11 +61,23 @@ ObjectRef dateFrom(const struct statx_timestamp& t) {
     return Date::make(static_cast<double>(t.tv_sec) + static_cast<double>(t.tv_nsec) / 1e9);
 }
 
+// Where a file's calls go: its path, or its name in an open folder.
+struct Location {
+    int dirfd;
+    std::string relative;
+};
+
+Location locate(const std::string& path, const OpenFolder* folder) {
+    if (folder && folder->fd() >= 0)
+        return {folder->fd(), std::string(UrlPath::lastComponent(path))};
+    return {AT_FDCWD, path};
+}
+
 // Whether the file at `path` grants `mode` to this process; an error when the check fails
 // for another reason than the answer being no.
-Result<bool> access(const std::string& path, int mode, bool isSymbolicLink) {
+Result<bool> access(const std::string& path, const Location& at, int mode, bool isSymbolicLink) {
     FileSystem& fs = FileSystem::current();
-    if (fs.faccessat(AT_FDCWD, path, mode, AT_EACCESS | AT_SYMLINK_NOFOLLOW) == 0)
+    if (fs.faccessat(at.dirfd, at.relative, mode, AT_EACCESS | AT_SYMLINK_NOFOLLOW) == 0)
         return true;
     int error = errno;
     if (error == EINVAL) {
@@ -73,7 +86,7 @@ Result<bool> access(const std::string& path, int mode, bool isSymbolicLink) {
         // checked without the flag.
         if (isSymbolicLink)
             return true;
-        if (fs.faccessat(AT_FDCWD, path, mode, AT_EACCESS) == 0)
+        if (fs.faccessat(at.dirfd, at.relative, mode, AT_EACCESS) == 0)
             return true;
         error = errno;
     }
@@ -94,12 +107,23 @@ ObjectRef unsignedValue(uint64_t value) {
 
 }  // namespace
 
-bool isKnownKey(ResourceKey key) {
-    for (ResourceKey known : kAllKeys) {
-        if (known == key)
-            return true;
+static_assert(std::size(kAllKeys) == kKeyCount);
+
+int indexOf(ResourceKey key) {
+    for (size_t i = 0; i < kKeyCount; ++i) {
+        // The constants themselves come first: a key is nearly always one of them.
+        if (kAllKeys[i].data() == key.data() || kAllKeys[i] == key)
+            return static_cast<int>(i);
     }
-    return false;
+    return -1;
+}
+
+ResourceKey keyAt(size_t index) {
+    return kAllKeys[index];
+}
+
+bool isKnownKey(ResourceKey key) {
+    return indexOf(key) >= 0;
 }
 
 bool isReadFromFile(ResourceKey key) {
@@ -112,7 +136,8 @@ Error unknownKeyError(ResourceKey key) {
                   {"key", std::string(key)}});
 }
 
-Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<ResourceKey>& keys) {
+Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<ResourceKey>& keys,
+                                    const OpenFolder* folder) {
     unsigned int mask = STATX_TYPE | STATX_MODE;
     for (ResourceKey key : keys) {
         if (!isReadFromFile(key))
@@ -120,8 +145,9 @@ Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<R
         mask |= maskFor(key);
     }
 
+    const Location at = locate(path, folder);
     struct statx st {};
-    if (FileSystem::current().statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW, mask, &st) != 0) {
+    if (FileSystem::current().statx(at.dirfd, at.relative, AT_SYMLINK_NOFOLLOW, mask, &st) != 0) {
         return errorFor(errno, path);
     }
     const bool isDirectory = S_ISDIR(st.stx_mode);
@@ -161,7 +187,7 @@ Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<R
                 value = dateFrom(st.stx_mtime);
         } else if (key == K::kIsReadable || key == K::kIsWritable) {
             Result<bool> allowed =
-                access(path, key == K::kIsReadable ? R_OK : W_OK, isSymbolicLink);
+                access(path, at, key == K::kIsReadable ? R_OK : W_OK, isSymbolicLink);
             if (!allowed.ok())
                 return allowed.error();
             value = Number::fromBool(*allowed);

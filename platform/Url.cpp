@@ -1,6 +1,7 @@
 #include "platform/Url.h"
 
 #include <algorithm>
+#include <array>
 #include <atomic>
 #include <cerrno>
 #include <mutex>
@@ -16,8 +17,14 @@ struct Url::Storage {
     bool isFile = false;
     std::string text;  // the standardised path of a file URL, else the URL as given
 
+    // The folder the URL was made in, while whoever opened it keeps it open.
+    std::weak_ptr<const OpenFolder> folder;
+
     std::mutex mutex;
-    std::map<std::string, ObjectRef, std::less<>> cache;
+    // Indexed by ResourceValues::indexOf; a key is cached when its bit is set (a cached value
+    // may be null: "no value").
+    std::array<ObjectRef, ResourceValues::kKeyCount> values;
+    uint32_t cached = 0;
     // Bumped whenever cached values are removed, so that a read that was under way then does
     // not put back what the caller just dropped.
     uint64_t generation = 0;
@@ -26,6 +33,20 @@ struct Url::Storage {
 namespace {
 
 std::atomic<DocumentIdLookup> gDocumentIdLookup{nullptr};
+
+// The cache, under the storage's mutex.
+bool isCached(const Url::Storage& storage, int index) {
+    return (storage.cached >> index) & 1;
+}
+
+// Keeps `value` unless one is cached already; answers what is cached then.
+const ObjectRef& cacheValue(Url::Storage& storage, int index, ObjectRef value) {
+    if (!isCached(storage, index)) {
+        storage.values[index] = std::move(value);
+        storage.cached |= 1u << index;
+    }
+    return storage.values[index];
+}
 
 std::shared_ptr<Url::Storage> makeStorage(bool isFile, std::string text) {
     auto storage = std::make_shared<Url::Storage>();
@@ -78,6 +99,22 @@ std::optional<std::string> filePathOf(std::string_view rest) {
 Url::Url() : storage_(makeStorage(false, {})) {}
 
 Url::Url(std::shared_ptr<Storage> storage) : storage_(std::move(storage)) {}
+
+Url Url::fileURLInFolder(const std::shared_ptr<const OpenFolder>& folder, std::string_view name) {
+    std::string path;
+    path.reserve(folder->path().size() + 1 + name.size());
+    path.append(folder->path());
+    if (!path.ends_with('/'))
+        path.push_back('/');
+    path.append(name);
+    auto storage = makeStorage(true, std::move(path));
+    storage->folder = folder;
+    return Url(std::move(storage));
+}
+
+std::shared_ptr<const OpenFolder> Url::openFolder() const {
+    return storage_->folder.lock();
+}
 
 Url Url::fileURLWithPath(std::string_view path) {
     std::string base = path.starts_with('/') ? std::string("/") : UrlPath::workingDirectory();
@@ -161,16 +198,17 @@ Url Url::appendingPathComponent(std::string_view component) const {
 Result<ObjectRef> Url::resourceValue(ResourceKey key) const {
     if (!storage_->isFile)
         return notAFileUrlError(storage_->text);
-    if (!ResourceValues::isKnownKey(key))
+    const int index = ResourceValues::indexOf(key);
+    if (index < 0)
         return ResourceValues::unknownKeyError(key);
     uint64_t generation;
     {
         std::lock_guard lock(storage_->mutex);
-        auto it = storage_->cache.find(key);
-        if (it != storage_->cache.end())
-            return it->second;
+        if (isCached(*storage_, index))
+            return storage_->values[index];
         generation = storage_->generation;
     }
+    const auto folder = storage_->folder.lock();
 
     ObjectRef value;
     if (key == ResourceKeys::kDocumentID) {
@@ -181,14 +219,15 @@ Result<ObjectRef> Url::resourceValue(ResourceKey key) const {
             // No ID yet is a normal answer for a file that exists; a vanished file is an error,
             // as for every other key.
             Result<std::vector<ObjectRef>> exists =
-                ResourceValues::read(storage_->text, {ResourceKeys::kFileID});
+                ResourceValues::read(storage_->text, {ResourceKeys::kFileID}, folder.get());
             if (!exists.ok())
                 return exists.error();
             return ObjectRef();
         }
         value = Number::fromUInt64(*id);
     } else {
-        Result<std::vector<ObjectRef>> values = ResourceValues::read(storage_->text, {key});
+        Result<std::vector<ObjectRef>> values =
+            ResourceValues::read(storage_->text, {key}, folder.get());
         if (!values.ok())
             return values.error();
         value = std::move(values->front());
@@ -197,7 +236,7 @@ Result<ObjectRef> Url::resourceValue(ResourceKey key) const {
     std::lock_guard lock(storage_->mutex);
     if (storage_->generation == generation) {
         // A value set meanwhile wins over the one read.
-        return storage_->cache.try_emplace(std::string(key), value).first->second;
+        return cacheValue(*storage_, index, std::move(value));
     }
     return value;
 }
@@ -211,8 +250,10 @@ Status Url::setResourceValue(const ObjectRef& value, ResourceKey key) const {
                                           " can't be set; only the file and document IDs can."},
                       {"key", std::string(key)}});
     }
+    const int index = ResourceValues::indexOf(key);
     std::lock_guard lock(storage_->mutex);
-    storage_->cache.insert_or_assign(std::string(key), value);
+    storage_->values[index] = value;
+    storage_->cached |= 1u << index;
     return Status::OK();
 }
 
@@ -225,9 +266,10 @@ Status Url::prefetchResourceValues(const std::vector<ResourceKey>& keys) const {
     {
         std::lock_guard lock(storage_->mutex);
         for (ResourceKey key : keys) {
-            if (!ResourceValues::isKnownKey(key))
+            const int index = ResourceValues::indexOf(key);
+            if (index < 0)
                 return ResourceValues::unknownKeyError(key);
-            if (storage_->cache.contains(key))
+            if (isCached(*storage_, index))
                 continue;
             if (key == ResourceKeys::kDocumentID) {
                 wantsDocumentID = true;
@@ -240,7 +282,9 @@ Status Url::prefetchResourceValues(const std::vector<ResourceKey>& keys) const {
 
     std::vector<ObjectRef> values;
     if (!fromFile.empty()) {
-        Result<std::vector<ObjectRef>> read = ResourceValues::read(storage_->text, fromFile);
+        const auto folder = storage_->folder.lock();
+        Result<std::vector<ObjectRef>> read =
+            ResourceValues::read(storage_->text, fromFile, folder.get());
         if (!read.ok())
             return read.error();
         values = std::move(*read);
@@ -258,22 +302,25 @@ Status Url::prefetchResourceValues(const std::vector<ResourceKey>& keys) const {
     if (storage_->generation != generation)
         return Status::OK();
     for (size_t i = 0; i < fromFile.size(); ++i) {
-        storage_->cache.try_emplace(std::string(fromFile[i]), std::move(values[i]));
+        (void)cacheValue(*storage_, ResourceValues::indexOf(fromFile[i]), std::move(values[i]));
     }
     return Status::OK();
 }
 
 void Url::removeCachedResourceValue(ResourceKey key) const {
+    const int index = ResourceValues::indexOf(key);
     std::lock_guard lock(storage_->mutex);
-    auto it = storage_->cache.find(key);
-    if (it != storage_->cache.end())
-        storage_->cache.erase(it);
+    if (index >= 0) {
+        storage_->values[index] = nullptr;
+        storage_->cached &= ~(1u << index);
+    }
     ++storage_->generation;
 }
 
 void Url::removeAllCachedResourceValues() const {
     std::lock_guard lock(storage_->mutex);
-    storage_->cache.clear();
+    storage_->values = {};
+    storage_->cached = 0;
     ++storage_->generation;
 }
 

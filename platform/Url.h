@@ -12,6 +12,8 @@
 
 namespace tamber {
 
+class OpenFolder;
+
 // Resource keys and the names they are known by (in logs and caches).
 using ResourceKey = std::string_view;
 namespace ResourceKeys {
@@ -43,6 +45,12 @@ public:
     // `path` made absolute (against the working directory) and standardised: repeated and
     // trailing slashes, "." and ".." resolved lexically (no symbolic links are read).
     static Url fileURLWithPath(std::string_view path);
+    // The child `name` of an open folder. While the folder stays open, the URL's resource values
+    // are read relative to it.
+    static Url fileURLInFolder(const std::shared_ptr<const OpenFolder>& folder,
+                               std::string_view name);
+    // The open folder the URL was made in, or null (never made in one, or closed since).
+    std::shared_ptr<const OpenFolder> openFolder() const;
     // "file:///a%20b" or any other "scheme:..." string; nothing when it is not a URL.
     static std::optional<Url> parse(std::string_view string);
 
