@@ -4,7 +4,12 @@
 //   - a change enumeration of C changes (every batch until caught up), in changes per second;
 //   - the delay from a file write to the notifier's signal.
 //
+//   - per page of the flat folder: the time of the first, middle and last pages and the resident
+//     memory after them, which must not grow with the page number (run it with
+//     --files 1000000 --no-tree for a folder of a million files; not part of the suite).
+//
 //   build/bench/bench_enumeration [--files 100000] [--folders 1000] [--changes 10000] [--dir D]
+//                                 [--no-tree]
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -43,6 +48,7 @@ struct Options {
     size_t folders = 1000;
     size_t changes = 10000;
     std::string dir;
+    bool tree = true;
 };
 
 double since(Clock::time_point start) {
@@ -75,10 +81,22 @@ size_t parseCount(const std::string& flag, const char* text) {
     return static_cast<size_t>(value);
 }
 
+constexpr const char* kUsage =
+    "usage: bench_enumeration [--files N] [--folders M] [--changes C] [--dir DIR] [--no-tree]";
+
 Options parseOptions(int argc, char** argv) {
     Options options;
     const char* tmp = std::getenv("TMPDIR");
     options.dir = tmp && *tmp ? tmp : "/tmp";
+    std::vector<char*> args(argv, argv + argc);
+    std::erase_if(args, [&](char* arg) {
+        bool noTree = std::string(arg) == "--no-tree";
+        if (noTree)
+            options.tree = false;
+        return noTree;
+    });
+    argc = static_cast<int>(args.size());
+    argv = args.data();
     for (int i = 1; i + 1 < argc; i += 2) {
         std::string flag = argv[i];
         if (flag == "--files")
@@ -90,10 +108,10 @@ Options parseOptions(int argc, char** argv) {
         else if (flag == "--dir")
             options.dir = argv[i + 1];
         else
-            die("usage: bench_enumeration [--files N] [--folders M] [--changes C] [--dir DIR]");
+            die(kUsage);
     }
     if (argc % 2 == 0)
-        die("usage: bench_enumeration [--files N] [--folders M] [--changes C] [--dir DIR]");
+        die(kUsage);
     return options;
 }
 
@@ -162,15 +180,46 @@ public:
     DispatchSemaphore done;
 };
 
-// Lists every page of `container` over `urls`; returns the items seen.
-size_t listAllPages(const HostPorterItemIdentifier& container, const std::vector<Url>& urls) {
+// The resident memory of this process now and at its peak, in KiB.
+struct Resident {
+    long now = 0;
+    long peak = 0;
+};
+
+Resident residentMemory() {
+    Resident resident;
+    FILE* status = std::fopen("/proc/self/status", "r");
+    if (!status)
+        return resident;
+    char line[256];
+    while (std::fgets(line, sizeof line, status)) {
+        std::sscanf(line, "VmRSS: %ld", &resident.now);
+        std::sscanf(line, "VmHWM: %ld", &resident.peak);
+    }
+    std::fclose(status);
+    return resident;
+}
+
+// One page: how long it took, and the memory after it.
+struct PageSample {
+    double seconds;
+    Resident resident;
+};
+
+// Lists every page of `container` over `urls`; returns the items seen. With `samples`, each
+// page's time and the memory after it.
+size_t listAllPages(const HostPorterItemIdentifier& container, const std::vector<Url>& urls,
+                    std::vector<PageSample>* samples = nullptr) {
     auto enumerator = LocalFileEnumerator::initWithContainer(container, urls);
     HostPorterPage page = HostPorterInitialPageSortedByName();
     size_t total = 0;
     for (;;) {
         auto observer = std::make_shared<PageObserver>();
+        auto pageStart = Clock::now();
         enumerator->enumerateItemsForObserver(observer, page);
         observer->done.wait();
+        if (samples)
+            samples->push_back({since(pageStart), residentMemory()});
         if (observer->error)
             die("listing failed: " + observer->error->description());
         total += observer->count;
@@ -206,6 +255,29 @@ public:
     DispatchSemaphore done;
 };
 
+// The first, middle and last pages of a listing: each the median of ten pages around it, and
+// the memory after it.
+void printPageSamples(const std::vector<PageSample>& samples) {
+    if (samples.size() < 3)
+        return;
+    auto at = [&](const char* which, size_t center) {
+        size_t from = center >= 5 ? center - 5 : 0;
+        size_t to = std::min(samples.size(), from + 10);
+        from = to >= 10 ? std::min(from, to - 10) : 0;
+        std::vector<double> times;
+        for (size_t i = from; i < to; ++i) times.push_back(samples[i].seconds);
+        std::sort(times.begin(), times.end());
+        const Resident& r = samples[center].resident;
+        std::printf(
+            "  %-6s page %7zu: %8.3f ms (median of pages %zu-%zu), resident %ld KiB, "
+            "peak %ld KiB\n",
+            which, center + 1, times[times.size() / 2] * 1000, from + 1, to, r.now, r.peak);
+    };
+    at("first", 0);
+    at("middle", samples.size() / 2);
+    at("last", samples.size() - 1);
+}
+
 void printRow(const char* what, size_t items, double seconds, const char* unit, double baseline,
               const char* baselineWhat) {
     std::printf("%-44s %8zu %9.3f %12.0f %-9s %7.2fx  %s (%.3f s)\n", what, items, seconds,
@@ -240,10 +312,14 @@ int main(int argc, char** argv) {
     makeDirectory(flat);
     makeDirectory(tree);
     std::fprintf(stderr, "creating %zu files in one folder and %zu in %zu folders\n", options.files,
-                 options.files, options.folders);
-    for (size_t i = 0; i < options.files; ++i) writeFile(flat + "/f-" + std::to_string(i));
+                 options.tree ? options.files : 0, options.tree ? options.folders : 0);
+    for (size_t i = 0; i < options.files; ++i) {
+        writeFile(flat + "/f-" + std::to_string(i));
+        if ((i + 1) % 100000 == 0)
+            std::fprintf(stderr, "  %zu/%zu\n", i + 1, options.files);
+    }
     size_t perFolder = std::max<size_t>(1, options.files / options.folders);
-    for (size_t k = 0; k < options.folders; ++k) {
+    for (size_t k = 0; options.tree && k < options.folders; ++k) {
         std::string folder = tree + "/d-" + std::to_string(k);
         makeDirectory(folder);
         for (size_t i = 0; i < perFolder; ++i) writeFile(folder + "/f-" + std::to_string(i));
@@ -271,15 +347,19 @@ int main(int argc, char** argv) {
         start = Clock::now();
         walked = plainWalk(flat);
         baseline = since(start);
+        std::vector<PageSample> samples;
         start = Clock::now();
-        listed = listAllPages(*flatID, {flatURL});
+        listed = listAllPages(*flatID, {flatURL}, &samples);
         seconds = since(start);
         if (listed != walked)
             std::fprintf(stderr, "warning: listed %zu items, the walk saw %zu\n", listed, walked);
         printRow(round, listed, seconds, "items/s", baseline, "getdents+statx+llistxattr walk");
+        printPageSamples(samples);
     }
     for (const char* round :
          {"list a tree, first time (IDs made)", "list a tree, every page of 200"}) {
+        if (!options.tree)
+            break;
         start = Clock::now();
         walked = plainWalk(tree);
         baseline = since(start);
