@@ -150,7 +150,7 @@ void walkFrames(std::vector<Frame>& stack, DirectoryEnumerationOptions options, 
             const OpenFolderRef& folder = frame.openFolder(pager.keepOpen);
             Url url =
                 folder ? Url::fileURLInFolder(folder, entry.name) : Url::fileURLWithPath(path);
-            if (Status prefetched = url.prefetchResourceValues(LocalItem::urlKeys());
+            if (Status prefetched = url.prefetchResourceValues(LocalItem::listingKeys());
                 !prefetched.ok()) {
                 if (!pager.handleError(url, prefetched.error()))
                     return;

@@ -209,21 +209,20 @@ const std::string& LocalItem::xattrTrashPutBackName() {
 }
 
 const std::vector<ResourceKey>& LocalItem::urlKeys() {
-    // With the identity keys, the record's own prefetch then finds everything cached.
     static const std::vector<ResourceKey> keys = {
-        K::kParentDirectoryURL,
-        K::kName,
-        K::kLocalizedName,
-        K::kTypeIdentifier,
-        K::kFileSize,
-        K::kCreationDate,
-        K::kContentModificationDate,
-        K::kIsReadable,
-        K::kIsWritable,
-        K::kIsDirectory,
-        K::kIsPackage,
-        K::kFileID,
+        K::kParentDirectoryURL,      K::kName,       K::kLocalizedName,
+        K::kTypeIdentifier,          K::kFileSize,   K::kCreationDate,
+        K::kContentModificationDate, K::kIsReadable, K::kIsWritable,
     };
+    return keys;
+}
+
+const std::vector<ResourceKey>& LocalItem::listingKeys() {
+    static const std::vector<ResourceKey> keys = [] {
+        std::vector<ResourceKey> all = urlKeys();
+        all.insert(all.end(), {K::kIsDirectory, K::kIsPackage, K::kFileID});
+        return all;
+    }();
     return keys;
 }
 

@@ -43,9 +43,11 @@ public:
 
     // The resource keys enumerators prefetch so that building a record reads no value twice:
     // parent directory URL, name, localized name, type identifier, file size, creation date,
-    // content modification date, is readable, is writable, and the identity keys (is
-    // directory, is package, file ID).
+    // content modification date, is readable, is writable.
     static const std::vector<ResourceKey>& urlKeys();
+    // urlKeys and the keys the record's identifier needs (is directory, is package, file ID):
+    // what a listing prefetches, all from the same status query.
+    static const std::vector<ResourceKey>& listingKeys();
 
     // The identifier of the folder that holds `url`, as make() finds it: a listing that builds
     // many records in one folder asks once and passes it as customParentItemID.
