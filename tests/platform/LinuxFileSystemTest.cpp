@@ -63,6 +63,48 @@ TEST_F(LinuxFileSystemTest, DescriptorsAreCloseOnExecAndUserAttributesHideTheirP
     EXPECT_EQ(errno, ENODATA);
 }
 
+// Attribute lists read relative to a folder say what lists read by path say: user names only,
+// without their prefix, however long the list, and never a link's target's.
+TEST_F(LinuxFileSystemTest, AttributeListsInAFolderMatchThoseReadByPath) {
+    std::string folder = dir_.makeDir("listed");
+    std::string few = dir_.writeFile("listed/few", "x");
+    std::string many = dir_.writeFile("listed/many", "x");
+    std::string none = dir_.writeFile("listed/none", "x");
+    if (::setxattr(few.c_str(), "user.a", "1", 1, 0) != 0) {
+        if (errno == ENOTSUP)
+            GTEST_SKIP() << "the temporary file system has no user attributes";
+        FAIL() << "setxattr: " << std::strerror(errno);
+    }
+    // Longer than any buffer a first read would use.
+    for (int i = 0; i < 40; ++i) {
+        std::string name = "user.attribute-with-a-long-name-number-" + std::to_string(i);
+        ASSERT_EQ(::setxattr(many.c_str(), name.c_str(), "v", 1, 0), 0) << name;
+    }
+    ASSERT_EQ(::symlink(many.c_str(), (dir_ / "listed/link").c_str()), 0);
+    int fd = open(folder, O_PATH | O_DIRECTORY);
+    ASSERT_GE(fd, 0);
+
+    for (const char* name : {"few", "many", "none", "link"}) {
+        std::string path = folder + "/" + name;
+        ssize_t byPath = fs_.llistxattr(path, nullptr, 0);
+        ssize_t inFolder = fs_.llistxattrAt(fd, name, path, nullptr, 0);
+        ASSERT_EQ(inFolder, byPath) << name;
+        std::vector<char> a(static_cast<size_t>(byPath) + 1), b(a.size());
+        ASSERT_EQ(fs_.llistxattr(path, a.data(), a.size()), byPath);
+        ASSERT_EQ(fs_.llistxattrAt(fd, name, path, b.data(), b.size()), byPath) << name;
+        EXPECT_EQ(a, b) << name;
+        if (byPath > 0) {
+            EXPECT_EQ(fs_.llistxattrAt(fd, name, path, b.data(), 1), -1) << name;
+            EXPECT_EQ(errno, ERANGE);
+        }
+    }
+    EXPECT_EQ(fs_.llistxattrAt(fd, "link", folder + "/link", nullptr, 0), 0)
+        << "a link's own list, not its target's";
+    EXPECT_EQ(fs_.llistxattrAt(fd, "few", folder + "/few", nullptr, 0), ssize_t(sizeof "a"));
+    EXPECT_EQ(fs_.llistxattrAt(fd, "gone", folder + "/gone", nullptr, 0), -1);
+    EXPECT_EQ(errno, ENOENT);
+}
+
 TEST_F(LinuxFileSystemTest, ReadDirectorySortsAndTypesEntriesOrFailsEmpty) {
     for (const char* name : {"b.txt", "B.txt", "a", "\xC3\xA9t\xC3\xA9"}) dir_.writeFile(name);
     dir_.makeDir("sub/inner");
