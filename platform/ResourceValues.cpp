@@ -1,5 +1,6 @@
 #include "platform/ResourceValues.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <iterator>
 #include <optional>
@@ -155,12 +156,25 @@ Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<R
     const std::string_view name = UrlPath::lastComponent(path);
     auto has = [&](unsigned int field) { return (st.stx_mask & field) != 0; };
 
+    // Asked for both, one check answers both in the usual case: readable and writable.
+    std::optional<bool> readableAndWritable;
+    if (std::find(keys.begin(), keys.end(), K::kIsReadable) != keys.end() &&
+        std::find(keys.begin(), keys.end(), K::kIsWritable) != keys.end()) {
+        Result<bool> both = access(path, at, R_OK | W_OK, isSymbolicLink);
+        if (both.ok() && *both)
+            readableAndWritable = true;
+    }
+
     std::vector<ObjectRef> values;
     values.reserve(keys.size());
+    ObjectRef nameValue;
     for (ResourceKey key : keys) {
         ObjectRef value;
         if (key == K::kName || key == K::kLocalizedName) {
-            value = String::make(std::string(name));
+            // Immutable: the name and the localized name may share one.
+            if (!nameValue)
+                nameValue = String::make(std::string(name));
+            value = nameValue;
         } else if (key == K::kParentDirectoryURL) {
             if (path != "/") {
                 value = std::make_shared<UrlObject>(
@@ -185,6 +199,8 @@ Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<R
         } else if (key == K::kContentModificationDate) {
             if (has(STATX_MTIME))
                 value = dateFrom(st.stx_mtime);
+        } else if ((key == K::kIsReadable || key == K::kIsWritable) && readableAndWritable) {
+            value = Number::fromBool(true);
         } else if (key == K::kIsReadable || key == K::kIsWritable) {
             Result<bool> allowed =
                 access(path, at, key == K::kIsReadable ? R_OK : W_OK, isSymbolicLink);

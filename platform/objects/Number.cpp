@@ -16,7 +16,10 @@ std::shared_ptr<const Number> Number::fromDouble(double v) {
     return std::shared_ptr<const Number>(new Number(Kind::Floating, 0, 0, v));
 }
 std::shared_ptr<const Number> Number::fromBool(bool v) {
-    return std::shared_ptr<const Number>(new Number(Kind::Boolean, v ? 1 : 0, 0, 0));
+    // Immutable, and asked for several times per file a listing reads: two suffice.
+    static const std::shared_ptr<const Number> kFalse(new Number(Kind::Boolean, 0, 0, 0));
+    static const std::shared_ptr<const Number> kTrue(new Number(Kind::Boolean, 1, 0, 0));
+    return v ? kTrue : kFalse;
 }
 
 uint64_t Number::uint64Value() const {
