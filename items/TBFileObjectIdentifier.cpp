@@ -1,10 +1,12 @@
 #include "items/TBFileObjectIdentifier.h"
 
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <charconv>
 #include <climits>
+#include <map>
 #include <string>
 
 #include "host/HostPorterManager.h"
@@ -79,16 +81,18 @@ bool isRetriedErrno(int error) {
 }  // namespace
 
 uint32_t TBFileObjectIdentifier::deviceIDWithError(const Url& url, Error* error) {
-    ScopedFd fd = openEventOnly(url.path());
-    CommonAttributes attributes;
-    if (!fd.ok() || GetAttributeList(fd.get(), attributes) != 0) {
+    // The device is all that is asked: one statx, no descriptor and no document-ID look-up
+    // (every "did=" resolution asks it of the storage folder).
+    struct statx st {};
+    if (FileSystem::current().statx(AT_FDCWD, url.path(), AT_SYMLINK_NOFOLLOW, STATX_TYPE, &st) !=
+        0) {
         int saved = errno;
         if (error)
             *error = Error::posix(saved);
         errno = saved;
         return 0;
     }
-    return attributes.device;
+    return encodeDevice(st.stx_dev_major, st.stx_dev_minor);
 }
 
 uint32_t TBFileObjectIdentifier::deviceID(const Url& url) {
@@ -198,6 +202,87 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
                   {std::to_string(documentId), error.error().description()});
     }
     return TBPFileObjectIdentifier::fromDocumentID(documentId);
+}
+
+namespace {
+
+// Whether the entries of the folder at `folder` are inside a published tree, as itemIdentifier
+// decides it for each: below the storage folder, or below an app library's root.
+bool entriesAreInsideTrees(const Url& folder) {
+    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
+    UrlRelationship relation = pt_relationshipToItemAtURL(storage, folder);
+    if (relation != UrlRelationship::Other)
+        return true;
+    auto lookup = AppLibraryLookup::current();
+    for (const Url& root : lookup ? lookup->rootURLsForAppLibraries() : std::vector<Url>{}) {
+        if (pt_relationshipToItemAtURL(root, folder) != UrlRelationship::Other)
+            return true;
+    }
+    return false;
+}
+
+bool boolValue(const Url& url, ResourceKey key, bool& value) {
+    auto read = url.resourceValue(key);
+    if (!read.ok())
+        return false;
+    auto number = objectCast<Number>(read.value());
+    value = number && number->boolValue();
+    return true;
+}
+
+}  // namespace
+
+void TBFileObjectIdentifier::prepareItemIdentifiers(const std::vector<Url>& urls) {
+    auto service = StrataService::current();
+    if (!service || urls.empty())
+        return;
+    // The entries of a page share their folder: it is placed once.
+    std::map<std::string, bool> insideByFolder;
+    std::vector<ScopedFd> documents;
+    std::vector<const Url*> documentUrls;
+    FileSystem& fs = FileSystem::current();
+    for (const Url& url : urls) {
+        if (!url.isFileURL() || url.path() == "/")
+            continue;
+        Url folder = url.deletingLastPathComponent();
+        auto inside = insideByFolder.find(folder.path());
+        if (inside == insideByFolder.end())
+            inside = insideByFolder.emplace(folder.path(), entriesAreInsideTrees(folder)).first;
+        if (!inside->second)
+            continue;
+        bool isDirectory = false;
+        bool isPackage = false;
+        if (!boolValue(url, ResourceKeys::kIsDirectory, isDirectory) ||
+            (isDirectory && !boolValue(url, ResourceKeys::kIsPackage, isPackage)))
+            continue;
+        ScopedFd fd = openEventOnly(url.path());
+        struct statx st {};
+        if (!fd.ok() || fs.statx(fd.get(), "", AT_EMPTY_PATH, STATX_TYPE | STATX_INO, &st) != 0)
+            continue;
+        // What the resource values said must still hold: a file replaced meanwhile is left to
+        // itemIdentifier.
+        if (S_ISREG(st.stx_mode) && !isDirectory) {
+            documents.push_back(std::move(fd));
+            documentUrls.push_back(&url);
+        } else if (S_ISDIR(st.stx_mode) && isDirectory && isPackage) {
+            documents.push_back(std::move(fd));
+            documentUrls.push_back(&url);
+        } else if (S_ISDIR(st.stx_mode) && isDirectory) {
+            (void)url.setResourceValue(Number::fromUInt64(st.stx_ino), ResourceKeys::kFileID);
+        }
+    }
+    if (documents.empty())
+        return;
+    std::vector<int> fds;
+    fds.reserve(documents.size());
+    for (const ScopedFd& fd : documents) fds.push_back(fd.get());
+    std::vector<uint32_t> ids = service->getOrAllocateDocumentIds(fds);
+    for (size_t i = 0; i < ids.size() && i < documentUrls.size(); ++i) {
+        if (ids[i] != 0) {
+            (void)documentUrls[i]->setResourceValue(Number::fromUInt64(ids[i]),
+                                                    ResourceKeys::kDocumentID);
+        }
+    }
 }
 
 std::optional<Url> TBFileObjectIdentifier::fileURLWithItemIdentifier(

@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <vector>
 
 #include "host/HostPorterItemIdentifier.h"
 #include "platform/Url.h"
@@ -23,6 +24,14 @@ public:
     // The identifier of the item at `url`. Caches the file or document ID it found in the URL's
     // resource values, so that a second call on the same URL is cheap.
     static std::optional<HostPorterItemIdentifier> itemIdentifier(const Url& url);
+
+    // Gives every document among `urls` (regular files and packages inside the published
+    // trees) its document ID in one go: one journal sync, one index read, and one transaction
+    // for those that have none. Each ID is stored in its URL's resource-value cache (the
+    // document-ID key; the file-ID key for folders), so that itemIdentifier(url) then
+    // answers without touching the index. URLs that fail are left alone, for itemIdentifier
+    // to find and log the failure as it does today.
+    static void prepareItemIdentifiers(const std::vector<Url>& urls);
 
     static std::optional<Url> fileURLWithItemIdentifier(const HostPorterItemIdentifier& identifier);
     static std::optional<Url> fileURLWithFileIdentifier(uint64_t fileID);

@@ -24,6 +24,13 @@ std::shared_ptr<StrataService> StrataService::setCurrent(std::shared_ptr<StrataS
     return std::atomic_exchange(&slot(), std::move(service));
 }
 
+std::vector<uint32_t> StrataService::getOrAllocateDocumentIds(const std::vector<int>& fds) {
+    std::vector<uint32_t> ids;
+    ids.reserve(fds.size());
+    for (int fd : fds) ids.push_back(getOrAllocateDocumentId(fd));
+    return ids;
+}
+
 void StrataService::metadataAttributeWritten(int, const std::string&,
                                              const std::optional<std::vector<uint8_t>>&) {}
 

@@ -24,6 +24,10 @@ public:
     // The document ID of the open file, allocating the next one when it has none. Pending
     // file-system events are applied first, so a file saved just before is known.
     virtual uint32_t getOrAllocateDocumentId(int fd) = 0;
+    // The same for each open file, in order, with 0 for one that got no ID. The default asks for
+    // each in turn; the journal's service syncs once, reads its index once and writes the new
+    // IDs in one transaction (a listing asks for a page of files at a time).
+    virtual std::vector<uint32_t> getOrAllocateDocumentIds(const std::vector<int>& fds);
     // The document ID of an inode, 0 when it has none (never allocates).
     virtual uint32_t documentIdForInode(uint32_t device, uint64_t inode) = 0;
     // The file ID that holds a document now; 0 and ENOENT when unknown, EAGAIN while the index

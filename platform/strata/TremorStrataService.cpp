@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <map>
 
 #include "platform/FileSystem.h"
 #include "platform/Url.h"
@@ -45,49 +46,91 @@ std::optional<uint32_t> TremorStrataService::lookUpDocumentId(const std::string&
     return orLogged(store->documentIdForInode(st.stx_ino));
 }
 
+void TremorStrataService::allocate(TremorStore& store, const std::vector<File>& files,
+                                   std::vector<uint32_t>& ids) {
+    std::vector<uint64_t> inodes;
+    inodes.reserve(files.size());
+    for (const File& file : files) inodes.push_back(file.inode);
+    auto placed = store.placeInodes(inodes);
+    if (!placed.ok()) {
+        // Unknown is not "none": a second ID for a document would split it.
+        logError("Could not read the document index: " + placed.error().description());
+        errno = EIO;
+        return;
+    }
+    std::vector<TremorStore::NewDocument> wanted;
+    std::vector<size_t> wantedPositions;
+    int failure = 0;
+    for (size_t k = 0; k < files.size(); ++k) {
+        const TremorStore::Placement& place = placed.value()[k];
+        if (!place.path) {
+            failure = ENOENT;  // not inside a watched tree
+            continue;
+        }
+        if (place.docID != 0) {
+            ids[files[k].position] = place.docID;
+            continue;
+        }
+        TremorStore::NewDocument document{files[k].inode, {}};
+        // Metadata the file had before it became a document (given by another program, or
+        // copied in with it) follows it from now on too: kept in the transaction that gives
+        // the ID. Once per document: one listing, usually empty.
+        if (files[k].regular) {
+            if (auto values = DocumentAttributes::read(*place.path))
+                document.attributes = std::move(*values);
+        }
+        wanted.push_back(std::move(document));
+        wantedPositions.push_back(files[k].position);
+    }
+    if (!wanted.empty()) {
+        auto allocated = store.allocateDocumentIds(wanted);
+        if (!allocated.ok()) {
+            logError("Could not give document IDs: " + allocated.error().description());
+            errno = EIO;
+            return;
+        }
+        for (size_t k = 0; k < wanted.size(); ++k) ids[wantedPositions[k]] = allocated.value()[k];
+    }
+    if (failure != 0)
+        errno = failure;
+}
+
 uint32_t TremorStrataService::getOrAllocateDocumentId(int fd) {
+    std::vector<uint32_t> ids = getOrAllocateDocumentIds({fd});
+    return ids.front();
+}
+
+std::vector<uint32_t> TremorStrataService::getOrAllocateDocumentIds(const std::vector<int>& fds) {
+    std::vector<uint32_t> ids(fds.size(), 0);
     // A file saved just before must be in the index before it can be given an ID.
     service_->sync();
-    struct statx st {};
-    if (FileSystem::current().statx(fd, "", AT_EMPTY_PATH, STATX_INO | STATX_TYPE, &st) != 0)
-        return 0;
-    TremorStore* store = service_->storeForDevice(encodeDevice(st.stx_dev_major, st.stx_dev_minor));
-    if (!store) {
-        errno = EXDEV;
-        return 0;
-    }
-    auto path = store->pathForInode(st.stx_ino);
-    Result<std::optional<uint32_t>> existing = path.ok()
-                                                   ? store->documentIdForInode(st.stx_ino)
-                                                   : Result<std::optional<uint32_t>>(path.error());
-    if (!existing.ok()) {
-        // Unknown is not "none": a second ID for a document would split it.
-        logError("Could not read the document index: " + existing.error().description());
-        errno = EIO;
-        return 0;
-    }
-    if (!path.value()) {
-        errno = ENOENT;  // not inside a watched tree
-        return 0;
-    }
-    if (existing.value())
-        return *existing.value();
-    auto docID = store->allocateDocumentId(st.stx_ino);
-    if (!docID.ok()) {
-        errno = EIO;
-        return 0;
-    }
-    // Metadata the file had before it became a document (given by another program, or copied
-    // in with it) follows it from now on too. Once per document: one listing, usually empty.
-    if (S_ISREG(st.stx_mode)) {
-        auto values = DocumentAttributes::read(*path.value());
-        if (values && !values->empty()) {
-            if (auto status = store->replaceDocumentAttributes(docID.value(), *values);
-                !status.ok())
-                logError("Could not keep a document's metadata: " + status.error().description());
+    std::map<uint32_t, std::vector<File>> byDevice;
+    int failure = 0;
+    for (size_t i = 0; i < fds.size(); ++i) {
+        struct statx st {};
+        if (FileSystem::current().statx(fds[i], "", AT_EMPTY_PATH, STATX_INO | STATX_TYPE, &st) !=
+            0) {
+            failure = errno;
+            continue;
         }
+        byDevice[encodeDevice(st.stx_dev_major, st.stx_dev_minor)].push_back(
+            {i, st.stx_ino, S_ISREG(st.stx_mode)});
     }
-    return docID.value();
+    for (const auto& [device, files] : byDevice) {
+        TremorStore* store = service_->storeForDevice(device);
+        if (!store) {
+            failure = EXDEV;
+            continue;
+        }
+        errno = 0;
+        allocate(*store, files, ids);
+        if (errno != 0)
+            failure = errno;
+    }
+    // The one file of a single ask tells why it has none.
+    if (failure != 0)
+        errno = failure;
+    return ids;
 }
 
 uint32_t TremorStrataService::documentIdForInode(uint32_t device, uint64_t inode) {

@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <limits>
+#include <unordered_map>
 #include <unordered_set>
 
 #include "platform/UrlPath.h"
@@ -218,6 +219,45 @@ Result<std::optional<std::string>> InodeIndex::path(
     return std::optional<std::string>();
 }
 
+Result<std::vector<InodeIndex::Placement>> InodeIndex::place(
+    const std::vector<uint64_t>& inodes,
+    const std::function<const std::string*(uint64_t)>& rootPath) {
+    std::vector<Placement> placed(inodes.size());
+    // The entries of one listing share their folder: its path is walked once.
+    std::unordered_map<uint64_t, std::optional<std::string>> folders;
+    for (size_t i = 0; i < inodes.size(); ++i) {
+        auto entry = find(inodes[i]);
+        if (!entry.ok())
+            return entry.error();
+        if (const std::string* top = rootPath(inodes[i])) {
+            placed[i].path = *top;
+        } else if (entry.value() && UrlPath::isEntryName(entry.value()->name)) {
+            auto folder = folders.find(entry.value()->parent);
+            if (folder == folders.end()) {
+                auto walked = path(entry.value()->parent, rootPath);
+                if (!walked.ok())
+                    return walked.error();
+                folder = folders.emplace(entry.value()->parent, std::move(walked).value()).first;
+            }
+            if (folder->second) {
+                std::string found = *folder->second;
+                if (found.back() != '/')
+                    found += '/';
+                placed[i].path = found + entry.value()->name;
+            }
+        }
+        if (entry.value()) {
+            placed[i].docID = entry.value()->docID;
+        } else {
+            auto docID = documentIdForInode(inodes[i]);
+            if (!docID.ok())
+                return docID.error();
+            placed[i].docID = docID.value().value_or(0);
+        }
+    }
+    return placed;
+}
+
 Result<std::vector<InodeRecord>> InodeIndex::children(uint64_t parent) {
     auto stmt = db_.cached(kFindByParent);
     if (!stmt.ok())
@@ -256,35 +296,69 @@ Result<std::optional<uint64_t>> InodeIndex::inodeForDocumentId(uint32_t docID) {
 }
 
 Result<uint32_t> InodeIndex::allocateDocumentId(uint64_t inode) {
-    if (inode == 0)
-        return Error::invalidParameter("inode", "0");
-    auto existing = documentIdForInode(inode);
-    if (!existing.ok())
-        return existing.error();
-    if (existing.value())
-        return *existing.value();
-    if (nextDocumentId_ > std::numeric_limits<uint32_t>::max()) {
-        return Error(kPosixErrorDomain, EOVERFLOW,
-                     {{"description", "Every document ID of this volume has been used"}});
+    auto ids = allocateDocumentIds({NewDocument{inode, {}}});
+    if (!ids.ok())
+        return ids.error();
+    return ids.value().front();
+}
+
+Result<std::vector<uint32_t>> InodeIndex::allocateDocumentIds(
+    const std::vector<NewDocument>& documents) {
+    std::vector<uint32_t> ids(documents.size(), 0);
+    std::vector<size_t> fresh;                        // positions that get a new ID
+    std::unordered_map<uint64_t, size_t> firstFresh;  // an inode asked for twice gets one ID
+    for (size_t i = 0; i < documents.size(); ++i) {
+        uint64_t inode = documents[i].inode;
+        if (inode == 0)
+            return Error::invalidParameter("inode", "0");
+        auto existing = documentIdForInode(inode);
+        if (!existing.ok())
+            return existing.error();
+        if (existing.value())
+            ids[i] = *existing.value();
+        else if (firstFresh.try_emplace(inode, i).second)
+            fresh.push_back(i);
     }
-    // The counter moves in the same transaction as the row, so a crash cannot reuse an ID.
-    auto txn = db_.begin();
-    if (!txn.ok())
-        return txn.error();
-    auto insert = db_.cached("INSERT INTO documents(doc_id, inode) VALUES(?, ?)");
-    if (!insert.ok())
-        return insert.error();
-    if (Status status = insert->bind(1, toSqlite(nextDocumentId_)).bind(2, toSqlite(inode)).run();
-        !status.ok())
-        return status.error();
-    auto meta = db_.cached("UPDATE meta SET next_document_id = ? WHERE id = 1");
-    if (!meta.ok())
-        return meta.error();
-    if (Status status = meta->bind(1, toSqlite(nextDocumentId_ + 1)).run(); !status.ok())
-        return status.error();
-    if (Status status = txn->commit(); !status.ok())
-        return status.error();
-    return static_cast<uint32_t>(nextDocumentId_++);
+    if (!fresh.empty()) {
+        if (nextDocumentId_ + fresh.size() - 1 > std::numeric_limits<uint32_t>::max()) {
+            return Error(kPosixErrorDomain, EOVERFLOW,
+                         {{"description", "Every document ID of this volume has been used"}});
+        }
+        // The counter moves in the same transaction as the rows, so a crash cannot reuse an ID;
+        // and the rows are written before any ID is handed out, so none is lost in one.
+        auto txn = db_.begin();
+        if (!txn.ok())
+            return txn.error();
+        auto insert = db_.cached("INSERT INTO documents(doc_id, inode) VALUES(?, ?)");
+        if (!insert.ok())
+            return insert.error();
+        uint64_t next = nextDocumentId_;
+        for (size_t i : fresh) {
+            if (Status status =
+                    insert->bind(1, toSqlite(next)).bind(2, toSqlite(documents[i].inode)).run();
+                !status.ok())
+                return status.error();
+            for (const auto& [name, value] : documents[i].attributes) {
+                if (Status status = setDocumentAttribute(static_cast<uint32_t>(next), name, value);
+                    !status.ok())
+                    return status.error();
+            }
+            ids[i] = static_cast<uint32_t>(next++);
+        }
+        auto meta = db_.cached("UPDATE meta SET next_document_id = ? WHERE id = 1");
+        if (!meta.ok())
+            return meta.error();
+        if (Status status = meta->bind(1, toSqlite(next)).run(); !status.ok())
+            return status.error();
+        if (Status status = txn->commit(); !status.ok())
+            return status.error();
+        nextDocumentId_ = next;
+    }
+    for (size_t i = 0; i < documents.size(); ++i) {
+        if (ids[i] == 0)
+            ids[i] = ids[firstFresh.at(documents[i].inode)];
+    }
+    return ids;
 }
 
 Status InodeIndex::moveDocumentId(uint32_t docID, uint64_t newInode) {

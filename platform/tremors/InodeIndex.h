@@ -50,6 +50,26 @@ public:
     Result<std::vector<InodeRecord>> subtree(uint64_t top, std::unordered_set<uint64_t> stops);
     Result<std::vector<InodeRecord>> childrenNamed(uint64_t parent, std::string_view name);
 
+    // Where an inode is and the document ID it has (0: none); nothing as the path when path()
+    // would answer nothing.
+    struct Placement {
+        std::optional<std::string> path;
+        uint32_t docID = 0;
+    };
+    // The placement of each of `inodes`, in order; the folders they share are walked once.
+    Result<std::vector<Placement>> place(
+        const std::vector<uint64_t>& inodes,
+        const std::function<const std::string*(uint64_t)>& rootPath);
+
+    // An inode to give a document ID, with the metadata copy a new ID starts with.
+    struct NewDocument {
+        uint64_t inode = 0;
+        Attributes attributes;
+    };
+    // The document ID of each inode, in order: the one it has, else the next one with its
+    // `attributes` kept. The new IDs are written in one transaction: when it fails, none is
+    // handed out.
+    Result<std::vector<uint32_t>> allocateDocumentIds(const std::vector<NewDocument>& documents);
     Result<uint32_t> allocateDocumentId(uint64_t inode);
     Result<std::optional<uint64_t>> inodeForDocumentId(uint32_t docID);
     Result<std::optional<uint32_t>> documentIdForInode(uint64_t inode);

@@ -468,6 +468,19 @@ Result<uint32_t> TremorStore::allocateDocumentId(uint64_t inode) {
     return index_->allocateDocumentId(inode);
 }
 
+Result<std::vector<TremorStore::Placement>> TremorStore::placeInodes(
+    const std::vector<uint64_t>& inodes) const {
+    std::lock_guard lock(mutex_);
+    return index_->place(inodes,
+                         [this](uint64_t candidate) { return roots_->pathOfRootInode(candidate); });
+}
+
+Result<std::vector<uint32_t>> TremorStore::allocateDocumentIds(
+    const std::vector<NewDocument>& documents) {
+    std::lock_guard lock(mutex_);
+    return index_->allocateDocumentIds(documents);
+}
+
 Result<std::optional<uint64_t>> TremorStore::inodeForDocumentId(uint32_t docID) const {
     std::lock_guard lock(mutex_);
     return index_->inodeForDocumentId(docID);

@@ -155,8 +155,17 @@ public:
 
     // ---- Document IDs ----
 
+    // Where each of `inodes` is (as pathForInode) and its document ID (0: none), read under
+    // one hold of the lock; the folders they share are walked once.
+    using Placement = InodeIndex::Placement;
+    Result<std::vector<Placement>> placeInodes(const std::vector<uint64_t>& inodes) const;
+
     // The inode's document ID, or the next one (from 1, never reused).
     Result<uint32_t> allocateDocumentId(uint64_t inode);
+    // The same for each inode in order, in one transaction: the new IDs start with their
+    // document's metadata copy, and when the transaction fails none is handed out.
+    using NewDocument = InodeIndex::NewDocument;
+    Result<std::vector<uint32_t>> allocateDocumentIds(const std::vector<NewDocument>& documents);
     Result<std::optional<uint64_t>> inodeForDocumentId(uint32_t docID) const;
     Result<std::optional<uint32_t>> documentIdForInode(uint64_t inode) const;
     // A safe save: the ID follows the document to `newInode` and the old inode loses it. Fails
