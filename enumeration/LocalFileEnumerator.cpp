@@ -4,6 +4,7 @@
 #include "enumeration/LocalChangesObserverContext.h"
 #include "host/PublishedTrees.h"
 #include "items/LocalItem.h"
+#include "items/TBFileObjectIdentifier.h"
 #include "support/Log.h"
 #include "support/LogSection.h"
 #include "support/MutexLock.h"
@@ -191,6 +192,9 @@ void LocalFileEnumerator::gatherPhase(HostPorterEnumerationObserver& observer,
     std::vector<Url> urls;
     urls.reserve(kPageSize);
     uint64_t newOffset = walk.enumerate([&](const Url& url) { urls.push_back(url); }, &openFolders);
+    // The page's documents get their IDs together: one index read, and one transaction for
+    // those that have none yet.
+    TBFileObjectIdentifier::prepareItemIdentifiers(urls);
     std::vector<HostPorterItemRef> items = makeItems(urls);
     openFolders.clear();
 
