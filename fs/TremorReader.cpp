@@ -153,6 +153,13 @@ void TremorReader::stop() {
         logDebug([&] { return "stopped " + description(); });
 }
 
+void TremorReader::stopAfterCurrentEvent() {
+    stopping_.store(true);
+    // The stream's own stop ends its replay at the next batch; stop() releases it later.
+    if (TremorStreamRef stream = liveStream_.load())
+        TremorStreamStop(stream);
+}
+
 void TremorReader::reportLostHistory() {
     {
         std::lock_guard lock(mutex_);

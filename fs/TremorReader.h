@@ -51,10 +51,11 @@ public:
     // block there).
     void stop();
 
-    // Makes the batch in progress end after the event being reported: a delegate that has
-    // what it wanted (a full page) stops the reader asynchronously, and the rest of a replay
-    // batch (up to a thousand events, an item built for each) would be work thrown away.
-    void stopAfterCurrentEvent() { stopping_.store(true); }
+    // Makes the batch in progress end after the event being reported, and the stream's replay
+    // with it: a delegate that has what it wanted (a full page) stops the reader
+    // asynchronously, behind the replay on the same queue, and the rest of the history (read,
+    // decoded and passed over) would be work thrown away. Call it on `streamQueue`.
+    void stopAfterCurrentEvent();
 
     void setDelegate(std::weak_ptr<TremorReaderDelegate> delegate);
     // Read on `streamQueue`, or once the reader is stopped.
