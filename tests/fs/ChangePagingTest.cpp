@@ -87,6 +87,7 @@ protected:
     }
     // Everything published under the storage folder, by identifier.
     HostState disk() {
+        currentID();  // identifiers of moved files come from the journaled moves
         HostState state;
         for (const auto& entry : fsys::recursive_directory_iterator(storagePath())) {
             if (entry.path().filename().string().starts_with("."))
@@ -108,9 +109,13 @@ protected:
     // Every kind of history the paging has to keep whole: long runs of one file across page
     // boundaries, a file that lives and dies inside the history, a rename chain, a deletion
     // followed by a re-creation under the same name, and a moved folder with its contents.
+    // A folder with a file in it, known before the history starts.
+    void prepare() {
+        fsys::create_directories(storagePath() + "/work/folder");
+        write("work/folder/inner");
+    }
     void makeHistory() {
         std::string work = storagePath() + "/work";
-        fsys::create_directory(work);
         for (int i = 0; i < 30; ++i) write("work/plain-" + std::to_string(i));
         // The journal folds quick writes together: runs of events for one file are written
         // into it, as a slower writer would make them.
@@ -126,8 +131,6 @@ protected:
         write("work/again", "first");
         fsys::remove(work + "/again");
         write("work/again", "second");
-        fsys::create_directory(work + "/folder");
-        write("work/folder/inner");
         fsys::rename(work + "/folder", work + "/moved");
         modify(work + "/plain-0", 230);
         fsys::remove(work + "/plain-1");
@@ -140,6 +143,7 @@ protected:
 };
 
 TEST_F(ChangePagingTest, PagingThroughTheHistoryEndsWithTheDisksState) {
+    prepare();
     HostState state = disk();
     uint64_t since = currentID();
     makeHistory();
