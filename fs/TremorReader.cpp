@@ -155,9 +155,11 @@ void TremorReader::stop() {
 
 void TremorReader::stopAfterCurrentEvent() {
     stopping_.store(true);
-    // The stream's own stop ends its replay at the next batch; stop() releases it later.
-    if (TremorStreamRef stream = liveStream_.load())
-        TremorStreamStop(stream);
+    // The stream's own stop ends its replay at the next batch; stop() releases it later. The
+    // lock keeps a stop() on another thread from releasing it meanwhile.
+    std::lock_guard lock(mutex_);
+    if (stream_)
+        TremorStreamStop(stream_);
 }
 
 void TremorReader::reportLostHistory() {
