@@ -5,6 +5,7 @@
 #include "platform/FileSystem.h"
 #include "platform/strata/StrataService.h"
 #include "support/Log.h"
+#include "support/MutexLock.h"
 
 namespace tamber {
 
@@ -44,7 +45,15 @@ void LocalChangesObserverContext::setFSChangesEnumerator(
 
 void LocalChangesObserverContext::didUpdateItems(const std::vector<HostPorterItemRef>& items) {
     if (shouldUpdateFileIDInStrata_) {
-        for (const auto& item : items) updateFileIDInStrata(item);
+        for (const auto& item : items) {
+            {
+                MutexLock lock(mutex_);
+                if (item == lastLookedUp_)
+                    continue;
+                lastLookedUp_ = item;
+            }
+            updateFileIDInStrata(item);
+        }
     }
     observer_->didUpdateItems(items);
 }

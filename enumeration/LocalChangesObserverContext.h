@@ -4,6 +4,7 @@
 
 #include "fs/FSChangesEnumerator.h"
 #include "host/HostPorterChangeObserver.h"
+#include "support/Mutex.h"
 
 namespace tamber {
 
@@ -34,6 +35,10 @@ private:
     std::shared_ptr<LocalFileEnumerator> localFileEnumerator_;
     std::weak_ptr<FSChangesEnumerator> fsChangesEnumerator_;
     bool shouldUpdateFileIDInStrata_;
+    // The record looked up last. A reader sends the one record it read for a file with every
+    // event of a batch that names the file; asking about the same record again learns nothing.
+    Mutex mutex_;
+    HostPorterItemRef lastLookedUp_ GUARDED_BY(mutex_);
 };
 
 }  // namespace tamber

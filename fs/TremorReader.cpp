@@ -153,6 +153,15 @@ void TremorReader::stop() {
         logDebug([&] { return "stopped " + description(); });
 }
 
+void TremorReader::stopAfterCurrentEvent() {
+    stopping_.store(true);
+    // The stream's own stop ends its replay at the next batch; stop() releases it later. The
+    // lock keeps a stop() on another thread from releasing it meanwhile.
+    std::lock_guard lock(mutex_);
+    if (stream_)
+        TremorStreamStop(stream_);
+}
+
 void TremorReader::reportLostHistory() {
     {
         std::lock_guard lock(mutex_);
@@ -248,6 +257,8 @@ void TremorReader::receiveBatch(size_t numEvents, const ObjectRef& paths, const 
             fileID = number->uint64Value();
         processEvent(path->value(), fileID, flags[i], ids[i], i, numEvents);
     }
+    batchItemsByFileID_.clear();
+    batchItemsByPath_.clear();
     if (auto target = delegate())
         target->readerDidFinishBatch(*this);
 }
@@ -337,7 +348,7 @@ void TremorReader::processDocIDEvent(const std::string& path, uint64_t eventID) 
             logDebug([&] { return "dropping tremor at " + url->path() + "; URL is hidden"; });
         return;
     }
-    auto item = LocalItem::make(*url);
+    auto item = itemAt(*url);
     if (!item) {
         logError("dropping tremor at " + url->path() + "; can't create local item");
         return;
@@ -381,7 +392,7 @@ void TremorReader::processPathEvent(const std::string& path, std::optional<uint6
             }
         }
     }
-    LocalItemRef item = fileID ? LocalItem::makeWithFileIdentifier(*fileID) : LocalItem::make(url);
+    LocalItemRef item = fileID ? itemWithFileIdentifier(*fileID) : itemAt(url);
     if (item && isReusedFileID(flags, url, *item)) {
         // Linux hands a freed inode number to the next file made: the item that has this
         // file ID now is another one, and the one the event is about is gone.
@@ -403,6 +414,20 @@ void TremorReader::processPathEvent(const std::string& path, std::optional<uint6
             target->readerDidDelete(*this, identifier, url);
     }
     recordEventID(eventID);
+}
+
+LocalItemRef TremorReader::itemWithFileIdentifier(uint64_t fileID) {
+    auto [it, inserted] = batchItemsByFileID_.try_emplace(fileID);
+    if (inserted)
+        it->second = LocalItem::makeWithFileIdentifier(fileID);
+    return it->second;
+}
+
+LocalItemRef TremorReader::itemAt(const Url& url) {
+    auto [it, inserted] = batchItemsByPath_.try_emplace(url.path());
+    if (inserted)
+        it->second = LocalItem::make(url);
+    return it->second;
 }
 
 bool TremorReader::isHidden(const Url& url) const {

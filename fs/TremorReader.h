@@ -6,6 +6,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <unordered_map>
 #include <utility>
 #include <vector>
 
@@ -51,10 +52,11 @@ public:
     // block there).
     void stop();
 
-    // Makes the batch in progress end after the event being reported: a delegate that has
-    // what it wanted (a full page) stops the reader asynchronously, and the rest of a replay
-    // batch (up to a thousand events, an item built for each) would be work thrown away.
-    void stopAfterCurrentEvent() { stopping_.store(true); }
+    // Makes the batch in progress end after the event being reported, and the stream's replay
+    // with it: a delegate that has what it wanted (a full page) stops the reader
+    // asynchronously, behind the replay on the same queue, and the rest of the history (read,
+    // decoded and passed over) would be work thrown away. Call it on `streamQueue`.
+    void stopAfterCurrentEvent();
 
     void setDelegate(std::weak_ptr<TremorReaderDelegate> delegate);
     // Read on `streamQueue`, or once the reader is stopped.
@@ -97,6 +99,12 @@ private:
     // On streamQueue_: the loss of history owed by a start from an ID no journal hands out.
     void reportLostHistory();
     bool isHidden(const Url& url) const;
+    // The item of a file as this batch found it. A batch often names the same file many times
+    // (created, written, closed, its attributes set); the record read from the disk for the
+    // first of them is what reading it again for the others would give, and a change made
+    // after it was read comes as a later event.
+    LocalItemRef itemWithFileIdentifier(uint64_t fileID);
+    LocalItemRef itemAt(const Url& url);
     std::shared_ptr<TremorReaderDelegate> delegate() const;
     void recordEventID(uint64_t eventID);
 
@@ -116,6 +124,10 @@ private:
     std::atomic<TremorStreamRef> liveStream_{nullptr};
     bool lostHistoryOwed_ = false;                  // guarded by mutex_; started without stream
     std::weak_ptr<TremorReaderDelegate> delegate_;  // guarded by mutex_
+    // Items read during the batch in progress, by file ID and by path; on streamQueue_,
+    // emptied after every batch so that they never outlive the events that asked for them.
+    std::unordered_map<uint64_t, LocalItemRef> batchItemsByFileID_;
+    std::unordered_map<std::string, LocalItemRef> batchItemsByPath_;
 };
 
 using TremorReaderRef = std::shared_ptr<TremorReader>;

@@ -197,6 +197,7 @@ struct TremorStore::Cursor {
     std::vector<JournalEvent> buffered;
     size_t next = 0;  // the first of `buffered` not yet delivered
     bool exhausted = false;
+    size_t limit = 0;  // rows of the next read
 
     bool empty() const { return next == buffered.size(); }
     const JournalEvent& front() const { return buffered[next]; }
@@ -276,7 +277,9 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
         Cursor* next = nullptr;
         for (Cursor& cursor : cursors) {
             if (cursor.empty() && !cursor.exhausted) {
-                if (Status status = fetch(cursor, chunk, upTo); !status.ok())
+                cursor.limit = cursor.limit == 0 ? std::min(chunk, kFirstReplayRead)
+                                                 : std::min(chunk, cursor.limit * 2);
+                if (Status status = fetch(cursor, cursor.limit, upTo); !status.ok())
                     return status;
             }
             if (!cursor.empty() && (!next || cursor.front().id < next->front().id)) {

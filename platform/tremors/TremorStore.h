@@ -42,6 +42,9 @@ public:
 
     static constexpr int kSchemaVersion = TremorStoreSchema::kVersion;
     static constexpr size_t kDefaultReplayChunk = 1000;
+    // A client that wants a page of changes stops after a few hundred events: reading a full
+    // chunk first would read (and copy) rows mostly thrown away.
+    static constexpr size_t kFirstReplayRead = 250;
     static constexpr size_t kMaxPathComponents = InodeIndex::kMaxPathComponents;
     static constexpr const char* kDocumentIdRoot = kTremorDocumentIdRoot;
 
@@ -86,9 +89,9 @@ public:
     // Calls `each` for every event with `sinceExclusive` < id <= lastEventId() at the start of
     // the call whose path is at or below one of `paths` (by whole components), in ID order,
     // until `each` returns false; nothing when `sinceExclusive` is at or past the last ID,
-    // whatever its value. Empty `paths` means the whole volume. Rows are read `chunk`
-    // at a time (0: the default) and the lock is not held while `each` runs, so it may call
-    // the store.
+    // whatever its value. Empty `paths` means the whole volume. Rows are read in growing
+    // reads of up to `chunk` (0: the default), the first of kFirstReplayRead, and the lock is
+    // not held while `each` runs, so it may call the store.
     Status replay(uint64_t sinceExclusive, const std::vector<std::string>& paths, size_t chunk,
                   const std::function<bool(const JournalEvent&)>& each);
     // Incomplete when events after `since` were trimmed, when `since` is not from this history,

@@ -138,15 +138,17 @@ void TremorStream::replay(uint64_t since, uint64_t ceiling, uint64_t run) {
             return;
     }
     std::vector<JournalEvent> batch;
+    size_t batchSize = kFirstReplayBatch;
     bool going = true;
     auto status =
         store->replay(since, options_.paths, kReplayBatch, [&](const JournalEvent& event) {
             if (event.id > ceiling)
                 return false;  // it comes live
             batch.push_back(event);
-            if (batch.size() >= kReplayBatch) {
+            if (batch.size() >= batchSize) {
                 going = deliver(batch, run);
                 batch.clear();
+                batchSize = std::min(batchSize * 2, kReplayBatch);
             }
             return going;
         });

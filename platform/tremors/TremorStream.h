@@ -40,6 +40,10 @@ class TremorStream : public std::enable_shared_from_this<TremorStream> {
 public:
     static constexpr uint64_t kSinceNow = UINT64_MAX;
     static constexpr size_t kReplayBatch = 1000;
+    // The first replayed batch is smaller, and each one after it twice as large up to
+    // kReplayBatch: a client that stops after a page of changes has not had the journal read
+    // and decoded far past it.
+    static constexpr size_t kFirstReplayBatch = 250;
 
     // The typed form of the callback, for the program's own consumers of the journal.
     using EventsCallback = std::function<void(const std::vector<JournalEvent>& events)>;

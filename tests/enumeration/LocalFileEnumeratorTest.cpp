@@ -346,5 +346,33 @@ TEST_F(LocalFileEnumeratorTest, ObserverContextLooksUpUpdatedItemsOnlyWhenAsked)
     StrataService::setCurrent(previous);
 }
 
+TEST_F(LocalFileEnumeratorTest, ObserverContextLooksUpARecordSentAgainOnlyOnce) {
+    std::string path = dir.writeFile("s/a.txt");
+    auto a = LocalItem::make(Url::fileURLWithPath(path));
+    auto b = LocalItem::make(Url::fileURLWithPath(dir.writeFile("s/b.txt")));
+    ASSERT_TRUE(a && b);
+    auto strata = std::make_shared<CountingStrata>(StrataService::current());
+    auto previous = StrataService::setCurrent(strata);
+    auto host = std::make_shared<testing::WaitingChangeObserver>();
+    LocalChangesObserverContext context(host, folderEnumerator(storage), true);
+    auto again = LocalItem::make(Url::fileURLWithPath(path));
+    ASSERT_TRUE(again);
+    strata->lookups = 0;
+    // A batch of events names a file many times and sends the one record it read for it with
+    // each: the answer about that record does not change.
+    context.didUpdateItems({a});
+    context.didUpdateItems({a});
+    context.didUpdateItems({a});
+    EXPECT_EQ(strata->lookups, 1);
+    // Another record, even of the same file, is read anew: the file may have changed.
+    context.didUpdateItems({b});
+    context.didUpdateItems({again});
+    context.didUpdateItems({a});
+    EXPECT_EQ(strata->lookups, 4);
+    // The host hears of every one of them.
+    EXPECT_EQ(host->updated, (Names{"a.txt", "a.txt", "a.txt", "b.txt", "a.txt", "a.txt"}));
+    StrataService::setCurrent(previous);
+}
+
 }  // namespace
 }  // namespace tamber

@@ -217,6 +217,38 @@ TEST_F(TremorTest, ReportsLiveCreationChangeAndDeletionOfRealFiles) {
     EXPECT_GT(paths->lastProcessedTremorID(), 0u);
 }
 
+// Where each reported item says its file is.
+class ItemPathDelegate : public testing::RecordingReaderDelegate {
+public:
+    void readerDidChange(TremorReader& reader, const LocalItemRef& item,
+                         const std::optional<Url>& url) override {
+        waiter_.update([&] { paths_.push_back(item->fileURL().path()); });
+        RecordingReaderDelegate::readerDidChange(reader, item, url);
+    }
+    bool waitForItemAt(const std::string& path) {
+        return waiter_.waitFor(
+            [&] { return std::find(paths_.begin(), paths_.end(), path) != paths_.end(); });
+    }
+
+private:
+    testing::Waiter waiter_;
+    std::vector<std::string> paths_;
+};
+
+TEST_F(TremorTest, AFileMovedAfterABatchIsReportedWhereItIsNow) {
+    auto paths = std::make_shared<ItemPathDelegate>();
+    delegate = paths;
+    startReader(currentID());
+    ASSERT_TRUE(paths->waitForReport("history"));
+    std::string a = write("a");
+    ASSERT_TRUE(paths->waitForItemAt(a));
+    // A batch reads each file once; what it read must not stand for the file in later ones.
+    std::string b = storagePath() + "/b";
+    std::filesystem::rename(a, b);
+    write("b", "more");
+    EXPECT_TRUE(paths->waitForItemAt(b));
+}
+
 TEST_F(TremorTest, AnAppLibraryRootIsReportedAsTheLibrary) {
     install({"com.example.notes"});
     auto manager = LocalAppLibraryManager::shared();

@@ -316,7 +316,8 @@ TEST_F(TremorStoreTest, ReplayMatchesWholePathComponents) {
 TEST_F(TremorStoreTest, ReplayMergesRootsInIdOrderFromAnyStart) {
     for (const char* root : {"/x", "/y", "/z"}) ASSERT_TRUE(store_->addRoot(root, 0).ok());
     Paths all;
-    for (int i = 0; i < 100; ++i) {
+    // Enough events for reads that grow from the first, small one to whole chunks.
+    for (int i = 0; i < 3000; ++i) {
         // Uneven interleaving, so that the roots' chunks end at different places.
         const char* root = (i % 3 == 0) ? "/x" : (i % 5 == 0 ? "/y" : "/z");
         all.push_back(std::string(root) + "/f" + std::to_string(i));
