@@ -194,6 +194,7 @@ void LocalFileEnumerator::gatherPhase(HostPorterEnumerationObserver& observer,
     uint64_t newOffset = walk.enumerate([&](const Url& url) { urls.push_back(url); }, &openFolders);
     // The page's documents get their IDs together: one index read, and one transaction for
     // those that have none yet.
+    PublishedTrees::CheckedFolders checkedFolders;
     TBFileObjectIdentifier::prepareItemIdentifiers(urls);
     std::vector<HostPorterItemRef> items = makeItems(urls);
     openFolders.clear();

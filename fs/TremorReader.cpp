@@ -9,6 +9,7 @@
 #include "fs/DocIDPath.h"
 #include "fs/TremorChecker.h"
 #include "host/HostPorterManager.h"
+#include "host/PublishedTrees.h"
 #include "host/UrlOperations.h"
 #include "items/LocalAppLibraryItem.h"
 #include "items/TBFileObjectIdentifier.h"
@@ -244,6 +245,10 @@ void TremorReader::receiveBatch(size_t numEvents, const ObjectRef& paths, const 
     const size_t available = array ? std::min(numEvents, array->count()) : 0;
     if (verbose_)
         logDebug([&] { return "tremor: received " + std::to_string(numEvents) + " events"; });
+    // A batch names many files of a few folders: each folder is checked once.
+    PublishedTrees::CheckedFolders checkedFolders;
+    if (array)
+        prepareBatch(*array, flags, available);
     for (size_t i = 0; i < available && !stopping_.load(); ++i) {
         auto entry = objectCast<Dictionary>(array->objects()[i]);
         auto path = entry ? objectCast<String>(entry->objectForKey("path")) : nullptr;
@@ -259,6 +264,8 @@ void TremorReader::receiveBatch(size_t numEvents, const ObjectRef& paths, const 
     }
     batchItemsByFileID_.clear();
     batchItemsByPath_.clear();
+    batchURLsByFileID_.clear();
+    batchURLsByPath_.clear();
     if (auto target = delegate())
         target->readerDidFinishBatch(*this);
 }
@@ -416,17 +423,54 @@ void TremorReader::processPathEvent(const std::string& path, std::optional<uint6
     recordEventID(eventID);
 }
 
+void TremorReader::prepareBatch(const Array& entries, const uint32_t* flags, size_t count) {
+    constexpr uint32_t kStreamFlags =
+        kTremorEventIdsWrapped | kTremorUserDropped | kTremorKernelDropped | kTremorHistoryDone;
+    std::vector<Url> urls;
+    for (size_t i = 0; i < count; ++i) {
+        // The same choices as classifyEvent and processPathEvent make.
+        if (flags[i] & kStreamFlags)
+            continue;
+        auto entry = objectCast<Dictionary>(entries.objects()[i]);
+        auto path = entry ? objectCast<String>(entry->objectForKey("path")) : nullptr;
+        if (!path || DocIDPath::mentionsDocumentIds(path->value()))
+            continue;
+        Url url = Url::fileURLWithPath(path->value());
+        if (isHidden(url) || url.lastPathComponent() == "Documents")
+            continue;
+        if (auto number = objectCast<Number>(entry->objectForKey("fileID"))) {
+            auto [it, inserted] = batchURLsByFileID_.try_emplace(number->uint64Value());
+            if (!inserted)
+                continue;
+            it->second = TBFileObjectIdentifier::fileURLWithFileIdentifier(number->uint64Value());
+            if (it->second)
+                urls.push_back(*it->second);
+        } else if (batchURLsByPath_.try_emplace(url.path(), url).second) {
+            urls.push_back(url);
+        }
+    }
+    if (!urls.empty())
+        TBFileObjectIdentifier::prepareItemIdentifiers(urls);
+}
+
 LocalItemRef TremorReader::itemWithFileIdentifier(uint64_t fileID) {
     auto [it, inserted] = batchItemsByFileID_.try_emplace(fileID);
-    if (inserted)
-        it->second = LocalItem::makeWithFileIdentifier(fileID);
+    if (inserted) {
+        auto found = batchURLsByFileID_.find(fileID);
+        if (found == batchURLsByFileID_.end())
+            it->second = LocalItem::makeWithFileIdentifier(fileID);
+        else if (found->second)
+            it->second = LocalItem::make(*found->second);
+    }
     return it->second;
 }
 
 LocalItemRef TremorReader::itemAt(const Url& url) {
     auto [it, inserted] = batchItemsByPath_.try_emplace(url.path());
-    if (inserted)
-        it->second = LocalItem::make(url);
+    if (inserted) {
+        auto found = batchURLsByPath_.find(url.path());
+        it->second = LocalItem::make(found != batchURLsByPath_.end() ? found->second : url);
+    }
     return it->second;
 }
 

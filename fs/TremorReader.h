@@ -17,6 +17,8 @@
 
 namespace tamber {
 
+class Array;
+
 enum class TremorReaderMode : uint8_t { pathBased = 0, docIDBased = 1 };
 const char* tremorReaderModeName(TremorReaderMode mode);  // "pathBased" / "docIDBased"
 
@@ -105,6 +107,10 @@ private:
     // after it was read comes as a later event.
     LocalItemRef itemWithFileIdentifier(uint64_t fileID);
     LocalItemRef itemAt(const Url& url);
+    // Before a batch's events are reported: finds the files they name and gives the documents
+    // among them their IDs in one go (a burst of new files would otherwise cost a transaction
+    // each). Only events that will build an item are looked at.
+    void prepareBatch(const Array& entries, const uint32_t* flags, size_t count);
     std::shared_ptr<TremorReaderDelegate> delegate() const;
     void recordEventID(uint64_t eventID);
 
@@ -128,6 +134,10 @@ private:
     // emptied after every batch so that they never outlive the events that asked for them.
     std::unordered_map<uint64_t, LocalItemRef> batchItemsByFileID_;
     std::unordered_map<std::string, LocalItemRef> batchItemsByPath_;
+    // Where prepareBatch found the batch's files (nothing: a file ID that names none now), the
+    // URLs whose document IDs it cached; on streamQueue_ and emptied with the items.
+    std::unordered_map<uint64_t, std::optional<Url>> batchURLsByFileID_;
+    std::unordered_map<std::string, Url> batchURLsByPath_;
 };
 
 using TremorReaderRef = std::shared_ptr<TremorReader>;

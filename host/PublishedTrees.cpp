@@ -16,6 +16,9 @@ namespace tamber {
 
 namespace {
 
+// The innermost scope of checked folders of this thread, or null.
+thread_local PublishedTrees::CheckedFolders* tCheckedFolders = nullptr;
+
 // Whether `path` names an entry directly inside the folder `folder`.
 bool isChildPath(const std::string& folder, const std::string& path) {
     std::string_view prefix(folder);
@@ -169,6 +172,11 @@ Status PublishedTrees::check(const Url& url) {
     if (OpenFolderRef folder = url.openFolder();
         folder && folder->linkFree() && isChildPath(folder->path(), url.path()))
         return Status::OK();
+    std::string_view folderPath(url.path());
+    folderPath = folderPath.substr(0, folderPath.rfind('/'));
+    CheckedFolders* checked = tCheckedFolders;
+    if (checked && checked->inside_.contains(std::string(folderPath)))
+        return Status::OK();
     auto parent = openParent(url, O_PATH);
     if (!parent.ok()) {
         // A missing folder on the way leaves nothing to escape through; only refusals count.
@@ -177,7 +185,17 @@ Status PublishedTrees::check(const Url& url) {
         return Status::OK();
     }
     ScopedFd opened(parent.value().fd);  // only its opening mattered
+    if (checked)
+        checked->inside_.emplace(folderPath);
     return Status::OK();
+}
+
+PublishedTrees::CheckedFolders::CheckedFolders() : outer_(tCheckedFolders) {
+    tCheckedFolders = this;
+}
+
+PublishedTrees::CheckedFolders::~CheckedFolders() {
+    tCheckedFolders = outer_;
 }
 
 }  // namespace tamber

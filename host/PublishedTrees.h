@@ -3,6 +3,7 @@
 #include <functional>
 #include <optional>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include "platform/OpenFolder.h"
@@ -44,6 +45,23 @@ public:
     // from that root without a symbolic link. The item itself may be a link, or missing.
     // A URL made in a folder opened by openListedFolder is inside while that folder is open.
     static Status check(const Url& url);
+
+    // While one lives, check() on its thread opens each folder at most once: a folder found
+    // inside answers for every file in it. For work that checks many files of a few folders
+    // within moments (a page of a listing, a batch of events); a folder made a link meanwhile
+    // could be missed for as long as the scope lasts, as it could between any check and its use.
+    class CheckedFolders {
+    public:
+        CheckedFolders();
+        ~CheckedFolders();
+        CheckedFolders(const CheckedFolders&) = delete;
+        CheckedFolders& operator=(const CheckedFolders&) = delete;
+
+    private:
+        friend class PublishedTrees;
+        CheckedFolders* outer_;
+        std::unordered_set<std::string> inside_;
+    };
 
     // The folder `folder`, held open for reading its children (O_PATH): opened beneath its root
     // when it is inside (and then marked link-free), else as named. Nothing when it can't be

@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <thread>
 
 #include "host/RecordingHostPorterManager.h"
 #include "host/StagingCopies.h"
@@ -129,6 +130,32 @@ TEST_F(PublishedTreesTest, InsideMeansAtOrBelowARootWithoutALinkOnTheWay) {
     // Without the library hook only the storage is published.
     PublishedTrees::setAppLibraryRootsSource(nullptr);
     EXPECT_TRUE(refused(PublishedTrees::check(urlAt(library + "/a"))));
+}
+
+// A scope of checked folders answers for a folder it found inside, on its own thread and only
+// while it lives: a folder made a link later is refused again once the scope ends, and a refusal
+// is never remembered as inside.
+TEST_F(PublishedTreesTest, CheckedFoldersAnswerOnlyOnTheirThreadAndWhileTheyLive) {
+    dir.makeDir("storage/Work/Sub");
+    const std::string sub = storage + "/Work/Sub";
+    {
+        PublishedTrees::CheckedFolders checked;
+        EXPECT_TRUE(PublishedTrees::check(urlAt(sub + "/a")).ok());
+        EXPECT_TRUE(refused(PublishedTrees::check(urlAt(storage + "/away/f"))));
+        EXPECT_TRUE(refused(PublishedTrees::check(urlAt(storage + "/away/g"))))
+            << "a refused folder is asked again";
+        fs::rename(sub, storage + "/Work/Old");
+        fs::create_directory_symlink(outside, sub);
+        Status elsewhere;
+        std::thread([&] { elsewhere = PublishedTrees::check(urlAt(sub + "/b")); }).join();
+        EXPECT_TRUE(refused(elsewhere)) << "another thread has its own scope";
+        {
+            PublishedTrees::CheckedFolders inner;
+            EXPECT_TRUE(refused(PublishedTrees::check(urlAt(sub + "/c"))))
+                << "an inner scope starts empty";
+        }
+    }
+    EXPECT_TRUE(refused(PublishedTrees::check(urlAt(sub + "/b"))));
 }
 
 TEST_F(PublishedTreesTest, OperationsRefuseOutsideBeforeTouchingAnything) {
