@@ -119,8 +119,10 @@ void InotifyBackend::drain(std::vector<FileChange>& out) {
     // Events queued after this point may come along too; those before it all do.
     int queued = api_->queuedBytes(inotifyFd_);
     size_t bytes = 0;
-    bool queueEmpty = false;
-    for (;;) {
+    // Nothing queued: a read would only answer EAGAIN (every identifier asked syncs, and
+    // passes here).
+    bool queueEmpty = queued == 0;
+    while (!queueEmpty) {
         if (!readOnce(out, bytes)) {
             queueEmpty = true;
             break;
