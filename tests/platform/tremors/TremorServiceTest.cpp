@@ -123,7 +123,16 @@ TEST_F(TremorServiceTest, ABurstIsJournaledWholeAndInOrder) {
         if (i % 3 == 0) {
             std::string renamed = tree_ + "/b" + std::to_string(i);
             const JournalEvent* moved = findEvent(events, renamed, kTremorItemRenamed);
-            ASSERT_NE(moved, nullptr) << renamed;
+            ASSERT_NE(moved, nullptr)
+                << renamed << "\n"
+                << [&] {
+                       std::string text;
+                       for (const auto& e : events)
+                           if (e.path == renamed || e.path == created)
+                               text += std::to_string(e.id) + " " + e.path +
+                                       " flags=" + std::to_string(e.flags) + "\n";
+                       return text;
+                   }();
             EXPECT_LT(event->id, moved->id) << renamed;
             EXPECT_EQ(moved->fileID, inodeOf(renamed));
         }
