@@ -106,7 +106,7 @@ void InotifyBackend::consume(std::vector<FileChange>& out) {
     MutexLock lock(mutex_);
     size_t bytes = 0;
     for (size_t i = 0; i < kReadsPerConsume; ++i) {
-        if (!readOnce(out, bytes)) {
+        if (!readOnce(out, bytes) && !awaitMovePartner()) {
             finishReading(out, true);
             return;
         }
@@ -119,9 +119,11 @@ void InotifyBackend::drain(std::vector<FileChange>& out) {
     // Events queued after this point may come along too; those before it all do.
     int queued = api_->queuedBytes(inotifyFd_);
     size_t bytes = 0;
-    bool queueEmpty = false;
-    for (;;) {
-        if (!readOnce(out, bytes)) {
+    // Nothing queued: a read would only answer EAGAIN (every identifier asked syncs, and
+    // passes here).
+    bool queueEmpty = queued == 0 && !translator_.hasPendingMoves();
+    while (!queueEmpty) {
+        if (!readOnce(out, bytes) && !awaitMovePartner()) {
             queueEmpty = true;
             break;
         }
@@ -159,6 +161,17 @@ bool InotifyBackend::readOnce(std::vector<FileChange>& out, size_t& bytesRead) {
     dropOrphanedWatches();
     handle(changes, out);
     return true;
+}
+
+bool InotifyBackend::awaitMovePartner() {
+    if (!translator_.hasPendingMoves())
+        return false;
+    struct pollfd fd = {inotifyFd_, POLLIN, 0};
+    int ready;
+    do {
+        ready = api_->poll(&fd, 1, kMovePartnerWaitMs);
+    } while (ready < 0 && errno == EINTR);
+    return ready > 0 && (fd.revents & POLLIN);
 }
 
 void InotifyBackend::finishReading(std::vector<FileChange>& out, bool queueEmpty) {

@@ -35,6 +35,10 @@ public:
     // cannot keep it from returning.
     static constexpr size_t kReadBufferSize = 64 * 1024;
     static constexpr size_t kReadsPerConsume = 16;
+    // The kernel queues the two halves of a rename one after the other, so a read can end
+    // between them: a first half that ends the queue waits this long for its second before it
+    // is taken for a move out of the trees.
+    static constexpr int kMovePartnerWaitMs = 1;
 
     static Result<std::unique_ptr<InotifyBackend>> start(
         std::shared_ptr<InotifyApi> api = InotifyApi::system());
@@ -76,6 +80,9 @@ public:
 private:
     // Reads and handles one buffer; false when nothing more was queued.
     bool readOnce(std::vector<FileChange>& out, size_t& bytesRead) REQUIRES(mutex_);
+    // With the first half of a rename read and the queue empty: whether more events came
+    // within kMovePartnerWaitMs.
+    bool awaitMovePartner() REQUIRES(mutex_);
     // Hands out what the translator still holds; `queueEmpty` when the last read found nothing.
     void finishReading(std::vector<FileChange>& out, bool queueEmpty) REQUIRES(mutex_);
     // Removes the kernel watches of directories that left the trees.

@@ -141,7 +141,7 @@ SqliteDatabase::Transaction::~Transaction() {
 Status SqliteDatabase::Transaction::commit() {
     if (!db_)
         return makeError(SQLITE_MISUSE, "COMMIT", "no transaction");
-    Status status = db_->exec(nested_ ? "RELEASE nested" : "COMMIT");
+    Status status = db_->runCached(nested_ ? "RELEASE nested" : "COMMIT");
     if (status.ok())
         db_ = nullptr;
     return status;
@@ -216,6 +216,13 @@ Result<SqliteDatabase::Statement> SqliteDatabase::cached(std::string_view sql) {
     return Statement(db_, it->second.stmt_, false);
 }
 
+Status SqliteDatabase::runCached(std::string_view sql) {
+    auto stmt = cached(sql);
+    if (!stmt.ok())
+        return stmt.error();
+    return stmt->run();
+}
+
 Result<SqliteDatabase::Statement> SqliteDatabase::firstRow(std::string_view sql) {
     auto stmt = prepare(sql);
     if (!stmt.ok())
@@ -244,7 +251,7 @@ Result<std::string> SqliteDatabase::queryText(std::string_view sql) {
 
 Result<SqliteDatabase::Transaction> SqliteDatabase::begin() {
     bool nested = !sqlite3_get_autocommit(db_);
-    if (Status status = exec(nested ? "SAVEPOINT nested" : "BEGIN IMMEDIATE"); !status.ok())
+    if (Status status = runCached(nested ? "SAVEPOINT nested" : "BEGIN IMMEDIATE"); !status.ok())
         return status.error();
     return Transaction(this, nested);
 }

@@ -142,6 +142,9 @@ public:
     static Error makeError(int rc, std::string_view what, std::string_view message);
 
 private:
+    // Runs a statement kept prepared with the connection: the transaction statements, which
+    // every batch of the journal and every document ID pays for, are parsed once.
+    Status runCached(std::string_view sql);
     // A statement stepped onto its first row; an error when the query has none.
     Result<Statement> firstRow(std::string_view sql);
     SqliteDatabase(sqlite3* db, std::string path);

@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdlib>
+#include <iterator>
 #include <utility>
 
 #include "platform/FileSystem.h"
@@ -164,6 +165,7 @@ void TremorService::shutdown() {
 }
 
 void TremorService::enqueue(std::vector<FileChange> changes) {
+    bool wake = true;
     {
         std::lock_guard lock(queueMutex_);
         if (queuedChanges_ + changes.size() > queueLimit_) {
@@ -173,9 +175,13 @@ void TremorService::enqueue(std::vector<FileChange> changes) {
         } else {
             queuedChanges_ += changes.size();
             queue_.push_back({Item::Kind::Batch, std::move(changes), 0});
+            // A journaling thread that groups a burst wakes at the end of its window anyway:
+            // waking it for every read would cost a switch each.
+            wake = !grouping_ || queuedChanges_ >= kGroupChanges;
         }
     }
-    queueChanged_.notify_one();
+    if (wake)
+        queueChanged_.notify_one();
 }
 
 void TremorService::readLoop() {
@@ -213,6 +219,11 @@ void TremorService::sync() {
 }
 
 void TremorService::journalLoop() {
+    // When the last batch was written this recently, the journal is in a burst: what arrives
+    // within the window joins the next batch, so that a burst costs a commit per window rather
+    // than one per read of the kernel queue (a commit is tens of microseconds of a core that
+    // the program writing the files needs). A change after a quiet spell is written at once.
+    Clock::time_point lastWritten = Clock::now() - kGroupWindow;
     for (;;) {
         Item item;
         {
@@ -220,17 +231,40 @@ void TremorService::journalLoop() {
             queueChanged_.wait(lock, [&] { return !queue_.empty() || stopJournaling_; });
             if (queue_.empty())
                 break;
+            if (queue_.front().kind == Item::Kind::Barrier) {
+                passedBarrier_ = queue_.front().barrier;
+                queue_.pop_front();
+                barrierPassed_.notify_all();
+                continue;
+            }
+            if (queue_.front().kind == Item::Kind::Batch &&
+                Clock::now() - lastWritten < kGroupWindow) {
+                // A sync() waiting behind, a full batch or a stop ends the wait early.
+                grouping_ = true;
+                queueChanged_.wait_until(lock, lastWritten + kGroupWindow, [&] {
+                    return stopJournaling_ || nextBarrier_ != passedBarrier_ ||
+                           queuedChanges_ >= kGroupChanges;
+                });
+                grouping_ = false;
+            }
             item = std::move(queue_.front());
             queue_.pop_front();
             queuedChanges_ -= item.changes.size();
-            if (item.kind == Item::Kind::Barrier) {
-                passedBarrier_ = item.barrier;
-                barrierPassed_.notify_all();
-                continue;
+            // Batches read one after the other are journaled as one, in their order.
+            while (item.kind == Item::Kind::Batch && !queue_.empty() &&
+                   queue_.front().kind == Item::Kind::Batch &&
+                   item.changes.size() < kGroupChanges) {
+                Item& next = queue_.front();
+                queuedChanges_ -= next.changes.size();
+                item.changes.insert(item.changes.end(),
+                                    std::make_move_iterator(next.changes.begin()),
+                                    std::make_move_iterator(next.changes.end()));
+                queue_.pop_front();
             }
             journaling_ = true;
         }
         journal(item);
+        lastWritten = Clock::now();
         std::lock_guard lock(queueMutex_);
         journaling_ = false;
     }

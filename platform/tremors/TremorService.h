@@ -1,6 +1,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <condition_variable>
 #include <cstdint>
 #include <deque>
@@ -40,6 +41,11 @@ class TremorService {
 public:
     // Changes read but not journaled yet; above this the reader drops and journals a loss.
     static constexpr size_t kDefaultQueueLimit = 1 << 20;
+
+    // In a burst of changes, those read within this window of the last write are written
+    // together, up to this many at a time.
+    static constexpr std::chrono::milliseconds kGroupWindow{2};
+    static constexpr size_t kGroupChanges = 8192;
 
     using Listener = std::function<void(uint32_t device, const std::vector<JournalEvent>&)>;
 
@@ -128,6 +134,7 @@ private:
         uint64_t barrier = 0;
     };
     struct Private {};
+    using Clock = std::chrono::steady_clock;
 
 public:
     TremorService(Private, std::string stateDir, std::unique_ptr<InotifyBackend> backend,
@@ -175,6 +182,7 @@ private:
     uint64_t nextBarrier_ = 0;
     uint64_t passedBarrier_ = 0;
     bool journaling_ = false;  // the journaling thread is writing a batch it took off the queue
+    bool grouping_ = false;    // the journaling thread waits for more of a burst
     std::condition_variable barrierPassed_;
 
     // Serialises every use of the writers and the stores' index.

@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/inotify.h>
 #include <unistd.h>
 
@@ -223,6 +224,69 @@ private:
     std::map<std::string, int> failures_;
 };
 
+// The real calls, except that a read ending in the first half of a rename holds the second
+// half back until the next poll that waits: what a reader sees when it reads between the two
+// halves, which the kernel queues one after the other.
+class SplitRenameInotifyApi : public LinuxInotifyApi {
+public:
+    ssize_t read(int fd, void* buffer, size_t size) override {
+        std::lock_guard lock(mutex_);
+        if (!held_.empty()) {
+            if (!released_) {
+                errno = EAGAIN;
+                return -1;
+            }
+            size_t n = std::min(size, held_.size());
+            std::memcpy(buffer, held_.data(), n);
+            held_.erase(0, n);
+            return static_cast<ssize_t>(n);
+        }
+        ssize_t n = LinuxInotifyApi::read(fd, buffer, size);
+        if (n <= 0)
+            return n;
+        // Cut after the first IN_MOVED_FROM that has records after it.
+        const char* bytes = static_cast<const char*>(buffer);
+        for (size_t at = 0; at < static_cast<size_t>(n);) {
+            const auto* event = reinterpret_cast<const struct inotify_event*>(bytes + at);
+            at += sizeof(struct inotify_event) + event->len;
+            if ((event->mask & IN_MOVED_FROM) && at < static_cast<size_t>(n)) {
+                held_.assign(bytes + at, static_cast<size_t>(n) - at);
+                released_ = false;
+                ++splits_;
+                return static_cast<ssize_t>(at);
+            }
+        }
+        return n;
+    }
+    int queuedBytes(int fd) override {
+        std::lock_guard lock(mutex_);
+        int real = LinuxInotifyApi::queuedBytes(fd);
+        return released_ && real >= 0 ? real + static_cast<int>(held_.size()) : real;
+    }
+    int poll(struct pollfd* fds, nfds_t count, int timeoutMs) override {
+        {
+            std::lock_guard lock(mutex_);
+            if (!held_.empty() && timeoutMs != 0) {
+                released_ = true;  // the second half is queued now
+                for (nfds_t i = 0; i < count; ++i) fds[i].revents = 0;
+                fds[0].revents = POLLIN;
+                return 1;
+            }
+        }
+        return LinuxInotifyApi::poll(fds, count, timeoutMs);
+    }
+    int splits() {
+        std::lock_guard lock(mutex_);
+        return splits_;
+    }
+
+private:
+    std::mutex mutex_;
+    std::string held_;
+    bool released_ = true;
+    int splits_ = 0;
+};
+
 // The real file system, with hooks that let a test act at the worst moment.
 class HookedFileSystem : public LinuxFileSystem {
 public:
@@ -356,6 +420,37 @@ TEST_F(InotifyBackendTest, AWatchThatCannotBeAddedIsReportedAndTheRestIsWatched)
     EXPECT_TRUE(
         inOrder(drain(), {created(path("fresh"), true), watchFailed(path("fresh"), ENOSPC)}));
     EXPECT_EQ(log->countStartingWith("[ERROR] Cannot watch " + path("fresh") + ": [28: "), 1u);
+}
+
+// A read that ends between the two halves of a rename must not take the first for a move out
+// of the trees: the file would be reported removed, and created again under its new name.
+TEST(InotifyBackendRenameTest, ARenameReadInTwoHalvesIsStillOneRename) {
+    TempDir dir;
+    std::string root = dir.makeDir("root");
+    auto api = std::make_shared<SplitRenameInotifyApi>();
+    auto started = InotifyBackend::start(api);
+    ASSERT_TRUE(started.ok()) << started.error().description();
+    auto backend = std::move(started).value();
+    Changes discovered;
+    ASSERT_TRUE(backend->watchTree(root, discovered).ok());
+    std::ofstream(root + "/a", std::ios::binary) << "x";
+    std::ofstream(root + "/c", std::ios::binary) << "x";
+    Changes before;
+    backend->drain(before);
+
+    // Through a sync's drain and through the reading thread's consume alike.
+    fs::rename(root + "/a", root + "/b");
+    Changes drained;
+    backend->drain(drained);
+    fs::rename(root + "/c", root + "/d");
+    Changes consumed;
+    ASSERT_TRUE(backend->wait(5000));
+    backend->consume(consumed);
+    backend->drain(consumed);
+
+    EXPECT_EQ(api->splits(), 2);
+    EXPECT_EQ(drained, (Changes{renamed(root + "/a", root + "/b")}));
+    EXPECT_EQ(consumed, (Changes{renamed(root + "/c", root + "/d")}));
 }
 
 }  // namespace

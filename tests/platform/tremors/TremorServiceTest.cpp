@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <filesystem>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -78,6 +79,63 @@ TEST_F(TremorServiceTest, CurrentEventIdIncludesAWriteThatJustCompleted) {
         ASSERT_NE(created, nullptr) << "write " << i << " not journaled before the answer";
         EXPECT_LE(created->id, current);
         EXPECT_EQ(created->fileID, inodeOf(path));
+    }
+}
+
+// A burst is written in groups: none of its changes may be lost, doubled or reordered, and the
+// listeners see each event once, in ID order.
+TEST_F(TremorServiceTest, ABurstIsJournaledWholeAndInOrder) {
+    ASSERT_NO_FATAL_FAILURE(startWatching());
+    uint64_t since = service_->currentEventId();
+    std::mutex mutex;
+    std::vector<uint64_t> delivered;
+    uint64_t token = service_->addListener([&](uint32_t, const std::vector<JournalEvent>& events) {
+        std::lock_guard lock(mutex);
+        for (const auto& event : events) delivered.push_back(event.id);
+    });
+    constexpr int kFiles = 1500;
+    for (int i = 0; i < kFiles; ++i) {
+        std::string path = tree_ + "/a" + std::to_string(i);
+        writeText(path, "x");
+        if (i % 3 == 0)
+            fs::rename(path, tree_ + "/b" + std::to_string(i));
+    }
+    uint64_t last = service_->currentEventId();
+    service_->removeListener(token);
+    auto events = journaled(*service_, device_, since);
+    ASSERT_FALSE(events.empty());
+    EXPECT_EQ(events.back().id, last);
+    for (size_t k = 1; k < events.size(); ++k) ASSERT_LT(events[k - 1].id, events[k].id);
+    {
+        std::lock_guard lock(mutex);
+        std::vector<uint64_t> journaledIds;
+        for (const auto& event : events) journaledIds.push_back(event.id);
+        EXPECT_EQ(delivered, journaledIds);
+    }
+    // Each file's creation comes before its rename, and the one after it is created after it.
+    uint64_t previous = 0;
+    for (int i = 0; i < kFiles; ++i) {
+        std::string created = tree_ + "/a" + std::to_string(i);
+        const JournalEvent* event = findEvent(events, created, kTremorItemCreated);
+        ASSERT_NE(event, nullptr) << created;
+        EXPECT_LT(previous, event->id) << created;
+        previous = event->id;
+        if (i % 3 == 0) {
+            std::string renamed = tree_ + "/b" + std::to_string(i);
+            const JournalEvent* moved = findEvent(events, renamed, kTremorItemRenamed);
+            ASSERT_NE(moved, nullptr)
+                << renamed << "\n"
+                << [&] {
+                       std::string text;
+                       for (const auto& e : events)
+                           if (e.path == renamed || e.path == created)
+                               text += std::to_string(e.id) + " " + e.path +
+                                       " flags=" + std::to_string(e.flags) + "\n";
+                       return text;
+                   }();
+            EXPECT_LT(event->id, moved->id) << renamed;
+            EXPECT_EQ(moved->fileID, inodeOf(renamed));
+        }
     }
 }
 
