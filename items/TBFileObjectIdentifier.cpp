@@ -1,5 +1,6 @@
 #include "items/TBFileObjectIdentifier.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -16,6 +17,7 @@
 #include "items/AppLibraryLookup.h"
 #include "items/TBPFileObjectIdentifier.h"
 #include "platform/FileSystem.h"
+#include "platform/OpenFolder.h"
 #include "platform/ScopedFd.h"
 #include "platform/objects/Number.h"
 #include "platform/strata/AttributeList.h"
@@ -238,9 +240,10 @@ void TBFileObjectIdentifier::prepareItemIdentifiers(const std::vector<Url>& urls
         return;
     // The entries of a page share their folder: it is placed once.
     std::map<std::string, bool> insideByFolder;
-    std::vector<ScopedFd> documents;
+    std::vector<StrataService::FileName> documents;
     std::vector<const Url*> documentUrls;
-    FileSystem& fs = FileSystem::current();
+    // A listing's URLs keep their open folder: each file is then found by its name alone.
+    std::vector<OpenFolderRef> folders;
     for (const Url& url : urls) {
         if (!url.isFileURL() || url.path() == "/")
             continue;
@@ -250,33 +253,28 @@ void TBFileObjectIdentifier::prepareItemIdentifiers(const std::vector<Url>& urls
             inside = insideByFolder.emplace(folder.path(), entriesAreInsideTrees(folder)).first;
         if (!inside->second)
             continue;
+        // What a listing prefetched: no call to the file system for these.
         bool isDirectory = false;
         bool isPackage = false;
         if (!boolValue(url, ResourceKeys::kIsDirectory, isDirectory) ||
             (isDirectory && !boolValue(url, ResourceKeys::kIsPackage, isPackage)))
             continue;
-        ScopedFd fd = openEventOnly(url.path());
-        struct statx st {};
-        if (!fd.ok() || fs.statx(fd.get(), "", AT_EMPTY_PATH, STATX_TYPE | STATX_INO, &st) != 0)
+        if (isDirectory && !isPackage) {
+            (void)url.resourceValue(ResourceKeys::kFileID);  // read once, kept in the cache
             continue;
-        // What the resource values said must still hold: a file replaced meanwhile is left to
-        // itemIdentifier.
-        if (S_ISREG(st.stx_mode) && !isDirectory) {
-            documents.push_back(std::move(fd));
-            documentUrls.push_back(&url);
-        } else if (S_ISDIR(st.stx_mode) && isDirectory && isPackage) {
-            documents.push_back(std::move(fd));
-            documentUrls.push_back(&url);
-        } else if (S_ISDIR(st.stx_mode) && isDirectory) {
-            (void)url.setResourceValue(Number::fromUInt64(st.stx_ino), ResourceKeys::kFileID);
         }
+        // The service checks the type again (a regular file or a folder, never a link).
+        if (OpenFolderRef open = url.openFolder()) {
+            documents.push_back({open->fd(), url.lastPathComponent()});
+            folders.push_back(std::move(open));
+        } else {
+            documents.push_back({AT_FDCWD, url.path()});
+        }
+        documentUrls.push_back(&url);
     }
     if (documents.empty())
         return;
-    std::vector<int> fds;
-    fds.reserve(documents.size());
-    for (const ScopedFd& fd : documents) fds.push_back(fd.get());
-    std::vector<uint32_t> ids = service->getOrAllocateDocumentIds(fds);
+    std::vector<uint32_t> ids = service->getOrAllocateDocumentIds(documents);
     for (size_t i = 0; i < ids.size() && i < documentUrls.size(); ++i) {
         if (ids[i] != 0) {
             (void)documentUrls[i]->setResourceValue(Number::fromUInt64(ids[i]),

@@ -1,5 +1,9 @@
 #include "platform/strata/StrataService.h"
+#include "platform/FileSystem.h"
+#include "platform/ScopedFd.h"
 #include "support/ProcessWide.h"
+
+#include <fcntl.h>
 
 #include <atomic>
 #include <cerrno>
@@ -24,10 +28,14 @@ std::shared_ptr<StrataService> StrataService::setCurrent(std::shared_ptr<StrataS
     return std::atomic_exchange(&slot(), std::move(service));
 }
 
-std::vector<uint32_t> StrataService::getOrAllocateDocumentIds(const std::vector<int>& fds) {
+std::vector<uint32_t> StrataService::getOrAllocateDocumentIds(const std::vector<FileName>& files) {
     std::vector<uint32_t> ids;
-    ids.reserve(fds.size());
-    for (int fd : fds) ids.push_back(getOrAllocateDocumentId(fd));
+    ids.reserve(files.size());
+    for (const FileName& file : files) {
+        ScopedFd fd(FileSystem::current().openat(file.folder, file.name,
+                                                 O_PATH | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+        ids.push_back(fd.ok() ? getOrAllocateDocumentId(fd.get()) : 0);
+    }
     return ids;
 }
 

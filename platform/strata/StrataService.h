@@ -24,10 +24,17 @@ public:
     // The document ID of the open file, allocating the next one when it has none. Pending
     // file-system events are applied first, so a file saved just before is known.
     virtual uint32_t getOrAllocateDocumentId(int fd) = 0;
-    // The same for each open file, in order, with 0 for one that got no ID. The default asks for
-    // each in turn; the journal's service syncs once, reads its index once and writes the new
-    // IDs in one transaction (a listing asks for a page of files at a time).
-    virtual std::vector<uint32_t> getOrAllocateDocumentIds(const std::vector<int>& fds);
+    // A file named relative to an open folder, or by absolute path with `folder` AT_FDCWD.
+    struct FileName {
+        int folder;
+        std::string name;
+    };
+    // The same for each of `files` (a regular file or a package folder, never followed through
+    // a final link), in order, with 0 for one that got no ID. The default opens each and asks
+    // for it in turn; the journal's service syncs once, reads its index once and writes the new
+    // IDs in one transaction (a listing asks for a page of files at a time, each relative to
+    // the listed folder: one name lookup, no descriptor).
+    virtual std::vector<uint32_t> getOrAllocateDocumentIds(const std::vector<FileName>& files);
     // The document ID of an inode, 0 when it has none (never allocates).
     virtual uint32_t documentIdForInode(uint32_t device, uint64_t inode) = 0;
     // The file ID that holds a document now; 0 and ENOENT when unknown, EAGAIN while the index

@@ -96,26 +96,42 @@ void TremorStrataService::allocate(TremorStore& store, const std::vector<File>& 
 }
 
 uint32_t TremorStrataService::getOrAllocateDocumentId(int fd) {
-    std::vector<uint32_t> ids = getOrAllocateDocumentIds({fd});
+    // A file saved just before must be in the index before it can be given an ID.
+    service_->sync();
+    std::vector<uint32_t> ids(1, 0);
+    struct statx st {};
+    if (FileSystem::current().statx(fd, "", AT_EMPTY_PATH, STATX_INO | STATX_TYPE, &st) != 0)
+        return 0;
+    std::map<uint32_t, std::vector<File>> byDevice;
+    byDevice[encodeDevice(st.stx_dev_major, st.stx_dev_minor)].push_back(
+        {0, st.stx_ino, S_ISREG(st.stx_mode)});
+    allocateAll(byDevice, ids);
     return ids.front();
 }
 
-std::vector<uint32_t> TremorStrataService::getOrAllocateDocumentIds(const std::vector<int>& fds) {
-    std::vector<uint32_t> ids(fds.size(), 0);
-    // A file saved just before must be in the index before it can be given an ID.
-    service_->sync();
+std::vector<uint32_t> TremorStrataService::getOrAllocateDocumentIds(
+    const std::vector<FileName>& files) {
+    std::vector<uint32_t> ids(files.size(), 0);
+    service_->sync();  // as for one file
     std::map<uint32_t, std::vector<File>> byDevice;
-    int failure = 0;
-    for (size_t i = 0; i < fds.size(); ++i) {
+    for (size_t i = 0; i < files.size(); ++i) {
+        // Never through a final link: what a descriptor opened O_NOFOLLOW would show, without
+        // opening one per file of a page.
         struct statx st {};
-        if (FileSystem::current().statx(fds[i], "", AT_EMPTY_PATH, STATX_INO | STATX_TYPE, &st) !=
-            0) {
-            failure = errno;
+        if (FileSystem::current().statx(files[i].folder, files[i].name, AT_SYMLINK_NOFOLLOW,
+                                        STATX_INO | STATX_TYPE, &st) != 0 ||
+            !(S_ISREG(st.stx_mode) || S_ISDIR(st.stx_mode)))
             continue;
-        }
         byDevice[encodeDevice(st.stx_dev_major, st.stx_dev_minor)].push_back(
             {i, st.stx_ino, S_ISREG(st.stx_mode)});
     }
+    allocateAll(byDevice, ids);
+    return ids;
+}
+
+void TremorStrataService::allocateAll(const std::map<uint32_t, std::vector<File>>& byDevice,
+                                      std::vector<uint32_t>& ids) {
+    int failure = 0;
     for (const auto& [device, files] : byDevice) {
         TremorStore* store = service_->storeForDevice(device);
         if (!store) {
@@ -130,7 +146,6 @@ std::vector<uint32_t> TremorStrataService::getOrAllocateDocumentIds(const std::v
     // The one file of a single ask tells why it has none.
     if (failure != 0)
         errno = failure;
-    return ids;
 }
 
 uint32_t TremorStrataService::documentIdForInode(uint32_t device, uint64_t inode) {

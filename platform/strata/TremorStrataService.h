@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -26,7 +27,7 @@ public:
     static std::optional<uint32_t> lookUpDocumentId(const std::string& path);
 
     uint32_t getOrAllocateDocumentId(int fd) override;
-    std::vector<uint32_t> getOrAllocateDocumentIds(const std::vector<int>& fds) override;
+    std::vector<uint32_t> getOrAllocateDocumentIds(const std::vector<FileName>& files) override;
     uint32_t documentIdForInode(uint32_t device, uint64_t inode) override;
     uint64_t resolveDocumentId(uint32_t device, uint32_t documentId) override;
     bool pathForFileId(uint32_t device, uint64_t fileId, std::string& path) override;
@@ -45,6 +46,9 @@ private:
     // tree).
     static void allocate(TremorStore& store, const std::vector<File>& files,
                          std::vector<uint32_t>& ids);
+    // The same for files of any volume, grouped by device.
+    void allocateAll(const std::map<uint32_t, std::vector<File>>& byDevice,
+                     std::vector<uint32_t>& ids);
 
     const std::shared_ptr<TremorService> service_;
 };

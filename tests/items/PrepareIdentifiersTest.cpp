@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "host/PublishedTrees.h"
 #include "host/RecordingHostPorterManager.h"
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/objects/Number.h"
@@ -17,6 +18,7 @@
 #include "platform/tremors/SqliteDatabase.h"
 #include "platform/tremors/TremorService.h"
 #include "tests/common/FakeAppLibraryLookup.h"
+#include "tests/common/FakeStrataService.h"
 #include "tests/common/ScopedLogCapture.h"
 #include "tests/common/ScopedSlots.h"
 #include "tests/common/TempDir.h"
@@ -186,6 +188,34 @@ TEST_F(PrepareIdentifiersTest, KnownFilesFoldersVanishedFilesAndFilesOutsideAreE
     EXPECT_EQ(freshIdentifier(next), "did=" + std::to_string(freshNumber + 1));
 }
 
+// A listed folder's files are found by name in the open folder, as the listing read them (even
+// after the folder was renamed meanwhile), and a link among them is never followed.
+TEST_F(PrepareIdentifiersTest, AListedFoldersFilesAreFoundInTheOpenFolderAndLinksAreNotFollowed) {
+    std::vector<std::string> paths = writeFiles("Documents/listed", 3);
+    std::string inner = dir_.writeFile("Documents/inner.txt", "i");
+    ASSERT_EQ(::symlink(inner.c_str(), (storage_ + "/listed/link").c_str()), 0);
+    std::vector<uint64_t> inodes;
+    for (const auto& path : paths) inodes.push_back(inodeOf(path));
+    OpenFolderRef folder = PublishedTrees::openListedFolder(storage_ + "/listed");
+    ASSERT_TRUE(folder && folder->linkFree());
+    std::vector<Url> urls;
+    for (const char* name : {"file-0.txt", "file-1.txt", "file-2.txt", "link"})
+        urls.push_back(Url::fileURLInFolder(folder, name));
+    for (const Url& url : urls) ASSERT_TRUE(url.resourceValue(ResourceKeys::kIsDirectory).ok());
+    ASSERT_EQ(::rename((storage_ + "/listed").c_str(), (storage_ + "/moved").c_str()), 0);
+
+    TBFileObjectIdentifier::prepareItemIdentifiers(urls);
+
+    for (size_t i = 0; i < paths.size(); ++i) {
+        std::optional<uint32_t> cached = cachedDocumentId(urls[i]);
+        ASSERT_TRUE(cached) << paths[i];
+        EXPECT_EQ(store().documentIdForInode(inodes[i]).value(), cached) << paths[i];
+    }
+    EXPECT_EQ(cachedDocumentId(urls[3]), std::nullopt);
+    EXPECT_EQ(store().documentIdForInode(inodeOf(inner)).value(), std::nullopt)
+        << "the link's target took no ID through it";
+}
+
 TEST_F(PrepareIdentifiersTest, ABatchThatCannotBeWrittenGivesNothingAndItemIdentifierStillAnswers) {
     std::vector<std::string> paths = writeFiles("Documents/page", 5);
     uint64_t failing = inodeOf(paths[2]);
@@ -222,6 +252,33 @@ TEST_F(PrepareIdentifiersTest, ABatchThatCannotBeWrittenGivesNothingAndItemIdent
         EXPECT_EQ(identifier, "did=" + std::to_string(expected++)) << i;
         EXPECT_EQ(freshIdentifier(paths[i]), identifier) << i;
     }
+}
+
+// A service with no batch of its own (a test's fake) is asked for each document in turn, and
+// only for documents.
+TEST(PrepareIdentifiersFakeTest, AServiceWithoutABatchIsAskedForEachDocument) {
+    testing::TempDir dir;
+    std::string storage = dir.makeDir("Documents");
+    std::string a = dir.writeFile("Documents/a.txt", "a");
+    std::string b = dir.writeFile("Documents/b.txt", "b");
+    std::string folder = dir.makeDir("Documents/folder");
+    std::string outside = dir.writeFile("outside.txt", "o");
+    auto strata = std::make_shared<testing::FakeStrataService>();
+    testing::ScopedSlots slots(
+        std::make_shared<RecordingHostPorterManager>(Url::fileURLWithPath(storage)), strata,
+        std::make_shared<testing::FakeAppLibraryLookup>());
+    std::vector<Url> urls{Url::fileURLWithPath(a), Url::fileURLWithPath(folder),
+                          Url::fileURLWithPath(b), Url::fileURLWithPath(outside)};
+
+    TBFileObjectIdentifier::prepareItemIdentifiers(urls);
+
+    EXPECT_EQ(strata->allocations(), 2);
+    auto first = TBFileObjectIdentifier::itemIdentifier(urls[0]);
+    auto second = TBFileObjectIdentifier::itemIdentifier(urls[2]);
+    ASSERT_TRUE(first && second);
+    EXPECT_NE(first, second);
+    EXPECT_EQ(TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(a)), first);
+    EXPECT_EQ(strata->allocations(), 2);  // answered from the URLs and the fake's index
 }
 
 }  // namespace
