@@ -35,6 +35,19 @@ ScopedFd openEventOnly(const std::string& path) {
     return ScopedFd(FileSystem::current().open(path, kEventOnlyFlags));
 }
 
+// How the storage stands to `url`. An entry of a listed folder, opened below its root, is
+// contained when the storage is its ancestor by name: the storage was a folder on the way to it,
+// which spares a status query of the storage per entry.
+UrlRelationship relationshipOfStorage(const Url& storage, const Url& url) {
+    const std::string& folder = storage.path();
+    const std::string& path = url.path();
+    if (OpenFolderRef open = url.openFolder();
+        open && open->linkFree() && path.size() > folder.size() + 1 && folder != "/" &&
+        path.compare(0, folder.size(), folder) == 0 && path[folder.size()] == '/')
+        return UrlRelationship::Contains;
+    return pt_relationshipToItemAtURL(storage, url);
+}
+
 std::string pathOrUnknown(const Url& url) {
     return url.path().empty() ? std::string("<Unknown File>") : url.path();
 }
@@ -114,7 +127,7 @@ std::optional<HostPorterItemIdentifier> TBFileObjectIdentifier::itemIdentifier(c
         return std::nullopt;
     }
     Url storage = HostPorterManager::defaultManager()->documentStorageURL();
-    switch (pt_relationshipToItemAtURL(storage, url)) {
+    switch (relationshipOfStorage(storage, url)) {
         case UrlRelationship::Same:
             return HostPorterRootContainerItemIdentifier;
         case UrlRelationship::Contains:
