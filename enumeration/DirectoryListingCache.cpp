@@ -123,7 +123,7 @@ DirectoryListingCache::Listing DirectoryListingCache::find(const FileSystem* fs,
 
 void DirectoryListingCache::keep(const std::shared_ptr<FileSystem>& fs, const Stamp& stamp,
                                  Listing listing) {
-    if (maxListings_ == 0 || listing->all.size() > maxEntries_)
+    if (maxListings_ == 0)
         return;
     MutexLock lock(mutex_);
     // Another thread may have read the same directory meanwhile.
@@ -138,7 +138,10 @@ void DirectoryListingCache::keep(const std::shared_ptr<FileSystem>& fs, const St
     }
     keptEntries_ += listing->all.size();
     kept_.push_front(Kept{fs.get(), fs, stamp, std::move(listing)});
-    while (kept_.size() > maxListings_ || keptEntries_ > maxEntries_) {
+    // The newest stays even when it alone is over the bound: it is the folder being listed, and
+    // reading a folder of a million entries again for each of its pages would make every page
+    // cost the whole folder.
+    while (kept_.size() > 1 && (kept_.size() > maxListings_ || keptEntries_ > maxEntries_)) {
         keptEntries_ -= kept_.back().listing->all.size();
         kept_.pop_back();
     }

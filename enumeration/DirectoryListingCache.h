@@ -18,7 +18,8 @@ namespace tamber {
 // is handed out only while the directory is provably unchanged: same file system object, same
 // device and inode, same modification and change times, and those times old enough that a
 // change within the same timestamp tick can't hide behind them. Bounded by a few listings and
-// a total entry count; the least recently used goes first.
+// a total entry count, the least recently used going first; a listing larger than the bound is
+// kept alone.
 class DirectoryListingCache {
 public:
     struct Entries {
