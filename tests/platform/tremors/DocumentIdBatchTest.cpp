@@ -8,6 +8,7 @@
 #include "platform/tremors/TremorStore.h"
 #include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
+#include "tests/platform/tremors/TestStores.h"
 
 // Document IDs given to many inodes at once, as a page of a listing asks for them, and the
 // placement read that comes before: where each inode is and which ID it has.
@@ -15,18 +16,8 @@
 namespace tamber {
 namespace {
 
-constexpr uint64_t kFsid = 0xba7c;
-const std::string kTags = "com.velk.metadata:_kHostItemUserTags";
-
-std::unique_ptr<TremorStore> openStore(const std::string& stateDir) {
-    auto store = TremorStore::open(stateDir, kFsid);
-    EXPECT_TRUE(store.ok()) << (store.ok() ? "" : store.error().description());
-    return store.ok() ? std::move(store).value() : nullptr;
-}
-
-std::string databaseIn(const testing::TempDir& state) {
-    return state / "000000000000ba7c/journal.sqlite";
-}
+constexpr uint64_t kBatchFsid = 0xba7c;
+const std::string kBatchTags = "com.velk.metadata:_kHostItemUserTags";
 
 // Makes every insert of a document row for `inode` fail, as a full disk or an I/O error
 // would fail the transaction that holds it. Only while no store has the database open.
@@ -47,7 +38,7 @@ InodeRecord entry(uint64_t inode, uint64_t parent, const std::string& name, uint
 class DocumentIdBatchTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        store_ = openStore(state_.path());
+        store_ = testing::openTestStore(state_.path(), kBatchFsid);
         ASSERT_TRUE(store_);
         // /w (inode 1) holds folders a (2) and b (3); a holds files 10..12, b holds 20.
         ASSERT_TRUE(store_->addRoot("/w", 0, 1).ok());
@@ -62,7 +53,7 @@ protected:
     }
     void reopen() {
         store_.reset();
-        store_ = openStore(state_.path());
+        store_ = testing::openTestStore(state_.path(), kBatchFsid);
         ASSERT_TRUE(store_);
     }
 
@@ -92,8 +83,8 @@ TEST_F(DocumentIdBatchTest, APlacementAnswersEveryInodeAsTheSingleLookUpsDo) {
 
 TEST_F(DocumentIdBatchTest, ABatchKeepsIdsThatExistGivesNewOnesOnceAndKeepsTheirCopies) {
     uint32_t existing = store_->allocateDocumentId(11).value();
-    auto ids = store_->allocateDocumentIds({{10, {{kTags, Bytes{'t'}}}},
-                                            {11, {{kTags, Bytes{'n', 'o'}}}},
+    auto ids = store_->allocateDocumentIds({{10, {{kBatchTags, Bytes{'t'}}}},
+                                            {11, {{kBatchTags, Bytes{'n', 'o'}}}},
                                             {12, {}},
                                             {10, {}},
                                             {20, {}}});
@@ -107,7 +98,7 @@ TEST_F(DocumentIdBatchTest, ABatchKeepsIdsThatExistGivesNewOnesOnceAndKeepsTheir
     EXPECT_EQ(store_->inodeForDocumentId(got[2]).value(), 12u);
     EXPECT_EQ(store_->inodeForDocumentId(got[4]).value(), 20u);
     EXPECT_EQ(store_->documentAttributes(got[0]).value(),
-              (TremorStore::Attributes{{kTags, Bytes{'t'}}}));
+              (TremorStore::Attributes{{kBatchTags, Bytes{'t'}}}));
     // An ID that existed keeps its own copy: the batch's is only for new ones.
     EXPECT_TRUE(store_->documentAttributes(existing).value().empty());
 
@@ -121,10 +112,11 @@ TEST_F(DocumentIdBatchTest, ABatchKeepsIdsThatExistGivesNewOnesOnceAndKeepsTheir
 TEST_F(DocumentIdBatchTest, AFailedBatchHandsOutNoIdAndKeepsNoCopy) {
     uint32_t before = store_->allocateDocumentId(20).value();
     store_.reset();
-    ASSERT_NO_FATAL_FAILURE(failDocumentRowsFor(databaseIn(state_), 12));
+    ASSERT_NO_FATAL_FAILURE(
+        failDocumentRowsFor(testing::testStoreDatabase(state_, kBatchFsid), 12));
     ASSERT_NO_FATAL_FAILURE(reopen());
 
-    auto ids = store_->allocateDocumentIds({{10, {{kTags, Bytes{'t'}}}}, {11, {}}, {12, {}}});
+    auto ids = store_->allocateDocumentIds({{10, {{kBatchTags, Bytes{'t'}}}}, {11, {}}, {12, {}}});
     EXPECT_FALSE(ids.ok());
     EXPECT_EQ(store_->documentIdForInode(10).value(), std::nullopt);
     EXPECT_EQ(store_->documentIdForInode(11).value(), std::nullopt);

@@ -18,6 +18,7 @@
 #include "tests/common/ScopedFileSystem.h"
 #include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
+#include "tests/platform/tremors/TestStores.h"
 
 // The document-ID part of the store: metadata copies, detached IDs, and the upgrade of
 // databases written by older versions.
@@ -28,16 +29,6 @@ namespace {
 constexpr uint64_t kFsid = 0x5eed;
 const std::string kTags = "com.velk.metadata:_kHostItemUserTags";
 const std::string kRank = "com.velk.favorite-rank.number#PS";
-
-std::unique_ptr<TremorStore> openStore(const std::string& stateDir) {
-    auto store = TremorStore::open(stateDir, kFsid);
-    EXPECT_TRUE(store.ok()) << (store.ok() ? "" : store.error().description());
-    return store.ok() ? std::move(store).value() : nullptr;
-}
-
-std::string databaseIn(const testing::TempDir& state) {
-    return state / "0000000000005eed/journal.sqlite";
-}
 
 void runSql(const std::string& database, const std::string& sql) {
     auto db = SqliteDatabase::open(database, SQLITE_OPEN_READWRITE);
@@ -63,7 +54,7 @@ InodeRecord stampedFile(uint64_t inode, uint64_t parent, const std::string& name
 
 TEST(DocumentIndexTest, MetadataCopiesFollowTheIdAndGoWithIt) {
     testing::TempDir state;
-    auto store = openStore(state.path());
+    auto store = testing::openTestStore(state.path(), kFsid);
     ASSERT_TRUE(store);
     uint32_t doc = store->allocateDocumentId(10).value();
     Bytes binary{0, 0xff, 'a', 0, 0x80};  // raw bytes, NULs included
@@ -80,7 +71,7 @@ TEST(DocumentIndexTest, MetadataCopiesFollowTheIdAndGoWithIt) {
     EXPECT_EQ(store->inodeForDocumentId(doc).value(), std::nullopt);
     EXPECT_EQ(store->documentIdForInode(10).value(), std::nullopt);
     store.reset();
-    store = openStore(state.path());
+    store = testing::openTestStore(state.path(), kFsid);
     ASSERT_TRUE(store);
     ASSERT_TRUE(store->moveDocumentId(doc, 20).ok());
     EXPECT_EQ(store->inodeForDocumentId(doc).value(), 20u);
@@ -104,7 +95,7 @@ TEST(DocumentIndexTest, MetadataCopiesFollowTheIdAndGoWithIt) {
 
 TEST(DocumentIndexTest, AFailedBatchTakesBackDetachesMovesAndCopies) {
     testing::TempDir state;
-    auto store = openStore(state.path());
+    auto store = testing::openTestStore(state.path(), kFsid);
     ASSERT_TRUE(store);
     uint32_t doc = store->allocateDocumentId(10).value();
     ASSERT_TRUE(store->setDocumentAttribute(doc, kTags, Bytes{'t'}).ok());
@@ -137,7 +128,7 @@ TEST(DocumentIndexTest, OlderDatabasesAreUpgradedInPlace) {
         std::string uuid;
         uint32_t doc = 0;
         {
-            auto store = openStore(state.path());
+            auto store = testing::openTestStore(state.path(), kFsid);
             ASSERT_TRUE(store);
             uuid = store->uuid();
             ASSERT_TRUE(store->addRoot("/watched", 0, 1).ok());
@@ -146,10 +137,10 @@ TEST(DocumentIndexTest, OlderDatabasesAreUpgradedInPlace) {
             std::vector<JournalEvent> events{{0, "/watched/a.txt", 2, 0x100}};
             ASSERT_TRUE(store->append(events).ok());
         }
-        runSql(databaseIn(state), version == 1 ? toVersion1 : toVersion2);
+        runSql(testing::testStoreDatabase(state, kFsid), version == 1 ? toVersion1 : toVersion2);
 
         testing::ScopedLogCapture log;
-        auto store = openStore(state.path());
+        auto store = testing::openTestStore(state.path(), kFsid);
         ASSERT_TRUE(store);
         EXPECT_EQ(store->uuid(), uuid) << "upgraded, not replaced";
         EXPECT_EQ(store->lastEventId(), 1u);
@@ -168,7 +159,8 @@ TEST(DocumentIndexTest, OlderDatabasesAreUpgradedInPlace) {
         EXPECT_EQ(store->allocateDocumentId(3).value(), doc + 1);
         EXPECT_EQ(log.sink().countStartingWith("[INFO] Upgraded the event journal in"), 1u);
         store.reset();
-        EXPECT_EQ(userVersion(databaseIn(state)), TremorStore::kSchemaVersion);
+        EXPECT_EQ(userVersion(testing::testStoreDatabase(state, kFsid)),
+                  TremorStore::kSchemaVersion);
     }
 }
 
@@ -183,7 +175,7 @@ TEST(DocumentIndexTest, ACrawlReadsTheMetadataOfDocumentsWithAnUnknownOrNewChang
         GTEST_SKIP() << "no user attributes on this file system";
     auto counting = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
     testing::ScopedFileSystem scoped(counting);
-    auto store = openStore(state.path());
+    auto store = testing::openTestStore(state.path(), kFsid);
     ASSERT_TRUE(store);
     JournalWriter writer(*store, 7);
     ASSERT_TRUE(store->addRoot(tree, 0).ok());
