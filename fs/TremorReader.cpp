@@ -427,6 +427,8 @@ void TremorReader::prepareBatch(const Array& entries, const uint32_t* flags, siz
     constexpr uint32_t kStreamFlags =
         kTremorEventIdsWrapped | kTremorUserDropped | kTremorKernelDropped | kTremorHistoryDone;
     std::vector<Url> urls;
+    // The storage's volume, looked up once for the batch's file IDs.
+    std::optional<uint32_t> device;
     for (size_t i = 0; i < count; ++i) {
         // The same choices as classifyEvent and processPathEvent make.
         if (flags[i] & kStreamFlags)
@@ -442,7 +444,11 @@ void TremorReader::prepareBatch(const Array& entries, const uint32_t* flags, siz
             auto [it, inserted] = batchURLsByFileID_.try_emplace(number->uint64Value());
             if (!inserted)
                 continue;
-            it->second = TBFileObjectIdentifier::fileURLWithFileIdentifier(number->uint64Value());
+            if (!device)
+                device = TBFileObjectIdentifier::storageDeviceID();
+            if (*device != 0)
+                it->second = TBFileObjectIdentifier::_fileURLWithFileIdentifier(
+                    number->uint64Value(), *device);
             if (it->second)
                 urls.push_back(*it->second);
         } else if (batchURLsByPath_.try_emplace(url.path(), url).second) {

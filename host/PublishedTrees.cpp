@@ -168,14 +168,7 @@ Status PublishedTrees::check(const Url& url) {
         return outsideError(url);
     if (root->path() == url.path())
         return Status::OK();
-    // A listing that opened the folder beneath its root has checked it already.
-    if (OpenFolderRef folder = url.openFolder();
-        folder && folder->linkFree() && isChildPath(folder->path(), url.path()))
-        return Status::OK();
-    std::string_view folderPath(url.path());
-    folderPath = folderPath.substr(0, folderPath.rfind('/'));
-    CheckedFolders* checked = tCheckedFolders;
-    if (checked && checked->inside_.contains(std::string(folderPath)))
+    if (knownInside(url))
         return Status::OK();
     auto parent = openParent(url, O_PATH);
     if (!parent.ok()) {
@@ -185,9 +178,24 @@ Status PublishedTrees::check(const Url& url) {
         return Status::OK();
     }
     ScopedFd opened(parent.value().fd);  // only its opening mattered
-    if (checked)
-        checked->inside_.emplace(folderPath);
+    if (CheckedFolders* checked = tCheckedFolders) {
+        const std::string& path = url.path();
+        checked->inside_.emplace(path, 0, path.rfind('/'));
+    }
     return Status::OK();
+}
+
+bool PublishedTrees::knownInside(const Url& url) {
+    // A listing that opened the folder beneath its root has checked it already.
+    if (OpenFolderRef folder = url.openFolder();
+        folder && folder->linkFree() && isChildPath(folder->path(), url.path()))
+        return true;
+    CheckedFolders* checked = tCheckedFolders;
+    if (!checked || checked->inside_.empty())
+        return false;
+    const std::string& path = url.path();
+    size_t slash = path.rfind('/');
+    return slash != std::string::npos && checked->inside_.contains(path.substr(0, slash));
 }
 
 PublishedTrees::CheckedFolders::CheckedFolders() : outer_(tCheckedFolders) {

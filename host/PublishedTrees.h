@@ -46,6 +46,11 @@ public:
     // A URL made in a folder opened by openListedFolder is inside while that folder is open.
     static Status check(const Url& url);
 
+    // Whether `url` is known to be inside without a look at the disk: made in a folder that a
+    // listing opened beneath its root, or in a folder that the current scope of checked
+    // folders found inside. Its folder was then a folder on the way from a root.
+    static bool knownInside(const Url& url);
+
     // While one lives, check() on its thread opens each folder at most once: a folder found
     // inside answers for every file in it. For work that checks many files of a few folders
     // within moments (a page of a listing, a batch of events); a folder made a link meanwhile

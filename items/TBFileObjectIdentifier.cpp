@@ -35,15 +35,15 @@ ScopedFd openEventOnly(const std::string& path) {
     return ScopedFd(FileSystem::current().open(path, kEventOnlyFlags));
 }
 
-// How the storage stands to `url`. An entry of a listed folder, opened below its root, is
-// contained when the storage is its ancestor by name: the storage was a folder on the way to it,
-// which spares a status query of the storage per entry.
+// How the storage stands to `url`. An entry of a folder known to be inside (a listed one, or
+// one checked for this page or batch) is contained when the storage is its ancestor by name: the
+// storage was a folder on the way to it, which spares a status query of the storage per entry.
 UrlRelationship relationshipOfStorage(const Url& storage, const Url& url) {
     const std::string& folder = storage.path();
     const std::string& path = url.path();
-    if (OpenFolderRef open = url.openFolder();
-        open && open->linkFree() && path.size() > folder.size() + 1 && folder != "/" &&
-        path.compare(0, folder.size(), folder) == 0 && path[folder.size()] == '/')
+    if (path.size() > folder.size() + 1 && folder != "/" &&
+        path.compare(0, folder.size(), folder) == 0 && path[folder.size()] == '/' &&
+        PublishedTrees::knownInside(url))
         return UrlRelationship::Contains;
     return pt_relationshipToItemAtURL(storage, url);
 }
@@ -79,16 +79,6 @@ IdRead readIdResource(const Url& url, ResourceKey key, const char* kind, uint64_
 }
 
 // The device of the document storage folder; 0 after logging why it has none.
-uint32_t storageDeviceID() {
-    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
-    uint32_t device = TBFileObjectIdentifier::deviceID(storage);
-    if (device == 0) {
-        logFormat(LogLevel::Error, "can't get device ID for \"%@\"; %{errno}d",
-                  {storage.path(), ErrnoArg{errno}});
-    }
-    return device;
-}
-
 bool isRetriedErrno(int error) {
     return error == EAGAIN || error == EBUSY || error == ESTALE;
 }
@@ -108,6 +98,16 @@ uint32_t TBFileObjectIdentifier::deviceIDWithError(const Url& url, Error* error)
         return 0;
     }
     return encodeDevice(st.stx_dev_major, st.stx_dev_minor);
+}
+
+uint32_t TBFileObjectIdentifier::storageDeviceID() {
+    Url storage = HostPorterManager::defaultManager()->documentStorageURL();
+    uint32_t device = deviceID(storage);
+    if (device == 0) {
+        logFormat(LogLevel::Error, "can't get device ID for \"%@\"; %{errno}d",
+                  {storage.path(), ErrnoArg{errno}});
+    }
+    return device;
 }
 
 uint32_t TBFileObjectIdentifier::deviceID(const Url& url) {

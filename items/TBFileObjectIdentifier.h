@@ -20,6 +20,8 @@ public:
     // for) on failure.
     static uint32_t deviceIDWithError(const Url& url, Error* error);
     static uint32_t deviceID(const Url& url);
+    // The volume of the document storage, 0 (logged) when it can't be read.
+    static uint32_t storageDeviceID();
 
     // The identifier of the item at `url`. Caches the file or document ID it found in the URL's
     // resource values, so that a second call on the same URL is cheap.

@@ -140,8 +140,12 @@ TEST_F(PublishedTreesTest, CheckedFoldersAnswerOnlyOnTheirThreadAndWhileTheyLive
     const std::string sub = storage + "/Work/Sub";
     {
         PublishedTrees::CheckedFolders checked;
+        EXPECT_FALSE(PublishedTrees::knownInside(urlAt(sub + "/a")));
         EXPECT_TRUE(PublishedTrees::check(urlAt(sub + "/a")).ok());
+        EXPECT_TRUE(PublishedTrees::knownInside(urlAt(sub + "/sibling")));
+        EXPECT_FALSE(PublishedTrees::knownInside(urlAt(sub + "/a/below"))) << "only its folder";
         EXPECT_TRUE(refused(PublishedTrees::check(urlAt(storage + "/away/f"))));
+        EXPECT_FALSE(PublishedTrees::knownInside(urlAt(storage + "/away/f")));
         EXPECT_TRUE(refused(PublishedTrees::check(urlAt(storage + "/away/g"))))
             << "a refused folder is asked again";
         fs::rename(sub, storage + "/Work/Old");
@@ -156,6 +160,7 @@ TEST_F(PublishedTreesTest, CheckedFoldersAnswerOnlyOnTheirThreadAndWhileTheyLive
         }
     }
     EXPECT_TRUE(refused(PublishedTrees::check(urlAt(sub + "/b"))));
+    EXPECT_FALSE(PublishedTrees::knownInside(urlAt(sub + "/b")));
 }
 
 TEST_F(PublishedTreesTest, OperationsRefuseOutsideBeforeTouchingAnything) {
