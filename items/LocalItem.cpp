@@ -220,7 +220,8 @@ const std::vector<ResourceKey>& LocalItem::urlKeys() {
 const std::vector<ResourceKey>& LocalItem::listingKeys() {
     static const std::vector<ResourceKey> keys = [] {
         std::vector<ResourceKey> all = urlKeys();
-        all.insert(all.end(), {K::kIsDirectory, K::kIsPackage, K::kFileID});
+        all.insert(all.end(), {K::kIsDirectory, K::kIsPackage, K::kFileID, K::kVolumeIdentifier,
+                               K::kIsRegularFile});
         return all;
     }();
     return keys;

@@ -45,7 +45,8 @@ public:
     // parent directory URL, name, localized name, type identifier, file size, creation date,
     // content modification date, is readable, is writable.
     static const std::vector<ResourceKey>& urlKeys();
-    // urlKeys and the keys the record's identifier needs (is directory, is package, file ID):
+    // urlKeys and the keys the record's identifier needs (is directory, is package, file ID,
+    // volume, is regular file):
     // what a listing prefetches, all from the same status query.
     static const std::vector<ResourceKey>& listingKeys();
 

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -236,6 +237,16 @@ bool entriesAreInsideTrees(const Url& folder) {
     return false;
 }
 
+// The number `key` of `url`, false when it can't be read or has none.
+bool numberValue(const Url& url, ResourceKey key, uint64_t& value) {
+    auto read = url.resourceValue(key);
+    auto number = read.ok() ? objectCast<Number>(read.value()) : nullptr;
+    if (!number)
+        return false;
+    value = number->uint64Value();
+    return true;
+}
+
 bool boolValue(const Url& url, ResourceKey key, bool& value) {
     auto read = url.resourceValue(key);
     if (!read.ok())
@@ -276,11 +287,27 @@ void TBFileObjectIdentifier::prepareItemIdentifiers(const std::vector<Url>& urls
             (void)url.resourceValue(ResourceKeys::kFileID);  // read once, kept in the cache
             continue;
         }
-        // The service checks the type again (a regular file or a folder, never a link).
         if (OpenFolderRef open = url.openFolder()) {
-            documents.push_back({open->fd(), url.lastPathComponent()});
+            StrataService::FileName file{open->fd(), url.lastPathComponent()};
+            // A listing read the entry's identity with the rest of its status: the service needs
+            // no status query of its own.
+            uint64_t inode = 0;
+            uint64_t volume = 0;
+            bool regular = false;
+            if (numberValue(url, ResourceKeys::kFileID, inode) &&
+                numberValue(url, ResourceKeys::kVolumeIdentifier, volume) &&
+                boolValue(url, ResourceKeys::kIsRegularFile, regular)) {
+                if (!regular && !isDirectory)
+                    continue;  // a link or a special file: never a document
+                file.known = true;
+                file.device = encodeDevice(major(volume), minor(volume));
+                file.inode = inode;
+                file.regular = regular;
+            }
+            documents.push_back(std::move(file));
             folders.push_back(std::move(open));
         } else {
+            // The service checks the type (a regular file or a folder, never a link).
             documents.push_back({AT_FDCWD, url.path()});
         }
         documentUrls.push_back(&url);

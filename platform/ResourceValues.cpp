@@ -1,5 +1,7 @@
 #include "platform/ResourceValues.h"
 
+#include <sys/sysmacros.h>
+
 #include <algorithm>
 #include <cerrno>
 #include <iterator>
@@ -33,6 +35,8 @@ constexpr ResourceKey kAllKeys[] = {
     K::kIsSymbolicLink,
     K::kLinkCount,
     K::kFileID,
+    K::kVolumeIdentifier,
+    K::kIsRegularFile,
     K::kDocumentID,
 };
 
@@ -219,6 +223,10 @@ Result<std::vector<ObjectRef>> read(const std::string& path, const std::vector<R
         } else if (key == K::kFileID) {
             if (has(STATX_INO))
                 value = unsignedValue(st.stx_ino);
+        } else if (key == K::kVolumeIdentifier) {
+            value = unsignedValue(makedev(st.stx_dev_major, st.stx_dev_minor));
+        } else if (key == K::kIsRegularFile) {
+            value = Number::fromBool(S_ISREG(st.stx_mode));
         }
         values.push_back(std::move(value));
     }

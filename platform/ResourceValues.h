@@ -15,7 +15,7 @@ namespace tamber::ResourceValues {
 
 // How many keys there are, and the place of one of them among them (-1 for an unknown key):
 // what a cache of values indexes by.
-inline constexpr size_t kKeyCount = 15;
+inline constexpr size_t kKeyCount = 17;
 int indexOf(ResourceKey key);
 // The key at a place.
 ResourceKey keyAt(size_t index);

@@ -31,6 +31,9 @@ inline constexpr ResourceKey kIsPackage = "HostURLIsPackageKey";
 inline constexpr ResourceKey kIsSymbolicLink = "HostURLIsSymbolicLinkKey";
 inline constexpr ResourceKey kLinkCount = "HostURLLinkCountKey";
 inline constexpr ResourceKey kFileID = "_kHostURLFileIDKey";
+// The device number (dev_t) of the volume that holds the item itself (a mount point's own).
+inline constexpr ResourceKey kVolumeIdentifier = "HostURLVolumeIdentifierKey";
+inline constexpr ResourceKey kIsRegularFile = "HostURLIsRegularFileKey";
 inline constexpr ResourceKey kDocumentID = "HostURLDocumentIdentifierKey";
 }  // namespace ResourceKeys
 

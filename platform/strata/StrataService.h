@@ -28,6 +28,13 @@ public:
     struct FileName {
         int folder;
         std::string name;
+        // Set when the caller read the file's status moments before (a listing's entry): its
+        // volume (as encodeDevice gives it), inode and whether it is a regular file (else a
+        // package folder). The journal's service then makes no status query of its own.
+        bool known = false;
+        uint32_t device = 0;
+        uint64_t inode = 0;
+        bool regular = false;
     };
     // The same for each of `files` (a regular file or a package folder, never followed through
     // a final link), in order, with 0 for one that got no ID. The default opens each and asks

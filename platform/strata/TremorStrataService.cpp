@@ -115,6 +115,10 @@ std::vector<uint32_t> TremorStrataService::getOrAllocateDocumentIds(
     service_->sync();  // as for one file
     std::map<uint32_t, std::vector<File>> byDevice;
     for (size_t i = 0; i < files.size(); ++i) {
+        if (files[i].known) {
+            byDevice[files[i].device].push_back({i, files[i].inode, files[i].regular});
+            continue;
+        }
         // Never through a final link: what a descriptor opened O_NOFOLLOW would show, without
         // opening one per file of a page.
         struct statx st {};

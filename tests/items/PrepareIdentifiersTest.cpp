@@ -12,6 +12,7 @@
 
 #include "host/PublishedTrees.h"
 #include "host/RecordingHostPorterManager.h"
+#include "items/LocalItem.h"
 #include "items/TBFileObjectIdentifier.h"
 #include "platform/objects/Number.h"
 #include "platform/strata/TremorStrataService.h"
@@ -194,14 +195,17 @@ TEST_F(PrepareIdentifiersTest, AListedFoldersFilesAreFoundInTheOpenFolderAndLink
     std::vector<std::string> paths = writeFiles("Documents/listed", 3);
     std::string inner = dir_.writeFile("Documents/inner.txt", "i");
     ASSERT_EQ(::symlink(inner.c_str(), (storage_ + "/listed/link").c_str()), 0);
+    ASSERT_EQ(::mkfifo((storage_ + "/listed/pipe").c_str(), 0600), 0);
     std::vector<uint64_t> inodes;
     for (const auto& path : paths) inodes.push_back(inodeOf(path));
     OpenFolderRef folder = PublishedTrees::openListedFolder(storage_ + "/listed");
     ASSERT_TRUE(folder && folder->linkFree());
     std::vector<Url> urls;
-    for (const char* name : {"file-0.txt", "file-1.txt", "file-2.txt", "link"})
+    for (const char* name : {"file-0.txt", "file-1.txt", "file-2.txt", "link", "pipe"})
         urls.push_back(Url::fileURLInFolder(folder, name));
-    for (const Url& url : urls) ASSERT_TRUE(url.resourceValue(ResourceKeys::kIsDirectory).ok());
+    // As a listing does: the entries' status read relative to the folder, before the rename.
+    for (const Url& url : urls)
+        ASSERT_TRUE(url.prefetchResourceValues(LocalItem::listingKeys()).ok());
     ASSERT_EQ(::rename((storage_ + "/listed").c_str(), (storage_ + "/moved").c_str()), 0);
 
     TBFileObjectIdentifier::prepareItemIdentifiers(urls);
@@ -212,6 +216,8 @@ TEST_F(PrepareIdentifiersTest, AListedFoldersFilesAreFoundInTheOpenFolderAndLink
         EXPECT_EQ(store().documentIdForInode(inodes[i]).value(), cached) << paths[i];
     }
     EXPECT_EQ(cachedDocumentId(urls[3]), std::nullopt);
+    EXPECT_EQ(cachedDocumentId(urls[4]), std::nullopt) << "a pipe is no document";
+    EXPECT_EQ(store().documentIdForInode(inodeOf(storage_ + "/moved/pipe")).value(), std::nullopt);
     EXPECT_EQ(store().documentIdForInode(inodeOf(inner)).value(), std::nullopt)
         << "the link's target took no ID through it";
 }

@@ -94,11 +94,22 @@ TEST_F(UrlResourceValuesTest, FilesFoldersPackagesAndLinks) {
         {"file.lumen", "public.data", 0},
         {"link.lumen", "public.symlink", 0},
     };
+    ASSERT_EQ(::mkfifo((dir_ / "pipe").c_str(), 0600), 0);
     for (const auto& [name, type, isPackage] : kinds) {
         Url item = Url::fileURLWithPath(dir_ / name);
         EXPECT_EQ(stringValue(item, K::kTypeIdentifier), type) << name;
         EXPECT_EQ(flag(item, K::kIsPackage), isPackage) << name;
     }
+    // Only a file is a regular file; each item's volume is its own device (a link's, not its
+    // target's).
+    for (const char* name : {"file.lumen", "Talk.Lumen", "link.lumen", "pipe"}) {
+        struct stat st {};
+        ASSERT_EQ(::lstat((dir_ / name).c_str(), &st), 0) << name;
+        Url item = Url::fileURLWithPath(dir_ / name);
+        EXPECT_EQ(flag(item, K::kIsRegularFile), S_ISREG(st.st_mode) ? 1u : 0u) << name;
+        EXPECT_EQ(number(item, K::kVolumeIdentifier), uint64_t(st.st_dev)) << name;
+    }
+    EXPECT_EQ(flag(Url::fileURLWithPath(dir_ / "file.lumen"), K::kIsRegularFile), 1u);
     Url link = Url::fileURLWithPath(dir_ / "link.lumen");
     EXPECT_EQ(flag(link, K::kIsSymbolicLink), 1u);
     EXPECT_EQ(flag(link, K::kIsDirectory), 0u);
