@@ -10,7 +10,11 @@
 #include <thread>
 #include <vector>
 
+#include <dirent.h>
 #include <httplib.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <sys/socket.h>
 
 #include "server/HttpServer.h"
 
@@ -102,6 +106,53 @@ TEST(HttpServerTest, StopFinishesTheRequestInFlightAndDoesNotWaitForIdleConnecti
     auto after = clientFor(port);
     after->set_connection_timeout(2, 0);
     EXPECT_FALSE(after->Get("/api/v1/nothing"));
+}
+
+// Whether the connection from `remotePort` to `localPort` (this process's own socket) has
+// Nagle's algorithm off; -1 when no such socket is found.
+int noDelayOfConnection(int localPort, int remotePort) {
+    DIR* fds = ::opendir("/proc/self/fd");
+    if (!fds)
+        return -1;
+    int found = -1;
+    while (dirent* entry = ::readdir(fds)) {
+        int fd = std::atoi(entry->d_name);
+        sockaddr_in local{};
+        sockaddr_in peer{};
+        socklen_t localSize = sizeof local;
+        socklen_t peerSize = sizeof peer;
+        if (fd <= 2 || ::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0 ||
+            ::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &peerSize) != 0 ||
+            local.sin_family != AF_INET || ntohs(local.sin_port) != localPort ||
+            ntohs(peer.sin_port) != remotePort)
+            continue;
+        int value = 0;
+        socklen_t size = sizeof value;
+        if (::getsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &value, &size) == 0)
+            found = value != 0 ? 1 : 0;
+    }
+    ::closedir(fds);
+    return found;
+}
+
+// A response is written head first, then body: with Nagle's algorithm on, the body would wait
+// for the client's delayed acknowledgement (40 ms on Linux) on every request.
+TEST(HttpServerTest, ConnectionsSendWithoutWaitingForAcknowledgements) {
+    auto group = [](httplib::Server& server, std::shared_ptr<ApiContext>) {
+        server.Get(
+            "/api/v1/socket", [](const httplib::Request& request, httplib::Response& response) {
+                response.set_content(
+                    std::to_string(noDelayOfConnection(request.local_port, request.remote_port)),
+                    "text/plain");
+            });
+    };
+    HttpServer server(std::make_shared<ApiContext>(), kToken, {group});
+    ASSERT_TRUE(server.start(0).ok());
+    auto result = clientFor(server.port())->Get("/api/v1/socket");
+    ASSERT_TRUE(result);
+    EXPECT_EQ(result->status, 200);
+    EXPECT_EQ(result->body, "1") << "-1: the server's socket was not found";
+    server.stop();
 }
 
 }  // namespace
