@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/DirectoryStamp.h"
 #include "platform/FileSystem.h"
 #include "support/Mutex.h"
 #include "support/Result.h"
@@ -49,33 +50,20 @@ public:
     void clear();
     size_t listingCount() const;
 
-    // How long after a directory's last change its listing may be kept, for file systems with
-    // nanosecond stamps and with whole-second ones.
-    static constexpr int64_t kFineMarginNanoseconds = 50'000'000;
-    static constexpr int64_t kCoarseMarginNanoseconds = 2'000'000'000;
+    // How long after a directory's last change its listing may be kept.
+    static constexpr int64_t kFineMarginNanoseconds = DirectoryStamp::kFineMarginNanoseconds;
+    static constexpr int64_t kCoarseMarginNanoseconds = DirectoryStamp::kCoarseMarginNanoseconds;
 
 private:
-    struct Stamp {
-        uint32_t deviceMajor = 0;
-        uint32_t deviceMinor = 0;
-        uint64_t inode = 0;
-        int64_t mtimeSeconds = 0;
-        uint32_t mtimeNanoseconds = 0;
-        int64_t ctimeSeconds = 0;
-        uint32_t ctimeNanoseconds = 0;
-        friend bool operator==(const Stamp&, const Stamp&) = default;
-    };
     struct Kept {
         const FileSystem* fileSystem;
         std::weak_ptr<FileSystem> fileSystemAlive;
-        Stamp stamp;
+        DirectoryStamp stamp;
         Listing listing;
     };
 
-    static Result<Stamp> stampOf(FileSystem& fs, int fd, const std::string& path);
-    static bool oldEnoughToKeep(const Stamp& stamp);
-    Listing find(const FileSystem* fs, const Stamp& stamp);
-    void keep(const std::shared_ptr<FileSystem>& fs, const Stamp& stamp, Listing listing);
+    Listing find(const FileSystem* fs, const DirectoryStamp& stamp);
+    void keep(const std::shared_ptr<FileSystem>& fs, const DirectoryStamp& stamp, Listing listing);
 
     const size_t maxListings_;
     const size_t maxEntries_;

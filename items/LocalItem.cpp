@@ -10,6 +10,7 @@
 #include "host/ItemIdentifier.h"
 #include "host/UrlOperations.h"
 #include "items/AppLibraryLookup.h"
+#include "items/FolderEntryCounts.h"
 #include "items/ItemMetadata.h"
 #include "items/ResourceValueGetter.h"
 #include "items/TBFileObjectIdentifier.h"
@@ -135,16 +136,11 @@ struct StatusFields {
 // folder's link count (and btrfs always says 1), so the count that other systems read from the
 // link count is read from the folder itself here. Nothing when it can't be read.
 std::shared_ptr<const Number> countEntries(const Url& url) {
-    FileSystem& fs = FileSystem::current();
-    ScopedFd fd(fs.open(url.path(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC, 0));
-    if (!fd.ok())
-        return nullptr;
-    std::vector<FileSystem::DirectoryEntry> entries;
-    bool read = fs.readDirectory(fd.get(), entries);
-    if (!read)
+    std::optional<uint64_t> count = FolderEntryCounts::shared().count(url.path());
+    if (!count)
         return nullptr;
     // A 16-bit count, as the host's is; a larger folder says the most it can.
-    return Number::fromUInt64(std::min<uint64_t>(entries.size(), UINT16_MAX));
+    return Number::fromUInt64(std::min<uint64_t>(*count, UINT16_MAX));
 }
 
 // The status query: the inode number, and for folders the number of children. A URL made in a
