@@ -1,5 +1,4 @@
 #include "enumeration/DirectoryListingCache.h"
-#include "support/MutexLock.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -12,7 +11,7 @@ DirectoryListingCache& DirectoryListingCache::shared() {
 }
 
 DirectoryListingCache::DirectoryListingCache(size_t maxListings, size_t maxEntries)
-    : maxListings_(maxListings), maxEntries_(maxEntries) {}
+    : kept_(maxListings, maxEntries, [](const Listing& listing) { return listing->all.size(); }) {}
 
 Result<DirectoryListingCache::Listing> DirectoryListingCache::listing(const std::string& path) {
     std::shared_ptr<FileSystem> fs = FileSystem::currentShared();
@@ -25,9 +24,9 @@ Result<DirectoryListingCache::Listing> DirectoryListingCache::listing(const std:
         fs->close(fd);
         return stamp.error();
     }
-    if (Listing kept = find(fs.get(), *stamp)) {
+    if (std::optional<Listing> kept = kept_.find(fs.get(), *stamp)) {
         fs->close(fd);
-        return kept;
+        return *kept;
     }
 
     auto entries = std::make_shared<Entries>();
@@ -52,59 +51,15 @@ Result<DirectoryListingCache::Listing> DirectoryListingCache::listing(const std:
     // The stamp was taken before the read: a change made during the read shows as a newer
     // stamp next time, so the listing is never served for a directory it does not describe.
     if (stamp->oldEnoughToKeep())
-        keep(fs, *stamp, listing);
+        kept_.keep(fs, *stamp, listing);
     return listing;
 }
 
-DirectoryListingCache::Listing DirectoryListingCache::find(const FileSystem* fs,
-                                                           const DirectoryStamp& stamp) {
-    MutexLock lock(mutex_);
-    for (auto it = kept_.begin(); it != kept_.end(); ++it) {
-        if (it->fileSystem != fs || !it->stamp.sameDirectory(stamp))
-            continue;
-        if (it->stamp != stamp || it->fileSystemAlive.expired()) {
-            keptEntries_ -= it->listing->all.size();
-            kept_.erase(it);
-            return nullptr;
-        }
-        kept_.splice(kept_.begin(), kept_, it);
-        return kept_.front().listing;
-    }
-    return nullptr;
-}
-
-void DirectoryListingCache::keep(const std::shared_ptr<FileSystem>& fs, const DirectoryStamp& stamp,
-                                 Listing listing) {
-    if (maxListings_ == 0)
-        return;
-    MutexLock lock(mutex_);
-    // Another thread may have read the same directory meanwhile.
-    for (auto it = kept_.begin(); it != kept_.end(); ++it) {
-        if (it->fileSystem == fs.get() && it->stamp.sameDirectory(stamp)) {
-            keptEntries_ -= it->listing->all.size();
-            kept_.erase(it);
-            break;
-        }
-    }
-    keptEntries_ += listing->all.size();
-    kept_.push_front(Kept{fs.get(), fs, stamp, std::move(listing)});
-    // The newest stays even when it alone is over the bound: it is the folder being listed, and
-    // reading a folder of a million entries again for each of its pages would make every page
-    // cost the whole folder.
-    while (kept_.size() > 1 && (kept_.size() > maxListings_ || keptEntries_ > maxEntries_)) {
-        keptEntries_ -= kept_.back().listing->all.size();
-        kept_.pop_back();
-    }
-}
-
 void DirectoryListingCache::clear() {
-    MutexLock lock(mutex_);
     kept_.clear();
-    keptEntries_ = 0;
 }
 
 size_t DirectoryListingCache::listingCount() const {
-    MutexLock lock(mutex_);
     return kept_.size();
 }
 

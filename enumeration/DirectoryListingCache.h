@@ -9,7 +9,7 @@
 
 #include "platform/DirectoryStamp.h"
 #include "platform/FileSystem.h"
-#include "support/Mutex.h"
+#include "platform/StampedDirectoryCache.h"
 #include "support/Result.h"
 
 namespace tamber {
@@ -55,21 +55,10 @@ public:
     static constexpr int64_t kCoarseMarginNanoseconds = DirectoryStamp::kCoarseMarginNanoseconds;
 
 private:
-    struct Kept {
-        const FileSystem* fileSystem;
-        std::weak_ptr<FileSystem> fileSystemAlive;
-        DirectoryStamp stamp;
-        Listing listing;
-    };
-
-    Listing find(const FileSystem* fs, const DirectoryStamp& stamp);
-    void keep(const std::shared_ptr<FileSystem>& fs, const DirectoryStamp& stamp, Listing listing);
-
-    const size_t maxListings_;
-    const size_t maxEntries_;
-    mutable Mutex mutex_;
-    std::list<Kept> kept_ GUARDED_BY(mutex_);  // most recently used first
-    size_t keptEntries_ GUARDED_BY(mutex_) = 0;
+    // A folder over the bound of entries is still kept, alone: it is the folder being listed,
+    // and reading a folder of a million entries again for each of its pages would make every
+    // page cost the whole folder.
+    StampedDirectoryCache<Listing> kept_;
 };
 
 }  // namespace tamber

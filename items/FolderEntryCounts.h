@@ -2,14 +2,13 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <list>
 #include <memory>
 #include <optional>
 #include <string>
 
 #include "platform/DirectoryStamp.h"
 #include "platform/FileSystem.h"
-#include "support/Mutex.h"
+#include "platform/StampedDirectoryCache.h"
 
 namespace tamber {
 
@@ -39,20 +38,8 @@ public:
     size_t keptCount() const;
 
 private:
-    struct Kept {
-        const FileSystem* fileSystem;
-        std::weak_ptr<FileSystem> fileSystemAlive;
-        DirectoryStamp stamp;
-        uint64_t count;
-    };
-
-    std::optional<uint64_t> find(const FileSystem* fs, const DirectoryStamp& stamp);
-    void keep(const std::shared_ptr<FileSystem>& fs, const DirectoryStamp& stamp, uint64_t count);
-
-    const size_t capacity_;
     const uint64_t minimumKept_;
-    mutable Mutex mutex_;
-    std::list<Kept> kept_ GUARDED_BY(mutex_);  // most recently used first
+    StampedDirectoryCache<uint64_t> kept_;
 };
 
 }  // namespace tamber
