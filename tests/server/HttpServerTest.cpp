@@ -155,6 +155,34 @@ TEST(HttpServerTest, ConnectionsSendWithoutWaitingForAcknowledgements) {
     server.stop();
 }
 
+// On loopback an answer is sent as it is, whatever the client accepts: the library's brotli
+// took 180 ms for a page of 200 records.
+TEST(HttpServerTest, AnswersAreNotCompressed) {
+    const std::string body = "{\"items\":[" + std::string(20000, ' ') + "]}";
+    auto group = [body](httplib::Server& server, std::shared_ptr<ApiContext>) {
+        server.Get("/api/v1/big", [body](const httplib::Request&, httplib::Response& response) {
+            response.set_content(body, "application/json");
+        });
+        server.Get("/page.html", [](const httplib::Request&, httplib::Response& response) {
+            response.set_content(std::string(5000, 'x'), "text/html");
+        });
+    };
+    HttpServer server(std::make_shared<ApiContext>(), kToken, {group});
+    ASSERT_TRUE(server.start(0).ok());
+    auto client = clientFor(server.port());
+    for (const char* path : {"/api/v1/big", "/page.html"}) {
+        auto result = client->Get(path, {{"Accept-Encoding", "br, gzip, deflate"}});
+        ASSERT_TRUE(result) << path;
+        EXPECT_EQ(result->status, 200) << path;
+        EXPECT_FALSE(result->has_header("Content-Encoding"))
+            << path << ": " << result->get_header_value("Content-Encoding");
+    }
+    auto json = client->Get("/api/v1/big", {{"Accept-Encoding", "br"}});
+    ASSERT_TRUE(json);
+    EXPECT_EQ(json->body, body);
+    server.stop();
+}
+
 }  // namespace
 }  // namespace tamber
 
