@@ -245,22 +245,27 @@ void TremorReader::receiveBatch(size_t numEvents, const ObjectRef& paths, const 
     const size_t available = array ? std::min(numEvents, array->count()) : 0;
     if (verbose_)
         logDebug([&] { return "tremor: received " + std::to_string(numEvents) + " events"; });
-    // A batch names many files of a few folders: each folder is checked once.
-    PublishedTrees::CheckedFolders checkedFolders;
-    if (array)
-        prepareBatch(*array, flags, available);
-    for (size_t i = 0; i < available && !stopping_.load(); ++i) {
+    // Each entry is decoded once, for the preparation and for the reports.
+    std::vector<BatchEntry> entries(available);
+    for (size_t i = 0; i < available; ++i) {
         auto entry = objectCast<Dictionary>(array->objects()[i]);
         auto path = entry ? objectCast<String>(entry->objectForKey("path")) : nullptr;
-        if (!path) {
+        if (!path)
+            continue;
+        entries[i].path = &path->value();
+        if (auto number = objectCast<Number>(entry->objectForKey("fileID")))
+            entries[i].fileID = number->uint64Value();
+    }
+    // A batch names many files of a few folders: each folder is checked once.
+    PublishedTrees::CheckedFolders checkedFolders;
+    prepareBatch(entries, flags);
+    for (size_t i = 0; i < available && !stopping_.load(); ++i) {
+        if (!entries[i].path) {
             logError("ignore event " + std::to_string(ids[i]) +
                      " because no path can be extracted");
             continue;
         }
-        std::optional<uint64_t> fileID;
-        if (auto number = objectCast<Number>(entry->objectForKey("fileID")))
-            fileID = number->uint64Value();
-        processEvent(path->value(), fileID, flags[i], ids[i], i, numEvents);
+        processEvent(*entries[i].path, entries[i].fileID, flags[i], ids[i], i, numEvents);
     }
     batchItemsByFileID_.clear();
     batchItemsByPath_.clear();
@@ -423,32 +428,28 @@ void TremorReader::processPathEvent(const std::string& path, std::optional<uint6
     recordEventID(eventID);
 }
 
-void TremorReader::prepareBatch(const Array& entries, const uint32_t* flags, size_t count) {
+void TremorReader::prepareBatch(const std::vector<BatchEntry>& entries, const uint32_t* flags) {
     constexpr uint32_t kStreamFlags =
         kTremorEventIdsWrapped | kTremorUserDropped | kTremorKernelDropped | kTremorHistoryDone;
     std::vector<Url> urls;
     // The storage's volume, looked up once for the batch's file IDs.
     std::optional<uint32_t> device;
-    for (size_t i = 0; i < count; ++i) {
+    for (size_t i = 0; i < entries.size(); ++i) {
         // The same choices as classifyEvent and processPathEvent make.
-        if (flags[i] & kStreamFlags)
+        const std::string* path = entries[i].path;
+        if ((flags[i] & kStreamFlags) || !path || DocIDPath::mentionsDocumentIds(*path))
             continue;
-        auto entry = objectCast<Dictionary>(entries.objects()[i]);
-        auto path = entry ? objectCast<String>(entry->objectForKey("path")) : nullptr;
-        if (!path || DocIDPath::mentionsDocumentIds(path->value()))
-            continue;
-        Url url = Url::fileURLWithPath(path->value());
+        Url url = Url::fileURLWithPath(*path);
         if (isHidden(url) || url.lastPathComponent() == "Documents")
             continue;
-        if (auto number = objectCast<Number>(entry->objectForKey("fileID"))) {
-            auto [it, inserted] = batchURLsByFileID_.try_emplace(number->uint64Value());
+        if (const std::optional<uint64_t>& fileID = entries[i].fileID) {
+            auto [it, inserted] = batchURLsByFileID_.try_emplace(*fileID);
             if (!inserted)
                 continue;
             if (!device)
                 device = TBFileObjectIdentifier::storageDeviceID();
             if (*device != 0)
-                it->second = TBFileObjectIdentifier::_fileURLWithFileIdentifier(
-                    number->uint64Value(), *device);
+                it->second = TBFileObjectIdentifier::_fileURLWithFileIdentifier(*fileID, *device);
             if (it->second)
                 urls.push_back(*it->second);
         } else if (batchURLsByPath_.try_emplace(url.path(), url).second) {

@@ -17,8 +17,6 @@
 
 namespace tamber {
 
-class Array;
-
 enum class TremorReaderMode : uint8_t { pathBased = 0, docIDBased = 1 };
 const char* tremorReaderModeName(TremorReaderMode mode);  // "pathBased" / "docIDBased"
 
@@ -107,10 +105,15 @@ private:
     // after it was read comes as a later event.
     LocalItemRef itemWithFileIdentifier(uint64_t fileID);
     LocalItemRef itemAt(const Url& url);
+    // One event of a batch as the stream sent it: no path when its entry had none.
+    struct BatchEntry {
+        const std::string* path = nullptr;  // in the batch's array, alive while it is handled
+        std::optional<uint64_t> fileID;
+    };
     // Before a batch's events are reported: finds the files they name and gives the documents
     // among them their IDs in one go (a burst of new files would otherwise cost a transaction
     // each). Only events that will build an item are looked at.
-    void prepareBatch(const Array& entries, const uint32_t* flags, size_t count);
+    void prepareBatch(const std::vector<BatchEntry>& entries, const uint32_t* flags);
     std::shared_ptr<TremorReaderDelegate> delegate() const;
     void recordEventID(uint64_t eventID);
 
