@@ -1,3 +1,6 @@
+#include <fcntl.h>
+#include <sys/stat.h>
+
 #include <algorithm>
 #include <atomic>
 #include <limits>
@@ -48,6 +51,17 @@ void restamp(const Url& url) {
     (void)ItemMetadata::writeTrashDate(url, Date::now());
 }
 
+// A symbolic link can carry no attributes, so it has no trash date: it ages from its last
+// status change, which moving it into the trash made. Nothing for anything else.
+std::shared_ptr<const Date> linkTrashDate(FileSystem& fileSystem, const Url& url) {
+    struct statx st {};
+    if (fileSystem.statx(AT_FDCWD, url.path(), AT_SYMLINK_NOFOLLOW, STATX_TYPE | STATX_CTIME,
+                         &st) != 0 ||
+        !S_ISLNK(st.stx_mode))
+        return nullptr;
+    return Date::make(double(st.stx_ctime.tv_sec) + st.stx_ctime.tv_nsec / 1e9);
+}
+
 }  // namespace
 
 void LocalPorter::_removeTrashedItemsOlderThanDate(std::shared_ptr<const Date> referenceDate,
@@ -84,14 +98,17 @@ void LocalPorter::sweepTrash(std::shared_ptr<const Date> referenceDate,
                    DirectoryEnumerationOption::kSkipsSubdirectoryDescendants;
         };
         walk.enumerate([&](const Url& url) {
-            auto data = ReadXattrData(LocalItem::xattrTrashDateName(), url);
-            if (!data) {
+            std::shared_ptr<const Date> trashDate = linkTrashDate(*services_.fileSystem, url);
+            auto data =
+                trashDate ? std::nullopt : ReadXattrData(LocalItem::xattrTrashDateName(), url);
+            if (!trashDate && !data) {
                 logDebug([&] {
                     return "can't find trash date for URL \"" + url.path() + "\"; set current date";
                 });
                 return restamp(url);
             }
-            auto trashDate = UnarchiveLogged<Date>(*data);
+            if (!trashDate)
+                trashDate = UnarchiveLogged<Date>(*data);
             if (!trashDate) {
                 logError("can't unarchive xattr data for URL \"" + url.path() +
                          "\"; set current date");

@@ -126,6 +126,22 @@ TEST_F(AutoDeletionTest, ItemsWithoutAReadableDateAreRestampedAndGoLater) {
     EXPECT_FALSE(std::filesystem::exists(broken));
 }
 
+// A symbolic link can carry no attributes, so it can hold no trash date: it ages from when it
+// was moved into the trash (its status change), or a trashed link would stay there forever.
+TEST_F(AutoDeletionTest, ATrashedLinkAgesFromWhenItWasMovedThere) {
+    std::string link = libraryTrash() + "/shortcut";
+    std::filesystem::create_directories(libraryTrash());
+    std::filesystem::create_symlink("/etc/passwd", link);
+    publishWithParents(link);
+
+    sweep(Date::make(Date::now()->timeIntervalSince1970() - 3600));
+    EXPECT_TRUE(std::filesystem::is_symlink(link)) << "it was moved there only now";
+    sweep(Date::make(Date::now()->timeIntervalSince1970() + 1));
+    EXPECT_FALSE(std::filesystem::is_symlink(link));
+    EXPECT_TRUE(std::filesystem::exists("/etc/passwd"));
+    EXPECT_EQ(log->countStartingWith("[ERROR] can't set xattr"), 0u);
+}
+
 TEST_F(AutoDeletionTest, ATrashedFolderIsOneItemAndHiddenEntriesAreLeftAlone) {
     std::string folder = libraryTrash() + "/Old";
     writeFile(folder + "/inner/a.txt");
