@@ -7,6 +7,7 @@
 #include "applibraries/LocalAppLibraryManager.h"
 #include "fs/CanonicalUUID.h"
 #include "fs/DocIDPath.h"
+#include "fs/FolderDescendants.h"
 #include "fs/TremorChecker.h"
 #include "host/HostPorterManager.h"
 #include "host/PublishedTrees.h"
@@ -415,6 +416,8 @@ void TremorReader::processPathEvent(const std::string& path, std::optional<uint6
             logDebug([&] { return "did change " + item->description(); });
         if (auto target = delegate())
             target->readerDidChange(*this, item, url);
+        if ((flags & kTremorItemRenamed) && item->isFolder() && !item->isPackage())
+            reportContentsCrossingTheTrash(*item, url);
     } else if (!fileID) {
         if (verbose_)
             logDebug([&] { return "dropping tremor at \"" + path + "\"; No object at path"; });
@@ -481,6 +484,39 @@ LocalItemRef TremorReader::itemAt(const Url& url) {
     return it->second;
 }
 
+void TremorReader::reportContentsCrossingTheTrash(const LocalItem& folder, const Url& eventURL) {
+    // The working set holds a trash's top level but not what trashed folders hold: their
+    // contents leave it with them and come back when they are put back.
+    bool trashed = isTrashTop(folder.fileURL());
+    if (!trashed && !isTrashTop(eventURL))
+        return;
+    auto target = delegate();
+    if (!target)
+        return;
+    forEachVisibleDescendant(folder.fileURL(), [&](const Url& url) {
+        LocalItemRef item = LocalItem::make(url);
+        if (!item)
+            return false;
+        if (trashed)
+            target->readerDidDelete(*this, item->itemIdentifier(), url);
+        else
+            target->readerDidChange(*this, item, url);
+        return !item->isPackage();
+    });
+}
+
+bool TremorReader::isTrashTop(const Url& url) const {
+    std::vector<std::string> components = url.pathComponents();
+    for (const Url& root : urls_) {
+        std::vector<std::string> rootComponents = root.pathComponents();
+        if (rootComponents.size() + 2 == components.size() &&
+            std::equal(rootComponents.begin(), rootComponents.end(), components.begin()) &&
+            components[rootComponents.size()] == ".Trash")
+            return true;
+    }
+    return false;
+}
+
 bool TremorReader::isHidden(const Url& url) const {
     streamQueue_->assertCurrent();
     std::vector<std::string> components = url.pathComponents();
@@ -490,8 +526,16 @@ bool TremorReader::isHidden(const Url& url) const {
             !std::equal(rootComponents.begin(), rootComponents.end(), components.begin()))
             continue;
         for (size_t i = rootComponents.size(); i < components.size(); ++i) {
-            if (!components[i].empty() && components[i][0] == '.')
+            if (components[i].empty() || components[i][0] != '.')
+                continue;
+            // The top level of a root's trash is in the working set: what leaves it must be
+            // told, or a trashed folder deleted for good would stay in the host's view.
+            bool trashTop = i == rootComponents.size() && components[i] == ".Trash" &&
+                            i + 2 == components.size() && !components[i + 1].empty() &&
+                            components[i + 1][0] != '.';
+            if (!trashTop)
                 return true;
+            ++i;
         }
         return false;
     }

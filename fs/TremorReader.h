@@ -98,6 +98,13 @@ private:
                           uint64_t eventID);
     // On streamQueue_: the loss of history owed by a start from an ID no journal hands out.
     void reportLostHistory();
+    // When a folder moved into a trash's top level, its contents are reported deleted; when it
+    // moved out of one, they are reported changed.
+    void reportContentsCrossingTheTrash(const LocalItem& folder, const Url& eventURL);
+    // Whether `url` is an entry of the top level of a root's trash.
+    bool isTrashTop(const Url& url) const;
+    // Whether a component of `url` below its root starts with a dot; the top level of the root's
+    // trash is not hidden.
     bool isHidden(const Url& url) const;
     // The item of a file as this batch found it. A batch often names the same file many times
     // (created, written, closed, its attributes set); the record read from the disk for the

@@ -136,5 +136,70 @@ TEST_F(OperationsEndToEndTest, EveryOperationShowsOnDiskAndInTheChangesThatFollo
     EXPECT_FALSE(replica.contains(reports->itemIdentifier()));
 }
 
+// The top level of a trash is in the working set, so what leaves it must leave the host's view
+// too: folders and links are known by their file IDs, and only their path events tell of it.
+TEST_F(OperationsEndToEndTest, WhatIsDeletedFromTheTrashLeavesTheHostsView) {
+    fs::create_directories(library + "/Old/inner");
+    write(library + "/Old/inner/note.txt", "note");
+    fs::create_symlink("/etc/passwd", library + "/shortcut");
+    auto made =
+        porter->enumeratorForContainerItemIdentifier(HostPorterWorkingSetContainerItemIdentifier);
+    ASSERT_TRUE(made.ok());
+    enumerator = made.value();
+    HostPorterSyncAnchor anchor = currentAnchor();
+    listEverything();
+    std::vector<HostPorterItemIdentifier> trashed;
+    for (const char* name : {"Old", "shortcut"}) {
+        auto item = LocalItem::make(Url::fileURLWithPath(library + "/" + name));
+        ASSERT_TRUE(item);
+        ok(run([&](auto done) { porter->trashItemWithIdentifier(item->itemIdentifier(), done); }));
+        trashed.push_back(item->itemIdentifier());
+    }
+    TremorService::shared().value()->sync();
+    catchUp(anchor);
+    expectSameView(replica, disk(), "after trashing");
+    ASSERT_TRUE(replica.contains(trashed[0]) && replica.contains(trashed[1]));
+
+    EXPECT_FALSE(remove(trashed[0]));
+    fs::remove(library + "/.Trash/shortcut");  // another program empties the trash
+    TremorService::shared().value()->sync();
+    catchUp(anchor);
+    expectSameView(replica, disk(), "after deleting from the trash");
+    EXPECT_FALSE(replica.contains(trashed[0]));
+    EXPECT_FALSE(replica.contains(trashed[1]));
+}
+
+// What a trashed folder holds leaves the working set with it, and comes back when it is put back.
+TEST_F(OperationsEndToEndTest, AFolderPutBackBringsItsContentsBack) {
+    fs::create_directories(library + "/Old/inner");
+    write(library + "/Old/inner/note.txt", "note");
+    TremorService::shared().value()->sync();
+    auto made =
+        porter->enumeratorForContainerItemIdentifier(HostPorterWorkingSetContainerItemIdentifier);
+    ASSERT_TRUE(made.ok());
+    enumerator = made.value();
+    HostPorterSyncAnchor anchor = currentAnchor();
+    catchUp(anchor);
+    listEverything();
+    auto old = LocalItem::make(Url::fileURLWithPath(library + "/Old"));
+    auto note = LocalItem::make(Url::fileURLWithPath(library + "/Old/inner/note.txt"));
+    ASSERT_TRUE(old && note);
+    ASSERT_TRUE(replica.contains(note->itemIdentifier()));
+
+    ok(run([&](auto done) { porter->trashItemWithIdentifier(old->itemIdentifier(), done); }));
+    TremorService::shared().value()->sync();
+    catchUp(anchor);
+    expectSameView(replica, disk(), "after trashing");
+    EXPECT_FALSE(replica.contains(note->itemIdentifier()));
+
+    ok(run([&](auto done) {
+        porter->untrashItemWithIdentifier(old->itemIdentifier(), std::nullopt, done);
+    }));
+    TremorService::shared().value()->sync();
+    catchUp(anchor);
+    expectSameView(replica, disk(), "after putting back");
+    EXPECT_TRUE(replica.contains(note->itemIdentifier()));
+}
+
 }  // namespace
 }  // namespace tamber
