@@ -82,6 +82,12 @@ void FaultInjectingFileSystem::inject(Operation op, int errnoValue, int times,
     injections_.push_back({op, errnoValue, times, std::move(pathSubstring)});
 }
 
+void FaultInjectingFileSystem::injectAfter(Operation op, int errnoValue, int pass,
+                                           std::string pathSubstring) {
+    MutexLock lock(mutex_);
+    injections_.push_back({op, errnoValue, 1, std::move(pathSubstring), pass});
+}
+
 void FaultInjectingFileSystem::clearInjections() {
     MutexLock lock(mutex_);
     injections_.clear();
@@ -135,6 +141,10 @@ bool FaultInjectingFileSystem::shouldFail(Operation op, const Subject& subject) 
             }
             if (path.find(it->pathSubstring) == std::string::npos)
                 continue;
+        }
+        if (it->pass > 0) {
+            --it->pass;
+            return false;
         }
         int errnoValue = it->errnoValue;
         if (it->remaining > 0 && --it->remaining == 0)

@@ -54,6 +54,9 @@ public:
     // directory descriptor, that directory's path, "/", and the name. An empty substring matches
     // every call. Injections are tried in the order they were made.
     void inject(Operation op, int errnoValue, int times = 1, std::string pathSubstring = "");
+    // Lets the next `pass` matching calls of `op` through, then fails one: a fault in the
+    // middle of an operation rather than at its first call.
+    void injectAfter(Operation op, int errnoValue, int pass, std::string pathSubstring = "");
     void clearInjections();
     // Injected failures not yet used up (forever-injections count as one).
     size_t pendingInjections() const;
@@ -100,6 +103,7 @@ private:
         int errnoValue;
         int remaining;
         std::string pathSubstring;
+        int pass = 0;  // matching calls let through first
     };
     // A path, or how to build it when an injection needs to look at it.
     struct Subject {

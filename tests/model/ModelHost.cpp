@@ -1,0 +1,223 @@
+#include "tests/model/ModelHost.h"
+
+#include <sys/inotify.h>
+
+#include <cstring>
+#include <mutex>
+
+#include "host/HostPorterChangeObserver.h"
+#include "host/HostPorterEnumerationObserver.h"
+#include "platform/LinuxFileSystem.h"
+#include "platform/tremors/TremorService.h"
+#include "support/DispatchSemaphore.h"
+#include "support/Error.h"
+
+namespace tamber::model {
+
+namespace {
+
+// Only a hang gets near it.
+constexpr double kPatience = 60;
+
+struct PageRecorder : HostPorterEnumerationObserver {
+    void didEnumerateItems(const std::vector<HostPorterItemRef>& page) override {
+        items.insert(items.end(), page.begin(), page.end());
+    }
+    void finishEnumeratingUpToPage(const std::optional<HostPorterPage>& page) override {
+        next = page;
+        done.signal();
+    }
+    void finishEnumeratingWithError(const Error& e) override {
+        error = e;
+        done.signal();
+    }
+    std::vector<HostPorterItemRef> items;
+    std::optional<HostPorterPage> next;
+    std::optional<Error> error;
+    DispatchSemaphore done;
+};
+
+struct BatchRecorder : HostPorterChangeObserver {
+    // In the order they came: a deletion and a later update of the same identifier must be
+    // applied in that order.
+    void didUpdateItems(const std::vector<HostPorterItemRef>& items) override {
+        std::lock_guard lock(mutex);
+        for (const auto& item : items) changes.push_back({item, {}});
+    }
+    void didDeleteItemsWithIdentifiers(const std::vector<HostPorterItemIdentifier>& ids) override {
+        std::lock_guard lock(mutex);
+        for (const auto& id : ids) changes.push_back({nullptr, id});
+    }
+    void finishEnumeratingChangesUpToSyncAnchor(const HostPorterSyncAnchor& a, bool more) override {
+        {
+            std::lock_guard lock(mutex);
+            anchor = a;
+            moreComing = more;
+        }
+        done.signal();
+    }
+    void finishEnumeratingWithError(const Error& e) override {
+        {
+            std::lock_guard lock(mutex);
+            error = e;
+        }
+        done.signal();
+    }
+    std::mutex mutex;
+    std::vector<std::pair<HostPorterItemRef, HostPorterItemIdentifier>> changes;
+    HostPorterSyncAnchor anchor;
+    bool moreComing = false;
+    std::optional<Error> error;
+    DispatchSemaphore done;
+};
+
+}  // namespace
+
+ssize_t OverflowingInotify::read(int fd, void* buffer, size_t size) {
+    if (size >= sizeof(inotify_event) && overflowNext.exchange(false)) {
+        inotify_event overflow{};
+        overflow.wd = -1;
+        overflow.mask = IN_Q_OVERFLOW;
+        std::memcpy(buffer, &overflow, sizeof overflow);
+        return sizeof overflow;
+    }
+    return real_->read(fd, buffer, size);
+}
+
+ModelHost::ModelHost(std::string storage, std::string state)
+    : storage_(std::move(storage)),
+      state_(std::move(state)),
+      faults_(std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>())) {}
+
+ModelHost::~ModelHost() {
+    stop();
+}
+
+std::string ModelHost::start() {
+    if (runtime_)
+        return "";
+    ProviderRuntimeOptions options;
+    options.storagePath = storage_;
+    options.stateDir = state_;
+    options.inotify = inotify_;
+    options.fileSystem = faults_;
+    runtime_ = std::make_unique<ProviderRuntime>(options);
+    auto journal = runtime_->startJournal();
+    if (!journal.ok())
+        return "the journal did not start: " + journal.error().description();
+    journal_ = journal.value();
+    auto porter = runtime_->provider();
+    if (!porter.ok())
+        return "the provider did not start: " + porter.error().description();
+    porter_ = porter.value();
+    enumerator_ = nullptr;
+    return "";
+}
+
+void ModelHost::stop(bool midEnumeration) {
+    if (!runtime_)
+        return;
+    if (midEnumeration && anchor_) {
+        if (auto enumerator = workingSet())
+            enumerator->enumerateChangesForObserver(std::make_shared<BatchRecorder>(), *anchor_);
+    }
+    if (enumerator_)
+        enumerator_->invalidate();
+    enumerator_ = nullptr;
+    porter_ = nullptr;
+    journal_ = nullptr;
+    runtime_->shutdown();
+    runtime_ = nullptr;
+}
+
+void ModelHost::sync() {
+    if (journal_)
+        journal_->sync();
+}
+
+HostPorterEnumeratorRef ModelHost::workingSet() {
+    if (!enumerator_ && porter_) {
+        auto made = porter_->enumeratorForContainerItemIdentifier(
+            HostPorterWorkingSetContainerItemIdentifier);
+        if (made.ok())
+            enumerator_ = made.value();
+    }
+    return enumerator_;
+}
+
+std::string ModelHost::relist() {
+    auto enumerator = workingSet();
+    if (!enumerator)
+        return "no working-set enumerator";
+    ++relists_;
+    // The anchor comes first, so that what changes during the listing is asked for again.
+    std::optional<HostPorterSyncAnchor> anchor;
+    DispatchSemaphore got;
+    enumerator->currentSyncAnchorWithCompletionHandler([&](auto value) {
+        anchor = value;
+        got.signal();
+    });
+    if (!got.wait(kPatience) || !anchor)
+        return "no current sync anchor";
+    Replica fresh;
+    HostPorterPage page = HostPorterInitialPageSortedByName();
+    for (int pages = 0;; ++pages) {
+        if (pages > 10000)
+            return "the listing never ended";
+        auto recorder = std::make_shared<PageRecorder>();
+        enumerator->enumerateItemsForObserver(recorder, page);
+        if (!recorder->done.wait(kPatience))
+            return "a listing page never finished";
+        if (recorder->error)
+            return "listing failed: " + recorder->error->description();
+        for (const auto& item : recorder->items)
+            fresh[item->itemIdentifier()] = {item->filename(), item->parentItemIdentifier()};
+        if (!recorder->next)
+            break;
+        page = *recorder->next;
+    }
+    replica_ = std::move(fresh);
+    anchor_ = anchor;
+    return "";
+}
+
+std::string ModelHost::catchUp() {
+    if (!anchor_) {
+        std::string failed = relist();
+        if (!failed.empty())
+            return failed;
+    }
+    auto enumerator = workingSet();
+    if (!enumerator)
+        return "no working-set enumerator";
+    for (int requests = 0; requests < 1000; ++requests) {
+        auto recorder = std::make_shared<BatchRecorder>();
+        enumerator->enumerateChangesForObserver(recorder, *anchor_);
+        if (!recorder->done.wait(kPatience))
+            return "a change enumeration never finished";
+        std::lock_guard lock(recorder->mutex);
+        if (recorder->error) {
+            if (recorder->error->domain() == kHostPorterErrorDomain &&
+                recorder->error->code() == kHostPorterSyncAnchorExpired) {
+                anchor_.reset();
+                std::string failed = relist();
+                if (!failed.empty())
+                    return failed;
+                continue;
+            }
+            return "changes failed: " + recorder->error->description();
+        }
+        for (const auto& [item, deleted] : recorder->changes) {
+            if (item)
+                replica_[item->itemIdentifier()] = {item->filename(), item->parentItemIdentifier()};
+            else
+                replica_.erase(deleted);
+        }
+        anchor_ = recorder->anchor;
+        if (!recorder->moreComing)
+            return "";
+    }
+    return "changes never caught up";
+}
+
+}  // namespace tamber::model

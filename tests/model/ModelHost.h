@@ -1,0 +1,97 @@
+#pragma once
+
+#include <atomic>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "host/HostPorterEnumerator.h"
+#include "platform/FaultInjectingFileSystem.h"
+#include "platform/tremors/InotifyApi.h"
+#include "provider/LocalPorter.h"
+#include "runtime/ProviderRuntime.h"
+
+namespace tamber::model {
+
+// The system's inotify calls, except that the next read can be made to report a queue overflow
+// (the kernel dropped events) before what really happened.
+class OverflowingInotify : public InotifyApi {
+public:
+    std::atomic<bool> overflowNext{false};
+
+    int init(int flags) override { return real_->init(flags); }
+    int addWatch(int fd, const std::string& path, uint32_t mask) override {
+        return real_->addWatch(fd, path, mask);
+    }
+    int removeWatch(int fd, int wd) override { return real_->removeWatch(fd, wd); }
+    ssize_t read(int fd, void* buffer, size_t size) override;
+    int queuedBytes(int fd) override { return real_->queuedBytes(fd); }
+    int eventfd(unsigned int initial, int flags) override { return real_->eventfd(initial, flags); }
+    int signal(int eventFd) override { return real_->signal(eventFd); }
+    int poll(struct pollfd* fds, nfds_t count, int timeoutMs) override {
+        return real_->poll(fds, count, timeoutMs);
+    }
+    int close(int fd) override { return real_->close(fd); }
+
+private:
+    std::shared_ptr<InotifyApi> real_ = InotifyApi::system();
+};
+
+// What a browser keeps of the working set: each item's name and parent, by identifier.
+struct ReplicaEntry {
+    std::string filename;
+    HostPorterItemIdentifier parent;
+    friend bool operator==(const ReplicaEntry&, const ReplicaEntry&) = default;
+};
+using Replica = std::map<HostPorterItemIdentifier, ReplicaEntry>;
+
+// A host over the model test's storage: a runtime with its own journal (restartable), a file
+// system that can be made to fail, inotify that can be made to overflow, and a replica of the
+// working set built from one listing and then only from change enumerations, applied in the
+// order sent; an expired anchor makes it list again, as a host must.
+class ModelHost {
+public:
+    // `storage` is the document storage folder, `state` the journal's folder.
+    ModelHost(std::string storage, std::string state);
+    ~ModelHost();
+
+    // Starts a runtime and its provider. An empty string on success, else what failed.
+    std::string start();
+    // Shuts the runtime down. With `midEnumeration`, a change enumeration is asked for first
+    // and left running, as a host stopped at any moment would.
+    void stop(bool midEnumeration = false);
+    bool running() const { return runtime_ != nullptr; }
+
+    LocalPorter& porter() { return *porter_; }
+    FaultInjectingFileSystem& faults() { return *faults_; }
+    OverflowingInotify& inotify() { return *inotify_; }
+
+    // Waits until the journal holds every change made before the call.
+    void sync();
+    // Lists the whole working set afresh.
+    std::string relist();
+    // Asks for changes until caught up; an expired anchor relists. Empty on success.
+    std::string catchUp();
+    const Replica& replica() const { return replica_; }
+    // How often the host had to list again since it started.
+    int relists() const { return relists_; }
+
+private:
+    HostPorterEnumeratorRef workingSet();
+
+    const std::string storage_;
+    const std::string state_;
+    std::shared_ptr<FaultInjectingFileSystem> faults_;
+    std::shared_ptr<OverflowingInotify> inotify_ = std::make_shared<OverflowingInotify>();
+    std::unique_ptr<ProviderRuntime> runtime_;
+    std::shared_ptr<LocalPorter> porter_;
+    std::shared_ptr<TremorService> journal_;
+    HostPorterEnumeratorRef enumerator_;
+
+    Replica replica_;
+    std::optional<HostPorterSyncAnchor> anchor_;  // none: list first
+    int relists_ = 0;
+};
+
+}  // namespace tamber::model

@@ -1,0 +1,67 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "host/HostPorterExtension.h"
+#include "tests/model/ModelWorld.h"
+
+namespace tamber::model {
+
+// The steps of a model run. Step `index` of a seed is drawn from its own generator, so a list
+// of step indices replays the same steps whichever others are dropped; a step whose target is
+// missing (dropped with the step that made it) does nothing.
+//
+// Three families: changes made by another program with ordinary system calls, provider
+// operations as a host calls them (some at once from several threads, some with a file-system
+// call made to fail), and disturbances (a restart of the journal and provider, a dropped
+// inotify queue).
+class ModelSteps {
+public:
+    explicit ModelSteps(ModelWorld& world) : world_(world) {}
+
+    // Runs one step; returns what it found wrong (empty when nothing). `description` says what
+    // the step did, for the failure report.
+    std::string run(uint64_t seed, uint64_t index, std::string& description);
+
+    // Operations that reported an error although no fault was injected, for the summary.
+    int unexpectedErrors() const { return unexpectedErrors_; }
+
+    // A provider operation, planned against the model and run later.
+    struct Operation {
+        std::string description;
+        // Starts the operation; `done` gets the item (or the error) once.
+        std::function<void(HostPorterExtension::ItemCompletion done)> start;
+        // Applies a success to the model and checks it; returns what is wrong.
+        std::function<std::string(const std::string& path)> apply;
+        std::vector<std::string> involved;  // paths it touches, for running others beside it
+        bool mayFail = false;               // refusing it is a right answer
+    };
+
+private:
+    // Outside changes.
+    std::string outsideChange(Rng& rng, std::string& description);
+    // Provider operations.
+    Operation planOperation(Rng& rng);
+    std::string runOne(Operation operation, bool faulted);
+    std::string runTogether(std::vector<Operation> operations);
+    // Disturbances.
+    std::string restart(Rng& rng, std::string& description);
+    std::string overflow(Rng& rng, std::string& description);
+    std::string fault(Rng& rng, std::string& description);
+
+    std::vector<std::string> folders(bool withRoots) const;
+    std::vector<std::string> entries() const;  // neither a root nor in a trash
+    std::vector<std::string> files() const;
+    std::vector<std::string> trashed() const;  // tops of trashed trees
+    std::string identifier(const std::string& path);
+    std::string pathOf(const Result<HostPorterItemRef>& item) const;
+
+    ModelWorld& world_;
+    int unexpectedErrors_ = 0;
+    int counter_ = 0;  // makes outside sources and contents distinct
+};
+
+}  // namespace tamber::model

@@ -1,0 +1,234 @@
+// The model test: for each seed, a random run of outside changes, provider operations and
+// disturbances against a temporary storage, checked after every step against a model of the
+// tree and against a host that knows the tree only from listings and change enumerations.
+//
+//   model_tests [--first-seed N] [--seeds COUNT] [--length STEPS] [--minutes M] [--log FILE]
+//   model_tests --seed N [--steps 3,7,12]     replays one seed, or only some of its steps
+//
+// A failure prints the seed and the shortest list of its steps found that still fails.
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <deque>
+#include <fstream>
+#include <iostream>
+#include <mutex>
+#include <optional>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "host/StagingCopies.h"
+#include "support/Log.h"
+#include "support/LogSink.h"
+#include "tests/common/TempDir.h"
+#include "tests/model/ModelSteps.h"
+#include "tests/model/ModelWorld.h"
+
+using namespace tamber;
+using namespace tamber::model;
+
+namespace {
+
+// Keeps the last lines the program logged, shown with a failure.
+class RecentLines : public LogSink {
+public:
+    void write(LogLevel, std::string_view line) override {
+        std::lock_guard lock(mutex_);
+        lines_.emplace_back(line);
+        if (lines_.size() > 40)
+            lines_.pop_front();
+    }
+    std::string take() {
+        std::lock_guard lock(mutex_);
+        std::string out;
+        for (const auto& line : lines_) out += "    " + line + "\n";
+        lines_.clear();
+        return out;
+    }
+
+private:
+    std::mutex mutex_;
+    std::deque<std::string> lines_;
+};
+
+struct Options {
+    uint64_t firstSeed = 1;
+    uint64_t seeds = 1;
+    uint64_t length = 200;
+    std::optional<std::vector<uint64_t>> steps;
+    double minutes = 0;
+    std::string log;
+};
+
+struct Outcome {
+    bool failed = false;
+    size_t at = 0;  // position in the step list of the failing step
+    std::string report;
+    int relists = 0;
+    int unexpectedErrors = 0;
+};
+
+Outcome runSeed(uint64_t seed, const std::vector<uint64_t>& steps) {
+    Outcome outcome;
+    ModelWorld world;
+    ModelSteps runner(world);
+    std::string failed = world.start();
+    if (failed.empty())
+        failed = world.check();
+    if (!failed.empty()) {
+        outcome = {true, 0, "before any step:" + failed};
+        return outcome;
+    }
+    for (size_t i = 0; i < steps.size(); ++i) {
+        std::string description;
+        failed = runner.run(seed, steps[i], description);
+        if (failed.empty())
+            failed = world.check();
+        if (!failed.empty()) {
+            outcome.failed = true;
+            outcome.at = i;
+            outcome.report =
+                "step " + std::to_string(steps[i]) + " (" + description + "):" + failed;
+            break;
+        }
+    }
+    outcome.relists = world.host().relists();
+    outcome.unexpectedErrors = runner.unexpectedErrors();
+    return outcome;
+}
+
+// Drops steps while the run still fails, in halving chunks, within a bounded number of runs.
+std::vector<uint64_t> shrink(uint64_t seed, std::vector<uint64_t> steps) {
+    int runs = 0;
+    for (size_t chunk = std::max<size_t>(steps.size() / 2, 1); chunk >= 1 && runs < 300;) {
+        bool dropped = false;
+        for (size_t start = 0; start + 1 < steps.size() && runs < 300;) {
+            // The last step is the failing one: keep it.
+            size_t end = std::min(start + chunk, steps.size() - 1);
+            std::vector<uint64_t> fewer(steps.begin(), steps.begin() + long(start));
+            fewer.insert(fewer.end(), steps.begin() + long(end), steps.end());
+            ++runs;
+            Outcome outcome = runSeed(seed, fewer);
+            if (outcome.failed) {
+                fewer.resize(outcome.at + 1);
+                steps = fewer;
+                dropped = true;
+            } else {
+                start = end;
+            }
+        }
+        if (!dropped) {
+            if (chunk == 1)
+                break;
+            chunk /= 2;
+        }
+    }
+    return steps;
+}
+
+std::string join(const std::vector<uint64_t>& steps) {
+    std::string out;
+    for (uint64_t step : steps) out += (out.empty() ? "" : ",") + std::to_string(step);
+    return out;
+}
+
+bool parse(int argc, char** argv, Options& options) {
+    for (int i = 1; i < argc; ++i) {
+        std::string arg = argv[i];
+        auto value = [&]() -> std::string { return i + 1 < argc ? argv[++i] : ""; };
+        try {
+            if (arg == "--seed") {
+                options.firstSeed = std::stoull(value());
+                options.seeds = 1;
+            } else if (arg == "--first-seed") {
+                options.firstSeed = std::stoull(value());
+            } else if (arg == "--seeds") {
+                options.seeds = std::stoull(value());
+            } else if (arg == "--length") {
+                options.length = std::stoull(value());
+            } else if (arg == "--minutes") {
+                options.minutes = std::stod(value());
+            } else if (arg == "--log") {
+                options.log = value();
+            } else if (arg == "--steps") {
+                std::vector<uint64_t> steps;
+                std::stringstream list(value());
+                for (std::string item; std::getline(list, item, ',');)
+                    steps.push_back(std::stoull(item));
+                options.steps = steps;
+            } else {
+                std::cerr << "model_tests: unknown option " << arg << "\n";
+                return false;
+            }
+        } catch (const std::exception&) {
+            std::cerr << "model_tests: " << arg << " needs a number\n";
+            return false;
+        }
+    }
+    return true;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    Options options;
+    if (!parse(argc, argv, options)) {
+        std::cerr << "usage: model_tests [--first-seed N] [--seeds COUNT] [--length STEPS] "
+                     "[--minutes M] [--log FILE] | --seed N [--steps LIST]\n";
+        return 2;
+    }
+    auto recent = std::make_shared<RecentLines>();
+    Log::shared().setSink(recent);
+    Log::shared().setDebugEnabled(false);
+    testing::TempDir ledger;
+    StagingCopies::setLedgerDirectoryForTesting(ledger.path());
+    std::ofstream log;
+    if (!options.log.empty())
+        log.open(options.log, std::ios::app);
+
+    const auto begun = std::chrono::steady_clock::now();
+    auto elapsedMinutes = [&] {
+        return std::chrono::duration<double>(std::chrono::steady_clock::now() - begun).count() / 60;
+    };
+    uint64_t seeds = 0, steps = 0, relists = 0, unexpected = 0;
+    for (uint64_t seed = options.firstSeed;; ++seed) {
+        if (options.minutes > 0 ? elapsedMinutes() >= options.minutes
+                                : seed >= options.firstSeed + options.seeds)
+            break;
+        std::vector<uint64_t> list = options.steps.value_or(std::vector<uint64_t>{});
+        if (!options.steps)
+            for (uint64_t i = 0; i < options.length; ++i) list.push_back(i);
+        Outcome outcome = runSeed(seed, list);
+        ++seeds;
+        steps += outcome.failed ? outcome.at + 1 : list.size();
+        relists += uint64_t(outcome.relists);
+        unexpected += uint64_t(outcome.unexpectedErrors);
+        if (log.is_open())
+            log << "seed " << seed << " steps " << list.size()
+                << (outcome.failed ? " FAILED" : " ok") << std::endl;
+        if (!outcome.failed) {
+            recent->take();
+            continue;
+        }
+        std::string lines = recent->take();
+        list.resize(outcome.at + 1);
+        std::cout << "model: seed " << seed << " failed at " << outcome.report << "\n"
+                  << "  last log lines:\n"
+                  << lines << std::flush;
+        std::vector<uint64_t> shortest = options.steps ? list : shrink(seed, list);
+        Outcome again = runSeed(seed, shortest);
+        std::cout << "  shortest failing steps (" << shortest.size() << "): " << join(shortest)
+                  << "\n  which fail with: " << (again.failed ? again.report : "(passed on replay)")
+                  << "\n  replay: model_tests --seed " << seed << " --steps " << join(shortest)
+                  << std::endl;
+        if (log.is_open())
+            log << "  replay: --seed " << seed << " --steps " << join(shortest) << std::endl;
+        return 1;
+    }
+    std::cout << "model: " << seeds << " seeds, " << steps << " steps, " << relists << " listings, "
+              << unexpected << " refusals without a fault, no failure ("
+              << int(elapsedMinutes() * 60) << " s)" << std::endl;
+    return 0;
+}
