@@ -179,6 +179,17 @@ Result<HostPorterItemRef> LocalPorter::itemAtURL(const Url& url) {
     return itemForURL(url);
 }
 
+void LocalPorter::finishWithItem(const Result<Url>& changed, const ChangeUndo& undo,
+                                 const ItemCompletion& completion) {
+    if (!changed.ok())
+        return completion(changed.error());
+    auto item = itemForURL(changed.value());
+    if (item.ok())
+        return completion(item.value());
+    Error error = item.error();
+    undo(changed.value(), [completion, error] { completion(error); });
+}
+
 Result<LocalPorter::LocalItemRef> LocalPorter::itemForURL(const Url& url) {
     if (auto outside = PublishedTrees::check(url); !outside.ok()) {
         logDebug([&] { return "\"" + url.path() + "\" is " + PublishedTrees::kOutsideMessage; });

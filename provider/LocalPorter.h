@@ -10,6 +10,7 @@
 #include "items/ItemMetadata.h"
 #include "items/LocalItem.h"
 #include "platform/apps/AppRecord.h"
+#include "provider/ChangeUndo.h"
 #include "provider/ProviderServices.h"
 #include "support/DispatchQueue.h"
 #include "support/Pacer.h"
@@ -56,6 +57,10 @@ public:
     std::optional<HostPorterItemIdentifier> identifierForURLLogged(const Url& url);
     Result<LocalItemRef> itemForIdentifierLogged(const HostPorterItemIdentifier& identifier);
     Result<LocalItemRef> itemForURL(const Url& url);
+    // Completes an item operation with the item at `changed`; when its record cannot be read,
+    // `undo` reverses the change first and the completion gets the error.
+    void finishWithItem(const Result<Url>& changed, const ChangeUndo& undo,
+                        const ItemCompletion& completion);
 
     // Enumerators: the root enumerator for the three root-served containers, a folder
     // enumerator for any other container; either is started before it is returned.

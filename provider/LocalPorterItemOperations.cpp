@@ -23,16 +23,6 @@ bool isFixedContainer(const HostPorterItemIdentifier& identifier) {
            kind == ItemIdentifier::Kind::AllDirectories || kind == ItemIdentifier::Kind::AppLibrary;
 }
 
-// Turns the outcome of a host file operation into the completion of an item operation.
-void finishWithItem(LocalPorter& porter, const Result<Url>& url,
-                    const LocalPorter::ItemCompletion& completion) {
-    if (!url.ok()) {
-        completion(url.error());
-        return;
-    }
-    completion(porter.itemForURL(url.value()));
-}
-
 }  // namespace
 
 void LocalPorter::importDocumentAtURL(const Url& source, const HostPorterItemIdentifier& parent,
@@ -45,7 +35,7 @@ void LocalPorter::importDocumentAtURL(const Url& source, const HostPorterItemIde
             if (!folder.ok())
                 return completion(folder.error());
             pt_importUnderFolder(source, folder.value(), [this, completion](Result<Url> url) {
-                finishWithItem(*this, url, completion);
+                finishWithItem(url, removeMade(), completion);
             });
         });
 }
@@ -66,7 +56,7 @@ void LocalPorter::createDirectoryWithName(const std::string& name,
         if (!folder.ok())
             return completion(folder.error());
         pt_createSubFolder(folder.value(), name, bounce, [this, completion](Result<Url> url) {
-            finishWithItem(*this, url, completion);
+            finishWithItem(url, removeMade(), completion);
         });
     });
 }
@@ -79,8 +69,9 @@ void LocalPorter::renameItemWithIdentifier(const HostPorterItemIdentifier& ident
         auto url = urlForIdentifierLogged(identifier);
         if (!url.ok())
             return completion(url.error());
-        pt_renameWithNewName(url.value(), name, [this, completion](Result<Url> renamed) {
-            finishWithItem(*this, renamed, completion);
+        Url original = url.value();
+        pt_renameWithNewName(original, name, [this, original, completion](Result<Url> renamed) {
+            finishWithItem(renamed, moveBackTo(original), completion);
         });
     });
 }
@@ -98,9 +89,11 @@ void LocalPorter::reparentItemWithIdentifier(const HostPorterItemIdentifier& ide
         auto folder = _urlForItemWithPersistentIdentifier(parent);
         if (!folder)
             return completion(Error::porterErrorForNonExistentItemWithIdentifier(parent));
-        pt_reparentUnderFolder(*url, *folder, newName, [this, completion](Result<Url> moved) {
-            finishWithItem(*this, moved, completion);
-        });
+        Url original = *url;
+        pt_reparentUnderFolder(original, *folder, newName,
+                               [this, original, completion](Result<Url> moved) {
+                                   finishWithItem(moved, moveBackTo(original), completion);
+                               });
     });
 }
 

@@ -94,7 +94,15 @@ void LocalPorter::trashItemWithIdentifier(const HostPorterItemIdentifier& identi
             // The move stands whatever happens to the attributes.
             (void)ItemMetadata::writeTrashDate(trashed.value(), Date::now());
             setPutBackString(trashed.value(), original);
-            completion(itemForURL(trashed.value()));
+            ChangeUndo moveBack = moveBackTo(original);
+            finishWithItem(
+                trashed,
+                [moveBack](const Url& url, std::function<void()> done) {
+                    (void)ItemMetadata::writeTrashDate(url, nullptr);
+                    (void)ItemMetadata::writePutBack(url, nullptr);
+                    moveBack(url, std::move(done));
+                },
+                completion);
         });
     });
 }
@@ -161,14 +169,25 @@ void LocalPorter::untrashItemWithIdentifier(const HostPorterItemIdentifier& iden
             return completion(makeLocalPorterError(LocalPorterError::invalidItemURL, url->path()));
         }
 
-        pt_reparentUnderFolder(*url, *destination, true, [this, completion](Result<Url> restored) {
-            if (!restored.ok())
-                return completion(restored.error());
-            // Only the date goes; the next trashing rewrites the put-back path anyway.
-            logDebug("removing trash date xattr");
-            (void)ItemMetadata::writeTrashDate(restored.value(), nullptr);
-            completion(itemForURL(restored.value()));
-        });
+        Url trashed = *url;
+        pt_reparentUnderFolder(
+            trashed, *destination, true, [this, trashed, completion](Result<Url> restored) {
+                if (!restored.ok())
+                    return completion(restored.error());
+                // Only the date goes; the next trashing rewrites the put-back path anyway.
+                logDebug("removing trash date xattr");
+                auto date = ItemMetadata::readTrashDate(restored.value());
+                (void)ItemMetadata::writeTrashDate(restored.value(), nullptr);
+                ChangeUndo moveBack = moveBackTo(trashed);
+                finishWithItem(
+                    restored,
+                    [moveBack, date](const Url& url, std::function<void()> done) {
+                        if (date)
+                            (void)ItemMetadata::writeTrashDate(url, date);
+                        moveBack(url, std::move(done));
+                    },
+                    completion);
+            });
     });
 }
 

@@ -1,5 +1,10 @@
 #include <gtest/gtest.h>
 
+#include <functional>
+
+#include "platform/FaultInjectingFileSystem.h"
+#include "platform/LinuxFileSystem.h"
+#include "tests/common/ScopedFileSystem.h"
 #include "tests/provider/ProviderOperationsTest.h"
 
 namespace tamber {
@@ -180,6 +185,61 @@ TEST_F(ItemOperationsTest, DeleteRemovesAFolderWithItsContentsButNeverAContainer
         expectNoPermission(refused.error);
     }
     EXPECT_EQ(tree(), before);
+}
+
+// A file-system call that fails anywhere in an operation, even after the change was made (when
+// the record of the item it moved or made is read), leaves the tree as it was when the
+// operation reports an error; the operation succeeds or fails, never both.
+TEST_F(ItemOperationsTest, AFailureAnywhereInAnOperationLeavesTheTreeAsItWas) {
+    using Op = FaultInjectingFileSystem::Operation;
+    std::filesystem::create_directories(library + "/.Trash");
+    std::string source = writeFile(dir / "outside/report.txt");
+    HostPorterItemIdentifier into = identifierOf(makeFolder(library + "/Into"));
+    auto faults = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    ScopedFileSystem scoped(faults);
+    using Run = std::function<void(const HostPorterItemIdentifier&, LocalPorter::ItemCompletion)>;
+    const std::vector<std::pair<std::string, Run>> operations = {
+        {"trash", [&](auto id, auto done) { porter->trashItemWithIdentifier(id, done); }},
+        {"rename",
+         [&](auto id, auto done) { porter->renameItemWithIdentifier(id, "renamed.txt", done); }},
+        {"move",
+         [&](auto id, auto done) {
+             porter->reparentItemWithIdentifier(id, into, std::nullopt, done);
+         }},
+        {"import",
+         [&](auto, auto done) {
+             porter->importDocumentAtURL(Url::fileURLWithPath(source), into, done);
+         }},
+        {"create", [&](auto, auto done) { porter->createDirectoryWithName("New", into, done); }},
+    };
+    int failures = 0;
+    int file = 0;
+    for (const auto& [name, operation] : operations) {
+        for (Op op : {Op::Statx, Op::OpenBeneath, Op::Openat, Op::ReadDirectory, Op::Lgetxattr}) {
+            for (int pass = 0; pass < 30; ++pass) {
+                std::string path = writeFile(library + "/f" + std::to_string(++file) + ".txt");
+                HostPorterItemIdentifier id = identifierOf(path);
+                const auto before = tree();
+                faults->injectAfter(op, EIO, pass);
+                ItemOutcome outcome;
+                operation(id, outcome.handler());
+                bool reached = faults->pendingInjections() == 0;
+                faults->clearInjections();
+                ASSERT_EQ(outcome.calls, 1);
+                if (outcome.error) {
+                    ++failures;
+                    EXPECT_EQ(tree(), before)
+                        << name << " failed at call " << pass << " of "
+                        << FaultInjectingFileSystem::operationName(op) << " and changed the tree";
+                } else {
+                    EXPECT_TRUE(outcome.item) << name;
+                }
+                if (!reached)
+                    break;
+            }
+        }
+    }
+    EXPECT_GT(failures, 0) << "no injected failure reached an operation";
 }
 
 }  // namespace
