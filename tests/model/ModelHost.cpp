@@ -2,7 +2,12 @@
 
 #include <sys/inotify.h>
 
+#include <algorithm>
+#include <cerrno>
+#include <chrono>
 #include <cstring>
+#include <thread>
+#include <vector>
 #include <mutex>
 
 #include "host/HostPorterChangeObserver.h"
@@ -73,8 +78,25 @@ struct BatchRecorder : HostPorterChangeObserver {
 
 }  // namespace
 
+int OverflowingInotify::poll(struct pollfd* fds, nfds_t count, int timeoutMs) {
+    if (hold) {
+        // Nothing is ready while held; the reader comes back after its timeout.
+        std::this_thread::sleep_for(std::chrono::milliseconds(timeoutMs < 0 ? 5 : std::min(timeoutMs, 5)));
+        for (nfds_t i = 0; i < count; ++i) fds[i].revents = 0;
+        return 0;
+    }
+    return real_->poll(fds, count, timeoutMs);
+}
+
 ssize_t OverflowingInotify::read(int fd, void* buffer, size_t size) {
+    if (hold) {
+        errno = EAGAIN;
+        return -1;
+    }
     if (size >= sizeof(inotify_event) && overflowNext.exchange(false)) {
+        std::vector<char> dropped(1 << 16);
+        while (real_->queuedBytes(fd) > 0 && real_->read(fd, dropped.data(), dropped.size()) > 0) {
+        }
         inotify_event overflow{};
         overflow.wd = -1;
         overflow.mask = IN_Q_OVERFLOW;

@@ -14,11 +14,13 @@
 
 namespace tamber::model {
 
-// The system's inotify calls, except that the next read can be made to report a queue overflow
-// (the kernel dropped events) before what really happened.
+// The system's inotify calls, except that reading can be held back while changes are made,
+// and the next read can be made to overflow: what the kernel queued is dropped and a queue
+// overflow reported instead, as when the kernel loses events.
 class OverflowingInotify : public InotifyApi {
 public:
     std::atomic<bool> overflowNext{false};
+    std::atomic<bool> hold{false};
 
     int init(int flags) override { return real_->init(flags); }
     int addWatch(int fd, const std::string& path, uint32_t mask) override {
@@ -29,9 +31,7 @@ public:
     int queuedBytes(int fd) override { return real_->queuedBytes(fd); }
     int eventfd(unsigned int initial, int flags) override { return real_->eventfd(initial, flags); }
     int signal(int eventFd) override { return real_->signal(eventFd); }
-    int poll(struct pollfd* fds, nfds_t count, int timeoutMs) override {
-        return real_->poll(fds, count, timeoutMs);
-    }
+    int poll(struct pollfd* fds, nfds_t count, int timeoutMs) override;
     int close(int fd) override { return real_->close(fd); }
 
 private:

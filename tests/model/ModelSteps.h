@@ -22,6 +22,11 @@ class ModelSteps {
 public:
     explicit ModelSteps(ModelWorld& world) : world_(world) {}
 
+    // Families of steps that can be left out: "together" (operations at once), "fault",
+    // "overflow", "restart". A step drawn from a left-out family is an outside change instead.
+    static const std::vector<std::string>& families();
+    void skip(const std::string& family) { skipped_.push_back(family); }
+
     // Runs one step; returns what it found wrong (empty when nothing). `description` says what
     // the step did, for the failure report.
     std::string run(uint64_t seed, uint64_t index, std::string& description);
@@ -61,6 +66,9 @@ private:
 
     ModelWorld& world_;
     int unexpectedErrors_ = 0;
+    bool faulted_ = false;
+    std::vector<std::string> skipped_;
+    bool skipped(const std::string& family) const;  // a file-system call is made to fail in the running operation
     int counter_ = 0;  // makes outside sources and contents distinct
 };
 

@@ -165,8 +165,9 @@ std::string ModelWorld::describeDifference(const Disk& before, const Disk& after
         else if (!(it->second == entry))
             out += "\n  changed: " + path;
     }
+    // An empty trash folder made on the way is no change anyone sees.
     for (const auto& [path, entry] : after)
-        if (!before.contains(path))
+        if (!before.contains(path) && !(nameOf(path) == ".Trash" && entry.attributes.empty()))
             out += "\n  new: " + path;
     return out;
 }

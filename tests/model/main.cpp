@@ -4,6 +4,8 @@
 //
 //   model_tests [--first-seed N] [--seeds COUNT] [--length STEPS] [--minutes M] [--log FILE]
 //   model_tests --seed N [--steps 3,7,12]     replays one seed, or only some of its steps
+//   --skip FAMILY leaves out a family of steps (together, fault, overflow, restart); --debug
+//   shows the debug lines with a failure.
 //
 // A failure prints the seed and the shortest list of its steps found that still fails.
 #include <algorithm>
@@ -37,9 +39,10 @@ public:
     void write(LogLevel, std::string_view line) override {
         std::lock_guard lock(mutex_);
         lines_.emplace_back(line);
-        if (lines_.size() > 40)
+        if (lines_.size() > limit)
             lines_.pop_front();
     }
+    size_t limit = 40;
     std::string take() {
         std::lock_guard lock(mutex_);
         std::string out;
@@ -60,6 +63,8 @@ struct Options {
     std::optional<std::vector<uint64_t>> steps;
     double minutes = 0;
     std::string log;
+    bool debug = false;
+    std::vector<std::string> skip;
 };
 
 struct Outcome {
@@ -70,10 +75,13 @@ struct Outcome {
     int unexpectedErrors = 0;
 };
 
+std::vector<std::string> skippedFamilies;
+
 Outcome runSeed(uint64_t seed, const std::vector<uint64_t>& steps) {
     Outcome outcome;
     ModelWorld world;
     ModelSteps runner(world);
+    for (const auto& family : skippedFamilies) runner.skip(family);
     std::string failed = world.start();
     if (failed.empty())
         failed = world.check();
@@ -150,6 +158,16 @@ bool parse(int argc, char** argv, Options& options) {
                 options.length = std::stoull(value());
             } else if (arg == "--minutes") {
                 options.minutes = std::stod(value());
+            } else if (arg == "--skip") {
+                std::string family = value();
+                const auto& known = ModelSteps::families();
+                if (std::find(known.begin(), known.end(), family) == known.end()) {
+                    std::cerr << "model_tests: --skip takes together, fault, overflow or restart\n";
+                    return false;
+                }
+                options.skip.push_back(family);
+            } else if (arg == "--debug") {
+                options.debug = true;
             } else if (arg == "--log") {
                 options.log = value();
             } else if (arg == "--steps") {
@@ -176,12 +194,15 @@ int main(int argc, char** argv) {
     Options options;
     if (!parse(argc, argv, options)) {
         std::cerr << "usage: model_tests [--first-seed N] [--seeds COUNT] [--length STEPS] "
-                     "[--minutes M] [--log FILE] | --seed N [--steps LIST]\n";
+                     "[--minutes M] [--log FILE] | --seed N [--steps LIST] [--debug]\n";
         return 2;
     }
+    skippedFamilies = options.skip;
     auto recent = std::make_shared<RecentLines>();
+    if (options.debug)
+        recent->limit = 400;
     Log::shared().setSink(recent);
-    Log::shared().setDebugEnabled(false);
+    Log::shared().setDebugEnabled(options.debug);
     testing::TempDir ledger;
     StagingCopies::setLedgerDirectoryForTesting(ledger.path());
     std::ofstream log;
@@ -217,11 +238,14 @@ int main(int argc, char** argv) {
         std::cout << "model: seed " << seed << " failed at " << outcome.report << "\n"
                   << "  last log lines:\n"
                   << lines << std::flush;
+        std::string skips;
+        for (const auto& family : options.skip) skips += " --skip " + family;
         std::vector<uint64_t> shortest = options.steps ? list : shrink(seed, list);
         Outcome again = runSeed(seed, shortest);
         std::cout << "  shortest failing steps (" << shortest.size() << "): " << join(shortest)
                   << "\n  which fail with: " << (again.failed ? again.report : "(passed on replay)")
                   << "\n  replay: model_tests --seed " << seed << " --steps " << join(shortest)
+                  << skips
                   << std::endl;
         if (log.is_open())
             log << "  replay: --seed " << seed << " --steps " << join(shortest) << std::endl;
