@@ -150,6 +150,15 @@ Status TremorStore::transact(const std::function<Status()>& work) {
     return status;
 }
 
+Status TremorStore::capSizeForTesting(bool capped) {
+    std::lock_guard lock(mutex_);
+    auto pages = db_->queryInt64("PRAGMA page_count");
+    if (!pages.ok())
+        return pages.error();
+    return db_->exec("PRAGMA max_page_count = " +
+                     std::to_string(capped ? pages.value() : int64_t{0xfffffffe}));
+}
+
 // ---- Journal ----
 
 Result<uint64_t> TremorStore::append(std::vector<JournalEvent>& events) {
