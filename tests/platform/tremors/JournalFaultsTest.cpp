@@ -4,6 +4,7 @@
 #include <string>
 #include <vector>
 
+#include "tests/common/FaultyInotifyApi.h"
 #include "tests/platform/tremors/TremorServiceFixture.h"
 
 namespace tamber {
@@ -59,8 +60,7 @@ TEST_F(JournalDiskFullTest, LostEventsLeaveAGapBeforeAnythingJournaledLater) {
     for (const auto& event : events) {
         if (event.id >= created->id)
             break;
-        if ((event.flags & kTremorUserDropped) &&
-            (event.flags & kTremorMustScanSubdirs))
+        if ((event.flags & kTremorUserDropped) && (event.flags & kTremorMustScanSubdirs))
             gapFirst = true;
     }
     EXPECT_TRUE(gapFirst) << "events were lost without a trace in the journal\n"
@@ -72,6 +72,60 @@ TEST_F(JournalDiskFullTest, LostEventsLeaveAGapBeforeAnythingJournaledLater) {
         ASSERT_TRUE(indexed.ok());
         EXPECT_TRUE(indexed.value().has_value()) << path << " is missing from the index";
     }
+}
+
+// Past the kernel's watch limit a folder is not watched: what changes in it must still reach
+// the journal, found by rescanning it when a client asks where the journal stands.
+class WatchLimitTest : public TremorServiceTest {
+protected:
+    void SetUp() override {
+        TremorServiceTest::SetUp();
+        std::filesystem::create_directories(tree_ + "/full/deeper");
+        writeText(tree_ + "/full/old.txt", "o");
+        writeText(tree_ + "/full/renamed.txt", "r");
+        api_->failAddWatch("/full", ENOSPC);
+        auto service = TremorService::create(state_.path(), api_);
+        ASSERT_TRUE(service.ok()) << service.error().description();
+        service_ = service.value();
+        ASSERT_TRUE(service_->watchTree(tree_).ok());
+    }
+
+    std::shared_ptr<FaultyInotifyApi> api_ = std::make_shared<FaultyInotifyApi>();
+};
+
+TEST_F(WatchLimitTest, ChangesInAFolderPastTheLimitAreJournaledByRescans) {
+    ScopedLogCapture log;
+    const uint64_t anchor = service_->currentEventId();
+    const std::string full = tree_ + "/full";
+    writeText(tree_ + "/watched.txt", "w");
+    writeText(full + "/new.txt", "n");
+    writeText(full + "/deeper/inner.txt", "i");
+    std::filesystem::rename(full + "/renamed.txt", full + "/deeper/moved.txt");
+    // Last: a file created after it could be given its inode number.
+    std::filesystem::remove(full + "/old.txt");
+
+    const uint64_t now = service_->currentEventId();
+    auto events = journaled(*service_, device_, anchor, {tree_});
+    for (const auto& event : events) EXPECT_LE(event.id, now) << "journaled after the answer";
+    EXPECT_NE(findEvent(events, tree_ + "/watched.txt", kTremorItemCreated), nullptr);
+    EXPECT_NE(findEvent(events, full + "/new.txt", kTremorItemCreated), nullptr)
+        << describe(events);
+    EXPECT_NE(findEvent(events, full + "/deeper/inner.txt", kTremorItemCreated), nullptr)
+        << describe(events);
+    EXPECT_NE(findEvent(events, full + "/old.txt", kTremorItemRemoved), nullptr)
+        << describe(events);
+    EXPECT_NE(findEvent(events, full + "/deeper/moved.txt", kTremorItemRenamed), nullptr)
+        << describe(events);
+    // The index follows, so identifiers of the new files resolve.
+    std::string path;
+    TremorStrataService strata(service_);
+    ASSERT_TRUE(strata.pathForFileId(device_, inodeOf(full + "/deeper/inner.txt"), path));
+    EXPECT_EQ(path, full + "/deeper/inner.txt");
+
+    // A second look with nothing changed journals nothing more.
+    EXPECT_EQ(service_->currentEventId(), now);
+    // The folder appears once in the log as not watched; rescans themselves are quiet.
+    for (const auto& line : log->lines()) EXPECT_NE(line.level, LogLevel::Error) << line.text;
 }
 
 }  // namespace
