@@ -199,6 +199,10 @@ void TremorService::sync() {
     flush(false);
 }
 
+void TremorService::catchUp() {
+    flush(true);
+}
+
 void TremorService::flush(bool rescan) {
     if (stopped_ || std::this_thread::get_id() == journalerId_)
         return;
@@ -444,7 +448,7 @@ void TremorService::publish(const Volume& volume, Result<std::vector<JournalEven
 }
 
 uint64_t TremorService::currentEventId() {
-    flush(true);
+    catchUp();
     std::lock_guard lock(volumesMutex_);
     uint64_t last = 0;
     for (const auto& volume : volumes_) last = std::max(last, volume->store->lastEventId());

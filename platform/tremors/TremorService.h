@@ -101,9 +101,10 @@ public:
 
     // Returns once every event the kernel queued before the call has been journaled.
     void sync();
-    // The last event ID handed out (after sync), over every volume. Folders that could not be
-    // watched (past the kernel's watch limit) are rescanned first, so that what changed in
-    // them is journaled before the answer.
+    // sync(), after rescanning the folders that could not be watched (past the kernel's watch
+    // limit): for a client about to read the journal, so that what changed in them is there.
+    void catchUp();
+    // The last event ID handed out (after catchUp), over every volume.
     uint64_t currentEventId();
     // The UUID of the store of `device` (after sync); empty when no tree of it is watched.
     std::string uuidForDevice(uint32_t device);
