@@ -47,7 +47,15 @@ Result<std::unique_ptr<TremorStore>> TremorStore::open(
 
     std::string database = store->dir_->databasePath();
     if (isTransient(status.error())) {
-        logError("Cannot open the event journal " + database + ": " + status.error().description());
+        const int code = status.error().code() & 0xff;
+        const bool held = status.error().domain() == std::string_view(kSqliteErrorDomain) &&
+                          (code == SQLITE_BUSY || code == SQLITE_LOCKED);
+        // Tamber processes take turns through the directory lock, so this is another program
+        // (a backup, an sqlite3 shell) that kept the database past the busy timeout.
+        std::string why = status.error().description();
+        if (held)
+            why = "another program holds it; try again once it lets go (" + why + ")";
+        logError("Cannot open the event journal " + database + ": " + why);
         return status.error();
     }
     logError("The event journal " + database + " is unusable (" + status.error().description() +

@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <filesystem>
+#include <future>
 #include <string>
 #include <vector>
 
@@ -126,6 +128,54 @@ TEST_F(WatchLimitTest, ChangesInAFolderPastTheLimitAreJournaledByRescans) {
     EXPECT_EQ(service_->currentEventId(), now);
     // The folder appears once in the log as not watched; rescans themselves are quiet.
     for (const auto& line : log->lines()) EXPECT_NE(line.level, LogLevel::Error) << line.text;
+}
+
+// Another program (a backup, a curious user with the sqlite3 shell) holds the journal's
+// database longer than the busy timeout: opening it fails with a clear error, once, leaves the
+// journal as it was, and works again once the other program lets go.
+TEST(JournalLockedTest, AJournalHeldByAnotherProgramFailsClearlyAndOpensOnceReleased) {
+    TempDir state;
+    std::string database, uuid;
+    uint64_t last = 0;
+    {
+        auto store = TremorStore::open(state.path(), 1);
+        ASSERT_TRUE(store.ok()) << store.error().description();
+        std::vector<JournalEvent> events{{0, "/tree/a", 1, kTremorItemCreated}};
+        ASSERT_TRUE(store.value()->append(events).ok());
+        database = store.value()->directory() + "/" + TremorStoreDirectory::kDatabaseName;
+        uuid = store.value()->uuid();
+        last = store.value()->lastEventId();
+    }
+    auto holder = SqliteDatabase::open(database, SQLITE_OPEN_READWRITE);
+    ASSERT_TRUE(holder.ok());
+    ASSERT_TRUE(holder.value()->exec("BEGIN EXCLUSIVE").ok());
+
+    {
+        ScopedLogCapture log;
+        auto attempt =
+            std::async(std::launch::async, [&] { return TremorStore::open(state.path(), 1); });
+        ASSERT_EQ(attempt.wait_for(std::chrono::seconds(60)), std::future_status::ready)
+            << "opening a held journal hangs";
+        auto opened = attempt.get();
+        ASSERT_FALSE(opened.ok()) << "a held journal was opened";
+        EXPECT_EQ(opened.error().domain(), std::string(kSqliteErrorDomain));
+        EXPECT_EQ(opened.error().code() & 0xff, SQLITE_BUSY) << opened.error().description();
+        size_t errors = 0;
+        for (const auto& line : log->lines()) {
+            if (line.level != LogLevel::Error)
+                continue;
+            ++errors;
+            EXPECT_NE(line.text.find(database), std::string::npos) << line.text;
+        }
+        EXPECT_EQ(errors, 1u);
+    }
+
+    ASSERT_TRUE(holder.value()->exec("COMMIT").ok());
+    holder.value().reset();
+    auto again = TremorStore::open(state.path(), 1);
+    ASSERT_TRUE(again.ok()) << again.error().description();
+    EXPECT_EQ(again.value()->uuid(), uuid) << "the held journal was replaced";
+    EXPECT_EQ(again.value()->lastEventId(), last);
 }
 
 }  // namespace
