@@ -209,8 +209,13 @@ void FSChangesEnumerator::readerDidProcessHistory(TremorReader& reader) {
         return;
     stopAsync(reader);
     MutexLock lock(mutex_);
-    maxTremorID_ = std::max(maxTremorID_, reader.lastProcessedTremorID());
     if (shouldProcessedTremorsDocIDBased_) {
+        // The path-based pass saw every path event up to the end of its history. The
+        // document-ID pass starts later and may read further; the anchor stays here, or the
+        // path events journaled in between would be skipped. Document-ID events past here are
+        // sent again by the next request, which a host takes in its stride.
+        maxTremorID_ =
+            std::max({maxTremorID_, reader.lastProcessedTremorID(), reader.historyEndTremorID()});
         logDebug("processed all Tremors path based, carry on with the docID based");
         shouldProcessedTremorsDocIDBased_ = false;
         auto next = TremorReader::make(urls_, sinceTremorID_, TremorReaderMode::docIDBased, true);

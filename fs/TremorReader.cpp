@@ -308,6 +308,7 @@ void TremorReader::classifyEvent(const std::string& path, std::optional<uint64_t
         if (auto target = delegate())
             target->readerMustRescan(*this);
     } else if (flags & kTremorHistoryDone) {
+        historyEnd_.store(eventID);
         if (verbose_)
             logDebug("done processing history");
         if (auto target = delegate())

@@ -61,6 +61,9 @@ public:
     void setDelegate(std::weak_ptr<TremorReaderDelegate> delegate);
     // Read on `streamQueue`, or once the reader is stopped.
     uint64_t lastProcessedTremorID() const;
+    // The event the replayed history went up to (0 until it is done): every event of this
+    // reader's kind up to it has been processed, the last of them perhaps well before it.
+    uint64_t historyEndTremorID() const { return historyEnd_.load(); }
     // The ID of the event whose report is being made, while a delegate call runs on
     // `streamQueue`; 0 between events.
     uint64_t eventInProgress() const { return eventInProgress_; }
@@ -133,6 +136,7 @@ private:
     std::shared_ptr<DispatchQueue> streamQueue_;
 
     std::atomic<uint64_t> lastProcessedTremorID_;
+    std::atomic<uint64_t> historyEnd_{0};
     mutable std::mutex mutex_;
     TremorStreamRef stream_ = nullptr;  // guarded by mutex_
     // stream_ as the stream's callback checks it, without the lock start() holds while the

@@ -300,8 +300,19 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
 
 void InotifyBackend::reportUnwatched(const std::string& path, int error,
                                      std::vector<FileChange>& out) {
-    logError(formatPlatform("Cannot watch %@: %{errno}d; changes in that tree are not journaled",
-                            {path, ErrnoArg{error}}));
+    if (error != ENOSPC) {
+        logError(
+            formatPlatform("Cannot watch %@: %{errno}d; changes in that tree are not journaled",
+                           {path, ErrnoArg{error}}));
+    } else if (!watchLimitLogged_.exchange(true)) {
+        logError("Cannot watch " + path +
+                 ": the limit of inotify watches (fs.inotify.max_user_watches) is reached; "
+                 "folders past it are rescanned when changes are asked for, not watched. "
+                 "Raise it with \"sysctl -w fs.inotify.max_user_watches=524288\" (and a file "
+                 "in /etc/sysctl.d/ to keep it)");
+    } else {
+        logDebug([&] { return "Cannot watch " + path + ": the watch limit is reached"; });
+    }
     FileChange change;
     change.kind = Kind::WatchFailed;
     change.path = path;

@@ -120,6 +120,8 @@ private:
     // Directories that appeared but were gone when they were to be watched; a rename read
     // later may say where they went. Forgotten once the queue is empty.
     std::vector<std::string> vanished_ GUARDED_BY(mutex_);
+    // The watch limit is logged once: past it, every further folder fails alike.
+    std::atomic<bool> watchLimitLogged_{false};
 };
 
 }  // namespace tamber

@@ -464,16 +464,35 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
     if (oldTop != top.stx_ino)
         logIfFailed(store_.setRootInode(root, top.stx_ino), "Could not update a root");
 
+    return crawl(root, top.stx_ino, oldTop, journal);
+}
+
+Result<std::vector<JournalEvent>> JournalWriter::rescan(uint64_t inode) {
+    auto path = store_.pathForInode(inode);
+    if (!path.ok())
+        return path.error();
+    if (!path.value())
+        return Error::posix(ENOENT);
+    struct statx top {};
+    if (!FileStamp::read(*path.value(), top))
+        return Error::posix(errno);
+    if (top.stx_ino != inode || !S_ISDIR(top.stx_mode))
+        return Error::posix(ENOENT);  // another file took its place: the index catches up live
+    return crawl(*path.value(), inode, inode, true);
+}
+
+Result<std::vector<JournalEvent>> JournalWriter::crawl(const std::string& at, uint64_t top,
+                                                       uint64_t oldTop, bool journal) {
     // What is on disk, walked relative to each directory's descriptor, never following links.
     // The walk is done before the index is locked: it can take long.
     FileSystem& fs = FileSystem::current();
     std::map<uint64_t, Found> onDisk;
-    std::vector<std::pair<uint64_t, std::string>> stack{{top.stx_ino, root}};
+    std::vector<std::pair<uint64_t, std::string>> stack{{top, at}};
     std::vector<FileSystem::DirectoryEntry> entries;
     while (!stack.empty()) {
-        auto [dir, at] = std::move(stack.back());
+        auto [dir, folder] = std::move(stack.back());
         stack.pop_back();
-        ScopedFd fd(fs.open(at, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        ScopedFd fd(fs.open(folder, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
         if (!fd.ok())
             continue;  // vanished or unreadable: what it held counts as gone
         entries.clear();
@@ -483,14 +502,14 @@ Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& ro
             if (fs.statx(fd.get(), entry.name, AT_SYMLINK_NOFOLLOW, FileStamp::kMask, &st) != 0)
                 continue;
             InodeRecord record = FileStamp::recordOf(st, dir, entry.name);
-            std::string path = at + "/" + entry.name;
+            std::string path = folder + "/" + entry.name;
             if (record.kind == InodeRecord::kDirectory)
                 stack.emplace_back(record.inode, path);
             onDisk[record.inode] = {std::move(record), std::move(path)};
         }
     }
     // The crawl saw every file: a known file at a document's old path was moved there.
-    return commit(Settle::Clear, [&] { compareWithIndex(root, oldTop, onDisk, journal); });
+    return commit(Settle::Clear, [&] { compareWithIndex(at, oldTop, onDisk, journal); });
 }
 
 void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,

@@ -44,6 +44,9 @@ public:
     // `journal`, what differs is journaled as it would have been by live watching (a tree that
     // is indexed for the first time is not).
     Result<std::vector<JournalEvent>> reconcile(const std::string& root, bool journal);
+    // The same for the indexed folder `inode` inside a root (one that could not be watched),
+    // journaling what differs. ENOENT when the index no longer has that folder.
+    Result<std::vector<JournalEvent>> rescan(uint64_t inode);
 
     static std::string documentIdPath(uint32_t device, uint32_t docID, uint64_t src, uint64_t dst);
 
@@ -57,6 +60,10 @@ private:
     void removed(const FileChange& change);
     void renamed(const FileChange& change);
     void touched(const FileChange& change, uint32_t flag);
+    // Walks the tree at `at` (the folder `top` on disk) and compares it with the index's tree
+    // under `oldTop`.
+    Result<std::vector<JournalEvent>> crawl(const std::string& at, uint64_t top, uint64_t oldTop,
+                                            bool journal);
     void compareWithIndex(const std::string& root, uint64_t oldTop,
                           std::map<uint64_t, Found>& onDisk, bool journal);
     // What becomes of documents whose files vanished and were not claimed in the batch: cleared,

@@ -13,6 +13,7 @@
 #include "platform/Url.h"
 #include "platform/strata/StrataService.h"
 #include "platform/strata/TremorStrataService.h"
+#include "platform/tremors/FileStamp.h"
 #include "platform/tremors/TremorFlags.h"
 #include "platform/tremors/WatchedRoots.h"
 #include "support/Log.h"
@@ -195,8 +196,17 @@ void TremorService::readLoop() {
 }
 
 void TremorService::sync() {
+    flush(false);
+}
+
+void TremorService::catchUp() {
+    flush(true);
+}
+
+void TremorService::flush(bool rescan) {
     if (stopped_ || std::this_thread::get_id() == journalerId_)
         return;
+    const bool recheck = lossOwed_ || (rescan && unwatchedFolders_ > 0);
     uint64_t barrier = 0;
     {
         std::lock_guard read(readMutex_);
@@ -205,6 +215,8 @@ void TremorService::sync() {
         if (!changes.empty())
             enqueue(std::move(changes));
         std::lock_guard lock(queueMutex_);
+        if (recheck)
+            queue_.push_back({Item::Kind::Recheck, {}, 0});
         // Nothing read and nothing left to write: everything before this call is journaled
         // already, and a round trip through the journaling thread would only cost time (an
         // identifier asked for every file of a listing passes here).
@@ -288,24 +300,33 @@ void TremorService::journal(Item& item) {
     std::lock_guard write(writeMutex_);
     auto volumes = journalingVolumes();
     if (item.kind == Item::Kind::Dropped) {
+        for (auto [volume, writer] : volumes)
+            settleLoss(*volume, kTremorUserDropped | kTremorMustScanSubdirs);
+        return;
+    }
+    if (item.kind == Item::Kind::Recheck) {
         for (auto [volume, writer] : volumes) {
-            publish(*volume, writer->journalDropped(rootPaths(*volume),
-                                                    kTremorUserDropped | kTremorMustScanSubdirs));
-            reconcileAll(*volume);
+            if (volume->lossOwed)
+                settleLoss(*volume, kTremorUserDropped | kTremorMustScanSubdirs);
+            if (!volume->lossOwed)
+                rescanUnwatched(*volume);
         }
         return;
     }
     // A batch that could not be journaled was rolled back whole: readers are told to look for
-    // themselves, and the index is brought back in step, as after lost events.
+    // themselves, and the index is brought back in step, as after lost events. Until the
+    // journal takes that notice, nothing later is journaled: the rescan that comes with the
+    // notice reports those changes too.
     auto applyBatch = [this](Volume& volume, const std::vector<FileChange>& changes) {
+        if (volume.lossOwed)
+            settleLoss(volume, kTremorUserDropped | kTremorMustScanSubdirs);
+        if (volume.lossOwed || changes.empty())
+            return;
         auto events = volume.writer->apply(changes);
         const bool failed = !events.ok();
         publish(volume, std::move(events));
-        if (failed) {
-            publish(volume, volume.writer->journalDropped(
-                                rootPaths(volume), kTremorUserDropped | kTremorMustScanSubdirs));
-            reconcileAll(volume);
-        }
+        if (failed)
+            settleLoss(volume, kTremorUserDropped | kTremorMustScanSubdirs);
     };
     std::map<Volume*, std::vector<FileChange>> byVolume;
     bool overflow = false;
@@ -322,9 +343,16 @@ void TremorService::journal(Item& item) {
         if (change.kind == FileChange::Kind::WatchFailed) {
             applyBatch(*volume, byVolume[volume]);
             byVolume[volume].clear();
-            logError("A tree is not watched: " + change.path);
-            publish(*volume, volume->writer->journalDropped(
-                                 {change.path}, kTremorUserDropped | kTremorMustScanSubdirs));
+            noteUnwatched(*volume, change);
+            if (volume->lossOwed)
+                continue;  // the owed notice covers every tree
+            auto dropped = volume->writer->journalDropped(
+                {change.path}, kTremorUserDropped | kTremorMustScanSubdirs);
+            if (!dropped.ok()) {
+                volume->lossOwed = true;
+                lossOwed_ = true;
+            }
+            publish(*volume, std::move(dropped));
             continue;
         }
         byVolume[volume].push_back(std::move(change));
@@ -332,19 +360,80 @@ void TremorService::journal(Item& item) {
     for (auto& [volume, changes] : byVolume) applyBatch(*volume, changes);
     if (overflow) {
         logError("inotify dropped events; rescanning the watched trees");
-        for (auto [volume, writer] : volumes) {
-            publish(*volume, writer->journalDropped(rootPaths(*volume),
-                                                    kTremorKernelDropped | kTremorMustScanSubdirs));
-            reconcileAll(*volume);
-        }
+        for (auto [volume, writer] : volumes)
+            settleLoss(*volume, kTremorKernelDropped | kTremorMustScanSubdirs);
     }
 }
 
-void TremorService::reconcileAll(Volume& volume) {
+void TremorService::settleLoss(Volume& volume, uint32_t flags) {
+    auto dropped = volume.writer->journalDropped(rootPaths(volume), flags);
+    bool settled = dropped.ok();
+    // The first refusal is logged; retries while the disk stays full would only repeat it.
+    if (settled || !volume.lossOwed)
+        publish(volume, std::move(dropped));
+    if (settled)
+        settled = reconcileAll(volume);
+    if (settled == !volume.lossOwed)
+        return;
+    volume.lossOwed = !settled;
+    if (settled) {
+        logInfo("The event journal " + volume.store->directory() +
+                " takes events again; the lost ones were rescanned");
+    }
+    std::lock_guard lock(volumesMutex_);
+    lossOwed_ = std::any_of(volumes_.begin(), volumes_.end(),
+                            [](const auto& other) { return other->lossOwed; });
+}
+
+bool TremorService::reconcileAll(Volume& volume) {
     indexReady_ = false;
-    for (const auto& path : rootPaths(volume))
-        publish(volume, volume.writer->reconcile(path, true));
+    bool journaled = true;
+    for (const auto& path : rootPaths(volume)) {
+        auto events = volume.writer->reconcile(path, true);
+        if (!events.ok() && events.error().domain() == std::string_view(kSqliteErrorDomain))
+            journaled = false;
+        publish(volume, std::move(events));
+    }
     indexReady_ = true;
+    return journaled;
+}
+
+void TremorService::noteUnwatched(Volume& volume, const FileChange& change) {
+    // A tree that is gone or unmounted has nothing left to rescan.
+    if (change.error == ENOENT || change.error == ENODEV) {
+        logError("A tree is not watched: " + change.path);
+        return;
+    }
+    // The backend has said why, once for the watch limit; one line per folder would flood the
+    // log when a large tree is past the limit.
+    logDebug([&] { return "Rescanning rather than watching " + change.path; });
+    struct statx st {};
+    if (!FileStamp::read(change.path, st) || !S_ISDIR(st.stx_mode))
+        return;
+    if (std::find(volume.unwatched.begin(), volume.unwatched.end(), st.stx_ino) !=
+        volume.unwatched.end())
+        return;
+    volume.unwatched.push_back(st.stx_ino);
+    ++unwatchedFolders_;
+}
+
+void TremorService::rescanUnwatched(Volume& volume) {
+    for (size_t i = 0; i < volume.unwatched.size();) {
+        auto events = volume.writer->rescan(volume.unwatched[i]);
+        if (!events.ok() && events.error().domain() != std::string_view(kSqliteErrorDomain)) {
+            // Gone from the trees: whatever took its place is watched when it appears.
+            volume.unwatched.erase(volume.unwatched.begin() + static_cast<ptrdiff_t>(i));
+            --unwatchedFolders_;
+            continue;
+        }
+        const bool failed = !events.ok();
+        publish(volume, std::move(events));
+        if (failed) {
+            settleLoss(volume, kTremorUserDropped | kTremorMustScanSubdirs);
+            return;
+        }
+        ++i;
+    }
 }
 
 void TremorService::publish(const Volume& volume, Result<std::vector<JournalEvent>> events) {
@@ -359,7 +448,7 @@ void TremorService::publish(const Volume& volume, Result<std::vector<JournalEven
 }
 
 uint64_t TremorService::currentEventId() {
-    sync();
+    catchUp();
     std::lock_guard lock(volumesMutex_);
     uint64_t last = 0;
     for (const auto& volume : volumes_) last = std::max(last, volume->store->lastEventId());

@@ -101,7 +101,10 @@ public:
 
     // Returns once every event the kernel queued before the call has been journaled.
     void sync();
-    // The last event ID handed out (after sync), over every volume.
+    // sync(), after rescanning the folders that could not be watched (past the kernel's watch
+    // limit): for a client about to read the journal, so that what changed in them is there.
+    void catchUp();
+    // The last event ID handed out (after catchUp), over every volume.
     uint64_t currentEventId();
     // The UUID of the store of `device` (after sync); empty when no tree of it is watched.
     std::string uuidForDevice(uint32_t device);
@@ -127,9 +130,15 @@ private:
         std::unique_ptr<TremorStore> store;
         // Made (once, under volumesMutex_) when the device is known.
         std::unique_ptr<JournalWriter> writer;
+        // Touched by the journaling thread only, under writeMutex_:
+        // history was lost and the journal could not yet say so (a full disk, say);
+        bool lossOwed = false;
+        // the folders (by inode) that could not be watched, rescanned when changes are asked for.
+        std::vector<uint64_t> unwatched;
     };
     struct Item {
-        enum class Kind { Batch, Barrier, Dropped } kind = Kind::Batch;
+        // Recheck: a journal owes a loss, or has folders that are rescanned rather than watched.
+        enum class Kind { Batch, Barrier, Dropped, Recheck } kind = Kind::Batch;
         std::vector<FileChange> changes;
         uint64_t barrier = 0;
     };
@@ -157,13 +166,25 @@ private:
     void journalLoop();
     void journal(Item& item);
     void publish(const Volume& volume, Result<std::vector<JournalEvent>> events);
-    void reconcileAll(Volume& volume);
+    // Journals that history under every root was lost and brings the index back in step; what
+    // the journal cannot take now stays owed and is settled before anything else is journaled.
+    void settleLoss(Volume& volume, uint32_t flags);
+    // False when the journal refused a write (a tree that vanished is not a failure).
+    bool reconcileAll(Volume& volume);
+    // A folder that could not be watched: its changes are found by rescans instead.
+    void noteUnwatched(Volume& volume, const FileChange& change);
+    void rescanUnwatched(Volume& volume);
+    // sync(), first settling owed losses and, with `rescan`, rescanning unwatched folders.
+    void flush(bool rescan);
 
     const std::string stateDir_;
     const std::unique_ptr<InotifyBackend> backend_;
     const size_t queueLimit_;
     const TremorStoreDirectory::LockWait lockWait_;
     std::atomic<bool> indexReady_{false};
+    // Whether any volume owes a loss or has unwatched folders (read without writeMutex_).
+    std::atomic<bool> lossOwed_{false};
+    std::atomic<size_t> unwatchedFolders_{0};
     std::atomic<bool> stopped_{false};
 
     // Guards volumes_ and roots_.

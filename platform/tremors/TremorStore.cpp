@@ -47,7 +47,15 @@ Result<std::unique_ptr<TremorStore>> TremorStore::open(
 
     std::string database = store->dir_->databasePath();
     if (isTransient(status.error())) {
-        logError("Cannot open the event journal " + database + ": " + status.error().description());
+        const int code = status.error().code() & 0xff;
+        const bool held = status.error().domain() == std::string_view(kSqliteErrorDomain) &&
+                          (code == SQLITE_BUSY || code == SQLITE_LOCKED);
+        // Tamber processes take turns through the directory lock, so this is another program
+        // (a backup, an sqlite3 shell) that kept the database past the busy timeout.
+        std::string why = status.error().description();
+        if (held)
+            why = "another program holds it; try again once it lets go (" + why + ")";
+        logError("Cannot open the event journal " + database + ": " + why);
         return status.error();
     }
     logError("The event journal " + database + " is unusable (" + status.error().description() +
@@ -148,6 +156,15 @@ Status TremorStore::transact(const std::function<Status()>& work) {
             logError("Cannot reread the document-ID counter: " + reloaded.error().description());
     }
     return status;
+}
+
+Status TremorStore::capSizeForTesting(bool capped) {
+    std::lock_guard lock(mutex_);
+    auto pages = db_->queryInt64("PRAGMA page_count");
+    if (!pages.ok())
+        return pages.error();
+    return db_->exec("PRAGMA max_page_count = " +
+                     std::to_string(capped ? pages.value() : int64_t{0xfffffffe}));
 }
 
 // ---- Journal ----

@@ -189,6 +189,10 @@ public:
                                 const std::optional<Bytes>& value);
     Status replaceDocumentAttributes(uint32_t docID, const Attributes& attributes);
 
+    // Tests only: writes that would grow the database file past its current size fail with
+    // SQLITE_FULL, as on a full disk; false lifts the cap again.
+    Status capSizeForTesting(bool capped);
+
 private:
     struct Cursor;
 

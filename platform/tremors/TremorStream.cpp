@@ -67,7 +67,7 @@ bool TremorStream::start() {
     TremorStore* store = service_->storeForDevice(device_);
     if (!store)
         return false;
-    service_->sync();  // what completed before the start is in the history
+    service_->catchUp();  // what completed before the start is in the history
     std::weak_ptr<TremorStream> weak = weak_from_this();
     uint64_t token =
         service_->addListener([weak](uint32_t device, const std::vector<JournalEvent>& events) {

@@ -1,11 +1,14 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <memory>
 #include <string>
 #include <vector>
 
+#include "platform/tremors/SqliteDatabase.h"
 #include "platform/tremors/TremorService.h"
+#include "platform/tremors/TremorStoreDirectory.h"
 #include "tests/cli/TamberProcess.h"
 #include "tests/common/TempDir.h"
 
@@ -111,6 +114,44 @@ TEST_F(JournalLockCommandsTest, AWaitingRunSaysOnceWhomItWaitsForAndGoesOnWhenRe
     EXPECT_EQ(occurrences(run->err(), "waiting for Tamber process"), 1u) << run->err();
     EXPECT_EQ(occurrences(run->err(), "is held by Tamber process " + std::to_string(getpid())), 1u)
         << run->err();
+}
+
+// Not a Tamber process but another program (a backup, the sqlite3 shell) holds the journal's
+// database past the busy timeout: the verb fails with one clear line instead of hanging, the
+// journal is kept, and the next run works once the program lets go.
+TEST_F(JournalLockCommandsTest, ADatabaseHeldByAnotherProgramFailsOnceAndTheNextRunWorks) {
+    auto first = start({"ls", "root"});
+    ASSERT_EQ(first->finish(), 0) << first->err();
+    std::string database;
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(stateDir())) {
+        if (entry.path().filename() == TremorStoreDirectory::kDatabaseName)
+            database = entry.path();
+    }
+    ASSERT_FALSE(database.empty());
+    auto other = SqliteDatabase::open(database, SQLITE_OPEN_READWRITE);
+    ASSERT_TRUE(other.ok());
+    ASSERT_TRUE(other.value()->exec("BEGIN EXCLUSIVE").ok());
+
+    auto run = start({"--verbose", "ls", "root"});
+    int status = run->finish(60);
+    EXPECT_NE(status, -1) << "hung or crashed: " << run->err();
+    EXPECT_NE(status, 0) << run->out();
+    EXPECT_EQ(occurrences(run->err(), "[ERROR]"), 1u) << run->err();
+    EXPECT_EQ(occurrences(run->err(), "[ERROR] Cannot open the event journal " + database +
+                                          ": another program holds it"),
+              1u)
+        << run->err();
+    EXPECT_EQ(occurrences(run->err(), "moving it aside"), 0u) << run->err();
+
+    ASSERT_TRUE(other.value()->exec("COMMIT").ok());
+    other.value().reset();
+    run = start({"ls", "root"});
+    EXPECT_EQ(run->finish(), 0) << run->err();
+    EXPECT_NE(run->out().find("a.txt"), std::string::npos) << run->out();
+    for (const auto& entry :
+         std::filesystem::directory_iterator(std::filesystem::path(database).parent_path()))
+        EXPECT_EQ(entry.path().string().find(".corrupt-"), std::string::npos)
+            << "the held journal was replaced: " << entry.path();
 }
 
 }  // namespace

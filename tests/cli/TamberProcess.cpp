@@ -99,6 +99,20 @@ bool TamberProcess::waitForError(const std::string& text, int seconds) {
     return true;
 }
 
+bool TamberProcess::waitForOutput(const std::string& text, int seconds) {
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
+    while (out_.find(text) == std::string::npos) {
+        if (std::chrono::steady_clock::now() >= deadline || !pump(100))
+            return out_.find(text) != std::string::npos;
+    }
+    return true;
+}
+
+void TamberProcess::sendSignal(int signal) {
+    if (pid_ > 0)
+        ::kill(pid_, signal);
+}
+
 int TamberProcess::finish(int seconds) {
     if (pid_ <= 0)
         return -1;
@@ -114,9 +128,11 @@ int TamberProcess::finish(int seconds) {
         ::kill(pid_, SIGKILL);
         ::waitpid(pid_, nullptr, 0);
         pid_ = -1;
+        timedOut_ = true;
         return -1;
     }
     pid_ = -1;
+    termSignal_ = WIFSIGNALED(status) ? WTERMSIG(status) : 0;
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 

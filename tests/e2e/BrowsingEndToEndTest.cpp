@@ -1,3 +1,7 @@
+#include <cerrno>
+
+#include "tests/common/FaultyInotifyApi.h"
+#include "tests/common/ScopedLogCapture.h"
 #include "tests/e2e/EndToEndHost.h"
 
 namespace tamber {
@@ -56,6 +60,50 @@ TEST_F(BrowsingEndToEndTest, TheHostsViewMatchesTheDiskAfterCatchingUp) {
     Replica before = replica;
     catchUp(anchor);
     expectSameView(replica, before, "after a request with nothing new");
+}
+
+// The kernel's watch limit is reached: a folder of the storage is not watched, yet the host
+// still lists it and, catching up, learns what changed in it.
+class WatchLimitEndToEndTest : public EndToEndHost {
+protected:
+    WatchLimitEndToEndTest() { inotify = faulty; }
+    std::shared_ptr<FaultyInotifyApi> faulty = std::make_shared<FaultyInotifyApi>();
+};
+
+TEST_F(WatchLimitEndToEndTest, AFolderPastTheLimitIsListedAndItsChangesReachTheHost) {
+    ScopedLogCapture log;
+    faulty->failAddWatch("/Full", ENOSPC);
+    fs::create_directories(storage + "/Full/Inner");
+    write(storage + "/Full/before.txt", "b");
+    write(storage + "/Full/Inner/doomed.txt", "d");
+
+    auto made =
+        porter->enumeratorForContainerItemIdentifier(HostPorterWorkingSetContainerItemIdentifier);
+    ASSERT_TRUE(made.ok()) << made.error().description();
+    enumerator = made.value();
+    HostPorterSyncAnchor anchor = currentAnchor();
+    catchUp(anchor);
+    listEverything();
+    expectSameView(replica, disk(), "after listing");
+    ASSERT_TRUE(replica.contains(
+        LocalItem::make(Url::fileURLWithPath(storage + "/Full/before.txt"))->itemIdentifier()));
+
+    write(storage + "/Full/created.txt", "new");
+    fs::create_directories(storage + "/Full/Inner/Deeper");
+    write(storage + "/Full/Inner/Deeper/deep.txt", "deep");
+    fs::rename(storage + "/Full/before.txt", storage + "/Full/Inner/after.txt");
+    fs::remove(storage + "/Full/Inner/doomed.txt");
+    catchUp(anchor);
+    expectSameView(replica, disk(), "after catching up");
+
+    size_t limitLines = 0;
+    for (const auto& line : log->lines()) {
+        if (line.level != LogLevel::Error)
+            continue;
+        EXPECT_NE(line.text.find("fs.inotify.max_user_watches"), std::string::npos) << line.text;
+        ++limitLines;
+    }
+    EXPECT_EQ(limitLines, 1u);
 }
 
 }  // namespace

@@ -98,7 +98,7 @@ protected:
     void SetUp() override {
         AppLibraryTest::SetUp();
         TremorService::resetForTesting();
-        TremorService::configure(state.path());
+        TremorService::configure(state.path(), inotify);
         storage = host->documentStorageURL().path();
         install({"com.example.notes"});
         library = documents("com.example.notes").path();
@@ -215,6 +215,8 @@ protected:
     std::shared_ptr<LocalPorter> porter;
     HostPorterEnumeratorRef enumerator;
     Replica replica;
+    // The journal's inotify calls; a test may put a faulty one here before SetUp.
+    std::shared_ptr<InotifyApi> inotify = InotifyApi::system();
 };
 
 }  // namespace tamber::testing

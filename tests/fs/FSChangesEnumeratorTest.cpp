@@ -1,7 +1,10 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <filesystem>
+#include <functional>
 #include <thread>
+#include <utility>
 
 #include "fs/FSChangesEnumerator.h"
 #include "items/TBFileObjectIdentifier.h"
@@ -171,6 +174,46 @@ TEST_F(FSChangesEnumeratorTest, BothPassesCountTogetherAndTheAnchorMovesToTheLas
     EXPECT_EQ(observer->anchor, tokenSince(last, 0));
     EXPECT_EQ(log->count("[DEBUG] forward update of ", LogLevel::Debug), 0u);
     EXPECT_EQ(log->countStartingWith("[DEBUG] forward update of <LocalItem:"), 1u);
+}
+
+// Events journaled while the path-based pass runs lie past its end; the document-ID pass that
+// follows reads further. The anchor must not move past path events no pass reported, or the
+// next request never sends them.
+TEST_F(FSChangesEnumeratorTest, APathEventJournaledDuringThePathPassIsNotSkipped) {
+    std::string a = write("a.txt");
+    std::string b = write("b.txt");
+    auto idB = TBFileObjectIdentifier::itemIdentifier(Url::fileURLWithPath(b));
+    ASSERT_TRUE(idB);
+    uint64_t since = currentID();
+    journal({{0, a, 0, 0}});
+    class JournalingObserver : public RecordingObserver {
+    public:
+        std::function<void()> onFirstUpdate;
+        void didUpdateItems(const std::vector<HostPorterItemRef>& items) override {
+            if (auto hook = std::exchange(onFirstUpdate, nullptr))
+                hook();
+            RecordingObserver::didUpdateItems(items);
+        }
+    };
+    auto observer = std::make_shared<JournalingObserver>();
+    const std::string deletedDocument =
+        "/.docid/" + std::to_string(device()) + "/changed/9/src=1,dst=0";
+    observer->onFirstUpdate = [&] {
+        std::vector<JournalEvent> events{{0, b, 0, 0}, {0, deletedDocument, 0, 0}};
+        EXPECT_TRUE(store().append(events).ok());
+    };
+    auto enumerator = FSChangesEnumerator::make(
+        tokenSince(since), HostPorterRootContainerItemIdentifier, {storageURL()}, observer);
+    enumerator->start();
+    ASSERT_TRUE(observer->waitForFinish());
+    enumerator->stop();
+    ASSERT_TRUE(observer->anchor) << (observer->error ? observer->error->description() : "");
+
+    auto next = request(*observer->anchor);
+    auto all = observer->updates;
+    all.insert(all.end(), next->updates.begin(), next->updates.end());
+    EXPECT_NE(std::find(all.begin(), all.end(), *idB), all.end())
+        << "the change to b.txt was never sent";
 }
 
 TEST_F(FSChangesEnumeratorTest, LostHistoryInEitherPassExpiresTheAnchor) {

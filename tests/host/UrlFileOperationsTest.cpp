@@ -220,6 +220,36 @@ TEST(ImportTest, FallsBackToReadingAndWritingWhenTheKernelCannotCopy) {
     EXPECT_GT(failing->calls(Op::Write), 0u);
 }
 
+// The disk fills part-way through the copy the kernel could not make itself: nothing of the
+// import stays in the folder, the staging copy included.
+TEST(ImportTest, AFallbackCopyThatFillsTheDiskLeavesNothingBehind) {
+    TempDir dir;
+    std::string file = dir.writeFile("in/big.bin", std::string(300000, 'x'));
+    std::string docs = dir.makeDir("Documents");
+    dir.writeFile("Documents/keep.txt", "k");
+    class FillingDisk : public FaultInjectingFileSystem {
+    public:
+        using FaultInjectingFileSystem::FaultInjectingFileSystem;
+        ssize_t write(int fd, const void* buffer, size_t size) override {
+            if (++writes_ > 1) {  // the first block fits, the next does not
+                errno = ENOSPC;
+                return -1;
+            }
+            return FaultInjectingFileSystem::write(fd, buffer, size);
+        }
+
+    private:
+        int writes_ = 0;
+    };
+    auto failing = std::make_shared<FillingDisk>(std::make_shared<LinuxFileSystem>());
+    testing::ScopedFileSystem scoped(failing);
+    failing->inject(Op::CopyFileRange, EXDEV, -1);
+    Outcome o = run([&](auto done) { pt_importUnderFolder(at(file), at(docs), done); });
+    failing->clearInjections();
+    EXPECT_EQ(o.error, Error::posix(ENOSPC));
+    EXPECT_EQ(tree(docs), std::set<std::string>{"keep.txt=k"});
+}
+
 TEST(CreateFolderTest, BouncesTakenNames) {
     TempDir dir;
     std::string docs = dir.makeDir("Documents");

@@ -131,6 +131,52 @@ TEST_F(MetadataTest, UnknownIdentifiersFailOnceWithNoSuchItem) {
     EXPECT_EQ(log->countStartingWith("[ERROR] can't find URL for item; "), 2u);
 }
 
+// The disk fills while metadata is written: every update fails with ENOSPC and the item keeps
+// each old value, the desktop's copy of the tags included.
+TEST_F(MetadataTest, OnAFullDiskEveryUpdateFailsAndTheOldValuesStand) {
+    std::string file = writeFile(library + "/a.txt");
+    HostPorterItemIdentifier identifier = identifierOf(file);
+    Url url = Url::fileURLWithPath(file);
+    ItemOutcome before;
+    porter->setTagData(GetTagsDataForTags({Tag::make("Old")}), identifier, before.handler());
+    porter->setFavoriteRank(Number::fromInt64(1), identifier, before.handler());
+    porter->setLastUsedDate(Date::make(100), identifier, before.handler());
+    ASSERT_EQ(before.calls, 3);
+    ASSERT_FALSE(before.error);
+    auto desktopList = ReadXattrData(XdgTagList::attributeName(), url);
+    ASSERT_TRUE(desktopList);
+
+    auto faults = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    ScopedFileSystem scoped(faults);
+    faults->inject(FaultInjectingFileSystem::Operation::Fsetxattr, ENOSPC, -1);
+    ItemOutcome tags, rank, date;
+    porter->setTagData(GetTagsDataForTags({Tag::make("New"), Tag::make("Newer")}), identifier,
+                       tags.handler());
+    porter->setFavoriteRank(Number::fromInt64(5), identifier, rank.handler());
+    porter->setLastUsedDate(Date::make(200), identifier, date.handler());
+    for (ItemOutcome* outcome : {&tags, &rank, &date}) {
+        EXPECT_EQ(outcome->calls, 1);
+        EXPECT_FALSE(outcome->item);
+        ASSERT_TRUE(outcome->error);
+        EXPECT_TRUE(outcome->error->is(kPosixErrorDomain, ENOSPC)) << outcome->error->description();
+    }
+    faults->clearInjections();
+
+    EXPECT_EQ(ItemMetadata::readTagLabels(url), std::vector<std::string>{"Old"});
+    EXPECT_EQ(ReadXattrData(XdgTagList::attributeName(), url), desktopList)
+        << "the desktop's tags changed although the item's did not";
+    ASSERT_TRUE(ItemMetadata::readFavoriteRank(url));
+    EXPECT_EQ(ItemMetadata::readFavoriteRank(url)->int64Value(), 1);
+    ASSERT_TRUE(ItemMetadata::readLastUsedDate(url));
+    EXPECT_EQ(ItemMetadata::readLastUsedDate(url)->timeIntervalSince1970(), 100);
+    // And the record the host gets next says the same.
+    ItemOutcome after;
+    porter->setFavoriteRank(Number::fromInt64(1), identifier, after.handler());
+    ASSERT_TRUE(after.item) << after.error->description();
+    ASSERT_TRUE(after.item->lastUsedDate());
+    EXPECT_EQ(after.item->lastUsedDate()->timeIntervalSince1970(), 100);
+}
+
 TEST_F(MetadataTest, FailedWritesAreLoggedAndFailTheUpdate) {
     std::string file = writeFile(library + "/a.txt");
     HostPorterItemIdentifier identifier = identifierOf(file);

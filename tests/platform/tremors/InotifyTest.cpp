@@ -23,6 +23,7 @@
 #include "platform/tremors/InotifyBackend.h"
 #include "platform/tremors/InotifyTranslator.h"
 #include "platform/tremors/LinuxInotifyApi.h"
+#include "tests/common/FaultyInotifyApi.h"
 #include "tests/common/ScopedFileSystem.h"
 #include "tests/common/ScopedLogCapture.h"
 #include "tests/common/TempDir.h"
@@ -193,37 +194,6 @@ TEST_F(InotifyTranslatorTest, ImpossibleRecordsStopTheTranslation) {
     }
 }
 
-// The real calls, except add_watch for directories whose path contains one of the given
-// strings. Watches are added through "/proc/self/fd/N/.", so the descriptor is resolved first.
-class FaultyInotifyApi : public LinuxInotifyApi {
-public:
-    void failAddWatch(std::string pathSubstring, int error) {
-        std::lock_guard lock(mutex_);
-        failures_[std::move(pathSubstring)] = error;
-    }
-    int addWatch(int fd, const std::string& path, uint32_t mask) override {
-        std::string target = path;
-        if (path.starts_with("/proc/self/fd/")) {
-            char link[4096];
-            ssize_t n = ::readlink(path.substr(0, path.find('/', 14)).c_str(), link, sizeof link);
-            if (n >= 0)
-                target.assign(link, static_cast<size_t>(n));
-        }
-        std::lock_guard lock(mutex_);
-        for (const auto& [substring, error] : failures_) {
-            if (target.find(substring) != std::string::npos) {
-                errno = error;
-                return -1;
-            }
-        }
-        return LinuxInotifyApi::addWatch(fd, path, mask);
-    }
-
-private:
-    std::mutex mutex_;
-    std::map<std::string, int> failures_;
-};
-
 // The real calls, except that a read ending in the first half of a rename holds the second
 // half back until the next poll that waits: what a reader sees when it reads between the two
 // halves, which the kernel queues one after the other.
@@ -393,12 +363,12 @@ TEST_F(InotifyBackendTest, AWatchThatCannotBeAddedIsReportedAndTheRestIsWatched)
     ScopedLogCapture log;
     fs::create_directories(path("ok"));
     fs::create_directories(path("blocked/inner"));
-    api_->failAddWatch("/blocked", ENOSPC);
+    api_->failAddWatch("/blocked", EACCES);
     Changes discovered;
     EXPECT_TRUE(backend_->watchTree(root_, discovered).ok());
-    EXPECT_EQ(discovered, (Changes{watchFailed(path("blocked"), ENOSPC)}));
-    EXPECT_EQ(log->count("[ERROR] Cannot watch " + path("blocked") + ": [28: " +
-                             std::strerror(ENOSPC) + "]; changes in that tree are not journaled",
+    EXPECT_EQ(discovered, (Changes{watchFailed(path("blocked"), EACCES)}));
+    EXPECT_EQ(log->count("[ERROR] Cannot watch " + path("blocked") + ": [13: " +
+                             std::strerror(EACCES) + "]; changes in that tree are not journaled",
                          LogLevel::Error),
               1u);
     EXPECT_EQ(backend_->watchCount(), 2u);
@@ -415,11 +385,38 @@ TEST_F(InotifyBackendTest, AWatchThatCannotBeAddedIsReportedAndTheRestIsWatched)
     }
 
     // The same for a directory that appears later.
-    api_->failAddWatch("/fresh", ENOSPC);
+    api_->failAddWatch("/fresh", EACCES);
     fs::create_directory(path("fresh"));
     EXPECT_TRUE(
-        inOrder(drain(), {created(path("fresh"), true), watchFailed(path("fresh"), ENOSPC)}));
-    EXPECT_EQ(log->countStartingWith("[ERROR] Cannot watch " + path("fresh") + ": [28: "), 1u);
+        inOrder(drain(), {created(path("fresh"), true), watchFailed(path("fresh"), EACCES)}));
+    EXPECT_EQ(log->countStartingWith("[ERROR] Cannot watch " + path("fresh") + ": [13: "), 1u);
+}
+
+// Past the kernel's watch limit every further folder fails alike: the log says once which
+// limit it is and how to raise it, not once per folder of a large tree.
+TEST_F(InotifyBackendTest, TheWatchLimitIsLoggedOnceWithHowToRaiseIt) {
+    ScopedLogCapture log;
+    for (const char* folder : {"full/a", "full/b", "full/c/d"})
+        fs::create_directories(path(folder));
+    api_->failAddWatch("/full/", ENOSPC);
+    Changes discovered;
+    EXPECT_TRUE(backend_->watchTree(root_, discovered).ok());
+    EXPECT_EQ(discovered.size(), 3u) << ::testing::PrintToString(discovered);
+    for (const FileChange& change : discovered) {
+        EXPECT_EQ(change.kind, Kind::WatchFailed);
+        EXPECT_EQ(change.error, ENOSPC);
+    }
+    fs::create_directory(path("full/later"));
+    EXPECT_TRUE(inOrder(drain(), {watchFailed(path("full/later"), ENOSPC)}));
+
+    std::vector<std::string> errors;
+    for (const auto& line : log->lines()) {
+        if (line.level == LogLevel::Error)
+            errors.push_back(line.text);
+    }
+    ASSERT_EQ(errors.size(), 1u) << ::testing::PrintToString(errors);
+    EXPECT_NE(errors[0].find("fs.inotify.max_user_watches"), std::string::npos) << errors[0];
+    EXPECT_NE(errors[0].find("sysctl"), std::string::npos) << errors[0];
 }
 
 // A read that ends between the two halves of a rename must not take the first for a move out
