@@ -6,7 +6,9 @@
 // - reading is settled after one read: a second read gives the same metadata (taking in the
 //   desktop's list happens once);
 // - what was read, written back through the one writer, reads back equal;
-// - the tag labels are the labels of the tag data.
+// - the tag labels are the labels of the tag data;
+// - the record's put-back location, read from the attribute whatever it holds, is one only
+//   with a put-back attribute, and always strictly inside the library that holds the file.
 #include <sys/xattr.h>
 
 #include <cerrno>
@@ -26,6 +28,7 @@
 #include "items/XdgTagList.h"
 #include "platform/Tag.h"
 #include "platform/strata/StrataService.h"
+#include "provider/TrashLocations.h"
 
 using namespace tamber;
 
@@ -61,7 +64,10 @@ const std::vector<std::string>& attributeNames() {
 const std::string& itemPath() {
     static const std::string path = [] {
         fuzz::silenceLog();
-        std::string storage = fuzz::scratchFolder("metadata") + "/storage";
+        // The app libraries (none) are read from a cache of the scratch folder's.
+        ::setenv("XDG_DATA_HOME", (fuzz::scratchFolder("metadata") + "/data").c_str(), 1);
+        installPutBackResolver();
+        std::string storage = fuzz::scratchFolder(nullptr) + "/storage";
         std::filesystem::create_directories(storage);
         std::string file = storage + "/item.txt";
         std::ofstream(file) << "contents";
@@ -114,6 +120,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     check(item != nullptr);
     check(same(item->lastUsedDate(), settled.lastUsedDate) && item->tagData() == settled.tagData &&
           same(item->favoriteRank(), settled.favoriteRank));
+
+    if (auto back = item->putBackURL()) {
+        const std::string storage = fuzz::scratchFolder(nullptr) + "/storage/";
+        check(settled.putBack && back->isFileURL() && back->path().starts_with(storage) &&
+              back->path().size() > storage.size());
+    }
 
     check(ItemMetadata::writeLastUsedDate(url, settled.lastUsedDate).ok());
     check(ItemMetadata::writeFavoriteRank(url, settled.favoriteRank).ok());

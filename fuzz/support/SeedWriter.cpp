@@ -205,6 +205,14 @@ void itemMetadata(const std::string& scratch) {
         write("item_metadata", "trashed", attributeRecords(path));
     }
     {
+        // Attributes travel with a file: this one was trashed somewhere else entirely.
+        std::string path = item();
+        Url url = Url::fileURLWithPath(path);
+        ItemMetadata::writeTrashDate(url, Date::make(1.0e9));
+        ItemMetadata::writePutBack(url, String::make("a/../../../etc/passwd"));
+        write("item_metadata", "put_back_climbing", attributeRecords(path));
+    }
+    {
         // The desktop's list changed by another program after Tamber wrote its tags.
         std::string path = item();
         Url url = Url::fileURLWithPath(path);
