@@ -6,7 +6,9 @@
 // error; none may crash or hang, and what the store does answer must make sense:
 // - a replay yields events in rising ID order, after the ID asked for and not past the last;
 // - a path from the index is absolute and made of real names (no empty, "." or ".." part, so
-//   no row can make a path climb out of its root).
+//   no row can make a path climb out of its root);
+// - IDs are never handed out twice: an event appended afterwards is the one journaled at its
+//   ID, and a document ID allocated afterwards names the inode it was allocated for.
 #include <sqlite3.h>
 
 #include <cstdint>
@@ -203,6 +205,33 @@ void checkLookups(TremorStore& store, uint64_t inode, uint32_t document) {
     (void)store.rememberedRoots();
 }
 
+// Whatever the rows held, new IDs go to new things only. Failing is an answer too.
+void checkNewIds(TremorStore& store, uint64_t inode) {
+    std::vector<JournalEvent> events = {{0, "/w/appended", 7, 0x100}};
+    auto appended = store.append(events);
+    if (appended.ok()) {
+        const uint64_t id = appended.value();
+        check(id >= 1 && id <= TremorStore::kLastEventId && id == store.lastEventId());
+        std::vector<JournalEvent> found;
+        Status status = store.replay(id - 1, {}, 0, [&](const JournalEvent& event) {
+            found.push_back(event);
+            return found.size() < 2;
+        });
+        if (status.ok())
+            check(found.size() == 1 && found[0].id == id && found[0].path == "/w/appended");
+    }
+    auto document = store.allocateDocumentId(inode);
+    if (document.ok()) {
+        check(document.value() != 0);
+        auto held = store.inodeForDocumentId(document.value());
+        if (held.ok())
+            check(held.value() == inode);
+        auto back = store.documentIdForInode(inode);
+        if (back.ok())
+            check(back.value() == document.value());
+    }
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -226,5 +255,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     checkReplay(store, mixed % 16, {"/w"}, 1 + mixed % 5);
     checkReplay(store, mixed, {"/x", "/w/a"}, 2);
     checkLookups(store, inode, static_cast<uint32_t>(mixed));
+    checkNewIds(store, inode);
     return 0;
 }
