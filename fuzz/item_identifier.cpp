@@ -7,7 +7,8 @@
 //   the host's helper says so;
 // - only a root, file or document identifier yields a URL, and every URL yielded is a root or
 //   lies in a folder that really is inside a published tree (or would be, were it made): no
-//   "..", link or look-alike sibling folder leads out.
+//   "..", link or look-alike sibling folder leads out; nor does the way to it pass through a
+//   link, even one that leads back inside.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -124,6 +125,21 @@ bool reallyInside(const std::string& path, const Trees& t) {
     return atOrBelow(resolved.string(), t.storage) || atOrBelow(resolved.string(), t.library);
 }
 
+// Whether `path` lies lexically below `root` with no symbolic link among the folders between
+// them: the published trees are walked beneath their roots without following any link.
+bool linkFreeBelow(const std::string& path, const std::string& root) {
+    if (!atOrBelow(path, root))
+        return false;
+    for (std::string folder = std::filesystem::path(path).parent_path().string();
+         folder.size() > root.size();
+         folder = std::filesystem::path(folder).parent_path().string()) {
+        struct stat status;
+        if (::lstat(folder.c_str(), &status) == 0 && S_ISLNK(status.st_mode))
+            return false;
+    }
+    return true;
+}
+
 void checkReading(const std::string& identifier) {
     ItemIdentifier parsed = ItemIdentifier::parse(identifier);
     if (parsed.isContainer() != isHostContainerIdentifier(identifier))
@@ -173,7 +189,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     const bool named = parsed.kind() == ItemIdentifier::Kind::RootContainer ||
                        parsed.kind() == ItemIdentifier::Kind::File ||
                        parsed.kind() == ItemIdentifier::Kind::Document;
-    if (!named || !url->isFileURL() || !reallyInside(url->path(), t))
+    if (!named || !url->isFileURL() || !reallyInside(url->path(), t) ||
+        !(linkFreeBelow(url->path(), t.storage) || linkFreeBelow(url->path(), t.library)))
         std::abort();
     return 0;
 }
