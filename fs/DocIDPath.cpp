@@ -16,10 +16,15 @@ std::string rootNameWithSlash() {
     return std::string(kTremorDocumentIdRoot + 1) + "/";
 }
 
-bool readNumber(const char*& cursor, int64_t& value) {
+bool readNumber(const char*& cursor, uint64_t& value) {
+    // strtoull would take "-1" for the largest number: another inode altogether.
+    const char* first = cursor;
+    while (std::isspace(static_cast<unsigned char>(*first))) ++first;
+    if (*first == '-')
+        return false;
     errno = 0;
     char* end = nullptr;
-    long long number = std::strtoll(cursor, &end, 10);
+    unsigned long long number = std::strtoull(cursor, &end, 10);
     if (errno != 0)
         return false;
     value = number;
@@ -45,7 +50,7 @@ std::optional<DocIDPath> DocIDPath::parse(const std::string& path) {
     if (!readLiteral(cursor, end, rootNameWithSlash().c_str()))
         return std::nullopt;
     if (cursor < end && std::isdigit(static_cast<unsigned char>(*cursor))) {
-        int64_t device = 0;  // not used: the stream already chose the device
+        uint64_t device = 0;  // not used: the stream already chose the device
         if (!readNumber(cursor, device) || !readLiteral(cursor, end, "/"))
             return std::nullopt;
     }

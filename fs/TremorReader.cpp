@@ -328,7 +328,7 @@ void TremorReader::processDocIDEvent(const std::string& path, uint64_t eventID) 
         return;
     }
     HostPorterItemIdentifier identifier =
-        TBPFileObjectIdentifier::fromDocumentID(static_cast<uint64_t>(parsed->documentID));
+        TBPFileObjectIdentifier::fromDocumentID(parsed->documentID);
     if (parsed->destination == 0) {
         if (verbose_)
             logDebug([&] { return "did delete " + identifier; });
@@ -337,8 +337,7 @@ void TremorReader::processDocIDEvent(const std::string& path, uint64_t eventID) 
         recordEventID(eventID);
         return;
     }
-    auto url = TBFileObjectIdentifier::fileURLWithFileIdentifier(
-        static_cast<uint64_t>(parsed->destination));
+    auto url = TBFileObjectIdentifier::fileURLWithFileIdentifier(parsed->destination);
     if (!url) {
         if (verbose_)
             logDebug([&] { return "can't compute url for " + identifier; });

@@ -1,5 +1,6 @@
 // Feeds arbitrary bytes to the sync-anchor and page-token decoder. A token that decodes must
-// encode back to a token equal to it, and its event ID, whatever its value, must lead to a
+// encode back to a token equal to it, and never to (nor from) one of the two fixed first pages
+// a listing starts from; its event ID, whatever its value, must lead to a
 // replay decision and a replay that end: nothing at or before the ID, nothing past the
 // journal's last event, and a replay from past the end judged incomplete.
 #include <unistd.h>
@@ -12,6 +13,7 @@
 #include <vector>
 
 #include "fs/FSChangeToken.h"
+#include "host/HostPorterPage.h"
 #include "platform/tremors/TremorStore.h"
 #include "support/Log.h"
 
@@ -69,11 +71,14 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
         return true;
     }();
     (void)quiet;
-    auto token = FSChangeToken::decode(Bytes(data, data + size));
+    const Bytes input(data, data + size);
+    auto token = FSChangeToken::decode(input);
     if (!token)
         return 0;
-    auto again = FSChangeToken::decode(token->encode());
-    if (!again || !(*again == *token))
+    const Bytes encoded = token->encode();
+    auto again = FSChangeToken::decode(encoded);
+    if (!again || !(*again == *token) || isHostPorterInitialPage(input) ||
+        isHostPorterInitialPage(encoded))
         std::abort();
 
     Journal& j = openJournal();

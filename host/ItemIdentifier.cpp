@@ -6,9 +6,12 @@ namespace tamber {
 
 namespace {
 
-// The whole of `digits` as a number: no sign, no space, no trailing text, no overflow.
+// The whole of `digits` as a number: no sign, no space, no trailing text, no overflow, and no
+// leading zero ("fid=04" would be a second identifier for the item "fid=4").
 bool parseNumber(std::string_view digits, uint64_t& value) {
     if (digits.empty() || digits.front() < '0' || digits.front() > '9')
+        return false;
+    if (digits.size() > 1 && digits.front() == '0')
         return false;
     auto [end, ec] = std::from_chars(digits.data(), digits.data() + digits.size(), value);
     return ec == std::errc() && end == digits.data() + digits.size();

@@ -20,7 +20,8 @@ public:
         WorkingSet,
         AllDirectories,
         TemporaryFolder,
-        File,        // "fid=N": N a file ID, decimal digits only, in range of 64 bits
+        File,        // "fid=N": N a file ID, decimal digits only (no leading zero), in range
+                     // of 64 bits
         Document,    // "did=N": N a document ID, likewise
         AppLibrary,  // "#" and a non-empty bundle identifier without NUL
     };

@@ -166,7 +166,8 @@ std::optional<Tags> takeInDesktopList(const Url& url) {
     auto theirs = desktopListIfChanged(url, changed);
     if (!changed)
         return std::nullopt;
-    Tags ours = ItemMetadata::readTags(url).value_or(Tags{});
+    const std::optional<Tags> stored = ItemMetadata::readTags(url);
+    Tags ours = stored.value_or(Tags{});
     std::vector<std::string> listed;
     if (theirs)
         listed = XdgTagList::parse(
@@ -179,6 +180,9 @@ std::optional<Tags> takeInDesktopList(const Url& url) {
             noteIt(fd);
             return true;
         });
+        // Nothing written: a file without tags of ours reads as untagged, as it will next time.
+        if (!stored)
+            return std::nullopt;
     } else {
         // Should the write fail (logged), the record still shows what the desktop holds.
         (void)writeTags(url, merged, noteIt);

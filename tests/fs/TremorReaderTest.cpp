@@ -9,6 +9,7 @@
 #include "fs/DocIDPath.h"
 #include "fs/TremorReader.h"
 #include "items/TBFileObjectIdentifier.h"
+#include "platform/tremors/JournalWriter.h"
 #include "platform/tremors/TremorFlags.h"
 #include "tests/common/Sanitizers.h"
 #include "tests/fs/FsTest.h"
@@ -32,17 +33,17 @@ std::string docIDPath(uint32_t device, uint64_t doc, uint64_t src, uint64_t dst)
 TEST(DocIDPathTest, AcceptsTheGrammarAndNothingAroundIt) {
     auto full = DocIDPath::parse("/.docid/5/changed/42/src=7,dst=0");
     ASSERT_TRUE(full);
-    EXPECT_EQ(full->documentID, 42);
-    EXPECT_EQ(full->source, 7);
-    EXPECT_EQ(full->destination, 0);
+    EXPECT_EQ(full->documentID, 42u);
+    EXPECT_EQ(full->source, 7u);
+    EXPECT_EQ(full->destination, 0u);
     auto bare = DocIDPath::parse(".docid/changed/43/src=1,dst=9");
     ASSERT_TRUE(bare);
-    EXPECT_EQ(bare->documentID, 43);
-    EXPECT_EQ(bare->destination, 9);
+    EXPECT_EQ(bare->documentID, 43u);
+    EXPECT_EQ(bare->destination, 9u);
     // Leading slashes are skipped; a number without digits reads 0.
     auto empty = DocIDPath::parse("///.docid/changed/1/src=,dst=2");
     ASSERT_TRUE(empty);
-    EXPECT_EQ(empty->source, 0);
+    EXPECT_EQ(empty->source, 0u);
 
     for (std::string bad : {
              "/.docid/5/changed/42/src=7,dst=0x",                   // trailing text
@@ -59,6 +60,31 @@ TEST(DocIDPathTest, AcceptsTheGrammarAndNothingAroundIt) {
         EXPECT_FALSE(DocIDPath::parse(bad)) << bad;
     }
     EXPECT_FALSE(DocIDPath::parse(std::string("/.docid/changed/1/src=1,dst=2\0x", 32)));
+}
+
+// Inode numbers use all 64 bits on some file systems (overlay's high bits, 64-bit tmpfs): a
+// path the journal wrote for one must read back, or the document's change is lost.
+TEST(DocIDPathTest, ReadsBackEveryPathTheJournalWrites) {
+    struct Numbers {
+        uint32_t device;
+        uint32_t document;
+        uint64_t source;
+        uint64_t destination;
+    };
+    for (const Numbers& n :
+         {Numbers{2049, 42, 7, 9}, Numbers{1, 3, (1ull << 63) + 5, 12},
+          Numbers{0, UINT32_MAX, UINT64_MAX, UINT64_MAX}, Numbers{64769, 8, 11, (1ull << 63)}}) {
+        std::string path =
+            JournalWriter::documentIdPath(n.device, n.document, n.source, n.destination);
+        auto parsed = DocIDPath::parse(path);
+        ASSERT_TRUE(parsed) << path;
+        EXPECT_EQ(parsed->documentID, n.document) << path;
+        EXPECT_EQ(parsed->source, n.source) << path;
+        EXPECT_EQ(parsed->destination, n.destination) << path;
+    }
+    // The journal never writes a sign; one would wrap round to another inode.
+    EXPECT_FALSE(DocIDPath::parse("/.docid/5/changed/42/src=-7,dst=0"));
+    EXPECT_FALSE(DocIDPath::parse("/.docid/5/changed/42/src=7,dst=-1"));
 }
 
 // Events journaled by the test replay through a real stream, in ID order.

@@ -59,6 +59,8 @@ TEST(ItemIdentifierTest, HostileStringsAreInvalid) {
         "did=99999999999999999999999",
         "did=1x",
         "fid=0x10",
+        "fid=04",  // another spelling of "fid=4": one item, one identifier
+        "did=00",
         "fid=1=2",
         "FID=1",
         "fid",

@@ -173,6 +173,16 @@ TEST_F(DesktopTagsTest, AListSetBeforeTamberEverTaggedIsTakenIn) {
     EXPECT_EQ(storedTags(), (Coloured{{"from desktop", 0}}));
 }
 
+// A list that holds no label, on a file Tamber never tagged, leaves it untagged: the record
+// says the same on the read that takes the list in and on every read after.
+TEST_F(DesktopTagsTest, AnEmptyForeignListGivesTheSameRecordOnEveryRead) {
+    setByAnotherProgram(" , ");
+    std::optional<Bytes> first = ItemMetadata::read(file).tagData;
+    std::optional<Bytes> second = ItemMetadata::read(file).tagData;
+    EXPECT_EQ(first, second);
+    EXPECT_EQ(first, std::nullopt);
+}
+
 TEST_F(DesktopTagsTest, TagsFromBeforeTheDesktopListAreNotTakenForARemoval) {
     // Tamber's attribute alone, as files tagged by earlier versions have it.
     ASSERT_TRUE(ItemMetadata::writeTagData(file, tagDataOf({{"Kept", 0}})).ok());
