@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <sys/eventfd.h>
 
+#include <algorithm>
 #include <cerrno>
 
 #include "platform/FileSystem.h"
@@ -82,8 +83,11 @@ Status InotifyBackend::watchTree(const std::string& root, std::vector<FileChange
 
     MutexLock lock(mutex_);
     int error = watchDirectories(top, false, discovered);
-    if (error == 0)
+    if (error == 0) {
+        if (std::find(roots_.begin(), roots_.end(), top) == roots_.end())
+            roots_.push_back(top);
         return Status::OK();
+    }
     // Asked for explicitly, so even a missing root is worth a line.
     if (vanished(error))
         reportUnwatched(top, error, discovered);
@@ -207,6 +211,13 @@ void InotifyBackend::handle(std::vector<FileChange>& changes, std::vector<FileCh
         std::string path = appeared ? change.path : std::string();
         std::string from = kind == Kind::Renamed ? change.fromPath : std::string();
         out.push_back(std::move(change));
+        if (kind == Kind::Overflow) {
+            // Lost events may have moved watched directories (their watches now answer for
+            // paths they no longer have) and made new ones that no watch covers: every tree
+            // is walked again, each watch given its directory's path now.
+            for (const std::string& root : roots_) watchDirectories(root, false, out, true);
+            continue;
+        }
         if (!appeared)
             continue;
         // A directory renamed within the trees is normally watched already, and then this
@@ -231,20 +242,20 @@ void InotifyBackend::rewatchMoved(const std::string& from, const std::string& to
 }
 
 int InotifyBackend::watchDirectories(const std::string& top, bool reportContents,
-                                     std::vector<FileChange>& out) {
+                                     std::vector<FileChange>& out, bool refresh) {
     // An explicit stack: trees can be deeper than the call stack is.
     std::vector<std::string> stack;
-    int topError = watchOne(top, stack, reportContents, out);
+    int topError = watchOne(top, stack, reportContents, out, refresh);
     while (!stack.empty()) {
         std::string path = std::move(stack.back());
         stack.pop_back();
-        watchOne(path, stack, reportContents, out);
+        watchOne(path, stack, reportContents, out, refresh);
     }
     return topError;
 }
 
 int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& subdirectories,
-                             bool reportContents, std::vector<FileChange>& out) {
+                             bool reportContents, std::vector<FileChange>& out, bool refresh) {
     FileSystem& fs = FileSystem::current();
     ScopedFd fd(fs.open(path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW, 0));
     if (!fd.ok()) {
@@ -269,7 +280,7 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
             reportUnwatched(path, error, out);
         return error;
     }
-    if (translator_.addWatch(wd, path)) {
+    if (translator_.addWatch(wd, path) && !refresh) {
         // Watched before: what is inside was listed then or reported since.
         return 0;
     }

@@ -90,14 +90,15 @@ private:
     // Passes translated changes on, watching and listing the directories that appeared.
     void handle(std::vector<FileChange>& changes, std::vector<FileChange>& out) REQUIRES(mutex_);
     // Watches `top` and the directories below it. With `reportContents`, every entry found in
-    // a directory that was not watched yet is reported as Created. Returns the errno value that
-    // kept `top` from being watched, 0 when it is watched.
-    int watchDirectories(const std::string& top, bool reportContents, std::vector<FileChange>& out)
-        REQUIRES(mutex_);
+    // a directory that was not watched yet is reported as Created. With `refresh`, directories
+    // watched before are listed again too, so that every watch below `top` gets its path now.
+    // Returns the errno value that kept `top` from being watched, 0 when it is watched.
+    int watchDirectories(const std::string& top, bool reportContents, std::vector<FileChange>& out,
+                         bool refresh = false) REQUIRES(mutex_);
     // Opens the directory, watches it through that descriptor and lists it. Returns the errno
     // value on failure.
     int watchOne(const std::string& path, std::vector<std::string>& subdirectories,
-                 bool reportContents, std::vector<FileChange>& out) REQUIRES(mutex_);
+                 bool reportContents, std::vector<FileChange>& out, bool refresh) REQUIRES(mutex_);
     void reportUnwatched(const std::string& path, int error, std::vector<FileChange>& out)
         REQUIRES(mutex_);
     // Lists again, at their new place, directories that vanished before they could be watched
@@ -120,6 +121,8 @@ private:
     // Directories that appeared but were gone when they were to be watched; a rename read
     // later may say where they went. Forgotten once the queue is empty.
     std::vector<std::string> vanished_ GUARDED_BY(mutex_);
+    // The trees asked for, walked again after the kernel dropped events.
+    std::vector<std::string> roots_ GUARDED_BY(mutex_);
     // The watch limit is logged once: past it, every further folder fails alike.
     std::atomic<bool> watchLimitLogged_{false};
 };

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
@@ -448,6 +449,54 @@ TEST(InotifyBackendRenameTest, ARenameReadInTwoHalvesIsStillOneRename) {
     EXPECT_EQ(api->splits(), 2);
     EXPECT_EQ(drained, (Changes{renamed(root + "/a", root + "/b")}));
     EXPECT_EQ(consumed, (Changes{renamed(root + "/c", root + "/d")}));
+}
+
+// The kernel's queue, dropped whole on the next read and replaced by an overflow, as when the
+// kernel loses events.
+class DroppingInotifyApi : public FaultyInotifyApi {
+public:
+    std::atomic<bool> dropNext{false};
+    ssize_t read(int fd, void* buffer, size_t size) override {
+        if (!dropNext.exchange(false))
+            return FaultyInotifyApi::read(fd, buffer, size);
+        std::vector<char> lost(1 << 16);
+        while (queuedBytes(fd) > 0 && FaultyInotifyApi::read(fd, lost.data(), lost.size()) > 0) {
+        }
+        inotify_event overflow{};
+        overflow.wd = -1;
+        overflow.mask = IN_Q_OVERFLOW;
+        std::memcpy(buffer, &overflow, sizeof overflow);
+        return sizeof overflow;
+    }
+};
+
+// Events lost with a moved tree leave its watches answering for the old paths, and a folder
+// made meanwhile without one: after the overflow every watch answers for where its folder is.
+TEST(InotifyOverflowTest, AfterLostEventsEveryWatchAnswersForItsFoldersPathNow) {
+    TempDir dir;
+    std::string root = dir.makeDir("root");
+    auto api = std::make_shared<DroppingInotifyApi>();
+    auto started = InotifyBackend::start(api);
+    ASSERT_TRUE(started.ok());
+    auto backend = std::move(started).value();
+    fs::create_directories(root + "/a/b");
+    Changes out;
+    ASSERT_TRUE(backend->watchTree(root, out).ok());
+
+    fs::rename(root + "/a", root + "/c");
+    fs::create_directories(root + "/c/b/new");
+    api->dropNext = true;
+    out.clear();
+    backend->drain(out);
+    EXPECT_TRUE(inOrder(out, {kOverflow}));
+
+    std::ofstream(root + "/c/b/f") << "x";
+    std::ofstream(root + "/c/b/new/g") << "x";
+    out.clear();
+    backend->drain(out);
+    backend->drain(out);
+    EXPECT_TRUE(inOrder(out, {created(root + "/c/b/f")}));
+    EXPECT_TRUE(inOrder(out, {created(root + "/c/b/new/g")}));
 }
 
 }  // namespace
