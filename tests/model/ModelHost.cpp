@@ -6,9 +6,9 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
+#include <mutex>
 #include <thread>
 #include <vector>
-#include <mutex>
 
 #include "host/HostPorterChangeObserver.h"
 #include "host/HostPorterEnumerationObserver.h"
@@ -81,7 +81,8 @@ struct BatchRecorder : HostPorterChangeObserver {
 int OverflowingInotify::poll(struct pollfd* fds, nfds_t count, int timeoutMs) {
     if (hold) {
         // Nothing is ready while held; the reader comes back after its timeout.
-        std::this_thread::sleep_for(std::chrono::milliseconds(timeoutMs < 0 ? 5 : std::min(timeoutMs, 5)));
+        std::this_thread::sleep_for(
+            std::chrono::milliseconds(timeoutMs < 0 ? 5 : std::min(timeoutMs, 5)));
         for (nfds_t i = 0; i < count; ++i) fds[i].revents = 0;
         return 0;
     }

@@ -411,7 +411,7 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
                 porter.untrashItemWithIdentifier(id, destinationID, done);
             };
             std::string putBack = tree.find(from)->putBack;
-            std::string expected = destination ? *destination
+            std::string expected = destination       ? *destination
                                    : putBack.empty() ? ""
                                    : tree.contains(putBack) && !tree.inTrash(putBack)
                                        ? putBack

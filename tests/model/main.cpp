@@ -76,6 +76,7 @@ struct Outcome {
 };
 
 std::vector<std::string> skippedFamilies;
+bool verbose = false;  // prints every step
 
 Outcome runSeed(uint64_t seed, const std::vector<uint64_t>& steps) {
     Outcome outcome;
@@ -92,6 +93,8 @@ Outcome runSeed(uint64_t seed, const std::vector<uint64_t>& steps) {
     for (size_t i = 0; i < steps.size(); ++i) {
         std::string description;
         failed = runner.run(seed, steps[i], description);
+        if (verbose)
+            std::cout << "  step " << steps[i] << ": " << description << std::endl;
         if (failed.empty())
             failed = world.check();
         if (!failed.empty()) {
@@ -166,6 +169,8 @@ bool parse(int argc, char** argv, Options& options) {
                     return false;
                 }
                 options.skip.push_back(family);
+            } else if (arg == "--verbose") {
+                verbose = true;
             } else if (arg == "--debug") {
                 options.debug = true;
             } else if (arg == "--log") {
@@ -194,7 +199,7 @@ int main(int argc, char** argv) {
     Options options;
     if (!parse(argc, argv, options)) {
         std::cerr << "usage: model_tests [--first-seed N] [--seeds COUNT] [--length STEPS] "
-                     "[--minutes M] [--log FILE] | --seed N [--steps LIST] [--debug]\n";
+                     "[--minutes M] [--log FILE] | --seed N [--steps LIST] [--debug] [--verbose]\n";
         return 2;
     }
     skippedFamilies = options.skip;
@@ -245,8 +250,7 @@ int main(int argc, char** argv) {
         std::cout << "  shortest failing steps (" << shortest.size() << "): " << join(shortest)
                   << "\n  which fail with: " << (again.failed ? again.report : "(passed on replay)")
                   << "\n  replay: model_tests --seed " << seed << " --steps " << join(shortest)
-                  << skips
-                  << std::endl;
+                  << skips << std::endl;
         if (log.is_open())
             log << "  replay: --seed " << seed << " --steps " << join(shortest) << std::endl;
         return 1;
