@@ -453,18 +453,32 @@ void JournalWriter::touched(const FileChange& change, uint32_t flag) {
 // ---- Reconciliation ----
 
 Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::string& root, bool journal) {
-    struct statx top {};
-    if (!FileStamp::read(root, top))
-        return Error::posix(errno);
-    uint64_t oldTop = 0;
-    for (const auto& r : store_.roots()) {
-        if (r.path == root)
-            oldTop = r.inode;
-    }
-    if (oldTop != top.stx_ino)
-        logIfFailed(store_.setRootInode(root, top.stx_ino), "Could not update a root");
+    return reconcile(std::vector<std::string>{root}, journal);
+}
 
-    return crawl(root, top.stx_ino, oldTop, journal);
+Result<std::vector<JournalEvent>> JournalWriter::reconcile(const std::vector<std::string>& roots,
+                                                           bool journal) {
+    std::vector<Tree> trees;
+    Status missing;
+    for (const std::string& root : roots) {
+        struct statx top {};
+        if (!FileStamp::read(root, top)) {
+            missing = Error::posix(errno);
+            continue;
+        }
+        uint64_t oldTop = 0;
+        for (const auto& r : store_.roots()) {
+            if (r.path == root)
+                oldTop = r.inode;
+        }
+        if (oldTop != top.stx_ino)
+            logIfFailed(store_.setRootInode(root, top.stx_ino), "Could not update a root");
+        trees.push_back({root, top.stx_ino, oldTop});
+    }
+    if (trees.empty())
+        return missing.ok() ? Result<std::vector<JournalEvent>>(std::vector<JournalEvent>{})
+                            : Result<std::vector<JournalEvent>>(missing.error());
+    return crawl(trees, journal);
 }
 
 Result<std::vector<JournalEvent>> JournalWriter::rescan(uint64_t inode) {
@@ -478,15 +492,22 @@ Result<std::vector<JournalEvent>> JournalWriter::rescan(uint64_t inode) {
         return Error::posix(errno);
     if (top.stx_ino != inode || !S_ISDIR(top.stx_mode))
         return Error::posix(ENOENT);  // another file took its place: the index catches up live
-    return crawl(*path.value(), inode, inode, true);
+    return crawl({{*path.value(), inode, inode}}, true);
 }
 
-Result<std::vector<JournalEvent>> JournalWriter::crawl(const std::string& at, uint64_t top,
-                                                       uint64_t oldTop, bool journal) {
-    // What is on disk, walked relative to each directory's descriptor, never following links.
+Result<std::vector<JournalEvent>> JournalWriter::crawl(const std::vector<Tree>& trees,
+                                                       bool journal) {
     // The walk is done before the index is locked: it can take long.
-    FileSystem& fs = FileSystem::current();
     std::map<uint64_t, Found> onDisk;
+    for (const Tree& tree : trees) walk(tree.path, tree.top, onDisk);
+    // The crawl saw every file of every tree: a known file at a document's old path was moved
+    // there, and one that moved from one tree to another is the same file.
+    return commit(Settle::Clear, [&] { compareWithIndex(trees, onDisk, journal); });
+}
+
+void JournalWriter::walk(const std::string& at, uint64_t top, std::map<uint64_t, Found>& onDisk) {
+    // What is on disk, walked relative to each directory's descriptor, never following links.
+    FileSystem& fs = FileSystem::current();
     std::vector<std::pair<uint64_t, std::string>> stack{{top, at}};
     std::vector<FileSystem::DirectoryEntry> entries;
     while (!stack.empty()) {
@@ -508,17 +529,16 @@ Result<std::vector<JournalEvent>> JournalWriter::crawl(const std::string& at, ui
             onDisk[record.inode] = {std::move(record), std::move(path)};
         }
     }
-    // The crawl saw every file: a known file at a document's old path was moved there.
-    return commit(Settle::Clear, [&] { compareWithIndex(at, oldTop, onDisk, journal); });
 }
 
-void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
+void JournalWriter::compareWithIndex(const std::vector<Tree>& trees,
                                      std::map<uint64_t, Found>& onDisk, bool journal) {
     // What the index says, by inode.
     std::map<uint64_t, Found> indexed;
     std::vector<std::pair<uint64_t, std::string>> stack;
-    if (oldTop != 0)
-        stack.emplace_back(oldTop, root);
+    for (const Tree& tree : trees)
+        if (tree.oldTop != 0)
+            stack.emplace_back(tree.oldTop, tree.path);
     while (!stack.empty()) {
         auto [dir, at] = std::move(stack.back());
         stack.pop_back();
@@ -579,8 +599,11 @@ void JournalWriter::compareWithIndex(const std::string& root, uint64_t oldTop,
     fail(store_.upsertInodes(updates), "Could not update the file index");
     if (journal && unstamped) {
         // Indexed before contents were tracked: what changed inside files is not known.
-        logInfo("Files in " + root + " may have changed unseen; asking readers to rescan it");
-        pending_.push_back({0, root, 0, kTremorUserDropped | kTremorMustScanSubdirs});
+        for (const Tree& tree : trees) {
+            logInfo("Files in " + tree.path +
+                    " may have changed unseen; asking readers to rescan it");
+            pending_.push_back({0, tree.path, 0, kTremorUserDropped | kTremorMustScanSubdirs});
+        }
     }
 }
 

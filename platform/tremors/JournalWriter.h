@@ -44,6 +44,11 @@ public:
     // `journal`, what differs is journaled as it would have been by live watching (a tree that
     // is indexed for the first time is not).
     Result<std::vector<JournalEvent>> reconcile(const std::string& root, bool journal);
+    // The same for several roots at once, in one batch: a file that moved from one to another
+    // while nothing watched is the same file, and a document keeps its ID. Roots that cannot be
+    // read are passed over; the error of the last one is returned when none could.
+    Result<std::vector<JournalEvent>> reconcile(const std::vector<std::string>& roots,
+                                                bool journal);
     // The same for the indexed folder `inode` inside a root (one that could not be watched),
     // journaling what differs. ENOENT when the index no longer has that folder.
     Result<std::vector<JournalEvent>> rescan(uint64_t inode);
@@ -60,12 +65,18 @@ private:
     void removed(const FileChange& change);
     void renamed(const FileChange& change);
     void touched(const FileChange& change, uint32_t flag);
-    // Walks the tree at `at` (the folder `top` on disk) and compares it with the index's tree
-    // under `oldTop`.
-    Result<std::vector<JournalEvent>> crawl(const std::string& at, uint64_t top, uint64_t oldTop,
-                                            bool journal);
-    void compareWithIndex(const std::string& root, uint64_t oldTop,
-                          std::map<uint64_t, Found>& onDisk, bool journal);
+    // A tree to compare: its path, its folder on disk and the folder the index has for it.
+    struct Tree {
+        std::string path;
+        uint64_t top = 0;
+        uint64_t oldTop = 0;
+    };
+    // Walks the trees on disk and compares them with the index's trees, in one batch.
+    Result<std::vector<JournalEvent>> crawl(const std::vector<Tree>& trees, bool journal);
+    // Adds what is on disk below `at` (the folder `top`) to `onDisk`.
+    static void walk(const std::string& at, uint64_t top, std::map<uint64_t, Found>& onDisk);
+    void compareWithIndex(const std::vector<Tree>& trees, std::map<uint64_t, Found>& onDisk,
+                          bool journal);
     // What becomes of documents whose files vanished and were not claimed in the batch: cleared,
     // or first given to the file at their path, if it has no ID of its own.
     enum class Settle { Clear, ClaimByPath };

@@ -388,12 +388,12 @@ void TremorService::settleLoss(Volume& volume, uint32_t flags) {
 bool TremorService::reconcileAll(Volume& volume) {
     indexReady_ = false;
     bool journaled = true;
-    for (const auto& path : rootPaths(volume)) {
-        auto events = volume.writer->reconcile(path, true);
-        if (!events.ok() && events.error().domain() == std::string_view(kSqliteErrorDomain))
-            journaled = false;
-        publish(volume, std::move(events));
-    }
+    // All roots in one pass: a document moved from one tree to another while events were lost
+    // keeps its ID.
+    auto events = volume.writer->reconcile(rootPaths(volume), true);
+    if (!events.ok() && events.error().domain() == std::string_view(kSqliteErrorDomain))
+        journaled = false;
+    publish(volume, std::move(events));
     indexReady_ = true;
     return journaled;
 }

@@ -397,6 +397,23 @@ protected:
     std::optional<JournalWriter> writer;
 };
 
+// Lost events are made up for by comparing every tree with the index: a document that moved
+// from one published tree to another meanwhile is the same file and keeps its ID.
+TEST_F(WriterAfterTheFactTest, ADocumentMovedToAnotherTreeUnseenKeepsItsId) {
+    std::string other = root.makeDir("other");
+    ASSERT_TRUE(store->addRoot(other, 0).ok());
+    ASSERT_TRUE(writer->reconcile(other, false).ok());
+    auto [inode, docID] = document("report.txt");
+    std::filesystem::rename(at("report.txt"), other + "/report.txt");
+
+    auto events = writer->reconcile(std::vector<std::string>{tree, other}, true);
+    ASSERT_TRUE(events.ok());
+    EXPECT_EQ(store->documentIdForInode(inode).value(), docID);
+    EXPECT_TRUE(journaled(events.value(), other + "/report.txt"));
+    EXPECT_FALSE(journaled(events.value(), JournalWriter::documentIdPath(7, docID, inode, 0)))
+        << "reported deleted";
+}
+
 TEST_F(WriterAfterTheFactTest, ADocumentRenamedThenRemovedIsReportedGoneAndLeavesNoEntry) {
     auto [inode, docID] = document("doomed.txt");
     fs::rename(at("doomed.txt"), at("renamed.txt"));
