@@ -217,6 +217,12 @@ std::string ModelSteps::outsideChange(Rng& rng, std::string& description) {
             description = "outside: move " + from + " to " + to;
             if (tree.contains(to) || to == from || isUnder(to, from))
                 return "";
+            if (whileStopped_ && !crossTreeWhileStopped_ && tree.rootOf(from) != tree.rootOf(to)) {
+                // A known gap: the journal compares each tree with its index on its own when
+                // it starts, so a document moved to another tree meanwhile gets a new ID.
+                description += " (left out: across trees while stopped)";
+                return "";
+            }
             if (::rename(world_.full(from).c_str(), world_.full(to).c_str()) != 0)
                 return "\n  rename failed: " + std::string(std::strerror(errno));
             tree.moveTree(from, to);
@@ -377,7 +383,7 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
             if (!pickEntry(from))
                 return op;
             op.description = "trash " + from;
-            op.involved = {from};
+            op.involved = {from, tree.rootOf(from) + "/.Trash"};
             std::string id = identifier(from);
             op.start = [&porter, id](auto done) { porter.trashItemWithIdentifier(id, done); };
             op.apply = [this, &tree, from](const std::string& path) {
@@ -387,6 +393,7 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
                 // A link can keep no put-back attribute, and a failed attribute write leaves
                 // the item trashed without one: where it goes back to is then not known.
                 node.putBack = faulted_ || node.kind == Kind::Link ? "" : parentOf(from);
+                node.mayLackTrashDate = faulted_;
                 return expectPlace(path, tree.rootOf(from) + "/.Trash", nameOf(from));
             };
             return op;
@@ -411,6 +418,8 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
                 porter.untrashItemWithIdentifier(id, destinationID, done);
             };
             std::string putBack = tree.find(from)->putBack;
+            if (!destination && !putBack.empty())
+                op.involved.push_back(putBack);
             std::string expected = destination       ? *destination
                                    : putBack.empty() ? ""
                                    : tree.contains(putBack) && !tree.inTrash(putBack)
@@ -511,18 +520,34 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
             bool everything = rng.chance(50);
             op.description = everything ? "purge the trash" : "purge old trash";
             op.involved = trashed();
+            std::vector<std::string> before = op.involved;
+            // Not beside anything that puts items in or takes them out of a trash.
+            for (const auto& root : tree.roots()) op.involved.push_back(root + "/.Trash");
             auto date =
                 Date::make(Date::now()->timeIntervalSince1970() + (everything ? 3600 : -3600));
             op.start = [&porter, date](auto done) {
                 porter.removeTrashedItemsOlderThanDate(
                     date, [done](size_t) { done(HostPorterItemRef(nullptr)); });
             };
-            op.apply = [&tree, everything](const std::string&) {
-                if (everything)
-                    for (const auto& path : tree.select(
-                             [](const std::string&, const ModelNode& n) { return n.trashed; }))
+            // Only what was in the trash before: an operation beside it may trash more.
+            op.apply = [this, &tree, everything, before](const std::string&) {
+                std::string out;
+                if (!everything)
+                    return out;
+                for (const auto& path : before) {
+                    if (!tree.contains(path))
+                        continue;
+                    std::error_code error;
+                    if (!fs::exists(fs::symlink_status(world_.full(path), error))) {
                         tree.removeTree(path);
-                return std::string();
+                    } else if (ModelNode& node = *tree.find(path); node.mayLackTrashDate) {
+                        node.mayLackTrashDate = false;  // dated now, deleted by the next sweep
+                    } else if (!faulted_) {
+                        // With a failing call the sweep may leave some; without, it takes all.
+                        out += "\n  still in the trash: " + path;
+                    }
+                }
+                return out;
             };
             return op;
         }
@@ -600,7 +625,9 @@ std::string ModelSteps::restart(Rng& rng, std::string& description) {
     // Changes while nothing runs must be found when the journal comes back.
     if (rng.chance(50)) {
         std::string ignored;
+        whileStopped_ = true;
         std::string failed = outsideChange(rng, ignored);
+        whileStopped_ = false;
         description += ", with " + ignored + " while stopped";
         if (!failed.empty())
             return failed;

@@ -19,6 +19,9 @@ struct ModelNode {
     std::optional<uint64_t> rank;
     bool trashed = false;  // the top of a trashed tree
     std::string putBack;   // a trashed tree's folder before, for put-back
+    // Trashed while a file-system call failed: it may have no trash date, and then the next
+    // sweep dates it instead of deleting it.
+    bool mayLackTrashDate = false;
     // The identifier the provider gave the entry the first time it was checked; empty before.
     std::string identifier;
     friend bool operator==(const ModelNode&, const ModelNode&) = default;
