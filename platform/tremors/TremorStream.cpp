@@ -48,8 +48,11 @@ bool TremorStream::start() {
             return false;
         first = !everStarted_;
     }
+    std::shared_ptr<TremorService> service = service_.lock();
+    if (!service)
+        return false;
     if (first && options_.device) {
-        if (!service_->storeForDevice(*options_.device)) {
+        if (!service->storeForDevice(*options_.device)) {
             logError("No watched tree on device " + std::to_string(*options_.device));
             return false;
         }
@@ -57,20 +60,20 @@ bool TremorStream::start() {
     } else if (first) {
         for (const auto& path : options_.paths) {
             // A stream for a tree nobody watched yet makes the service watch it.
-            if (auto status = service_->watchTree(path); !status.ok()) {
+            if (auto status = service->watchTree(path); !status.ok()) {
                 logError("Cannot watch " + path + ": " + status.error().description());
                 return false;
             }
         }
-        device_ = service_->deviceForPath(options_.paths.front()).value_or(0);
+        device_ = service->deviceForPath(options_.paths.front()).value_or(0);
     }
-    TremorStore* store = service_->storeForDevice(device_);
+    TremorStore* store = service->storeForDevice(device_);
     if (!store)
         return false;
-    service_->catchUp();  // what completed before the start is in the history
+    service->catchUp();  // what completed before the start is in the history
     std::weak_ptr<TremorStream> weak = weak_from_this();
     uint64_t token =
-        service_->addListener([weak](uint32_t device, const std::vector<JournalEvent>& events) {
+        service->addListener([weak](uint32_t device, const std::vector<JournalEvent>& events) {
             if (auto self = weak.lock())
                 self->onAppended(device, events);
         });
@@ -126,7 +129,10 @@ void TremorStream::onAppended(uint32_t device, const std::vector<JournalEvent>& 
 }
 
 void TremorStream::replay(uint64_t since, uint64_t ceiling, uint64_t run) {
-    TremorStore* store = service_->storeForDevice(device_);
+    std::shared_ptr<TremorService> service = service_.lock();
+    if (!service)
+        return;
+    TremorStore* store = service->storeForDevice(device_);
     if (!store)
         return;
     auto check = store->replayability(since, options_.paths);
@@ -250,8 +256,8 @@ void TremorStream::stop() {
         listener_ = 0;
         live_.clear();  // not delivered: a restart replays them
     }
-    if (token)
-        service_->removeListener(token);
+    if (auto service = service_.lock(); token && service)
+        service->removeListener(token);
 }
 
 void TremorStream::invalidate() {

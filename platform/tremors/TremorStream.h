@@ -84,7 +84,9 @@ private:
     // Calls the client unless the run is over; false when it is.
     bool deliver(const std::vector<JournalEvent>& events, uint64_t run);
 
-    const std::shared_ptr<TremorService> service_;
+    // Not owned: a stream its client never released must not keep a stopped journal (its
+    // databases and their lock) alive. Once the service is gone the stream does nothing.
+    const std::weak_ptr<TremorService> service_;
     Options options_;
     std::shared_ptr<TremorStream> handle_;
 

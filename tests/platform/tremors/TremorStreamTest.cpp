@@ -40,6 +40,24 @@ TEST_F(TremorServiceStreamTest, ReplayLiveAndARestartedStreamDeliverExactlyTheJo
     expectExactlyTheJournal();
 }
 
+// A stream its client never released (a change enumeration cut short by a shutdown) must not
+// keep a stopped journal alive: its databases and their lock would stay with it, and the next
+// journal on the same state could not start. Once the journal is gone the stream does nothing.
+TEST_F(TremorServiceStreamTest, AStreamNeverReleasedDoesNotKeepAStoppedJournalAlive) {
+    ASSERT_TRUE(service()->watchTree(tree_).ok());
+    TremorStreamRef stream = open(delivered_, 0);
+    ASSERT_TRUE(eventually([&] { return delivered_.has(kTremorHistoryDone); }));
+    std::weak_ptr<TremorService> journal = TremorService::sharedIfRunning();
+    ASSERT_FALSE(journal.expired());
+    TremorService::stopShared();
+    EXPECT_TRUE(journal.expired()) << "the stream still holds the journal";
+
+    auto next = TremorService::create(state_.path());
+    EXPECT_TRUE(next.ok()) << next.error().description();
+    TremorStreamStop(stream);
+    EXPECT_FALSE(TremorStreamStart(stream));
+}
+
 TEST_F(TremorServiceStreamTest, AnOverflowOrTrimmedHistoryReachesTheStreamAsDropped) {
     struct Overflowing : LinuxInotifyApi {
         std::atomic<bool> armed{false};
