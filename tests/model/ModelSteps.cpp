@@ -100,6 +100,17 @@ std::string ModelSteps::identifier(const std::string& path) {
     return world_.identifierAt(path);
 }
 
+void ModelSteps::forgetRemoved(const std::string& path) {
+    ModelTree& tree = world_.tree();
+    for (const auto& entry : tree.select([&](const std::string&p, const ModelNode&) {
+             return p == path || isUnder(p, path);
+         })) {
+        std::error_code error;
+        if (tree.contains(entry) && !fs::exists(fs::symlink_status(world_.full(entry), error)))
+            tree.removeTree(entry);
+    }
+}
+
 std::string ModelSteps::pathOf(const Result<HostPorterItemRef>& item) const {
     auto local = item.ok() ? std::dynamic_pointer_cast<const LocalItem>(item.value()) : nullptr;
     return local ? world_.relative(local->fileURL().path()) : "";
@@ -446,6 +457,7 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
                 return op;
             op.description = "delete " + path;
             op.involved = {path};
+            op.partial = true;
             std::string id = identifier(path);
             op.start = [&porter, id](auto done) {
                 porter.deleteItemWithIdentifier(id, [done](Status status) {
@@ -542,8 +554,9 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
                         tree.removeTree(path);
                     } else if (ModelNode& node = *tree.find(path); node.mayLackTrashDate) {
                         node.mayLackTrashDate = false;  // dated now, deleted by the next sweep
-                    } else if (!faulted_) {
-                        // With a failing call the sweep may leave some; without, it takes all.
+                    } else if (faulted_) {
+                        forgetRemoved(path);  // a failing call may leave some, or part of one
+                    } else {
                         out += "\n  still in the trash: " + path;
                     }
                 }
@@ -577,6 +590,10 @@ std::string ModelSteps::runOne(Operation operation, bool faulted) {
     if (!outcome->ok()) {
         if (!faulted && !operation.mayFail)
             ++unexpectedErrors_;
+        if (operation.partial) {
+            for (const auto& path : operation.involved) forgetRemoved(path);
+            return "";
+        }
         std::string changed = ModelWorld::describeDifference(before, world_.readDisk());
         if (!changed.empty())
             return "\n  it failed (" + outcome->error().description() + ") and changed:" + changed;

@@ -46,6 +46,9 @@ public:
         std::function<std::string(const std::string& path)> apply;
         std::vector<std::string> involved;  // paths it touches, for running others beside it
         bool mayFail = false;               // refusing it is a right answer
+        // A deletion: one that fails part-way leaves what it had not removed yet (a known gap:
+        // it is not undone, unlike the other operations).
+        bool partial = false;
     };
 
 private:
@@ -65,6 +68,8 @@ private:
     std::vector<std::string> files() const;
     std::vector<std::string> trashed() const;  // tops of trashed trees
     std::string identifier(const std::string& path);
+    // Takes out of the model what is no longer on disk at or below `path`.
+    void forgetRemoved(const std::string& path);
     std::string pathOf(const Result<HostPorterItemRef>& item) const;
 
     ModelWorld& world_;
