@@ -277,7 +277,7 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
         if (vanished(error))
             vanished_.push_back(path);
         else
-            reportUnwatched(path, error, out);
+            reportUnwatched(path, error, out, error == ENOSPC);  // ENOSPC: the watch limit
         return error;
     }
     if (translator_.addWatch(wd, path) && !refresh) {
@@ -288,9 +288,14 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
 
     std::vector<FileSystem::DirectoryEntry> entries;
     if (!fs.readDirectory(fd.get(), entries)) {
-        int error = errno;
-        reportUnwatched(path, error, out);
-        return error;
+        // Watched, but what it held before the watch is not known: the trees are compared
+        // with the index, as after lost events, rather than this folder given up.
+        logError(formatPlatform("Cannot list %@: %{errno}d; rescanning the watched trees",
+                                {path, ErrnoArg{errno}}));
+        FileChange rescan;
+        rescan.kind = Kind::Overflow;
+        out.push_back(std::move(rescan));
+        return 0;
     }
     for (const auto& entry : entries) {
         bool isDirectory = entry.type == DT_DIR;
@@ -310,8 +315,8 @@ int InotifyBackend::watchOne(const std::string& path, std::vector<std::string>& 
 }
 
 void InotifyBackend::reportUnwatched(const std::string& path, int error,
-                                     std::vector<FileChange>& out) {
-    if (error != ENOSPC) {
+                                     std::vector<FileChange>& out, bool watchLimit) {
+    if (!watchLimit) {
         logError(
             formatPlatform("Cannot watch %@: %{errno}d; changes in that tree are not journaled",
                            {path, ErrnoArg{error}}));

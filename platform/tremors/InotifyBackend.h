@@ -99,8 +99,10 @@ private:
     // value on failure.
     int watchOne(const std::string& path, std::vector<std::string>& subdirectories,
                  bool reportContents, std::vector<FileChange>& out, bool refresh) REQUIRES(mutex_);
-    void reportUnwatched(const std::string& path, int error, std::vector<FileChange>& out)
-        REQUIRES(mutex_);
+    // `watchLimit`: the kernel refused the watch for want of watches (ENOSPC from
+    // inotify_add_watch), which is logged once with how to raise the limit.
+    void reportUnwatched(const std::string& path, int error, std::vector<FileChange>& out,
+                         bool watchLimit = false) REQUIRES(mutex_);
     // Lists again, at their new place, directories that vanished before they could be watched
     // because `from` (or a directory above them) was renamed to `to`.
     void rewatchMoved(const std::string& from, const std::string& to, std::vector<FileChange>& out)

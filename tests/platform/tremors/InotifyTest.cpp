@@ -19,6 +19,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/FaultInjectingFileSystem.h"
 #include "platform/LinuxFileSystem.h"
 #include "platform/tremors/FileChange.h"
 #include "platform/tremors/InotifyBackend.h"
@@ -449,6 +450,26 @@ TEST(InotifyBackendRenameTest, ARenameReadInTwoHalvesIsStillOneRename) {
     EXPECT_EQ(api->splits(), 2);
     EXPECT_EQ(drained, (Changes{renamed(root + "/a", root + "/b")}));
     EXPECT_EQ(consumed, (Changes{renamed(root + "/c", root + "/d")}));
+}
+
+// A folder that is watched but cannot be listed (the disk or the kernel short of something for
+// a moment) stays watched; what it held is found by comparing the trees with the index, and it
+// is not taken for the watch limit.
+TEST_F(InotifyBackendTest, AFolderThatCannotBeListedStaysWatchedAndAsksForARescan) {
+    ScopedLogCapture log;
+    auto faults = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    ScopedFileSystem scoped(faults);
+    Changes discovered;
+    ASSERT_TRUE(backend_->watchTree(root_, discovered).ok());
+    faults->inject(FaultInjectingFileSystem::Operation::ReadDirectory, ENOSPC, 1);
+    fs::create_directory(path("fresh"));
+    Changes changes = drain();
+    EXPECT_TRUE(inOrder(changes, {created(path("fresh"), true), kOverflow}));
+    for (const auto& change : changes) EXPECT_NE(change.kind, Kind::WatchFailed);
+    write(path("fresh/later"));
+    EXPECT_TRUE(inOrder(drain(), {created(path("fresh/later"))}));
+    EXPECT_EQ(log->countStartingWith("[ERROR] Cannot list " + path("fresh")), 1u);
+    EXPECT_FALSE(log->contains("max_user_watches"));
 }
 
 // The kernel's queue, dropped whole on the next read and replaced by an overflow, as when the
