@@ -88,6 +88,11 @@ void FaultInjectingFileSystem::injectAfter(Operation op, int errnoValue, int pas
     injections_.push_back({op, errnoValue, 1, std::move(pathSubstring), pass});
 }
 
+void FaultInjectingFileSystem::onlyOnThread(std::optional<std::thread::id> thread) {
+    MutexLock lock(mutex_);
+    thread_ = thread;
+}
+
 void FaultInjectingFileSystem::clearInjections() {
     MutexLock lock(mutex_);
     injections_.clear();
@@ -129,6 +134,8 @@ std::string FaultInjectingFileSystem::describe(const Subject& subject) {
 bool FaultInjectingFileSystem::shouldFail(Operation op, const Subject& subject) {
     calls_[static_cast<size_t>(op)].fetch_add(1);
     MutexLock lock(mutex_);
+    if (thread_ && *thread_ != std::this_thread::get_id())
+        return false;
     std::string path;
     bool described = false;
     for (auto it = injections_.begin(); it != injections_.end(); ++it) {

@@ -4,8 +4,10 @@
 #include <atomic>
 #include <cstddef>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
+#include <thread>
 #include <vector>
 
 #include "platform/FileSystem.h"
@@ -58,6 +60,9 @@ public:
     // middle of an operation rather than at its first call.
     void injectAfter(Operation op, int errnoValue, int pass, std::string pathSubstring = "");
     void clearInjections();
+    // Injections fail only calls made on `thread` (none: calls from any thread), so that a
+    // test can fail an operation it runs without failing the threads working beside it.
+    void onlyOnThread(std::optional<std::thread::id> thread);
     // Injected failures not yet used up (forever-injections count as one).
     size_t pendingInjections() const;
 
@@ -119,6 +124,7 @@ private:
     std::array<std::atomic<size_t>, kOperationCount> calls_{};
     mutable Mutex mutex_;
     std::vector<Injection> injections_ GUARDED_BY(mutex_);
+    std::optional<std::thread::id> thread_ GUARDED_BY(mutex_);
 };
 
 }  // namespace tamber

@@ -11,6 +11,7 @@
 #include <filesystem>
 #include <fstream>
 #include <mutex>
+#include <thread>
 
 #include "items/LocalItem.h"
 #include "platform/Tag.h"
@@ -590,6 +591,7 @@ std::string ModelSteps::runOne(Operation operation, bool faulted) {
     if (!outcome->ok()) {
         if (!faulted && !operation.mayFail)
             ++unexpectedErrors_;
+        faultedFailures_ += faulted;
         if (operation.partial) {
             for (const auto& path : operation.involved) forgetRemoved(path);
             return "";
@@ -682,10 +684,14 @@ std::string ModelSteps::fault(Rng& rng, std::string& description) {
                   std::strerror(error) + ") after " + std::to_string(skip) + " calls";
     if (!operation.start)
         return "";
-    world_.host().faults().injectAfter(op, error, skip);
+    FaultInjectingFileSystem& faults = world_.host().faults();
+    if (!faultsAnywhere_)
+        faults.onlyOnThread(std::this_thread::get_id());
+    faults.injectAfter(op, error, skip);
     faulted_ = true;
     std::string failed = runOne(std::move(operation), true);
     faulted_ = false;
+    faults.onlyOnThread(std::nullopt);
     return failed;
 }
 

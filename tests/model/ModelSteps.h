@@ -29,6 +29,11 @@ public:
     // Lets an outside change made while the journal is stopped move an item from one tree to
     // another: a known gap, left out of runs unless asked for.
     void allowCrossTreeWhileStopped() { crossTreeWhileStopped_ = true; }
+    // Lets an injected failure hit any thread's call (the journal's too), not only the calls
+    // of the operation under test: a known gap, left out of runs unless asked for.
+    void allowFaultsAnywhere() { faultsAnywhere_ = true; }
+    // Operations an injected failure made fail, for the summary.
+    int faultedFailures() const { return faultedFailures_; }
 
     // Runs one step; returns what it found wrong (empty when nothing). `description` says what
     // the step did, for the failure report.
@@ -78,6 +83,8 @@ private:
     std::vector<std::string> skipped_;
     bool whileStopped_ = false;  // the running outside change is made while nothing runs
     bool crossTreeWhileStopped_ = false;
+    bool faultsAnywhere_ = false;
+    int faultedFailures_ = 0;
     bool skipped(const std::string& family)
         const;         // a file-system call is made to fail in the running operation
     int counter_ = 0;  // makes outside sources and contents distinct

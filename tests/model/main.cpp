@@ -6,7 +6,9 @@
 //   model_tests --seed N [--steps 3,7,12]     replays one seed, or only some of its steps
 //   --skip FAMILY leaves out a family of steps (together, fault, overflow, restart); --debug
 //   shows the debug lines with a failure; --cross-tree-while-stopped lets a change made while
-//   the journal is stopped move an item from one tree to another (a known gap).
+//   the journal is stopped move an item from one tree to another (a known gap);
+//   --faults-anywhere lets an injected failure hit the journal's threads too (a known gap);
+//   --keep-going reports every failing seed without shrinking.
 //
 // A failure prints the seed and the shortest list of its steps found that still fails.
 #include <algorithm>
@@ -74,11 +76,14 @@ struct Outcome {
     std::string report;
     int relists = 0;
     int unexpectedErrors = 0;
+    int faultedFailures = 0;
 };
 
 std::vector<std::string> skippedFamilies;
 bool verbose = false;  // prints every step
 bool crossTreeWhileStopped = false;
+bool faultsAnywhere = false;
+bool keepGoing = false;  // reports each failing seed and goes on, without shrinking
 
 Outcome runSeed(uint64_t seed, const std::vector<uint64_t>& steps) {
     Outcome outcome;
@@ -87,6 +92,8 @@ Outcome runSeed(uint64_t seed, const std::vector<uint64_t>& steps) {
     for (const auto& family : skippedFamilies) runner.skip(family);
     if (crossTreeWhileStopped)
         runner.allowCrossTreeWhileStopped();
+    if (faultsAnywhere)
+        runner.allowFaultsAnywhere();
     std::string failed = world.start();
     if (failed.empty())
         failed = world.check();
@@ -111,6 +118,7 @@ Outcome runSeed(uint64_t seed, const std::vector<uint64_t>& steps) {
     }
     outcome.relists = world.host().relists();
     outcome.unexpectedErrors = runner.unexpectedErrors();
+    outcome.faultedFailures = runner.faultedFailures();
     return outcome;
 }
 
@@ -173,6 +181,10 @@ bool parse(int argc, char** argv, Options& options) {
                     return false;
                 }
                 options.skip.push_back(family);
+            } else if (arg == "--faults-anywhere") {
+                faultsAnywhere = true;
+            } else if (arg == "--keep-going") {
+                keepGoing = true;
             } else if (arg == "--cross-tree-while-stopped") {
                 crossTreeWhileStopped = true;
             } else if (arg == "--verbose") {
@@ -206,7 +218,7 @@ int main(int argc, char** argv) {
     if (!parse(argc, argv, options)) {
         std::cerr << "usage: model_tests [--first-seed N] [--seeds COUNT] [--length STEPS] "
                      "[--minutes M] [--log FILE] | --seed N [--steps LIST] [--debug] [--verbose] "
-                     "[--cross-tree-while-stopped]\n";
+                     "[--cross-tree-while-stopped] [--faults-anywhere] [--keep-going]\n";
         return 2;
     }
     skippedFamilies = options.skip;
@@ -225,7 +237,7 @@ int main(int argc, char** argv) {
     auto elapsedMinutes = [&] {
         return std::chrono::duration<double>(std::chrono::steady_clock::now() - begun).count() / 60;
     };
-    uint64_t seeds = 0, steps = 0, relists = 0, unexpected = 0;
+    uint64_t seeds = 0, steps = 0, relists = 0, unexpected = 0, failures = 0, faulted = 0;
     for (uint64_t seed = options.firstSeed;; ++seed) {
         if (options.minutes > 0 ? elapsedMinutes() >= options.minutes
                                 : seed >= options.firstSeed + options.seeds)
@@ -238,6 +250,7 @@ int main(int argc, char** argv) {
         steps += outcome.failed ? outcome.at + 1 : list.size();
         relists += uint64_t(outcome.relists);
         unexpected += uint64_t(outcome.unexpectedErrors);
+        faulted += uint64_t(outcome.faultedFailures);
         if (log.is_open())
             log << "seed " << seed << " steps " << list.size()
                 << (outcome.failed ? " FAILED" : " ok") << std::endl;
@@ -247,6 +260,12 @@ int main(int argc, char** argv) {
         }
         std::string lines = recent->take();
         list.resize(outcome.at + 1);
+        if (keepGoing) {
+            ++failures;
+            std::cout << "model: seed " << seed << " failed at " << outcome.report.substr(0, 300)
+                      << std::endl;
+            continue;
+        }
         std::cout << "model: seed " << seed << " failed at " << outcome.report << "\n"
                   << "  last log lines:\n"
                   << lines << std::flush;
@@ -254,6 +273,8 @@ int main(int argc, char** argv) {
         for (const auto& family : options.skip) skips += " --skip " + family;
         if (crossTreeWhileStopped)
             skips += " --cross-tree-while-stopped";
+        if (faultsAnywhere)
+            skips += " --faults-anywhere";
         std::vector<uint64_t> shortest = options.steps ? list : shrink(seed, list);
         Outcome again = runSeed(seed, shortest);
         std::cout << "  shortest failing steps (" << shortest.size() << "): " << join(shortest)
@@ -265,7 +286,9 @@ int main(int argc, char** argv) {
         return 1;
     }
     std::cout << "model: " << seeds << " seeds, " << steps << " steps, " << relists << " listings, "
-              << unexpected << " refusals without a fault, no failure ("
+              << faulted << " operations failed by an injected fault, " << unexpected
+              << " refusals without a fault, "
+              << (failures ? std::to_string(failures) + " failing seeds" : "no failure") << " ("
               << int(elapsedMinutes() * 60) << " s)" << std::endl;
-    return 0;
+    return failures ? 1 : 0;
 }

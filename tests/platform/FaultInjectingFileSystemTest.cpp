@@ -59,6 +59,27 @@ TEST_F(FaultInjectingFileSystemTest, FailsTheGivenNumberOfCallsThenForwards) {
     EXPECT_TRUE(exists(path)) << "zero times injects nothing";
 }
 
+// A failure meant for an operation in the middle of its calls: the first calls pass, and calls
+// of other threads neither fail nor use it up.
+TEST_F(FaultInjectingFileSystemTest, AnInjectionCanWaitItsTurnAndKeepToOneThread) {
+    std::string path = dir_.writeFile("file");
+    fs_.onlyOnThread(std::this_thread::get_id());
+    fs_.injectAfter(Op::Statx, EIO, 2);
+    bool otherFailed = false;
+    std::thread other([&] {
+        for (int i = 0; i < 5; ++i) otherFailed |= !exists(path);
+    });
+    other.join();
+    EXPECT_FALSE(otherFailed);
+    EXPECT_TRUE(exists(path));
+    EXPECT_TRUE(exists(path));
+    EXPECT_FALSE(exists(path));
+    EXPECT_EQ(errno, EIO);
+    EXPECT_TRUE(exists(path));
+    EXPECT_EQ(fs_.pendingInjections(), 0u);
+    fs_.onlyOnThread(std::nullopt);
+}
+
 TEST_F(FaultInjectingFileSystemTest, PathSubstringsSelectTheFailingCalls) {
     std::string a = dir_.writeFile("alpha/file");
     std::string b = dir_.writeFile("beta/file");
