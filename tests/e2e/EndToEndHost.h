@@ -13,6 +13,7 @@
 #include "provider/LocalPorter.h"
 #include "support/DispatchSemaphore.h"
 #include "tests/common/AppLibraryTest.h"
+#include "tests/common/HostRecorders.h"
 
 namespace tamber::testing {
 
@@ -37,58 +38,6 @@ inline std::string describe(const Replica& replica) {
 inline void expectSameView(const Replica& host, const Replica& disk, const char* when) {
     EXPECT_TRUE(host == disk) << when << "\nhost:" << describe(host) << "\ndisk:" << describe(disk);
 }
-
-struct PageRecorder : HostPorterEnumerationObserver {
-    void didEnumerateItems(const std::vector<HostPorterItemRef>& page) override {
-        items.insert(items.end(), page.begin(), page.end());
-    }
-    void finishEnumeratingUpToPage(const std::optional<HostPorterPage>& page) override {
-        next = page;
-        done.signal();
-    }
-    void finishEnumeratingWithError(const Error& e) override {
-        error = e;
-        done.signal();
-    }
-    std::vector<HostPorterItemRef> items;
-    std::optional<HostPorterPage> next;
-    std::optional<Error> error;
-    DispatchSemaphore done;
-};
-
-struct BatchRecorder : HostPorterChangeObserver {
-    // Changes in the order they came: a deletion and a later update of the same identifier (a
-    // folder's number reused) must be applied in that order.
-    void didUpdateItems(const std::vector<HostPorterItemRef>& items) override {
-        std::lock_guard lock(mutex);
-        for (const auto& item : items) changes.push_back({item, {}});
-    }
-    void didDeleteItemsWithIdentifiers(const std::vector<HostPorterItemIdentifier>& ids) override {
-        std::lock_guard lock(mutex);
-        for (const auto& id : ids) changes.push_back({nullptr, id});
-    }
-    void finishEnumeratingChangesUpToSyncAnchor(const HostPorterSyncAnchor& a, bool more) override {
-        {
-            std::lock_guard lock(mutex);
-            anchor = a;
-            moreComing = more;
-        }
-        done.signal();
-    }
-    void finishEnumeratingWithError(const Error& e) override {
-        {
-            std::lock_guard lock(mutex);
-            error = e;
-        }
-        done.signal();
-    }
-    std::mutex mutex;
-    std::vector<std::pair<HostPorterItemRef, HostPorterItemIdentifier>> changes;
-    HostPorterSyncAnchor anchor;
-    bool moreComing = false;
-    std::optional<Error> error;
-    DispatchSemaphore done;
-};
 
 // A recording host over a real document storage, one app library and the real event journal:
 // it lists the working set, things change, it asks for changes until caught up, and its view

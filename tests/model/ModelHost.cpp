@@ -16,65 +16,17 @@
 #include "platform/tremors/TremorService.h"
 #include "support/DispatchSemaphore.h"
 #include "support/Error.h"
+#include "tests/common/HostRecorders.h"
 
 namespace tamber::model {
+
+using testing::BatchRecorder;
+using testing::PageRecorder;
 
 namespace {
 
 // Only a hang gets near it.
 constexpr double kPatience = 60;
-
-struct PageRecorder : HostPorterEnumerationObserver {
-    void didEnumerateItems(const std::vector<HostPorterItemRef>& page) override {
-        items.insert(items.end(), page.begin(), page.end());
-    }
-    void finishEnumeratingUpToPage(const std::optional<HostPorterPage>& page) override {
-        next = page;
-        done.signal();
-    }
-    void finishEnumeratingWithError(const Error& e) override {
-        error = e;
-        done.signal();
-    }
-    std::vector<HostPorterItemRef> items;
-    std::optional<HostPorterPage> next;
-    std::optional<Error> error;
-    DispatchSemaphore done;
-};
-
-struct BatchRecorder : HostPorterChangeObserver {
-    // In the order they came: a deletion and a later update of the same identifier must be
-    // applied in that order.
-    void didUpdateItems(const std::vector<HostPorterItemRef>& items) override {
-        std::lock_guard lock(mutex);
-        for (const auto& item : items) changes.push_back({item, {}});
-    }
-    void didDeleteItemsWithIdentifiers(const std::vector<HostPorterItemIdentifier>& ids) override {
-        std::lock_guard lock(mutex);
-        for (const auto& id : ids) changes.push_back({nullptr, id});
-    }
-    void finishEnumeratingChangesUpToSyncAnchor(const HostPorterSyncAnchor& a, bool more) override {
-        {
-            std::lock_guard lock(mutex);
-            anchor = a;
-            moreComing = more;
-        }
-        done.signal();
-    }
-    void finishEnumeratingWithError(const Error& e) override {
-        {
-            std::lock_guard lock(mutex);
-            error = e;
-        }
-        done.signal();
-    }
-    std::mutex mutex;
-    std::vector<std::pair<HostPorterItemRef, HostPorterItemIdentifier>> changes;
-    HostPorterSyncAnchor anchor;
-    bool moreComing = false;
-    std::optional<Error> error;
-    DispatchSemaphore done;
-};
 
 }  // namespace
 
