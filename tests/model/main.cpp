@@ -227,7 +227,7 @@ int main(int argc, char** argv) {
         recent->limit = 400;
     Log::shared().setSink(recent);
     Log::shared().setDebugEnabled(options.debug);
-    testing::TempDir ledger;
+    tamber::testing::TempDir ledger;
     StagingCopies::setLedgerDirectoryForTesting(ledger.path());
     std::ofstream log;
     if (!options.log.empty())
