@@ -1,5 +1,7 @@
 #include "platform/archive/BuiltinArchiveClasses.h"
 
+#include <cmath>
+
 #include "platform/Tag.h"
 #include "platform/archive/ArchiveError.h"
 #include "platform/objects/Array.h"
@@ -46,6 +48,9 @@ ArchiveClass dateClass() {
                 auto time = unarchiver.decodeDouble("time");
                 if (!time)
                     return invalid(unarchiver, "date has no time");
+                // Not a point in time, and it equals nothing, itself included.
+                if (!std::isfinite(*time))
+                    return invalid(unarchiver, "date is not a finite time");
                 return Date::make(*time);
             }};
 }

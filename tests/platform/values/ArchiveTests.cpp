@@ -1,4 +1,5 @@
 #include <gtest/gtest.h>
+#include <algorithm>
 
 #include <atomic>
 #include <cmath>
@@ -398,6 +399,37 @@ TEST(KeyedArchiveRoundTrip, EveryValueKindComesBackExactlyOrIsRefusedWhenWritten
         EXPECT_TRUE(r.error().is(kArchiveErrorDomain, int64_t(code)));
     }
     EXPECT_EQ(failure(archive(nestedArrays(KeyedUnarchiver::kMaxDepth - 1))).first, 0);
+}
+
+// A date that is no point in time (found by fuzzing the metadata attributes): NaN equals nothing,
+// itself included, so a record holding one never reads the same twice.
+TEST(KeyedUnarchiverHostile, ADateThatIsNoPointInTimeIsRefused) {
+    // The time is written as a 4-byte float when it fits one, else as an 8-byte double.
+    for (double time : {1.5, 1700000000.123456}) {
+        Bytes bytes = archive(Date::make(time));
+        float single = float(time);
+        uint8_t pattern[8];
+        size_t size = single == time ? 4 : 8;
+        uint64_t bits = 0;
+        if (size == 4)
+            std::memcpy(&bits, &single, 4);
+        else
+            std::memcpy(&bits, &time, 8);
+        for (size_t k = 0; k < size; ++k) pattern[k] = uint8_t(bits >> (8 * (size - 1 - k)));
+        auto at = std::search(bytes.begin(), bytes.end(), pattern, pattern + size);
+        ASSERT_NE(at, bytes.end()) << time;
+        for (double bad : {std::nan(""), -std::numeric_limits<double>::infinity()}) {
+            float badSingle = float(bad);
+            uint64_t badBits = 0;
+            if (size == 4)
+                std::memcpy(&badBits, &badSingle, 4);
+            else
+                std::memcpy(&badBits, &bad, 8);
+            for (size_t k = 0; k < size; ++k) *(at + k) = uint8_t(badBits >> (8 * (size - 1 - k)));
+            auto decoded = KeyedUnarchiver::unarchiveObjectWithData(bytes);
+            EXPECT_FALSE(decoded.ok() && *decoded) << time << " made " << bad;
+        }
+    }
 }
 
 TEST(KeyedArchiveRoundTrip, RegistryServesReadersWhileAnotherLayerRegisters) {
