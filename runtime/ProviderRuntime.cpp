@@ -1,10 +1,8 @@
 #include "runtime/ProviderRuntime.h"
 
 #include <cerrno>
-#include <chrono>
 #include <cstdlib>
 #include <cstring>
-#include <thread>
 #include <utility>
 
 #include "applibraries/LocalAppLibraryCache.h"
@@ -197,21 +195,7 @@ void ProviderRuntime::shutdown() {
         Log::shared().setSink(std::move(previousSink_));
     if (options_.fileSystem)
         FileSystem::setCurrent(std::move(previousFileSystem_));
-    std::weak_ptr<TremorService> owned = journal_;
     journal_.reset();
-    if (!ownsJournal_)
-        return;
-    // Work that finished late (a change enumeration stopped half-way) may hold the journal a
-    // moment longer; its databases, and the lock the next runtime needs, go with the last
-    // holder, so shutdown waits for that, a bounded while.
-    for (int waited = 0; !owned.expired() && waited < 500; ++waited) {
-        drainThreads();
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    if (!owned.expired())
-        logError(
-            "The event journal is still in use after shutdown; its state stays locked until "
-            "that use ends");
 }
 
 void ProviderRuntime::shutdownProcess() {
