@@ -273,8 +273,12 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
         if (sinceExclusive >= upTo)
             return Status::OK();
         if (!everything) {
-            for (uint64_t root : roots_->mayHoldEventsBelow(wanted))
-                cursors.push_back({toSqlite(root), sinceExclusive, {}});
+            // Once each: a damaged roots table may name one root twice, and two cursors over
+            // one root would hand out its events twice.
+            std::vector<uint64_t> roots = roots_->mayHoldEventsBelow(wanted);
+            std::sort(roots.begin(), roots.end());
+            roots.erase(std::unique(roots.begin(), roots.end()), roots.end());
+            for (uint64_t root : roots) cursors.push_back({toSqlite(root), sinceExclusive, {}});
         }
     }
     // Every root involved: one scan in ID order is cheaper than merging them all.
@@ -290,6 +294,7 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
         }
         return false;
     };
+    uint64_t delivered = sinceExclusive;
     while (true) {
         Cursor* next = nullptr;
         for (Cursor& cursor : cursors) {
@@ -306,6 +311,10 @@ Status TremorStore::replay(uint64_t sinceExclusive, const std::vector<std::strin
         if (!next)
             return Status::OK();
         const JournalEvent& event = next->buffered[next->next++];
+        // Never backwards nor twice, whatever a damaged journal holds.
+        if (event.id <= delivered)
+            continue;
+        delivered = event.id;
         if (matches(event.path) && !each(event))
             return Status::OK();
     }
