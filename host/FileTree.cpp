@@ -69,9 +69,17 @@ Status removeItem(int dirfd, const std::string& name) {
             std::string done = std::move(top.name);
             stack.pop_back();
             int parent = stack.empty() ? dirfd : stack.back().fd.get();
-            if (fs.unlinkat(parent, done, AT_REMOVEDIR) != 0 && errno != ENOENT) {
-                Error error = lastError();
-                return error;
+            if (fs.unlinkat(parent, done, AT_REMOVEDIR) == 0)
+                continue;
+            const int code = errno;
+            if (code != ENOENT)
+                return Error::errorWithPOSIXCode(code);
+            // ENOENT is another delete winning the race; for the item asked for, it is only
+            // believed when the folder is really gone.
+            if (stack.empty()) {
+                auto still = itemTypeAt(dirfd, name);
+                if (still && still->device == type->device && still->inode == type->inode)
+                    return Error::errorWithPOSIXCode(code);
             }
             continue;
         }

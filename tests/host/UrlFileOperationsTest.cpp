@@ -452,5 +452,25 @@ TEST(DeleteTest, AFailurePartWayReportsItOnceAndClosesEverything) {
     EXPECT_FALSE(fs::exists(doomed));
 }
 
+// ENOENT while removing is someone else's delete winning the race, so it passes for the
+// folders and files inside; but a folder that is still there after its own removal said so
+// was not deleted, whatever the call answered.
+TEST(DeleteTest, AFolderStillThereAfterItsRemovalAnsweredEnoentIsNotReportedDeleted) {
+    TempDir dir;
+    std::string doomed = dir.makeDir("doomed");
+    dir.writeFile("doomed/one", "1");
+    dir.writeFile("doomed/two", "2");
+    auto failing = std::make_shared<FaultInjectingFileSystem>(std::make_shared<LinuxFileSystem>());
+    testing::ScopedFileSystem scoped(failing);
+    failing->injectAfter(Op::Unlinkat, ENOENT, 2);  // the files go, the folder's own call fails
+    auto error = runDelete(doomed);
+    ASSERT_TRUE(fs::exists(doomed));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(*error, Error::posix(ENOENT));
+    EXPECT_EQ(tree(doomed), std::set<std::string>{});
+    EXPECT_FALSE(runDelete(doomed));
+    EXPECT_FALSE(fs::exists(doomed));
+}
+
 }  // namespace
 }  // namespace tamber
