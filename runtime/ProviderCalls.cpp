@@ -10,10 +10,15 @@ Result<HostPorterItemRef> ProviderCalls::waitForItem(const ItemStarter& start) {
     using ItemResult = Result<HostPorterItemRef>;
     auto waiter = std::make_shared<CompletionWaiter<ItemResult>>();
     start([waiter](Result<HostPorterItemRef> item) {
-        if (item.ok() && !item.value())  // a provider's bug: no item and no error
+        if (!item.ok()) {
+            waiter->finish(item.error());
+            return;
+        }
+        HostPorterItemRef value = item.value();
+        if (!value)  // a provider's bug: no item and no error
             waiter->finish(Error::porterErrorForNonExistentItemWithIdentifier(""));
         else
-            waiter->finish(std::move(item));
+            waiter->finish(ItemResult(std::move(value)));
     });
     return waiter->wait();
 }

@@ -125,8 +125,10 @@ Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
         return stoppedError();
     if (porter_)
         return porter_;
-    if (auto error = prepareJournal(); !error.ok())
+    if (auto error = prepareStorage(); !error.ok())
         return error.error();
+    if (auto service = startJournal(); !service.ok())
+        return service.error();
     if (!installedLookup_) {
         previousLookup_ = SharedAppLibraryLookup::install();
         installedLookup_ = true;
@@ -135,10 +137,16 @@ Result<std::shared_ptr<LocalPorter>> ProviderRuntime::provider() {
     auto porter = LocalPorter::create(
         {manager_, options_.fileSystem ? options_.fileSystem.get() : &FileSystem::current()});
     refreshOutcome_ = porter->refreshAppLibraries();
-    // Identifiers inside app libraries need their trees journaled like the storage folder.
-    for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries()) {
-        if (auto error = journal_->watchTree(root.path()); !error.ok())
-            logError("can't watch app library " + root.path() + "; " + error.error().description());
+    // Identifiers inside app libraries need their trees journaled like the storage folder,
+    // all in one pass with it: a document moved between two of them while no run watched
+    // keeps its ID.
+    std::vector<std::string> roots{storage_.path()};
+    for (const Url& root : TBPAppLibraryManager::rootURLsForAppLibraries())
+        roots.push_back(root.path());
+    for (const auto& [path, error] : journal_->watchTrees(roots)) {
+        if (path == storage_.path())
+            return error;
+        logError("can't watch app library " + path + "; " + error.description());
     }
     StagingCopies::sweepStale();  // copies left by imports that were killed part-way
     porter_ = porter;

@@ -86,6 +86,10 @@ public:
     // Watches the directory tree at `path`, remembers it, and indexes it. A tree watched until
     // the last run stopped goes on with its history and journals what changed meanwhile.
     Status watchTree(const std::string& path);
+    // watchTree() for several trees, whose changes while no run watched them are journaled in
+    // one pass: a document moved from one of them to another meanwhile keeps its ID. Returns
+    // the trees that could not be watched, with why; the others are watched all the same.
+    std::vector<std::pair<std::string, Error>> watchTrees(const std::vector<std::string>& paths);
     bool isWatched(const std::string& path) const;
     // Watches every tree that was watched until the last run stopped, as asking for each would
     // (for a process that serves whatever earlier runs published). Returns the first failure;
@@ -156,7 +160,11 @@ private:
     Result<Volume*> volumeFor(const std::string& path);
     Result<Volume*> openVolume(uint64_t fsid, uint32_t device);
     Result<Volume*> addVolume(uint64_t fsid, std::unique_ptr<TremorStore> store);
-    Status watch(const std::string& path);
+    // Watches and indexes one tree. With `resumedLater`, a resumed tree is not reconciled but
+    // added there, for one pass over all of them.
+    using Resumed = std::map<Volume*, std::vector<std::string>>;
+    Status watch(const std::string& path, Resumed* resumedLater = nullptr);
+    void reconcileResumed(const Resumed& resumed);
     // The volumes that journal (their device is known), with their writers.
     std::vector<std::pair<Volume*, JournalWriter*>> journalingVolumes() const;
     Volume* ownerOf(const std::string& path) const;

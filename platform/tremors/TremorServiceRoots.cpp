@@ -150,7 +150,33 @@ Status TremorService::watchTree(const std::string& path) {
     return watch(root);
 }
 
-Status TremorService::watch(const std::string& path) {
+std::vector<std::pair<std::string, Error>> TremorService::watchTrees(
+    const std::vector<std::string>& paths) {
+    std::vector<std::pair<std::string, Error>> failed;
+    if (stopped_) {
+        for (const auto& path : paths) failed.emplace_back(path, Error::posix(ESHUTDOWN));
+        return failed;
+    }
+    sync();  // as watchTree() does
+    Resumed resumed;
+    for (const auto& path : paths) {
+        std::string root = WatchedRoots::normalised(path);
+        if (isWatched(root))
+            continue;
+        if (auto status = watch(root, &resumed); !status.ok())
+            failed.emplace_back(path, status.error());
+    }
+    reconcileResumed(resumed);
+    return failed;
+}
+
+void TremorService::reconcileResumed(const Resumed& resumed) {
+    std::lock_guard write(writeMutex_);
+    for (const auto& [volume, paths] : resumed)
+        publish(*volume, volume->writer->reconcile(paths, true));
+}
+
+Status TremorService::watch(const std::string& path, Resumed* resumedLater) {
     if (isWatched(path))
         return Status::OK();
     auto volume = volumeFor(path);
@@ -192,7 +218,10 @@ Status TremorService::watch(const std::string& path) {
     }
     // Watched first, then crawled: nothing that changes from now on is missed. What changed
     // while no run watched a resumed tree is journaled, as live watching would have.
-    publish(v, v.writer->reconcile(path, resumed));
+    if (resumed && resumedLater)
+        (*resumedLater)[&v].push_back(path);
+    else
+        publish(v, v.writer->reconcile(path, resumed));
     return Status::OK();
 }
 
@@ -208,13 +237,10 @@ Status TremorService::watchRemembered() {
         }
     }
     Status first;
-    for (const auto& path : paths) {
-        if (auto status = watchTree(path); !status.ok()) {
-            logError("A remembered tree is not watched: " + path + ": " +
-                     status.error().description());
-            if (first.ok())
-                first = status;
-        }
+    for (const auto& [path, error] : watchTrees(paths)) {
+        logError("A remembered tree is not watched: " + path + ": " + error.description());
+        if (first.ok())
+            first = error;
     }
     return first;
 }

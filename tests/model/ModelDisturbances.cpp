@@ -95,9 +95,7 @@ std::string ModelSteps::restart(Rng& rng, std::string& description) {
     // Changes while nothing runs must be found when the journal comes back.
     if (rng.chance(50)) {
         std::string ignored;
-        whileStopped_ = true;
         std::string failed = outsideChange(rng, ignored);
-        whileStopped_ = false;
         description += ", with " + ignored + " while stopped";
         if (!failed.empty())
             return failed;

@@ -26,9 +26,6 @@ public:
     // "overflow", "restart". A step drawn from a left-out family is an outside change instead.
     static const std::vector<std::string>& families();
     void skip(const std::string& family) { skipped_.push_back(family); }
-    // Lets an outside change made while the journal is stopped move an item from one tree to
-    // another: a known gap, left out of runs unless asked for.
-    void allowCrossTreeWhileStopped() { crossTreeWhileStopped_ = true; }
     // Lets an injected failure hit any thread's call (the journal's too), not only the calls
     // of the operation under test: a known gap, left out of runs unless asked for.
     void allowFaultsAnywhere() { faultsAnywhere_ = true; }
@@ -81,8 +78,6 @@ private:
     int unexpectedErrors_ = 0;
     bool faulted_ = false;
     std::vector<std::string> skipped_;
-    bool whileStopped_ = false;  // the running outside change is made while nothing runs
-    bool crossTreeWhileStopped_ = false;
     bool faultsAnywhere_ = false;
     int faultedFailures_ = 0;
     bool skipped(const std::string& family)
