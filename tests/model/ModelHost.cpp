@@ -1,5 +1,6 @@
 #include "tests/model/ModelHost.h"
 
+#include <poll.h>
 #include <sys/inotify.h>
 
 #include <algorithm>
@@ -30,6 +31,14 @@ constexpr double kPatience = 60;
 
 }  // namespace
 
+int OverflowingInotify::init(int flags) {
+    int fd = real_->init(flags);
+    std::lock_guard lock(mutex_);
+    unread_.clear();  // what was left belonged to the descriptor of the last start
+    inotifyFd_ = fd;
+    return fd;
+}
+
 int OverflowingInotify::poll(struct pollfd* fds, nfds_t count, int timeoutMs) {
     if (hold) {
         // Nothing is ready while held; the reader comes back after its timeout.
@@ -38,7 +47,30 @@ int OverflowingInotify::poll(struct pollfd* fds, nfds_t count, int timeoutMs) {
         for (nfds_t i = 0; i < count; ++i) fds[i].revents = 0;
         return 0;
     }
-    return real_->poll(fds, count, timeoutMs);
+    bool unread;
+    {
+        std::lock_guard lock(mutex_);
+        unread = !unread_.empty();
+    }
+    if (!unread)
+        return real_->poll(fds, count, timeoutMs);
+    // Events read but not handed out make the queue readable now.
+    int ready = real_->poll(fds, count, 0);
+    if (ready < 0)
+        return ready;
+    for (nfds_t i = 0; i < count; ++i) {
+        if (fds[i].fd == inotifyFd_ && !(fds[i].revents & POLLIN)) {
+            fds[i].revents |= POLLIN;
+            ++ready;
+        }
+    }
+    return ready;
+}
+
+int OverflowingInotify::queuedBytes(int fd) {
+    int queued = real_->queuedBytes(fd);
+    std::lock_guard lock(mutex_);
+    return queued < 0 ? queued : queued + int(unread_.size());
 }
 
 ssize_t OverflowingInotify::read(int fd, void* buffer, size_t size) {
@@ -46,7 +78,9 @@ ssize_t OverflowingInotify::read(int fd, void* buffer, size_t size) {
         errno = EAGAIN;
         return -1;
     }
+    std::lock_guard lock(mutex_);
     if (size >= sizeof(inotify_event) && overflowNext.exchange(false)) {
+        unread_.clear();
         std::vector<char> dropped(1 << 16);
         while (real_->queuedBytes(fd) > 0 && real_->read(fd, dropped.data(), dropped.size()) > 0) {
         }
@@ -56,7 +90,25 @@ ssize_t OverflowingInotify::read(int fd, void* buffer, size_t size) {
         std::memcpy(buffer, &overflow, sizeof overflow);
         return sizeof overflow;
     }
-    return real_->read(fd, buffer, size);
+    if (!trickle && unread_.empty())
+        return real_->read(fd, buffer, size);
+    if (unread_.empty()) {
+        unread_.resize(1 << 16);
+        ssize_t n = real_->read(fd, unread_.data(), unread_.size());
+        unread_.resize(size_t(std::max<ssize_t>(n, 0)));
+        if (n <= 0)
+            return n;
+    }
+    inotify_event head;
+    std::memcpy(&head, unread_.data(), sizeof head);
+    const size_t length = sizeof(inotify_event) + head.len;
+    if (size < length) {
+        errno = EINVAL;  // as the kernel answers a buffer too small for the next event
+        return -1;
+    }
+    std::memcpy(buffer, unread_.data(), length);
+    unread_.erase(unread_.begin(), unread_.begin() + long(length));
+    return ssize_t(length);
 }
 
 ModelHost::ModelHost(std::string storage, std::string state)

@@ -3,8 +3,10 @@
 #include <atomic>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "host/HostPorterEnumerator.h"
 #include "platform/FaultInjectingFileSystem.h"
@@ -16,19 +18,22 @@ namespace tamber::model {
 
 // The system's inotify calls, except that reading can be held back while changes are made,
 // and the next read can be made to overflow: what the kernel queued is dropped and a queue
-// overflow reported instead, as when the kernel loses events.
+// overflow reported instead, as when the kernel loses events. With `trickle`, each read hands
+// out one event, as a reader that keeps up with a slow writer sees them: every place where a
+// burst of events can be split between two reads is then split.
 class OverflowingInotify : public InotifyApi {
 public:
     std::atomic<bool> overflowNext{false};
     std::atomic<bool> hold{false};
+    std::atomic<bool> trickle{false};
 
-    int init(int flags) override { return real_->init(flags); }
+    int init(int flags) override;
     int addWatch(int fd, const std::string& path, uint32_t mask) override {
         return real_->addWatch(fd, path, mask);
     }
     int removeWatch(int fd, int wd) override { return real_->removeWatch(fd, wd); }
     ssize_t read(int fd, void* buffer, size_t size) override;
-    int queuedBytes(int fd) override { return real_->queuedBytes(fd); }
+    int queuedBytes(int fd) override;
     int eventfd(unsigned int initial, int flags) override { return real_->eventfd(initial, flags); }
     int signal(int eventFd) override { return real_->signal(eventFd); }
     int poll(struct pollfd* fds, nfds_t count, int timeoutMs) override;
@@ -36,6 +41,9 @@ public:
 
 private:
     std::shared_ptr<InotifyApi> real_ = InotifyApi::system();
+    std::atomic<int> inotifyFd_{-1};
+    std::mutex mutex_;
+    std::vector<char> unread_;  // read from the kernel, not yet handed out (trickle)
 };
 
 // What a browser keeps of the working set: each item's name and parent, by identifier.
