@@ -453,6 +453,8 @@ void TremorReader::prepareBatch(const std::vector<BatchEntry>& entries, const ui
                 device = TBFileObjectIdentifier::storageDeviceID();
             if (*device != 0)
                 it->second = TBFileObjectIdentifier::_fileURLWithFileIdentifier(*fileID, *device);
+            if (it->second && isHidden(*it->second))
+                it->second.reset();  // another file's number now (see itemWithFileIdentifier)
             if (it->second)
                 urls.push_back(*it->second);
         } else if (batchURLsByPath_.try_emplace(url.path(), url).second) {
@@ -467,10 +469,14 @@ LocalItemRef TremorReader::itemWithFileIdentifier(uint64_t fileID) {
     auto [it, inserted] = batchItemsByFileID_.try_emplace(fileID);
     if (inserted) {
         auto found = batchURLsByFileID_.find(fileID);
-        if (found == batchURLsByFileID_.end())
-            it->second = LocalItem::makeWithFileIdentifier(fileID);
-        else if (found->second)
-            it->second = LocalItem::make(*found->second);
+        std::optional<Url> url = found != batchURLsByFileID_.end()
+                                     ? found->second
+                                     : TBFileObjectIdentifier::fileURLWithFileIdentifier(fileID);
+        // The number of a file gone is handed to the next file made, often a safe save's hidden
+        // temporary file: made an item, that file would get a document ID, and the save would
+        // then replace the document rather than carry its ID on.
+        if (url && !isHidden(*url))
+            it->second = LocalItem::make(*url);
     }
     return it->second;
 }

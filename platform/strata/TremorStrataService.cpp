@@ -89,7 +89,13 @@ void TremorStrataService::allocate(TremorStore& store, const std::vector<File>& 
             errno = EIO;
             return;
         }
-        for (size_t k = 0; k < wanted.size(); ++k) ids[wantedPositions[k]] = allocated.value()[k];
+        for (size_t k = 0; k < wanted.size(); ++k) {
+            ids[wantedPositions[k]] = allocated.value()[k];
+            logDebug([&] {
+                return "document " + std::to_string(allocated.value()[k]) + " given to inode " +
+                       std::to_string(wanted[k].inode);
+            });
+        }
     }
     if (failure != 0)
         errno = failure;

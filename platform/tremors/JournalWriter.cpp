@@ -234,8 +234,13 @@ void JournalWriter::claimDocumentId(const std::string& path, uint64_t inode, uin
         return;
     uint32_t docID = it->second.docID;
     uint64_t old = it->second.inode;
-    if (orFail(store_.documentIdForInode(inode), std::optional<uint32_t>()))
+    if (auto own = orFail(store_.documentIdForInode(inode), std::optional<uint32_t>())) {
+        logDebug([&] {
+            return "document " + std::to_string(docID) + " is not claimed at " + path + ": inode " +
+                   std::to_string(inode) + " is document " + std::to_string(*own);
+        });
         return;  // the new file is a document of its own
+    }
     vanished_.erase(it);
     if (Status moved = store_.moveDocumentId(docID, inode); !moved.ok()) {
         fail(moved, "Could not move document ID " + std::to_string(docID));

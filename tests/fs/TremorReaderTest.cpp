@@ -189,6 +189,22 @@ TEST_F(TremorTest, ARemovalWhoseFileIDWasReusedIsADeletion) {
                  "change " + *nowID + " " + renamed, "change " + *nowID + " " + now, "history"}));
 }
 
+// The next file made is often a safe save's hidden temporary file: an old event whose file ID
+// now names it must neither report it nor give it a document ID, which would make the save
+// replace the document rather than carry its ID on.
+TEST_F(TremorTest, AnOldEventWhoseFileIDNowNamesAHiddenFileReportsNothingOfIt) {
+    std::string temporary = write(".saving-report.pdf");
+    uint64_t inode = inodeOf(temporary);
+    std::string gone = storagePath() + "/deleted/x";
+    uint64_t since = currentID();
+    journal({{0, gone, inode, kTremorItemCreated}, {0, gone, inode, kTremorItemModified}});
+    startReader(since);
+    ASSERT_TRUE(delegate->waitForReport("history"));
+    for (const std::string& report : delegate->itemReports())
+        EXPECT_NE(report.rfind("change ", 0), 0u) << report;
+    EXPECT_EQ(store().documentIdForInode(inode).value(), std::nullopt);
+}
+
 TEST_F(TremorTest, DocumentIDEventsAreJudgedByTheirShapeAndTheDocumentTheyName) {
     std::string a = write("a.txt");
     std::string b = write("b.txt");
