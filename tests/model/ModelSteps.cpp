@@ -256,8 +256,14 @@ std::string ModelSteps::outsideChange(Rng& rng, std::string& description) {
                 }
             }
             path += "/" + rng.pick(kFileNames);
+            const ModelNode* there = tree.find(path);
+            if (there && there->kind != Kind::File)
+                return "";
             writeFile(world_.full(path), contents);
-            tree.add(path, ModelNode::file(contents));
+            if (there)  // written over in place: the file keeps its metadata
+                tree.find(path)->contents = contents;
+            else
+                tree.add(path, ModelNode::file(contents));
             return "";
         }
         case 9: {  // a symbolic link, inside the tree or pointing out of it
@@ -542,13 +548,15 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
                     std::error_code error;
                     if (!fs::exists(fs::symlink_status(world_.full(path), error))) {
                         tree.removeTree(path);
-                    } else if (ModelNode& node = *tree.find(path); node.mayLackTrashDate) {
-                        node.mayLackTrashDate = false;  // dated now, deleted by the next sweep
-                    } else if (faulted_) {
-                        forgetRemoved(path);  // a failing call may leave some, or part of one
-                    } else {
-                        out += "\n  still in the trash: " + path;
+                        continue;
                     }
+                    // One that may have had no date is dated now, deleted by the next sweep;
+                    // but it may have had one, and a failing call may leave part of any.
+                    const bool undated = std::exchange(tree.find(path)->mayLackTrashDate, false);
+                    if (faulted_)
+                        forgetRemoved(path);
+                    else if (!undated)
+                        out += "\n  still in the trash: " + path;
                 }
                 return out;
             };
