@@ -550,12 +550,14 @@ ModelSteps::Operation ModelSteps::planOperation(Rng& rng) {
                         tree.removeTree(path);
                         continue;
                     }
-                    // One that may have had no date is dated now, deleted by the next sweep;
-                    // but it may have had one, and a failing call may leave part of any.
-                    const bool undated = std::exchange(tree.find(path)->mayLackTrashDate, false);
-                    if (faulted_)
+                    // A failing call may leave part of any, and may have kept one without a
+                    // date from being dated.
+                    if (faulted_) {
                         forgetRemoved(path);
-                    else if (!undated)
+                        continue;
+                    }
+                    // One that may have had no date is dated now, deleted by the next sweep.
+                    if (!std::exchange(tree.find(path)->mayLackTrashDate, false))
                         out += "\n  still in the trash: " + path;
                 }
                 return out;
